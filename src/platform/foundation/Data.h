@@ -1,0 +1,22 @@
+#pragma once
+
+#include <cstddef>
+#include <span>
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace cindral {
+
+using Bytes = std::vector<std::byte>;
+using ByteView = std::span<const std::byte>;
+
+inline ByteView bytesOf(std::string_view text) {
+    return std::as_bytes(std::span(text.data(), text.size()));
+}
+
+inline std::string_view textOf(ByteView bytes) {
+    return {reinterpret_cast<const char*>(bytes.data()), bytes.size()};
+}
+
+}  // namespace cindral

@@ -1,0 +1,65 @@
+#pragma once
+
+#include <cstdint>
+#include <map>
+#include <memory>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "platform/foundation/Data.h"
+#include "platform/foundation/KsDate.h"
+#include "platform/foundation/Result.h"
+
+namespace cindral {
+
+/// A value of a property list: bool, integer (signed or unsigned 64 bits), real, date, data, string, array
+/// or dictionary with string keys.
+///
+/// Thread safety: a value.
+class PropertyList {
+public:
+    using Array = std::vector<PropertyList>;
+    using Dictionary = std::map<std::string, PropertyList, std::less<>>;
+
+    PropertyList() : value_(false) {}
+    PropertyList(bool value) : value_(value) {}                   // NOLINT(google-explicit-constructor)
+    PropertyList(std::int64_t value);                             // NOLINT(google-explicit-constructor)
+    PropertyList(std::uint64_t value) : value_(value) {}          // NOLINT(google-explicit-constructor)
+    PropertyList(double value) : value_(value) {}                 // NOLINT(google-explicit-constructor)
+    PropertyList(KsDate value) : value_(value) {}                 // NOLINT(google-explicit-constructor)
+    PropertyList(Bytes value) : value_(std::move(value)) {}       // NOLINT(google-explicit-constructor)
+    PropertyList(std::string value) : value_(std::move(value)) {} // NOLINT(google-explicit-constructor)
+    PropertyList(const char* value) : value_(std::string(value)) {}  // NOLINT(google-explicit-constructor)
+    PropertyList(Array value) : value_(std::move(value)) {}       // NOLINT(google-explicit-constructor)
+    PropertyList(Dictionary value) : value_(std::move(value)) {}  // NOLINT(google-explicit-constructor)
+
+    /// The value as that type, or null. A non-negative integer is always held unsigned; see also signedInteger().
+    const bool* boolean() const { return std::get_if<bool>(&value_); }
+    const std::uint64_t* unsignedInteger() const { return std::get_if<std::uint64_t>(&value_); }
+    const std::int64_t* negativeInteger() const { return std::get_if<std::int64_t>(&value_); }
+    const double* real() const { return std::get_if<double>(&value_); }
+    const KsDate* date() const { return std::get_if<KsDate>(&value_); }
+    const Bytes* data() const { return std::get_if<Bytes>(&value_); }
+    const std::string* string() const { return std::get_if<std::string>(&value_); }
+    const Array* array() const { return std::get_if<Array>(&value_); }
+    const Dictionary* dictionary() const { return std::get_if<Dictionary>(&value_); }
+    /// The value of a key of a dictionary; null when there is none or this is no dictionary.
+    const PropertyList* find(std::string_view key) const;
+
+    /// The binary form: docs/property-list.md. Equal values have equal bytes.
+    Bytes encodeBinary() const;
+    /// Reads the binary form.
+    ///
+    /// EINVAL (POSIX domain) with a message for anything malformed: every offset, length and reference is checked
+    /// before it is used; cycles, nesting beyond kPropertyListDepthMax and references that would unfold to more
+    /// than kPropertyListValuesMax values are refused, so that no input costs more than a small multiple of its size.
+    static Result<PropertyList> decodeBinary(ByteView bytes);
+
+    friend bool operator==(const PropertyList&, const PropertyList&) = default;
+
+private:
+    std::variant<bool, std::uint64_t, std::int64_t, double, KsDate, Bytes, std::string, Array, Dictionary> value_;
+};
+
+}  // namespace cindral

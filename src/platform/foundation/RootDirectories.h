@@ -1,0 +1,57 @@
+#pragma once
+
+#include <memory>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/foundation/Mutex.h"
+#include "platform/foundation/Result.h"
+#include "platform/foundation/Sys.h"
+#include "platform/foundation/UniqueFd.h"
+
+namespace cindral {
+
+/// An open directory and the path that it is presented under.
+///
+/// Thread safety: immutable.
+struct DirectoryReference {
+    UniqueFd fd;
+    std::string path;  ///< absolute, without a trailing slash
+    FileStatus status;
+};
+
+/// Whether links inside a root may be walked through. What an application can write to is not trusted.
+enum class RootPolicy { storage, applicationContainer };
+
+struct RootDirectory : DirectoryReference {
+    RootPolicy policy = RootPolicy::storage;
+};
+
+/// The directories whose contents are published, each held open.
+///
+/// Every access to something below a root starts at the root's descriptor and stays beneath it, so that no link, swapped
+/// at any moment, leads outside.
+///
+/// Thread safety: all operations, from any thread.
+class RootDirectories {
+public:
+    static RootDirectories& shared();
+
+    /// Opens the directory (links in the path itself are followed) and publishes it under `path`, replacing an earlier one of that path.
+    Result<std::shared_ptr<const RootDirectory>> add(const std::string& path, RootPolicy policy);
+    void remove(std::string_view path);
+
+    /// The root that is or holds the path, by whole components; the innermost when there are several; null when there is none.
+    std::shared_ptr<const RootDirectory> rootHolding(std::string_view path) const;
+    std::vector<std::shared_ptr<const RootDirectory>> all() const;
+
+    /// Opens what is at the path: beneath its root, or, where no root holds it, from the top without following a final link.
+    static Result<UniqueFd> open(const std::string& path, int flags);
+
+private:
+    mutable Mutex mutex_;
+    std::shared_ptr<const std::vector<std::shared_ptr<const RootDirectory>>> roots_ GUARDED_BY(mutex_);
+};
+
+}  // namespace cindral

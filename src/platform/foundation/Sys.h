@@ -1,0 +1,71 @@
+#pragma once
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/types.h>
+
+#include <cstdint>
+#include <optional>
+#include <span>
+#include <string>
+#include <string_view>
+
+#include "platform/foundation/Data.h"
+#include "platform/foundation/KsDate.h"
+#include "platform/foundation/Result.h"
+#include "platform/foundation/UniqueFd.h"
+
+namespace cindral {
+
+/// What one statx says of an object. Never of what a link points to.
+struct FileStatus {
+    std::uint64_t fileID = 0;
+    std::uint64_t device = 0;  ///< st_dev; valid until the next boot only
+    std::uint64_t size = 0;    ///< bytes
+    std::uint64_t attributes = 0;  ///< STATX_ATTR_ bits
+    KsDate modificationTime;
+    KsDate changeTime;
+    std::optional<KsDate> birthTime;
+    mode_t mode = 0;
+    uid_t owner = 0;
+
+    bool isDirectory() const { return S_ISDIR(mode); }
+    bool isRegular() const { return S_ISREG(mode); }
+    /// Birth time as one number, ns since 1970; 0 where the file system has none.
+    std::int64_t birthStamp() const;
+};
+
+/// System calls: one function a call, same name, same order of arguments. EINTR is retried here and nowhere else;
+/// every descriptor is close-on-exec. Errors are of the POSIX domain.
+namespace sys {
+
+Result<UniqueFd> open(const char* path, int flags, mode_t mode = 0);
+Result<UniqueFd> openat(int directory, const char* name, int flags, mode_t mode = 0);
+
+/// How a path below a directory may be walked: RESOLVE_ bits of openat2.
+/// RESOLVE_BENEATH and RESOLVE_NO_MAGICLINKS are always added. A path longer than PATH_MAX is walked in pieces.
+Result<UniqueFd> openBeneath(int directory, std::string_view relativePath, int flags, std::uint64_t resolve = 0);
+
+/// Of the entry itself, never of what a link points to. An empty name is the descriptor's own object.
+Result<FileStatus> statx(int directory, const char* name);
+
+/// Names of the extended attributes, NUL-terminated one after the other. ENOTSUP is an empty list.
+Result<std::string> listxattrat(int directory, const char* name);
+/// Whether there is any attribute at all, or an error; one system call and no allocation when there is none.
+Result<bool> hasXattrs(int directory, const char* name, std::string& names);
+/// Size of the value with an empty buffer, else bytes written. An empty name is the descriptor's own object.
+Result<std::size_t> getxattrat(int directory, const char* name, const char* attribute, std::span<std::byte> buffer);
+
+/// Whether the process may write the entry itself (effective identity, links not followed).
+Result<bool> isWritable(int directory, const char* name);
+
+/// Reads from a regular file without touching its access time. EPERM where the process may not ask for that;
+/// ENXIO for anything but a regular file, which is never opened.
+Result<Bytes> readBeginning(int directory, const char* name, std::size_t count);
+
+/// Entries that a directory holds, "." and ".." not counted, counting no further than `max`.
+Result<std::uint64_t> countEntries(int directory, const char* name, std::uint64_t max);
+
+}  // namespace sys
+
+}  // namespace cindral

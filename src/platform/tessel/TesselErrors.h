@@ -1,0 +1,30 @@
+#pragma once
+
+#include "platform/foundation/KsError.h"
+#include "platform/tessel/TesselTypes.h"
+
+namespace cindral {
+
+inline constexpr std::string_view kTesselErrorDomain = "TesselErrorDomain";
+inline constexpr std::string_view kTSErrorDomain = "TSErrorDomain";
+
+/// Codes of TesselErrorDomain. Part of the host interface: add numbers, never change one.
+enum class TesselErrorCode : std::int64_t {
+    noSuchItem = -1001,
+    pageExpired = -1002,  ///< and syncAnchorExpired: one number for both
+    filenameCollision = -1003,
+};
+/// Codes of TSErrorDomain. Part of the host interface: add numbers, never change one.
+enum class TSErrorCode : std::int64_t { invalidParameter = 1, itemNotFound = 2 };
+
+/// "identifier" in the user info names the item.
+KsError tesselErrorForNonExistentItemWithIdentifier(const TesselItemIdentifier& identifier);
+/// A page or sync anchor that can't be resumed: the host lists anew.
+KsError tesselErrorForExpiredPage();
+/// "path" in the user info is the item in the way.
+KsError tesselErrorForCollisionAtPath(std::string path);
+/// "parameter" and "value" in the user info.
+KsError tsInvalidParameterError(std::string parameter, std::string value);
+KsError tsItemNotFoundError(const TesselItemIdentifier& identifier);
+
+}  // namespace cindral
