@@ -81,7 +81,7 @@ public:
     Result<InternedString> typeIdentifier() const;
     Result<bool> isPackage() const;
     Result<bool> isWritable() const;
-    /// A folder's entries plus 2, saturating at what 16 bits hold (link counts don't count files here); else the real link count is not asked: 1.
+    /// A folder's entries plus 2, saturating at what 16 bits hold: link counts don't count files here. 1 for anything else.
     Result<std::uint16_t> linkCount() const;
 
     /// The folder test of the host: a directory that is no package. False when it can't be told.

@@ -31,8 +31,21 @@ struct FileStatus {
 
     bool isDirectory() const { return S_ISDIR(mode); }
     bool isRegular() const { return S_ISREG(mode); }
+    /// The device as one 32-bit number that is never 0 ("unknown"); valid until the next boot only.
+    std::uint32_t deviceID() const;
     /// Birth time as one number, ns since 1970; 0 where the file system has none.
     std::int64_t birthStamp() const;
+};
+
+/// One record of getdents64, as the kernel writes it. `name` ends with a NUL.
+struct DirectoryRecord {
+    std::uint64_t fileID;
+    std::int64_t nextOffset;  ///< where lseek() goes on after this record; opaque
+    std::uint16_t length;     ///< bytes to the next record
+    std::uint8_t type;        ///< DT_ value; DT_UNKNOWN where the file system doesn't say
+    char name[5];             ///< first bytes of the name, which may be longer
+
+    bool isDots() const { return name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0')); }
 };
 
 /// System calls: one function a call, same name, same order of arguments. EINTR is retried here and nowhere else;
@@ -62,6 +75,14 @@ Result<bool> isWritable(int directory, const char* name);
 /// Reads from a regular file without touching its access time. EPERM where the process may not ask for that;
 /// ENXIO for anything but a regular file, which is never opened.
 Result<Bytes> readBeginning(int directory, const char* name, std::size_t count);
+
+/// Opens a directory to be listed, leaving its access time alone where the process may. `name` "" is not allowed; "." is the directory itself.
+Result<UniqueFd> openDirectoryForReading(int directory, const char* name, int extraFlags = 0);
+/// Where a link of /proc/self/fd leads: the path of an open descriptor as the kernel knows it; "/" or a path with " (deleted)" where
+/// it knows none. Check what comes back.
+Result<std::string> pathOfDescriptor(int fd);
+/// Fills the buffer with DirectoryRecords; 0 at the end.
+Result<std::size_t> getdents(int directory, std::span<std::byte> buffer);
 
 /// Entries that a directory holds, "." and ".." not counted, counting no further than `max`.
 Result<std::uint64_t> countEntries(int directory, const char* name, std::uint64_t max);

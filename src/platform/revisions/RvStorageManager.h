@@ -18,26 +18,34 @@ namespace cindral {
 class RvStorageManager {
 public:
     static RvStorageManager& defaultManager();
+    /// Puts another manager in the default's place; null brings the default back. For tests; the manager outlives its use.
+    static void replaceDefaultManager(RvStorageManager* manager);
 
-    /// Connects the manager, and the URLs' document identifiers, to a store; null disconnects. The store outlives its connection.
+    virtual ~RvStorageManager() = default;
+
+    /// Connects the manager, and the URLs' document identifiers, to a store; null disconnects.
     void setStore(std::shared_ptr<VolumeStore> store);
     std::shared_ptr<VolumeStore> store() const;
 
     /// The file ID of the document on the device, checked against the file system; 0 with errno otherwise:
-    /// ENOENT no such document, or its file is gone; ESTALE what was recorded of the document does not hold, ask again; EAGAIN no store
-    /// is connected yet; EBUSY the store can't be read now; EXDEV another device than the storage's; EINVAL no document number.
-    std::uint64_t resolveDocumentID(std::int64_t documentID, std::uint32_t device);
+    /// ENOENT no such document, or its file is gone; ESTALE it moved while it was looked for, ask again; EAGAIN no store is
+    /// connected yet; EXDEV another device than the storage's; EINVAL no document number.
+    virtual std::uint64_t resolveDocumentID(std::int64_t documentID, std::uint32_t device);
 
-    /// The document ID of the open file, given now if it has none; 0 with errno otherwise.
-    std::uint32_t documentIDForDescriptor(int fd);
+    /// The document ID of the open file (O_PATH will do), given now if it has none; 0 with errno otherwise.
+    virtual std::uint32_t documentIDForDescriptor(int fd);
 
-    /// Gives the URLs of a page of a listing their document IDs, and records where they were seen, in one transaction.
-    /// The URLs' cached document identifiers are set. URLs whose object is gone are left as they are.
-    Result<void> identify(std::span<KsURL> urls, const KsURL& parent);
+    /// Gives the entries of one folder their document IDs, and records where they were seen, in one transaction.
+    ///
+    /// The URLs' cached document identifiers are set. Entries that are gone, and those of another device, are left as they are.
+    Result<void> identify(std::span<KsURL> entries, const KsURL& folder);
 
-    /// The path of an object by its number: recorded parents, checked against the file system; the file system asked directly where
-    /// they don't lead to it. At most 1,023 bytes, as the platform's call has it. POSIX errors; ENOENT when nothing has the number.
-    Result<std::string> pathOfFileID(std::uint64_t fileID, std::uint32_t device);
+    /// The path of an object by its number, as presented: by the recorded parents, or, where they don't lead to it, by asking the file system.
+    /// What is handed out was checked against the file system.
+    ///
+    /// POSIX errors: ENOENT when nothing below the roots has the number, ESTALE when it moved while it was looked for, ENAMETOOLONG
+    /// when the path does not fit `sizeMax` bytes with its NUL.
+    Result<std::string> pathOfFileID(std::uint64_t fileID, std::uint32_t device, std::size_t sizeMax);
 
 private:
     mutable Mutex mutex_;

@@ -1,0 +1,79 @@
+#include "platform/foundation/RootDirectories.h"
+
+#include <fcntl.h>
+#include <linux/openat2.h>
+
+#include <algorithm>
+#include <cerrno>
+
+namespace cindral {
+
+namespace {
+
+bool holds(std::string_view root, std::string_view path) {
+    return path.starts_with(root) && (path.size() == root.size() || path[root.size()] == '/' || root == "/");
+}
+
+using Roots = std::vector<std::shared_ptr<const RootDirectory>>;
+
+}  // namespace
+
+RootDirectories& RootDirectories::shared() {
+    // Never destroyed: work that ends with the process may still look a root up.
+    static RootDirectories& directories = *new RootDirectories;
+    return directories;
+}
+
+Result<std::shared_ptr<const RootDirectory>> RootDirectories::add(const std::string& path, RootPolicy policy) {
+    auto root = std::make_shared<RootDirectory>();
+    root->fd = TRY(sys::openDirectoryForReading(AT_FDCWD, path.c_str()));
+    root->path = path;
+    root->status = TRY(sys::statx(root->fd.get(), ""));
+    root->policy = policy;
+
+    const MutexLock lock(mutex_);
+    Roots roots = roots_ ? *roots_ : Roots();
+    std::erase_if(roots, [&](const auto& other) { return other->path == path; });
+    roots.push_back(root);
+    // The longest first, so that the first that holds a path is the innermost.
+    std::ranges::stable_sort(roots, std::ranges::greater(), [](const auto& other) { return other->path.size(); });
+    roots_ = std::make_shared<const Roots>(std::move(roots));
+    return std::shared_ptr<const RootDirectory>(std::move(root));
+}
+
+void RootDirectories::remove(std::string_view path) {
+    const MutexLock lock(mutex_);
+    if (!roots_) return;
+    Roots roots = *roots_;
+    std::erase_if(roots, [&](const auto& other) { return other->path == path; });
+    roots_ = std::make_shared<const Roots>(std::move(roots));
+}
+
+Roots RootDirectories::all() const {
+    const MutexLock lock(mutex_);
+    return roots_ ? *roots_ : Roots();
+}
+
+std::shared_ptr<const RootDirectory> RootDirectories::rootHolding(std::string_view path) const {
+    std::shared_ptr<const Roots> roots;
+    {
+        const MutexLock lock(mutex_);
+        roots = roots_;
+    }
+    if (!roots) return nullptr;
+    const auto found = std::ranges::find_if(*roots, [&](const auto& root) { return holds(root->path, path); });
+    return found == roots->end() ? nullptr : *found;
+}
+
+Result<UniqueFd> RootDirectories::open(const std::string& path, int flags) {
+    // A NUL would silently name another object.
+    if (path.find('\0') != std::string::npos) return KsError::posix(EINVAL, path);
+    const auto root = shared().rootHolding(path);
+    if (!root) return sys::open(path.c_str(), flags | O_NOFOLLOW);
+    std::string_view relative = std::string_view(path).substr(root->path.size());
+    while (relative.starts_with('/')) relative.remove_prefix(1);
+    const std::uint64_t resolve = root->policy == RootPolicy::applicationContainer ? RESOLVE_NO_SYMLINKS : 0;
+    return sys::openBeneath(root->fd.get(), relative, flags | O_NOFOLLOW, resolve);
+}
+
+}  // namespace cindral

@@ -1,0 +1,244 @@
+#include "platform/foundation/Sys.h"
+
+#include <fmt/format.h>
+#include <linux/openat2.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <climits>
+
+namespace cindral {
+
+namespace {
+
+// The *xattrat calls of Linux 6.13; the C library has no names for them yet. The numbers are those of every architecture but alpha.
+constexpr long kGetxattratCall = 464;
+constexpr long kListxattratCall = 465;
+
+struct XattrArguments {
+    std::uint64_t value;
+    std::uint32_t size;
+    std::uint32_t flags;
+};
+
+bool hasXattratCalls() {
+    // A kernel that knows the call refuses the descriptor; one that doesn't, or a filter that forbids it, answers something else.
+    static const bool known = ::syscall(kListxattratCall, -1, "", AT_EMPTY_PATH, nullptr, std::size_t{0}) < 0 && errno == EBADF;
+    return known;
+}
+
+/// "/proc/self/fd/N" or "/proc/self/fd/N/name": the way to an entry of an open directory for calls that take no descriptor.
+std::string pathThroughDescriptor(int directory, const char* name) {
+    return *name == '\0' ? fmt::format("/proc/self/fd/{}", directory) : fmt::format("/proc/self/fd/{}/{}", directory, name);
+}
+
+// With an empty name the path through /proc is the only way: a descriptor opened with O_PATH is no open file to the *at calls.
+ssize_t listxattrOnce(int directory, const char* name, char* buffer, std::size_t size) {
+    if (*name != '\0' && hasXattratCalls()) {
+        return ::syscall(kListxattratCall, directory, name, AT_SYMLINK_NOFOLLOW, buffer, size);
+    }
+    const std::string path = pathThroughDescriptor(directory, name);
+    return *name == '\0' ? ::listxattr(path.c_str(), buffer, size) : ::llistxattr(path.c_str(), buffer, size);
+}
+
+ssize_t getxattrOnce(int directory, const char* name, const char* attribute, void* buffer, std::size_t size) {
+    if (*name != '\0' && hasXattratCalls()) {
+        XattrArguments arguments{reinterpret_cast<std::uint64_t>(buffer), static_cast<std::uint32_t>(size), 0};
+        return ::syscall(kGetxattratCall, directory, name, AT_SYMLINK_NOFOLLOW, attribute, &arguments, sizeof arguments);
+    }
+    const std::string path = pathThroughDescriptor(directory, name);
+    return *name == '\0' ? ::getxattr(path.c_str(), attribute, buffer, size)
+                         : ::lgetxattr(path.c_str(), attribute, buffer, size);
+}
+
+KsDate dateOf(const statx_timestamp& time) {
+    return {time.tv_sec, time.tv_nsec};
+}
+
+}  // namespace
+
+std::int64_t FileStatus::birthStamp() const {
+    if (!birthTime) return 0;
+    const std::int64_t stamp = birthTime->seconds * 1'000'000'000 + birthTime->nanoseconds;
+    return stamp == 0 ? 1 : stamp;  // 0 says that there is none.
+}
+
+std::uint32_t FileStatus::deviceID() const {
+    // Twelve bits of major and twenty of minor number: the kernel's own packing.
+    const auto packed = static_cast<std::uint32_t>(((device >> 32) << 20) | (device & 0xFFFFF));
+    return packed == 0 ? 1 : packed;
+}
+
+namespace sys {
+
+Result<UniqueFd> open(const char* path, int flags, mode_t mode) {
+    return openat(AT_FDCWD, path, flags, mode);
+}
+
+Result<UniqueFd> openat(int directory, const char* name, int flags, mode_t mode) {
+    while (true) {
+        const int fd = ::openat(directory, name, flags | O_CLOEXEC, mode);
+        if (fd >= 0) return UniqueFd(fd);
+        if (errno != EINTR) return KsError::posix(errno);
+    }
+}
+
+namespace {
+
+Result<UniqueFd> openat2(int directory, const char* path, int flags, std::uint64_t resolve) {
+    open_how how{};
+    how.flags = static_cast<std::uint64_t>(flags) | O_CLOEXEC;
+    how.resolve = resolve | RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS;
+    while (true) {
+        const long fd = ::syscall(SYS_openat2, directory, path, &how, sizeof how);
+        if (fd >= 0) return UniqueFd(static_cast<int>(fd));
+        // EAGAIN: a rename elsewhere raced with the walk, which then can't prove that it stayed beneath.
+        if (errno != EINTR && errno != EAGAIN) return KsError::posix(errno);
+    }
+}
+
+}  // namespace
+
+Result<UniqueFd> openBeneath(int directory, std::string_view relativePath, int flags, std::uint64_t resolve) {
+    UniqueFd holder;
+    while (relativePath.size() >= PATH_MAX) {
+        const std::size_t cut = relativePath.rfind('/', PATH_MAX - 1);
+        if (cut == std::string_view::npos || cut == 0) return KsError::posix(ENAMETOOLONG);
+        const std::string piece(relativePath.substr(0, cut));
+        holder = TRY(openat2(directory, piece.c_str(), O_PATH | O_DIRECTORY, resolve));
+        directory = holder.get();
+        relativePath.remove_prefix(cut + 1);
+    }
+    if (relativePath.empty()) relativePath = ".";
+    return openat2(directory, std::string(relativePath).c_str(), flags, resolve);
+}
+
+Result<FileStatus> statx(int directory, const char* name) {
+    struct ::statx raw;
+    const int flags = AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT | (*name == '\0' ? AT_EMPTY_PATH : 0);
+    while (::statx(directory, name, flags, STATX_BASIC_STATS | STATX_BTIME, &raw) != 0) {
+        if (errno != EINTR) return KsError::posix(errno);
+    }
+    FileStatus status;
+    status.fileID = raw.stx_ino;
+    status.device = (std::uint64_t{raw.stx_dev_major} << 32) | raw.stx_dev_minor;
+    status.size = raw.stx_size;
+    status.attributes = raw.stx_attributes;
+    status.modificationTime = dateOf(raw.stx_mtime);
+    status.changeTime = dateOf(raw.stx_ctime);
+    if ((raw.stx_mask & STATX_BTIME) != 0) status.birthTime = dateOf(raw.stx_btime);
+    status.mode = raw.stx_mode;
+    status.owner = raw.stx_uid;
+    return status;
+}
+
+Result<bool> hasXattrs(int directory, const char* name, std::string& names) {
+    char buffer[512];
+    const ssize_t size = listxattrOnce(directory, name, buffer, sizeof buffer);
+    if (size >= 0) {
+        names.assign(buffer, static_cast<std::size_t>(size));
+        return size > 0;
+    }
+    if (errno == ENOTSUP) return false;
+    if (errno != ERANGE) return KsError::posix(errno);
+    names = TRY(listxattrat(directory, name));
+    return !names.empty();
+}
+
+Result<std::string> listxattrat(int directory, const char* name) {
+    std::string names;
+    while (true) {
+        const ssize_t size = listxattrOnce(directory, name, nullptr, 0);
+        if (size < 0) return errno == ENOTSUP ? Result<std::string>(std::string()) : KsError::posix(errno);
+        names.resize(static_cast<std::size_t>(size));
+        if (size == 0) return names;
+        const ssize_t read = listxattrOnce(directory, name, names.data(), names.size());
+        if (read >= 0) {
+            names.resize(static_cast<std::size_t>(read));
+            return names;
+        }
+        if (errno != ERANGE) return KsError::posix(errno);  // ERANGE: the list grew between the two calls.
+    }
+}
+
+Result<std::size_t> getxattrat(int directory, const char* name, const char* attribute, std::span<std::byte> buffer) {
+    const ssize_t size = getxattrOnce(directory, name, attribute, buffer.data(), buffer.size());
+    if (size < 0) return KsError::posix(errno);
+    return static_cast<std::size_t>(size);
+}
+
+Result<bool> isWritable(int directory, const char* name) {
+    const int flags = AT_EACCESS | (*name == '\0' ? AT_EMPTY_PATH : AT_SYMLINK_NOFOLLOW);
+    if (::faccessat(directory, name, W_OK, flags) == 0) return true;
+    if (errno == EACCES || errno == EROFS || errno == EPERM || errno == ETXTBSY) return false;
+    return KsError::posix(errno);
+}
+
+Result<Bytes> readBeginning(int directory, const char* name, std::size_t count) {
+    // O_PATH: a handle to the file itself; what it is can be told before anything is opened.
+    const UniqueFd handle = TRY(*name == '\0' ? openBeneath(directory, "", O_PATH) : openat(directory, name, O_PATH | O_NOFOLLOW));
+    if (!TRY(statx(handle.get(), "")).isRegular()) return KsError::posix(ENXIO);
+    const std::string path = pathThroughDescriptor(handle.get(), "");
+    const UniqueFd file = TRY(open(path.c_str(), O_RDONLY | O_NOATIME | O_NONBLOCK));
+    Bytes bytes(count);
+    std::size_t filled = 0;
+    while (filled < count) {
+        const ssize_t got = ::pread(file.get(), bytes.data() + filled, count - filled, static_cast<off_t>(filled));
+        if (got < 0 && errno == EINTR) continue;
+        if (got < 0) return KsError::posix(errno);
+        if (got == 0) break;
+        filled += static_cast<std::size_t>(got);
+    }
+    bytes.resize(filled);
+    return bytes;
+}
+
+Result<UniqueFd> openDirectoryForReading(int directory, const char* name, int extraFlags) {
+    const int flags = O_RDONLY | O_DIRECTORY | O_NONBLOCK | extraFlags;
+    Result<UniqueFd> opened = openat(directory, name, flags | O_NOATIME);
+    // Only an object's owner may leave its access time alone.
+    if (!opened.ok() && opened.error().isPosix(EPERM)) opened = openat(directory, name, flags);
+    return opened;
+}
+
+Result<std::string> pathOfDescriptor(int fd) {
+    const std::string link = pathThroughDescriptor(fd, "");
+    std::string path(PATH_MAX, '\0');
+    const ssize_t size = ::readlink(link.c_str(), path.data(), path.size());
+    if (size < 0) return KsError::posix(errno);
+    if (static_cast<std::size_t>(size) == path.size()) return KsError::posix(ENAMETOOLONG);
+    path.resize(static_cast<std::size_t>(size));
+    return path;
+}
+
+Result<std::size_t> getdents(int directory, std::span<std::byte> buffer) {
+    while (true) {
+        const long size = ::syscall(SYS_getdents64, directory, buffer.data(), buffer.size());
+        if (size >= 0) return static_cast<std::size_t>(size);
+        if (errno != EINTR) return KsError::posix(errno);
+    }
+}
+
+Result<std::uint64_t> countEntries(int directory, const char* name, std::uint64_t max) {
+    const UniqueFd fd = TRY(openDirectoryForReading(directory, *name == '\0' ? "." : name, O_NOFOLLOW));
+    alignas(8) std::byte buffer[8192];
+    std::uint64_t count = 0;
+    while (count < max) {
+        const std::size_t size = TRY(getdents(fd.get(), buffer));
+        if (size == 0) break;
+        for (std::size_t at = 0; at < size;) {
+            const auto* record = reinterpret_cast<const DirectoryRecord*>(buffer + at);
+            if (!record->isDots()) ++count;
+            at += record->length;
+        }
+    }
+    return std::min(count, max);
+}
+
+}  // namespace sys
+
+}  // namespace cindral

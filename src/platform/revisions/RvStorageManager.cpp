@@ -1,0 +1,141 @@
+#include "platform/revisions/RvStorageManager.h"
+
+#include <fcntl.h>
+
+#include <atomic>
+#include <cerrno>
+#include <vector>
+
+#include "platform/revisions/ObjectFinder.h"
+
+namespace cindral {
+
+namespace {
+
+std::atomic<RvStorageManager*> replacement{nullptr};
+
+int errnoOf(const KsError& error) {
+    return error.domain() == kKsPOSIXErrorDomain ? static_cast<int>(error.code()) : EIO;
+}
+
+}  // namespace
+
+RvStorageManager& RvStorageManager::defaultManager() {
+    // Never destroyed: work that ends with the process may still ask.
+    static RvStorageManager& manager = *new RvStorageManager;
+    RvStorageManager* other = replacement.load(std::memory_order_acquire);
+    return other != nullptr ? *other : manager;
+}
+
+void RvStorageManager::replaceDefaultManager(RvStorageManager* manager) {
+    replacement.store(manager, std::memory_order_release);
+}
+
+void RvStorageManager::setStore(std::shared_ptr<VolumeStore> store) {
+    KsURL::setDocumentIdentifierSource([store](const FileStatus& status) -> std::uint32_t {
+        const auto object = store ? store->object(FileID{status.fileID}) : std::nullopt;
+        return object && object->birthTime == status.birthStamp() ? static_cast<std::uint32_t>(object->documentID) : 0;
+    });
+    const MutexLock lock(mutex_);
+    store_ = std::move(store);
+}
+
+std::shared_ptr<VolumeStore> RvStorageManager::store() const {
+    const MutexLock lock(mutex_);
+    return store_;
+}
+
+std::uint64_t RvStorageManager::resolveDocumentID(std::int64_t documentID, std::uint32_t device) {
+    const auto fail = [](int errorNumber) {
+        errno = errorNumber;
+        return std::uint64_t{0};
+    };
+    const auto store = this->store();
+    if (!store) return fail(EAGAIN);
+    if (documentID <= 0 || documentID > UINT32_MAX) return fail(EINVAL);
+    const auto document = store->document(DocumentID{static_cast<std::uint32_t>(documentID)});
+    if (!document) return fail(ENOENT);
+    const Result<FoundObject> found = ObjectFinder(*store, device).find(document->fileID);
+    if (!found.ok()) return fail(errnoOf(found.error()));
+    // The number went to another object: the document's own is gone.
+    if (found->status.birthStamp() != document->birthTime) return fail(ENOENT);
+    return static_cast<std::uint64_t>(document->fileID);
+}
+
+std::uint32_t RvStorageManager::documentIDForDescriptor(int fd) {
+    const auto fail = [](int errorNumber) {
+        errno = errorNumber;
+        return std::uint32_t{0};
+    };
+    const auto store = this->store();
+    if (!store) return fail(EAGAIN);
+    const Result<FileStatus> status = sys::statx(fd, "");
+    if (!status.ok()) return fail(errnoOf(status.error()));
+
+    ObjectSighting sighting;
+    sighting.fileID = FileID{status->fileID};
+    sighting.birthTime = status->birthStamp();
+    sighting.kind = objectKindOf(*status, status->isDirectory());
+    sighting.wantsDocumentID = true;
+    std::string name;
+    if (const auto known = store->object(sighting.fileID); known && known->birthTime == sighting.birthTime) {
+        if (known->documentID != DocumentID{}) return static_cast<std::uint32_t>(known->documentID);
+        sighting.parent = known->parent;
+        name = known->name;
+    } else {
+        const Result<std::string> path = sys::pathOfDescriptor(fd);
+        if (!path.ok()) return fail(errnoOf(path.error()));
+        const KsURL url = KsURL::fileURL(*path);
+        name = url.lastPathComponent();
+        if (const auto folder = url.deletingLastPathComponent()) {
+            const Result<FileStatus> parent = sys::statx(AT_FDCWD, folder->path().c_str());
+            if (parent.ok()) sighting.parent = FileID{parent->fileID};
+        }
+    }
+    sighting.name = name;
+    const Result<void> identified = store->identify({&sighting, 1});
+    if (!identified.ok()) return fail(errnoOf(identified.error()));
+    return static_cast<std::uint32_t>(sighting.documentID);
+}
+
+Result<void> RvStorageManager::identify(std::span<KsURL> entries, const KsURL& folder) {
+    const auto store = this->store();
+    if (!store) return KsError::posix(EAGAIN);
+    const FileStatus folderStatus = TRY(folder.status());
+    TRY(ObjectFinder(*store, folderStatus.deviceID()).recordFolder(folder.path()));
+
+    std::vector<ObjectSighting> sightings;
+    std::vector<KsURL*> sighted;
+    sightings.reserve(entries.size());
+    sighted.reserve(entries.size());
+    for (KsURL& entry : entries) {
+        const Result<FileStatus> status = entry.status();
+        if (!status.ok() || status->device != folderStatus.device) continue;
+        ObjectSighting sighting;
+        sighting.fileID = FileID{status->fileID};
+        sighting.birthTime = status->birthStamp();
+        sighting.parent = FileID{folderStatus.fileID};
+        sighting.kind = objectKindOf(*status, entry.isPackage().valueOr(false));
+        sighting.name = entry.lastPathComponent();
+        sighting.wantsDocumentID = sighting.kind == ObjectKind::file || sighting.kind == ObjectKind::package;
+        sightings.push_back(sighting);
+        sighted.push_back(&entry);
+    }
+    TRY(store->identify(sightings));
+    for (std::size_t i = 0; i < sightings.size(); ++i) {
+        if (!sightings[i].wantsDocumentID) continue;
+        sighted[i]->setCachedResourceValue(ResourceKey::documentIdentifier, std::uint64_t{static_cast<std::uint32_t>(sightings[i].documentID)});
+    }
+    return {};
+}
+
+Result<std::string> RvStorageManager::pathOfFileID(std::uint64_t fileID, std::uint32_t device, std::size_t sizeMax) {
+    const auto store = this->store();
+    if (!store) return KsError::posix(EAGAIN);
+    const FoundObject found = TRY(ObjectFinder(*store, device).find(FileID{fileID}));
+    std::string path = found.path();
+    if (path.size() >= sizeMax) return KsError::posix(ENAMETOOLONG, path);
+    return path;
+}
+
+}  // namespace cindral
