@@ -6,6 +6,8 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "platform/foundation/Log.h"
+
 namespace cindral {
 
 namespace {
@@ -14,9 +16,17 @@ bool holds(std::string_view root, std::string_view path) {
     return path.starts_with(root) && (path.size() == root.size() || path[root.size()] == '/' || root == "/");
 }
 
+// Enough to tell a person what is the matter; a tree with more mounts than that has one matter only.
+constexpr std::size_t kLeftOutMax = 1000;
+
 using Roots = std::vector<std::shared_ptr<const RootDirectory>>;
 
 }  // namespace
+
+DirectoryReference::~DirectoryReference() {
+    if (!fd) return;
+    if (::close(fd.release()) != 0) logError("can't close directory at {}; {}", path, KsError::errorWithPOSIXCode().description());
+}
 
 RootDirectories& RootDirectories::shared() {
     // Never destroyed: work that ends with the process may still look a root up.
@@ -63,6 +73,26 @@ std::shared_ptr<const RootDirectory> RootDirectories::rootHolding(std::string_vi
     if (!roots) return nullptr;
     const auto found = std::ranges::find_if(*roots, [&](const auto& root) { return holds(root->path, path); });
     return found == roots->end() ? nullptr : *found;
+}
+
+bool RootDirectories::noteLeftOut(const std::string& path, const std::string& why) {
+    const MutexLock lock(mutex_);
+    if (leftOut_.size() >= kLeftOutMax || std::ranges::find(leftOut_, path, &LeftOut::path) != leftOut_.end()) return false;
+    leftOut_.push_back({path, why});
+    return true;
+}
+
+std::vector<RootDirectories::LeftOut> RootDirectories::leftOut() const {
+    const MutexLock lock(mutex_);
+    return leftOut_;
+}
+
+Result<UniqueFd> RootDirectories::openForReading(const std::string& path) {
+    constexpr int kFlags = O_RDONLY | O_DIRECTORY | O_NONBLOCK;
+    Result<UniqueFd> opened = open(path, kFlags | O_NOATIME);
+    // Only an object's owner may leave its access time alone.
+    if (!opened.ok() && opened.error().isPosix(EPERM)) opened = open(path, kFlags);
+    return opened;
 }
 
 Result<UniqueFd> RootDirectories::open(const std::string& path, int flags) {

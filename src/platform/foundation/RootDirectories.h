@@ -16,6 +16,11 @@ namespace cindral {
 ///
 /// Thread safety: immutable.
 struct DirectoryReference {
+    DirectoryReference() = default;
+    ~DirectoryReference();
+    DirectoryReference(const DirectoryReference&) = delete;
+    DirectoryReference& operator=(const DirectoryReference&) = delete;
+
     UniqueFd fd;
     std::string path;  ///< absolute, without a trailing slash
     FileStatus status;
@@ -46,12 +51,23 @@ public:
     std::shared_ptr<const RootDirectory> rootHolding(std::string_view path) const;
     std::vector<std::shared_ptr<const RootDirectory>> all() const;
 
+    /// Tells that something below a root is not published, and why. True the first time that is said of the path.
+    bool noteLeftOut(const std::string& path, const std::string& why);
+    struct LeftOut {
+        std::string path;
+        std::string why;
+    };
+    std::vector<LeftOut> leftOut() const;
+
+    /// Opens a directory to be listed, as open() does, leaving its access time alone where the process may.
+    static Result<UniqueFd> openForReading(const std::string& path);
     /// Opens what is at the path: beneath its root, or, where no root holds it, from the top without following a final link.
     static Result<UniqueFd> open(const std::string& path, int flags);
 
 private:
     mutable Mutex mutex_;
     std::shared_ptr<const std::vector<std::shared_ptr<const RootDirectory>>> roots_ GUARDED_BY(mutex_);
+    std::vector<LeftOut> leftOut_ GUARDED_BY(mutex_);
 };
 
 }  // namespace cindral

@@ -205,6 +205,13 @@ Result<UniqueFd> openDirectoryForReading(int directory, const char* name, int ex
     return opened;
 }
 
+Result<UniqueFd> openDirectoryBeneath(int directory, std::string_view relativePath, std::uint64_t resolve) {
+    constexpr int kFlags = O_RDONLY | O_DIRECTORY | O_NONBLOCK | O_NOFOLLOW;
+    Result<UniqueFd> opened = openBeneath(directory, relativePath, kFlags | O_NOATIME, resolve);
+    if (!opened.ok() && opened.error().isPosix(EPERM)) opened = openBeneath(directory, relativePath, kFlags, resolve);
+    return opened;
+}
+
 Result<std::string> pathOfDescriptor(int fd) {
     const std::string link = pathThroughDescriptor(fd, "");
     std::string path(PATH_MAX, '\0');

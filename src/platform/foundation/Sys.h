@@ -78,6 +78,8 @@ Result<Bytes> readBeginning(int directory, const char* name, std::size_t count);
 
 /// Opens a directory to be listed, leaving its access time alone where the process may. `name` "" is not allowed; "." is the directory itself.
 Result<UniqueFd> openDirectoryForReading(int directory, const char* name, int extraFlags = 0);
+/// The same for a directory at a path below another; a final link is refused.
+Result<UniqueFd> openDirectoryBeneath(int directory, std::string_view relativePath, std::uint64_t resolve = 0);
 /// Where a link of /proc/self/fd leads: the path of an open descriptor as the kernel knows it; "/" or a path with " (deleted)" where
 /// it knows none. Check what comes back.
 Result<std::string> pathOfDescriptor(int fd);

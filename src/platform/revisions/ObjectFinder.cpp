@@ -105,8 +105,7 @@ Result<FoundObject> ObjectFinder::findByReading(FileID fileID) const {
         while (!folders.empty()) {
             const std::string folder = std::move(folders.back());
             folders.pop_back();
-            const Result<UniqueFd> fd =
-                sys::openBeneath(root->fd.get(), folder, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_NONBLOCK, RESOLVE_NO_SYMLINKS | RESOLVE_NO_XDEV);
+            const Result<UniqueFd> fd = sys::openDirectoryBeneath(root->fd.get(), folder, RESOLVE_NO_SYMLINKS | RESOLVE_NO_XDEV);
             if (!fd.ok()) continue;  // Gone since, unreadable, or of another device: nothing in it can be told.
             while (true) {
                 const Result<std::size_t> size = sys::getdents(fd->get(), buffer);
@@ -134,9 +133,9 @@ Result<void> ObjectFinder::record(const FoundObject& object) const {
     const std::string parentPath = atTop ? "" : object.relativePath.substr(0, slash);
     const std::string name = atTop ? object.relativePath : object.relativePath.substr(slash + 1);
     if (name.empty()) return {};  // The root itself ends every chain.
-    TRY(recordFolder(parentPath.empty() ? object.root->path : object.root->path + "/" + parentPath));
     const UniqueFd parent = TRY(sys::openBeneath(object.root->fd.get(), parentPath, O_PATH | O_DIRECTORY, RESOLVE_NO_SYMLINKS));
     const FileStatus parentStatus = TRY(sys::statx(parent.get(), ""));
+    TRY(recordFolder(parentPath.empty() ? object.root->path : object.root->path + "/" + parentPath, parentStatus));
 
     ObjectSighting sighting;
     sighting.fileID = FileID{object.status.fileID};
@@ -147,14 +146,12 @@ Result<void> ObjectFinder::record(const FoundObject& object) const {
     return store_.identify({&sighting, 1});
 }
 
-Result<void> ObjectFinder::recordFolder(const std::string& path) const {
+Result<void> ObjectFinder::recordFolder(const std::string& path, const FileStatus& folder) const {
     const auto root = RootDirectories::shared().rootHolding(path);
     if (!root || path.size() <= root->path.size()) return {};
     const std::string relative = path.substr(root->path.size() + 1);
-    const UniqueFd own = TRY(sys::openBeneath(root->fd.get(), relative, kFindFlags));
-    const FileStatus ownStatus = TRY(sys::statx(own.get(), ""));
-    const auto recorded = store_.recordedPath(FileID{ownStatus.fileID}, rootIDs_);
-    if (recorded && recorded->path == relative && recorded->birthTime == ownStatus.birthStamp() && roots_[recorded->rootIndex] == root) return {};
+    const auto recorded = store_.recordedPath(FileID{folder.fileID}, rootIDs_);
+    if (recorded && recorded->path == relative && recorded->birthTime == folder.birthStamp() && roots_[recorded->rootIndex] == root) return {};
 
     std::vector<ObjectSighting> sightings;
     FileID parent{root->status.fileID};

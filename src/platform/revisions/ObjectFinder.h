@@ -36,7 +36,7 @@ public:
     Result<FoundObject> find(FileID fileID) const;
 
     /// Records where a folder is, and every folder above it, unless the store knows already. For folders outside of the roots nothing is done.
-    Result<void> recordFolder(const std::string& path) const;
+    Result<void> recordFolder(const std::string& path, const FileStatus& status) const;
 
 private:
     Result<FoundObject> findByRecords(FileID fileID) const;

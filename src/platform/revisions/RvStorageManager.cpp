@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <vector>
@@ -13,6 +14,18 @@ namespace cindral {
 namespace {
 
 std::atomic<RvStorageManager*> replacement{nullptr};
+
+/// Records the folders of a page that are not themselves among its entries, so that the entries' recorded parents lead to a root.
+Result<void> recordFolders(VolumeStore& store, std::vector<const DirectoryReference*>& folders, std::span<const ObjectSighting> sightings) {
+    std::ranges::sort(folders);
+    folders.erase(std::ranges::unique(folders).begin(), folders.end());
+    for (const DirectoryReference* folder : folders) {
+        const auto isFolder = [&](const ObjectSighting& sighting) { return sighting.fileID == FileID{folder->status.fileID}; };
+        if (folders.size() > 1 && std::ranges::any_of(sightings, isFolder)) continue;
+        TRY(ObjectFinder(store, folder->status.deviceID()).recordFolder(folder->path, folder->status));
+    }
+    return {};
+}
 
 int errnoOf(const KsError& error) {
     return error.domain() == kKsPOSIXErrorDomain ? static_cast<int>(error.code()) : EIO;
@@ -98,29 +111,29 @@ std::uint32_t RvStorageManager::documentIDForDescriptor(int fd) {
     return static_cast<std::uint32_t>(sighting.documentID);
 }
 
-Result<void> RvStorageManager::identify(std::span<KsURL> entries, const KsURL& folder) {
+Result<void> RvStorageManager::identify(std::span<KsURL> entries) {
     const auto store = this->store();
     if (!store) return KsError::posix(EAGAIN);
-    const FileStatus folderStatus = TRY(folder.status());
-    TRY(ObjectFinder(*store, folderStatus.deviceID()).recordFolder(folder.path()));
-
     std::vector<ObjectSighting> sightings;
     std::vector<KsURL*> sighted;
+    std::vector<const DirectoryReference*> folders;
     sightings.reserve(entries.size());
     sighted.reserve(entries.size());
     for (KsURL& entry : entries) {
+        const DirectoryReference& folder = *entry.directory();
         const Result<FileStatus> status = entry.status();
-        if (!status.ok() || status->device != folderStatus.device) continue;
-        ObjectSighting sighting;
+        if (!status.ok() || status->device != folder.status.device) continue;
+        if (folders.empty() || folders.back() != &folder) folders.push_back(&folder);
+        ObjectSighting& sighting = sightings.emplace_back();
         sighting.fileID = FileID{status->fileID};
         sighting.birthTime = status->birthStamp();
-        sighting.parent = FileID{folderStatus.fileID};
+        sighting.parent = FileID{folder.status.fileID};
         sighting.kind = objectKindOf(*status, entry.isPackage().valueOr(false));
         sighting.name = entry.lastPathComponent();
         sighting.wantsDocumentID = sighting.kind == ObjectKind::file || sighting.kind == ObjectKind::package;
-        sightings.push_back(sighting);
         sighted.push_back(&entry);
     }
+    TRY(recordFolders(*store, folders, sightings));
     TRY(store->identify(sightings));
     for (std::size_t i = 0; i < sightings.size(); ++i) {
         if (!sightings[i].wantsDocumentID) continue;

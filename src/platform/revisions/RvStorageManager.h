@@ -35,10 +35,11 @@ public:
     /// The document ID of the open file (O_PATH will do), given now if it has none; 0 with errno otherwise.
     virtual std::uint32_t documentIDForDescriptor(int fd);
 
-    /// Gives the entries of one folder their document IDs, and records where they were seen, in one transaction.
+    /// Gives entries of open folders (KsURL::child) their document IDs, and records where they were seen, in one transaction.
     ///
-    /// The URLs' cached document identifiers are set. Entries that are gone, and those of another device, are left as they are.
-    Result<void> identify(std::span<KsURL> entries, const KsURL& folder);
+    /// The URLs' cached document identifiers are set. Entries that are gone, and those of another device than their folder, are
+    /// left as they are.
+    Result<void> identify(std::span<KsURL> entries);
 
     /// The path of an object by its number, as presented: by the recorded parents, or, where they don't lead to it, by asking the file system.
     /// What is handed out was checked against the file system.

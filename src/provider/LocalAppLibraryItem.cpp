@@ -1,0 +1,30 @@
+#include "provider/LocalAppLibraryItem.h"
+
+#include <algorithm>
+
+#include "platform/foundation/Log.h"
+
+namespace cindral {
+
+std::shared_ptr<const LocalAppLibraryItem> LocalAppLibraryItem::initWithBundleProxy(const RoBundleProxy& proxy) {
+    if (!proxy.dataContainerURL()) {
+        logError("can't create an app library item without a data container URL");
+        return nullptr;
+    }
+    const KsURL documents = proxy.dataContainerURL()->appendingPathComponent("Documents");
+    auto item = std::make_shared<LocalAppLibraryItem>(Passkey(), documents);
+    Customs customs;
+    customs.itemID = "#" + proxy.bundleIdentifier();
+    customs.parentItemID = kTesselRootContainerItemIdentifier;
+    customs.filename = proxy.localizedName();
+    customs.bundleIdentifier = InternedString(proxy.bundleIdentifier());
+    if (!item->build(std::move(customs))) return nullptr;
+
+    for (const char* hidden : {"Inbox", ".Trash"}) {
+        if (item->childItemCount_.value_or(0) == 0) break;
+        if (documents.appendingPathComponent(hidden).status().ok()) --*item->childItemCount_;
+    }
+    return item;
+}
+
+}  // namespace cindral

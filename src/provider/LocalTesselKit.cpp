@@ -1,0 +1,192 @@
+#include "provider/LocalTesselKit.h"
+
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <utility>
+
+#include "platform/foundation/Log.h"
+#include "platform/roster/Roster.h"
+#include "platform/tessel/NotificationCenter.h"
+#include "platform/tessel/TesselErrors.h"
+#include "platform/tessel/TesselManager.h"
+#include "provider/AppRefresh.h"
+#include "provider/CindralProvider.h"
+#include "provider/KsURL+CdlFileObjectIdentifier.h"
+#include "provider/LocalAppLibraryItem.h"
+#include "provider/LocalFileEnumerator.h"
+#include "provider/LocalRootEnumerator.h"
+#include "provider/LocalTesselKitError.h"
+#include "provider/Utilities.h"
+
+namespace cindral {
+
+namespace {
+
+constexpr std::chrono::milliseconds kAppRefreshIntervalMin{500};
+constexpr std::string_view kDocumentsName = "Documents";
+
+NotificationCenter& requiredDistributedCenter() {
+    NotificationCenter* center = NotificationCenter::distributedCenter();
+    if (center == nullptr) {
+        std::fputs("the distributed notification center is missing\n", stderr);
+        std::abort();
+    }
+    return *center;
+}
+
+}  // namespace
+
+class LocalTesselKit::InstalledAppsProxy {
+public:
+    void setProvider(std::weak_ptr<LocalTesselKit> provider) {
+        const MutexLock lock(mutex_);
+        provider_ = std::move(provider);
+    }
+    std::shared_ptr<LocalTesselKit> provider() const {
+        const MutexLock lock(mutex_);
+        return provider_.lock();
+    }
+
+private:
+    mutable Mutex mutex_;
+    std::weak_ptr<LocalTesselKit> provider_ GUARDED_BY(mutex_);
+};
+
+LocalTesselKit::LocalTesselKit()
+    : appRefreshPacer_("cindral.app-refresh.pacer", appRefreshQueue_, kAppRefreshIntervalMin), installedAppsProxy_(std::make_shared<InstalledAppsProxy>()) {
+    // Captures nothing of the provider: a refresh may outlast it.
+    appRefreshPacer_.setEventBlock(refreshApps);
+    appRefreshPacer_.resume();
+    appRefreshPacer_.signal();
+}
+
+std::shared_ptr<LocalTesselKit> LocalTesselKit::init() {
+    std::shared_ptr<LocalTesselKit> provider(new LocalTesselKit);
+    NotificationCenter& center = requiredDistributedCenter();
+    const InstalledAppsProxy* proxy = provider->installedAppsProxy_.get();
+    provider->installedAppsProxy_->setProvider(provider);
+    center.addObserver(proxy, notificationCallback, kApplicationRegisteredNotification, SuspensionBehavior::coalesce);
+    center.addObserver(proxy, notificationCallback, kApplicationUnregisteredNotification, SuspensionBehavior::coalesce);
+    logInfo("auto notify changes on TesselWorkingSetContainerItemIdentifier at startup");
+    TesselManager::defaultManager().signalEnumeratorForContainerItemIdentifier(kTesselWorkingSetContainerItemIdentifier,
+                                                                               [](const std::optional<KsError>&) {});
+    return provider;
+}
+
+LocalTesselKit::~LocalTesselKit() {
+    // A notification that comes in between finds the proxy without a provider, and is dropped.
+    SerialQueue::main().async([proxy = std::move(installedAppsProxy_)] { requiredDistributedCenter().removeEveryObserver(proxy.get()); });
+}
+
+void LocalTesselKit::notificationCallback(const void* observer, std::string_view /*name*/) {
+    if (observer == nullptr) return;
+    const auto provider = static_cast<const InstalledAppsProxy*>(observer)->provider();
+    if (provider) provider->appRefreshPacer_.signal();
+}
+
+std::shared_ptr<const LocalItem> LocalTesselKit::resolveItem(const TesselItemIdentifier& identifier) {
+    if (identifier.starts_with('#')) {
+        const auto proxy = RoBundleProxy::bundleProxyForIdentifier(identifier.substr(1));
+        return proxy ? LocalAppLibraryItem::initWithBundleProxy(*proxy) : nullptr;
+    }
+    if (identifier == kTesselTemporaryLocalFolderItemIdentifier) return LocalItem::initWithURL(temporaryLocalFolderURL());
+    std::optional<KsURL> url = fileURLWithItemIdentifier(identifier);
+    return url ? LocalItem::initWithURL(*std::move(url)) : nullptr;
+}
+
+Result<KsURL> LocalTesselKit::urlForItem(const TesselItemIdentifier& identifier) {
+    const auto item = resolveItem(identifier);
+    if (!item) return tesselErrorForNonExistentItemWithIdentifier(identifier);
+    logDebug("found {}", item->fileURL()->description());
+    return *item->fileURL();
+}
+
+std::optional<KsURL> LocalTesselKit::URLForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier) {
+    return urlForItemWithPersistentIdentifier(identifier);
+}
+
+std::optional<KsURL> LocalTesselKit::urlForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier) {
+    const LogSection section("fetching URL for \"{}\"", identifier);
+    Result<KsURL> url = urlForItem(identifier);
+    if (url.ok()) return *std::move(url);
+    if (url.error().code() == static_cast<std::int64_t>(LocalTesselKitError::itemNotFound)) {
+        logDebug("can't find URL matching identifier {}; {}", identifier, url.error().description());
+    } else {
+        logError("can't find URL matching identifier {}; {}", identifier, url.error().description());
+    }
+    return std::nullopt;
+}
+
+std::optional<TesselItemIdentifier> LocalTesselKit::persistentIdentifierForItemAtURL(const KsURL& url) {
+    return persistentIdentifierForItemAt(url);
+}
+
+std::optional<TesselItemIdentifier> LocalTesselKit::persistentIdentifierForItemAt(const KsURL& url) {
+    const LogSection section("fetching item identifier for \"{}\"", url.description());
+    std::optional<TesselItemIdentifier> identifier;
+    if (url.lastPathComponent() == kDocumentsName) identifier = CdlFileObjectIdentifier::fromAppLibraryDataContainerURL(url);
+    if (!identifier) {
+        const auto item = LocalItem::initWithURL(url);
+        if (!item) return std::nullopt;
+        identifier = item->itemIdentifier();
+    }
+    logDebug("found {}", *identifier);
+    return identifier;
+}
+
+Result<std::shared_ptr<const TesselItem>> LocalTesselKit::itemForIdentifier(const TesselItemIdentifier& identifier) {
+    const LogSection section("fetching item's properties for \"{}\"", identifier);
+    std::shared_ptr<const TesselItem> item = resolveItem(identifier);
+    if (!item) {
+        logError("item lookup failed for identifier \"{}\"", identifier);
+        return errorFor(LocalTesselKitError::invalidItemIdentifier).with("identifier", identifier);
+    }
+    logDebug("found {}", item->description());
+    return item;
+}
+
+Result<std::shared_ptr<TesselEnumerator>> LocalTesselKit::enumeratorForContainerItemIdentifier(const TesselItemIdentifier& container) {
+    const LogSection section("enumerator for {}", container);
+    if (container == kTesselRootContainerItemIdentifier || container == kTesselWorkingSetContainerItemIdentifier ||
+        container == kTesselAllDirectoriesContainerItemIdentifier) {
+        return std::shared_ptr<TesselEnumerator>(LocalRootEnumerator::initWithContainer(container));
+    }
+    KsURL url = TRY(urlForItem(container));
+    return std::shared_ptr<TesselEnumerator>(LocalFileEnumerator::initWithContainer(container, {std::move(url)}));
+}
+
+void LocalTesselKit::providePlaceholderAtURL(const KsURL& /*url*/, Completion completion) {
+    completion(std::nullopt);
+}
+
+void LocalTesselKit::startProvidingItemAtURL(const KsURL& url, Completion completion) {
+    providePlaceholderAtURL(url, std::move(completion));
+}
+
+void LocalTesselKit::stopProvidingItemAtURL(const KsURL& /*url*/) {}
+
+void LocalTesselKit::itemChangedAtURL(const KsURL& url) {
+    stopProvidingItemAtURL(url);
+}
+
+void LocalTesselKit::defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier, ItemCompletion completion) {
+    const LogSection section("default location for {}", bundleIdentifier);
+    const auto proxy = RoBundleProxy::bundleProxyForIdentifier(bundleIdentifier);
+    if (!proxy) {
+        logError("can't create bundle proxy with '{}'", bundleIdentifier);
+        return completion(tsInvalidParameterError("bundleIdentifier", bundleIdentifier));
+    }
+    std::shared_ptr<const TesselItem> item = LocalAppLibraryItem::initWithBundleProxy(*proxy);
+    if (!item) {
+        logError("can't create an app library item with {}", proxy->description());
+        return completion(tsInvalidParameterError("bundleIdentifier", bundleIdentifier));
+    }
+    completion(std::move(item));
+}
+
+std::shared_ptr<TesselExtension> makeCindralProvider() {
+    return LocalTesselKit::init();
+}
+
+}  // namespace cindral
