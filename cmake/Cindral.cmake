@@ -38,7 +38,7 @@ endfunction()
 # cindral_tests(NAME [DEPENDS library...]): the *Test.cpp of the calling folder as one program, each test known to ctest.
 function(cindral_tests name)
   cmake_parse_arguments(PARSE_ARGV 1 arg "" "" "DEPENDS")
-  file(GLOB sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*Test.cpp)
+  file(GLOB sources CONFIGURE_DEPENDS ${CMAKE_CURRENT_SOURCE_DIR}/*Test.cpp ${CMAKE_CURRENT_SOURCE_DIR}/*Fixture.cpp)
   if(NOT sources)
     message(WARNING "No tests in ${CMAKE_CURRENT_SOURCE_DIR}")
     return()

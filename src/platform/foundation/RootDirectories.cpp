@@ -46,7 +46,7 @@ Result<std::shared_ptr<const RootDirectory>> RootDirectories::add(const std::str
     std::erase_if(roots, [&](const auto& other) { return other->path == path; });
     roots.push_back(root);
     // The longest first, so that the first that holds a path is the innermost.
-    std::ranges::stable_sort(roots, std::ranges::greater(), [](const auto& other) { return other->path.size(); });
+    std::ranges::sort(roots, std::ranges::greater(), [](const auto& other) { return other->path.size(); });
     roots_ = std::make_shared<const Roots>(std::move(roots));
     return std::shared_ptr<const RootDirectory>(std::move(root));
 }
