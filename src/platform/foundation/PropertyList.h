@@ -2,8 +2,9 @@
 
 #include <cstdint>
 #include <map>
-#include <memory>
+#include <optional>
 #include <string>
+#include <string_view>
 #include <variant>
 #include <vector>
 
@@ -13,8 +14,19 @@
 
 namespace cindral {
 
+/// Levels of a property list in its binary form: a scalar has one, an array of scalars two.
+inline constexpr unsigned kPropertyListDepthMax = 128;
+
+/// Values that a binary property list may unfold to, each counted once for every reference to it; a text or data counts
+/// as one more for every 16 of its bytes. A list of more bytes than this may unfold to as many values as it has bytes, which
+/// nothing that encodeBinary() writes can reach.
+inline constexpr std::uint64_t kPropertyListValuesMax = 16'384;
+
 /// A value of a property list: bool, integer (signed or unsigned 64 bits), real, date, data, string, array
 /// or dictionary with string keys.
+///
+/// Strings are bytes, UTF-8 by custom: what is not valid UTF-8 comes through the binary form unharmed. Dates keep what a
+/// double of seconds since 2001 can hold, about 0.1 µs in this century: docs/property-list.md.
 ///
 /// Thread safety: a value.
 class PropertyList {
@@ -34,7 +46,7 @@ public:
     PropertyList(Array value) : value_(std::move(value)) {}       // NOLINT(google-explicit-constructor)
     PropertyList(Dictionary value) : value_(std::move(value)) {}  // NOLINT(google-explicit-constructor)
 
-    /// The value as that type, or null. A non-negative integer is always held unsigned; see also signedInteger().
+    /// The value as that type, or null. A non-negative integer is always held unsigned.
     const bool* boolean() const { return std::get_if<bool>(&value_); }
     const std::uint64_t* unsignedInteger() const { return std::get_if<std::uint64_t>(&value_); }
     const std::int64_t* negativeInteger() const { return std::get_if<std::int64_t>(&value_); }
@@ -48,12 +60,14 @@ public:
     const PropertyList* find(std::string_view key) const;
 
     /// The binary form: docs/property-list.md. Equal values have equal bytes.
+    ///
+    /// Aborts when the value has more than kPropertyListDepthMax levels: only a wrong program makes one.
     Bytes encodeBinary() const;
     /// Reads the binary form.
     ///
     /// EINVAL (POSIX domain) with a message for anything malformed: every offset, length and reference is checked
     /// before it is used; cycles, nesting beyond kPropertyListDepthMax and references that would unfold to more
-    /// than kPropertyListValuesMax values are refused, so that no input costs more than a small multiple of its size.
+    /// values than kPropertyListValuesMax allows are refused, so that no input costs more than a small multiple of its size.
     static Result<PropertyList> decodeBinary(ByteView bytes);
 
     friend bool operator==(const PropertyList&, const PropertyList&) = default;
