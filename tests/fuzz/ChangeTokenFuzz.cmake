@@ -1,0 +1,1 @@
+cindral_fuzz_target(ChangeTokenFuzz DEPENDS cindral_provider)

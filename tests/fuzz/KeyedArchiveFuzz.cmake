@@ -1,0 +1,1 @@
+cindral_fuzz_target(KeyedArchiveFuzz DEPENDS cindral_foundation)

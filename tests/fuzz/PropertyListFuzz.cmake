@@ -1,0 +1,1 @@
+cindral_fuzz_target(PropertyListFuzz DEPENDS cindral_foundation)

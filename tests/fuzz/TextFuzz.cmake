@@ -1,0 +1,1 @@
+cindral_fuzz_target(TextFuzz DEPENDS cindral_foundation)
