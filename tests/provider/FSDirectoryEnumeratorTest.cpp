@@ -1,5 +1,7 @@
 #include "provider/fs/FSDirectoryEnumerator.h"
 
+#include <fcntl.h>
+#include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
 

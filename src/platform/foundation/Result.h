@@ -71,12 +71,16 @@ private:
 
 }  // namespace cindral
 
-/// The value of a Result, or a return of its error from the enclosing function.
-/// The statement expression is a compiler extension that both of our compilers have.
-#define TRY(expression)                                                     \
-    __extension__({                                                        \
-        auto tryResult = (expression);                                     \
-        if (!tryResult.ok()) [[unlikely]]                                  \
-            return std::move(tryResult).error();                           \
-        std::move(tryResult).value();                                      \
+#define CINDRAL_TRY(expression, result)                  \
+    __extension__({                                      \
+        auto result = (expression);                      \
+        if (!result.ok()) [[unlikely]]                   \
+            return std::move(result).error();            \
+        std::move(result).value();                       \
     })
+#define CINDRAL_JOINED(a, b) a##b
+#define CINDRAL_TRY_NUMBERED(expression, number) CINDRAL_TRY(expression, CINDRAL_JOINED(tryResult, number))
+
+/// The value of a Result, or a return of its error from the enclosing function.
+/// The statement expression is a compiler extension that both of our compilers have; the number lets one stand inside another.
+#define TRY(expression) CINDRAL_TRY_NUMBERED(expression, __COUNTER__)
