@@ -486,7 +486,7 @@ Result<std::string> Reader::string(const Object& object) {
     }
     if (object.kind != kUTF16Kind) return malformed("key that is no text");
     const ByteView units = TRY(contents(object, 2));
-    TRY(chargeBytes(units.size()));
+    TRY(chargeBytes(units.size() / 2 * 3));  // A unit takes up to three bytes in UTF-8.
     const auto unit = [&](std::size_t i) { return static_cast<char32_t>(readBigEndian(units.subspan(i, 2))); };
     std::string text;
     text.reserve(units.size());
