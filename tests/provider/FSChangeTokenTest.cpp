@@ -189,7 +189,18 @@ TEST(FSChangeToken, rejectsWhatIsNoDictionary) {
 TEST(FSChangeToken, rejectsWhatIsNoPropertyList) {
     expectNone({}, "too short for a property list");
     expectNone(bytesOf("TesselInitialPageSortedByName"), "too short for a property list");
-    expectNone(Bytes(100'000), "not a binary property list");
+    expectNone(Bytes(200), "not a binary property list");
+}
+
+TEST(FSChangeToken, rejectsMoreBytesThanATokenCanHave) {
+    const auto pageOfSize = [](std::size_t size) {
+        const Bytes bytes = pageWith("more", Bytes(256));
+        return pageWith("more", Bytes(256 + size - bytes.size()));
+    };
+    ASSERT_LE(pageOfSize(FSChangeToken::kEncodedSizeMax - 100).size(), FSChangeToken::kEncodedSizeMax);
+    EXPECT_EQ(FSChangeToken::decode(pageOfSize(FSChangeToken::kEncodedSizeMax - 100)), page());
+    expectNone(pageOfSize(FSChangeToken::kEncodedSizeMax + 100), "too large for a token");
+    expectNone(Bytes(10'000'000), "too large for a token");
 }
 
 TEST(FSChangeToken, readsAnUnknownFieldAsNothing) {

@@ -40,6 +40,7 @@ Result<KsUUID> uuid(const PropertyList& list, const char* key) {
 }
 
 Result<FSChangeToken> tokenFrom(ByteView bytes) {
+    if (bytes.size() > FSChangeToken::kEncodedSizeMax) return undecodable("too large for a token");
     const PropertyList list = TRY(PropertyList::decodeBinary(bytes));
     const FSChangeToken token{
         .version = TRY(integer(list, kVersionKey)),

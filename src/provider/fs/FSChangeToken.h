@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -20,6 +21,8 @@ namespace cindral {
 struct FSChangeToken {
     /// Clients keep tokens for as long as they like: add numbers, never change one.
     static constexpr std::uint64_t kCurrentVersion = 1;
+    /// Bytes that are worth looking at. A token has about 200; a client may send megabytes.
+    static constexpr std::size_t kEncodedSizeMax = 16'384;
 
     std::uint64_t version = kCurrentVersion;
     KsUUID deviceUUID;                         ///< volume that streamEventID belongs to
@@ -32,7 +35,7 @@ struct FSChangeToken {
     /// Reads what encode() wrote.
     ///
     /// Returns none, after one error line, when the bytes are no property list, lack a key, hold a value of another type or
-    /// a text that is no UUID, or are a token of another version. Keys beyond the five are ignored.
+    /// a text that is no UUID, are more than kEncodedSizeMax, or are a token of another version. Keys beyond the five are ignored.
     static std::optional<FSChangeToken> decode(ByteView bytes);
 
     /// All fields, for log lines.
