@@ -29,7 +29,7 @@ constexpr std::size_t kPathBufferSize = 1024;
 constexpr int kDocumentResolutionRetriesMax = 5;
 constexpr unsigned kDocumentResolutionRestMicroseconds = 1000;
 // "For event notification only": the object itself, without opening its contents or following a link.
-constexpr int kEventOnlyFlags = O_PATH | O_NOFOLLOW | O_NONBLOCK;
+constexpr int kEventOnlyFlags = O_PATH | O_NOFOLLOW;
 
 /// The root that a proper path is inside of, as text.
 struct MatchedRoot {

@@ -9,7 +9,6 @@ using cindral::FSChangeToken;
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
     const auto token = FSChangeToken::decode(std::as_bytes(std::span(data, size)));
     if (!token) return 0;
-    if (token->version != FSChangeToken::kCurrentVersion) std::abort();
     if (FSChangeToken::decode(token->encode()) != token) std::abort();
     return 0;
 }

@@ -4,6 +4,7 @@
 
 #include <memory>
 #include <optional>
+#include <ostream>
 #include <string>
 #include <vector>
 
@@ -14,6 +15,15 @@
 #include "platform/tessel/TesselErrors.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryFolder.h"
+
+namespace cindral {
+
+// What the test framework prints for a URL.
+inline void PrintTo(const KsURL& url, std::ostream* out) {  // NOLINT(readability-identifier-naming)
+    *out << url.description();
+}
+
+}  // namespace cindral
 
 namespace cindral::test {
 

@@ -49,8 +49,6 @@ Result<FSChangeToken> tokenFrom(ByteView bytes) {
         .offset = TRY(integer(list, kOffsetKey)),
         .appLibraryVersionToken = TRY(integer(list, kAppLibraryVersionTokenKey)),
     };
-    if (token.version != FSChangeToken::kCurrentVersion)
-        return undecodable(fmt::format("version {} is unknown", token.version));
     return token;
 }
 

@@ -30,7 +30,7 @@ struct FSChangeToken {
     std::uint64_t offset = 0;                  ///< directory entries consumed by the gather phase
     std::uint64_t appLibraryVersionToken = 0;  ///< app-library list that was reported; 0 where none takes part
 
-    /// Never fails. A token of another version than kCurrentVersion is written as it is, and read by nobody.
+    /// Never fails.
     Bytes encode() const;
     /// Reads what encode() wrote.
     ///
