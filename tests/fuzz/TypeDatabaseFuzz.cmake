@@ -1,0 +1,1 @@
+cindral_fuzz_target(TypeDatabaseFuzz DEPENDS cindral_foundation)
