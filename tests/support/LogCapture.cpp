@@ -35,12 +35,14 @@ bool LogCapture::containsOnFrameworkLog(LogLevel level, std::string_view message
 
 bool LogCapture::containsPart(LogLevel level, std::string_view part) const {
     const auto all = lines();
-    return std::ranges::any_of(all, [&](const Line& line) { return line.first == level && line.second.find(part) != std::string::npos; });
+    return std::ranges::any_of(
+        all, [&](const Line& line) { return line.first == level && line.second.find(part) != std::string::npos; });
 }
 
 std::size_t LogCapture::count(std::string_view part) const {
     const auto all = lines();
-    return static_cast<std::size_t>(std::ranges::count_if(all, [&](const Line& line) { return line.second.find(part) != std::string::npos; }));
+    return static_cast<std::size_t>(
+        std::ranges::count_if(all, [&](const Line& line) { return line.second.find(part) != std::string::npos; }));
 }
 
 }  // namespace cindral::test

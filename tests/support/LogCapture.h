@@ -19,7 +19,7 @@ public:
 
     using Line = std::pair<LogLevel, std::string>;
     std::vector<Line> lines() const;
-    bool contains(LogLevel level, std::string_view message) const;       ///< exactly that message
+    bool contains(LogLevel level, std::string_view message) const;  ///< exactly that message
     /// Exactly that message, on the host framework's own log.
     bool containsOnFrameworkLog(LogLevel level, std::string_view message) const;
     bool containsPart(LogLevel level, std::string_view part) const;

@@ -83,7 +83,8 @@ std::optional<FileNumbers> parseFileNumbers(std::string_view text) {
 // Asked anew for each line: standard error may have been redirected since the service manager named its stream.
 bool isJournal() REQUIRES(output.mutex) {
     struct stat status;
-    return output.hasJournal && ::fstat(STDERR_FILENO, &status) == 0 && status.st_dev == output.journal.device && status.st_ino == output.journal.inode;
+    return output.hasJournal && ::fstat(STDERR_FILENO, &status) == 0 && status.st_dev == output.journal.device &&
+           status.st_ino == output.journal.inode;
 }
 
 void appendTime(std::string& line) {
@@ -91,8 +92,8 @@ void appendTime(std::string& line) {
     ::clock_gettime(CLOCK_REALTIME, &now);
     tm parts{};
     ::gmtime_r(&now.tv_sec, &parts);
-    fmt::format_to(std::back_inserter(line), "{:04}-{:02}-{:02}T{:02}:{:02}:{:02}.{:06}Z", parts.tm_year + 1900, parts.tm_mon + 1, parts.tm_mday,
-                   parts.tm_hour, parts.tm_min, parts.tm_sec, now.tv_nsec / 1000);
+    fmt::format_to(std::back_inserter(line), "{:04}-{:02}-{:02}T{:02}:{:02}:{:02}.{:06}Z", parts.tm_year + 1900,
+                   parts.tm_mon + 1, parts.tm_mday, parts.tm_hour, parts.tm_min, parts.tm_sec, now.tv_nsec / 1000);
 }
 
 bool isContinuation(unsigned char byte) {
@@ -104,7 +105,10 @@ std::size_t sequenceLength(std::string_view text) {
     const auto at = [&](std::size_t i) { return i < text.size() ? static_cast<unsigned char>(text[i]) : 0U; };
     const unsigned lead = at(0);
     if (lead < 0x80) return 1;
-    const std::size_t length = lead >= 0xC2 && lead < 0xE0 ? 2 : lead >= 0xE0 && lead < 0xF0 ? 3 : lead >= 0xF0 && lead < 0xF5 ? 4 : 0;
+    const std::size_t length = lead >= 0xC2 && lead < 0xE0   ? 2
+                               : lead >= 0xE0 && lead < 0xF0 ? 3
+                               : lead >= 0xF0 && lead < 0xF5 ? 4
+                                                             : 0;
     for (std::size_t i = 1; i < length; ++i) {
         if (!isContinuation(static_cast<unsigned char>(at(i)))) return 0;
     }
@@ -130,7 +134,8 @@ void appendEscaped(std::string& line, std::string_view message) {
         if (length != 0 && !isControl(sequence)) {
             line += sequence;
         } else {
-            for (const char byte : sequence) fmt::format_to(std::back_inserter(line), "\\x{:02x}", static_cast<unsigned char>(byte));
+            for (const char byte : sequence)
+                fmt::format_to(std::back_inserter(line), "\\x{:02x}", static_cast<unsigned char>(byte));
         }
         message.remove_prefix(sequence.size());
     }

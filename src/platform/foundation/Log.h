@@ -57,15 +57,18 @@ void setObserver(Observer observer);
 /// "[DEBUG] MESSAGE", "[INFO] MESSAGE", "[ERROR] MESSAGE". The message is composed only when the line is written.
 template <typename... Args>
 void logDebug(fmt::format_string<Args...> format, Args&&... args) {
-    if (log::enabled(LogLevel::debug)) log::write(LogLevel::debug, "[DEBUG] " + fmt::format(format, std::forward<Args>(args)...));
+    if (log::enabled(LogLevel::debug))
+        log::write(LogLevel::debug, "[DEBUG] " + fmt::format(format, std::forward<Args>(args)...));
 }
 template <typename... Args>
 void logInfo(fmt::format_string<Args...> format, Args&&... args) {
-    if (log::enabled(LogLevel::info)) log::write(LogLevel::info, "[INFO] " + fmt::format(format, std::forward<Args>(args)...));
+    if (log::enabled(LogLevel::info))
+        log::write(LogLevel::info, "[INFO] " + fmt::format(format, std::forward<Args>(args)...));
 }
 template <typename... Args>
 void logError(fmt::format_string<Args...> format, Args&&... args) {
-    if (log::enabled(LogLevel::error)) log::write(LogLevel::error, "[ERROR] " + fmt::format(format, std::forward<Args>(args)...));
+    if (log::enabled(LogLevel::error))
+        log::write(LogLevel::error, "[ERROR] " + fmt::format(format, std::forward<Args>(args)...));
 }
 /// A line without a level prefix.
 template <typename... Args>
@@ -75,7 +78,8 @@ void logPlain(LogLevel level, fmt::format_string<Args...> format, Args&&... args
 /// A line on the host framework's own log, which is another channel than the system's.
 template <typename... Args>
 void logFrameworkDefault(LogLevel level, fmt::format_string<Args...> format, Args&&... args) {
-    if (log::enabled(level)) log::write(level, fmt::format(format, std::forward<Args>(args)...), LogChannel::frameworkDefault);
+    if (log::enabled(level))
+        log::write(level, fmt::format(format, std::forward<Args>(args)...), LogChannel::frameworkDefault);
 }
 
 /// The next section number, from 1; strictly increasing over the process. Not to be called on the queue "cindral.log-section".

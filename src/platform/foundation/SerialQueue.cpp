@@ -124,7 +124,8 @@ SerialQueue::~SerialQueue() {
         const MutexLock lock(state_->mutex);
         dropped.swap(state_->entries);
         for (const Entry& entry : dropped) {
-            if (entry.waiter != nullptr) fatal(fmt::format("queue \"{}\" is destroyed while a thread waits to enter it", state_->label));
+            if (entry.waiter != nullptr)
+                fatal(fmt::format("queue \"{}\" is destroyed while a thread waits to enter it", state_->label));
         }
         return;
     }

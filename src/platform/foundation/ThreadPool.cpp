@@ -1,40 +1,25 @@
 #include "platform/foundation/ThreadPool.h"
 
-#include <pthread.h>
-#include <signal.h>
-
 #include <algorithm>
-#include <cstring>
-#include <system_error>
+#include <string>
 #include <thread>
 #include <utility>
 
+#include "platform/foundation/BackgroundThread.h"
 #include "platform/foundation/Fatal.h"
 #include "platform/foundation/Log.h"
 
 namespace cindral {
 namespace {
 
-constexpr std::size_t kThreadNameBytesMax = 15;
-
 thread_local bool isPoolThread = false;
-thread_local char currentName[kThreadNameBytesMax + 1] = "";
-
-// Signals sent to the process are for the host's own threads; those that a thread brings upon itself must reach it.
-sigset_t signalsForOthers() {
-    sigset_t signals;
-    ::sigfillset(&signals);
-    for (const int own : {SIGSEGV, SIGBUS, SIGFPE, SIGILL, SIGABRT, SIGTRAP, SIGSYS}) ::sigdelset(&signals, own);
-    return signals;
-}
 
 void nameThread(std::string_view name) {
-    name = name.substr(0, kThreadNameBytesMax);
-    // A system call less where one queue comes after itself.
+    // Saves a system call where one queue comes after itself. Names that are equal as far as the kernel shows them may differ here.
+    static thread_local std::string currentName;
     if (name == currentName) return;
-    std::memcpy(currentName, name.data(), name.size());
-    currentName[name.size()] = '\0';
-    ::pthread_setname_np(::pthread_self(), currentName);
+    currentName = name;
+    nameCurrentThread(name);
 }
 
 }  // namespace
@@ -73,16 +58,7 @@ bool ThreadPool::wakeOneIfNeeded() {
 }
 
 void ThreadPool::startThread() {
-    const sigset_t blocked = signalsForOthers();
-    sigset_t before;
-    ::pthread_sigmask(SIG_SETMASK, &blocked, &before);
-    int error = 0;
-    try {
-        std::thread([this] { run(); }).detach();
-    } catch (const std::system_error& failure) {
-        error = failure.code().value();
-    }
-    ::pthread_sigmask(SIG_SETMASK, &before, nullptr);
+    const int error = startBackgroundThread([this] { run(); });
     if (error == 0) return;
 
     bool isAlone = false;

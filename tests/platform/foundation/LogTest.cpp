@@ -16,7 +16,6 @@
 #include <functional>
 #include <memory>
 #include <optional>
-#include <regex>
 #include <set>
 #include <sstream>
 #include <string>
@@ -30,11 +29,12 @@
 namespace cindral {
 namespace {
 
-using ::testing::ElementsAre;
-using ::testing::HasSubstr;
-using ::testing::SizeIs;
 using test::LogCapture;
 using test::TemporaryFolder;
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using ::testing::MatchesRegex;
+using ::testing::SizeIs;
 
 /// Puts another file in the place of standard error while it lives.
 class StandardErrorAs {
@@ -104,6 +104,11 @@ protected:
         return lines;
     }
 
+    /// Of a section's opening line.
+    static std::uint64_t numberOf(const LogCapture::Line& line) {
+        return std::stoull(line.second.substr(std::string_view("[DEBUG] ┏").size()));
+    }
+
     const LogLevel before_ = log::level();
     TemporaryFolder folder_;
     UniqueFd file_{::open((folder_ / "stderr").c_str(), O_RDWR | O_CREAT | O_APPEND | O_CLOEXEC, 0600)};
@@ -114,8 +119,10 @@ TEST_F(LogTest, prefixesEachLineWithItsLevel) {
     logDebug("one {}", 1);
     logInfo("two");
     logError("couldn't set putback xattr ({})", "it's gone");
-    EXPECT_THAT(capture.lines(), ElementsAre(LogCapture::Line(LogLevel::debug, "[DEBUG] one 1"), LogCapture::Line(LogLevel::info, "[INFO] two"),
-                                             LogCapture::Line(LogLevel::error, "[ERROR] couldn't set putback xattr (it's gone)")));
+    EXPECT_THAT(
+        capture.lines(),
+        ElementsAre(LogCapture::Line(LogLevel::debug, "[DEBUG] one 1"), LogCapture::Line(LogLevel::info, "[INFO] two"),
+                    LogCapture::Line(LogLevel::error, "[ERROR] couldn't set putback xattr (it's gone)")));
 }
 
 TEST_F(LogTest, prefixesAnEmptyMessageWithThePrefixAndABlank) {
@@ -123,14 +130,16 @@ TEST_F(LogTest, prefixesAnEmptyMessageWithThePrefixAndABlank) {
     logDebug("{}", "");
     logInfo("{}", "");
     logError("{}", "");
-    EXPECT_THAT(capture.lines(), ElementsAre(LogCapture::Line(LogLevel::debug, "[DEBUG] "), LogCapture::Line(LogLevel::info, "[INFO] "),
-                                             LogCapture::Line(LogLevel::error, "[ERROR] ")));
+    EXPECT_THAT(capture.lines(),
+                ElementsAre(LogCapture::Line(LogLevel::debug, "[DEBUG] "), LogCapture::Line(LogLevel::info, "[INFO] "),
+                            LogCapture::Line(LogLevel::error, "[ERROR] ")));
 }
 
 TEST_F(LogTest, leavesAPlainLineWithoutAPrefix) {
     const LogCapture capture;
     logPlain(LogLevel::error, "can't get device ID for \"{}\"; {}", "/a", errnoText(ENOENT));
-    EXPECT_THAT(capture.lines(), ElementsAre(LogCapture::Line(LogLevel::error, "can't get device ID for \"/a\"; ENOENT (2)")));
+    EXPECT_THAT(capture.lines(),
+                ElementsAre(LogCapture::Line(LogLevel::error, "can't get device ID for \"/a\"; ENOENT (2)")));
 }
 
 TEST_F(LogTest, keepsTheFrameworksLogApart) {
@@ -149,8 +158,10 @@ TEST_F(LogTest, writesTimeLevelAndMessage) {
         logInfo("b");
         logPlain(LogLevel::error, "c");
     });
-    const std::string time = R"(\d{4}-\d\d-\d\dT\d\d:\d\d:\d\d\.\d{6}Z)";
-    EXPECT_TRUE(std::regex_match(text, std::regex(time + " debug \\[DEBUG\\] a\n" + time + " info \\[INFO\\] b\n" + time + " error c\n"))) << text;
+    const std::string time = "[0-9]{4}-[0-9]{2}-[0-9]{2}T[0-9]{2}:[0-9]{2}:[0-9]{2}\\.[0-9]{6}Z";
+    EXPECT_THAT(linesOf(text), ElementsAre(MatchesRegex(time + " debug \\[DEBUG\\] a"),
+                                           MatchesRegex(time + " info \\[INFO\\] b"), MatchesRegex(time + " error c")));
+    EXPECT_TRUE(text.ends_with('\n'));
 }
 
 TEST_F(LogTest, writesTheTimeOfTheClockInUTC) {
@@ -235,7 +246,8 @@ TEST_F(LogTest, writesWholeLinesFromManyThreads) {
     std::string text;
     std::thread reader([&] {
         std::array<char, 65536> buffer{};
-        for (ssize_t count = 0; (count = ::read(source.get(), buffer.data(), buffer.size())) > 0;) text.append(buffer.data(), static_cast<std::size_t>(count));
+        for (ssize_t count = 0; (count = ::read(source.get(), buffer.data(), buffer.size())) > 0;)
+            text.append(buffer.data(), static_cast<std::size_t>(count));
     });
     {
         const StandardErrorAs redirected(target.get());
@@ -273,8 +285,10 @@ TEST_F(LogTest, writesPrioritiesToTheJournal) {
 TEST_F(LogTest, writesTimesWhereTheJournalIsAnotherFile) {
     struct stat status {};
     ASSERT_EQ(::fstat(file_.get(), &status), 0);
-    for (const std::string& stream : {fmt::format("{}:{}", status.st_dev, status.st_ino + 1), fmt::format("{}:{}", status.st_dev + 1, status.st_ino),
-                                      fmt::format("{}", status.st_dev), fmt::format("{}:{}x", status.st_dev, status.st_ino), std::string(":")}) {
+    for (const std::string& stream :
+         {fmt::format("{}:{}", status.st_dev, status.st_ino + 1),
+          fmt::format("{}:{}", status.st_dev + 1, status.st_ino), fmt::format("{}", status.st_dev),
+          fmt::format("{}:{}x", status.st_dev, status.st_ino), std::string(":")}) {
         const Environment environment("JOURNAL_STREAM", stream);
         EXPECT_THAT(written([] { logError("a"); }), ::testing::StartsWith("2")) << stream;
     }
@@ -312,7 +326,8 @@ TEST_F(LogTest, endsALineThatWasCutShort) {
     const auto drained = [&] {
         std::string text(1'000'000, '\0');
         std::size_t size = 0;
-        for (ssize_t count = 0; (count = ::read(source.get(), text.data() + size, text.size() - size)) > 0;) size += static_cast<std::size_t>(count);
+        for (ssize_t count = 0; (count = ::read(source.get(), text.data() + size, text.size() - size)) > 0;)
+            size += static_cast<std::size_t>(count);
         text.resize(size);
         return text;
     };
@@ -370,7 +385,8 @@ TEST_F(LogTest, printsASectionsNumberInDecimal) {
     const LogCapture capture;
     openLogSection(17, "enumerate items");
     closeLogSection(17);
-    EXPECT_THAT(capture.lines(), ElementsAre(LogCapture::Line(LogLevel::debug, "[DEBUG] ┏17 enumerate items"), LogCapture::Line(LogLevel::debug, "[DEBUG] ┗17")));
+    EXPECT_THAT(capture.lines(), ElementsAre(LogCapture::Line(LogLevel::debug, "[DEBUG] ┏17 enumerate items"),
+                                             LogCapture::Line(LogLevel::debug, "[DEBUG] ┗17")));
 }
 
 TEST_F(LogTest, bracketsAScopeWithOneNumber) {
@@ -381,10 +397,9 @@ TEST_F(LogTest, bracketsAScopeWithOneNumber) {
     }
     const auto lines = capture.lines();
     ASSERT_THAT(lines, SizeIs(3));
-    std::smatch match;
-    ASSERT_TRUE(std::regex_match(lines[0].second, match, std::regex("\\[DEBUG\\] ┏(\\d+) rename a to b")));
+    ASSERT_THAT(lines[0].second, MatchesRegex("\\[DEBUG\\] ┏[0-9]+ rename a to b"));
     EXPECT_EQ(lines[1].second, "[DEBUG] inside");
-    EXPECT_EQ(lines[2].second, "[DEBUG] ┗" + match[1].str());
+    EXPECT_EQ(lines[2].second, fmt::format("[DEBUG] ┗{}", numberOf(lines[0])));
 }
 
 TEST_F(LogTest, numbersSectionsUpwards) {
@@ -425,10 +440,9 @@ TEST_F(LogTest, closesConcurrentSectionsWithTheirOwnNumbers) {
     }
     const auto lines = capture.lines();
     ASSERT_THAT(lines, SizeIs(4));
-    const auto number = [&](std::size_t line) { return std::stoull(lines[line].second.substr(std::string_view("[DEBUG] ┏").size())); };
-    EXPECT_NE(number(0), number(1));
-    EXPECT_EQ(lines[2].second, fmt::format("[DEBUG] ┗{}", number(0)));
-    EXPECT_EQ(lines[3].second, fmt::format("[DEBUG] ┗{}", number(1)));
+    EXPECT_NE(numberOf(lines[0]), numberOf(lines[1]));
+    EXPECT_EQ(lines[2].second, fmt::format("[DEBUG] ┗{}", numberOf(lines[0])));
+    EXPECT_EQ(lines[3].second, fmt::format("[DEBUG] ┗{}", numberOf(lines[1])));
 }
 
 TEST(ErrnoText, namesTheSymbolAndTheNumber) {

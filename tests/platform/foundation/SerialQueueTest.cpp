@@ -433,7 +433,8 @@ protected:
 
 TEST_F(SerialQueueDeathTest, abortsWhenEnteredFromItself) {
     SerialQueue queue("cindral.test");
-    EXPECT_DEATH(queue.sync([&] { queue.sync([] {}); }), "queue \"cindral.test\" is entered synchronously from one of its own tasks");
+    EXPECT_DEATH(queue.sync([&] { queue.sync([] {}); }),
+                 "queue \"cindral.test\" is entered synchronously from one of its own tasks");
 }
 
 TEST_F(SerialQueueDeathTest, abortsWhenEnteredFromItselfByWayOfAnother) {
