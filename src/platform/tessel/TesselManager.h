@@ -38,10 +38,13 @@ public:
     /// Null takes the host away: signals are then answered without an error and go nowhere.
     void setHost(std::shared_ptr<Host> host);
 
+    /// The completion may be empty, here and below; the host always gets one that can be called.
     void signalEnumeratorForContainerItemIdentifier(const TesselItemIdentifier& container, Completion completion);
     void deleteSearchableItemsWithDomainIdentifiers(const std::vector<std::string>& domains, Completion completion);
 
 private:
+    std::shared_ptr<Host> host() const;
+
     mutable Mutex mutex_;
     std::optional<KsURL> documentStorageURL_ GUARDED_BY(mutex_);
     std::shared_ptr<Host> host_ GUARDED_BY(mutex_);
