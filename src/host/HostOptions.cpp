@@ -1,0 +1,191 @@
+#include "host/HostOptions.h"
+
+#include <fmt/format.h>
+
+#include <CLI/CLI.hpp>
+#include <algorithm>
+
+#include "host/HostError.h"
+#include "host/HostVersion.h"
+#include "host/PresentedPaths.h"
+#include "host/TerminalText.h"
+
+namespace cindral {
+namespace {
+
+constexpr const char* kItemHelp =
+    "An identifier (did=NUMBER, fid=NUMBER, #APPLICATION, or a container's well-known name), or a path. "
+    "./did=1 is the file of that name. Without it: the root container.";
+
+/// The words as they stand, before what they mean is worked out.
+struct Words {
+    std::string storage;
+    std::string state;
+    std::vector<std::string> applications;
+    std::string recorder = "auto";
+    bool noFlatpak = false;
+    bool json = false;
+    bool intoPackages = false;
+    std::string item;
+};
+
+struct CommandDescription {
+    HostCommand command;
+    const char* name;
+    const char* description;
+    enum class Argument { none, optionalItem, item, path } argument;
+};
+
+using Argument = CommandDescription::Argument;
+
+constexpr CommandDescription kCommands[] = {
+    {HostCommand::ls, "ls",
+     "List what a folder holds, a page at a time.\n\nThe columns: kind (d folder, - document, p package, l link, f "
+     "FIFO, s socket, "
+     "c and b devices) and what may be done with the item (r read, w write, m move, n rename, t trash, d delete); "
+     "size, or the "
+     "number of items in a folder; date of the last change; name.",
+     Argument::optionalItem},
+    {HostCommand::tree, "tree", "Show what a folder holds, and what is below it, as a tree, a page at a time.",
+     Argument::optionalItem},
+    {HostCommand::info, "info", "Show all that is known of an item.", Argument::item},
+    {HostCommand::url, "url", "Print the URL of an item.", Argument::item},
+    {HostCommand::id, "id", "Print the identifier of the item at a path.", Argument::path},
+    {HostCommand::anchor, "anchor", "Print the current sync anchor of a container, in base64.", Argument::optionalItem},
+    {HostCommand::status, "status", "Show where the host works and what it knows.", Argument::none},
+    {HostCommand::rpc, "rpc", "Speak JSON-RPC 2.0 on standard input and output, one message a line.", Argument::none},
+};
+
+RecorderChoice recorderOf(const std::string& name) {
+    if (name == "inotify") return RecorderChoice::inotify;
+    return name == "fanotify" ? RecorderChoice::fanotify : RecorderChoice::automatic;
+}
+
+std::string absolutePath(const std::string& path, const HostEnvironment& environment) {
+    if (path.empty()) return {};
+    return tidyPath(path.front() == '/' ? path : environment.workingFolder + "/" + path);
+}
+
+void addOptions(CLI::App& app, Words& words) {
+    const CLI::Validator notEmpty([](const std::string& value) { return value.empty() ? "is empty" : ""; }, "",
+                                  "not empty");
+    app.add_option("--storage", words.storage,
+                   "The document storage directory, made when missing. Default: your documents folder.")
+        ->type_name("DIR")
+        ->check(notEmpty);
+    app.add_option("--state", words.state,
+                   "Where the host keeps what it knows; not inside the storage. Default: $XDG_STATE_HOME/cindral.")
+        ->type_name("DIR")
+        ->check(notEmpty);
+    app.add_option("--apps", words.applications,
+                   "A folder of desktop entries, each an installed application. May be given again.")
+        ->type_name("DIR")
+        ->check(notEmpty)
+        ->expected(1)
+        ->take_all();
+    app.add_flag("--no-flatpak", words.noFlatpak, "Leave Flatpak's applications out.");
+    app.add_option("--recorder", words.recorder, "How events are recorded: inotify, fanotify or auto (the default).")
+        ->type_name("HOW")
+        ->check(CLI::IsMember({"inotify", "fanotify", "auto"}));
+    app.add_flag("--json", words.json, "Write JSON to standard output, one value a line for lists.");
+}
+
+void addArgument(CLI::App& command, Argument argument, Words& words) {
+    switch (argument) {
+        case Argument::none: return;
+        case Argument::optionalItem: command.add_option("ITEM", words.item, kItemHelp)->type_name(""); return;
+        case Argument::item: command.add_option("ITEM", words.item, kItemHelp)->type_name("")->required(); return;
+        case Argument::path:
+            command.add_option("PATH", words.item, "A path, absolute or relative.")->type_name("")->required();
+            return;
+    }
+}
+
+void addCommands(CLI::App& app, Words& words) {
+    for (const CommandDescription& description : kCommands) {
+        CLI::App* command = app.add_subcommand(description.name, description.description);
+        command->fallthrough();
+        addArgument(*command, description.argument, words);
+        if (description.command == HostCommand::tree) {
+            command->add_flag("--packages", words.intoPackages, "Also show what is in packages.");
+        }
+    }
+}
+
+const CommandDescription& chosenCommand(const CLI::App& app) {
+    const CLI::App* chosen = app.get_subcommands().front();
+    return *std::ranges::find_if(kCommands,
+                                 [&](const CommandDescription& each) { return chosen->get_name() == each.name; });
+}
+
+HostOptions optionsOf(const CLI::App& app, const Words& words, const HostEnvironment& environment) {
+    HostOptions options;
+    const CommandDescription& description = chosenCommand(app);
+    options.command = description.command;
+    const bool hasItem = description.argument != Argument::none &&
+                         app.get_subcommands()
+                                 .front()
+                                 ->get_option_no_throw(description.argument == Argument::path ? "PATH" : "ITEM")
+                                 ->count() > 0;
+    if (hasItem) options.item = words.item;
+    options.storage = words.storage.empty() ? documentsFolder(environment) : absolutePath(words.storage, environment);
+    if (!words.state.empty()) {
+        options.state = absolutePath(words.state, environment);
+    } else if (!environment.stateHome.empty()) {
+        options.state = environment.stateHome + "/cindral";
+    }
+    for (const std::string& folder : words.applications)
+        options.applications.push_back(absolutePath(folder, environment));
+    options.flatpak = !words.noFlatpak;
+    options.recorder = recorderOf(words.recorder);
+    options.json = words.json;
+    options.intoPackages = words.intoPackages;
+    return options;
+}
+
+HostReply usageReply(std::string_view message) {
+    return {kExitUsage, fmt::format("cindral: {}\n", terminalText(message))};
+}
+
+}  // namespace
+
+std::string_view recorderChoiceName(RecorderChoice choice) {
+    switch (choice) {
+        case RecorderChoice::automatic: return "auto";
+        case RecorderChoice::inotify: return "inotify";
+        case RecorderChoice::fanotify: return "fanotify";
+    }
+    return "auto";
+}
+
+std::variant<HostOptions, HostReply> parseHostOptions(std::span<const std::string> words,
+                                                      const HostEnvironment& environment) {
+    CLI::App app("Cindral shows a folder of documents as items with lasting identifiers.", "cindral");
+    Words parsed;
+    addOptions(app, parsed);
+    addCommands(app, parsed);
+    app.set_version_flag("--version", fmt::format("cindral {}", hostVersion()), "Print the version and exit.");
+    app.set_help_flag("-h,--help", "Say what can be said and exit.");
+    for (CLI::App* command : app.get_subcommands({}))
+        command->set_help_flag("-h,--help", "Say what can be said and exit.");
+    app.require_subcommand(1);
+    app.footer("Exit status: 0 done; 1 the operation failed; 2 the call's words are off.");
+
+    try {
+        // The library takes words from the end of the list.
+        app.parse(std::vector<std::string>(words.rbegin(), words.rend()));
+    } catch (const CLI::CallForHelp&) {
+        const auto chosen = app.get_subcommands();
+        // The options stand with the program; a command's help says them too.
+        return HostReply{kExitDone, chosen.empty()
+                                        ? app.help()
+                                        : chosen.front()->help() + "\nOptions of every command: cindral --help\n"};
+    } catch (const CLI::CallForVersion& version) {
+        return HostReply{kExitDone, std::string(version.what()) + "\n"};
+    } catch (const CLI::ParseError& error) {
+        return usageReply(error.what());
+    }
+    return optionsOf(app, parsed, environment);
+}
+
+}  // namespace cindral

@@ -1,0 +1,43 @@
+#pragma once
+
+#include <optional>
+#include <span>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "host/HostEnvironment.h"
+
+namespace cindral {
+
+enum class HostCommand { ls, tree, info, url, id, anchor, status, rpc };
+enum class RecorderChoice { automatic, inotify, fanotify };
+/// "auto", "inotify", "fanotify".
+std::string_view recorderChoiceName(RecorderChoice choice);
+
+/// What the words of the call say.
+///
+/// Thread safety: a value.
+struct HostOptions {
+    HostCommand command = HostCommand::tree;
+    std::optional<std::string> item;        ///< identifier or path, as written
+    std::string storage;                    ///< absolute, as written or the default; empty when nothing says where
+    std::string state;                      ///< the same
+    std::vector<std::string> applications;  ///< absolute
+    bool flatpak = true;
+    RecorderChoice recorder = RecorderChoice::automatic;
+    bool json = false;
+    bool intoPackages = false;  ///< tree
+};
+
+/// What there is to say instead of working: help, the version, or what is wrong with the call's words.
+struct HostReply {
+    int exitStatus = 0;
+    std::string text;  ///< for standard output where the status is 0, else for standard error; ends with a newline
+};
+
+/// Reads the words after the program's name. Options stand before or after the command.
+std::variant<HostOptions, HostReply> parseHostOptions(std::span<const std::string> words,
+                                                      const HostEnvironment& environment);
+
+}  // namespace cindral

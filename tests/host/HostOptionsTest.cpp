@@ -1,0 +1,168 @@
+#include "host/HostOptions.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+namespace cindral {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using ::testing::StartsWith;
+
+HostEnvironment environment() {
+    HostEnvironment environment;
+    environment.home = "/nowhere/u";
+    environment.configHome = "/nowhere/u/.config";
+    environment.stateHome = "/nowhere/u/.local/state";
+    environment.workingFolder = "/work";
+    return environment;
+}
+
+std::variant<HostOptions, HostReply> parse(const std::vector<std::string>& words) {
+    return parseHostOptions(words, environment());
+}
+
+HostOptions options(const std::vector<std::string>& words) {
+    auto parsed = parse(words);
+    if (const auto* reply = std::get_if<HostReply>(&parsed)) {
+        ADD_FAILURE() << reply->text;
+        return {};
+    }
+    return std::get<HostOptions>(parsed);
+}
+
+HostReply reply(const std::vector<std::string>& words) {
+    auto parsed = parse(words);
+    if (std::holds_alternative<HostOptions>(parsed)) {
+        ADD_FAILURE() << "the words were taken";
+        return {};
+    }
+    return std::get<HostReply>(parsed);
+}
+
+void expectUsageFailure(const std::vector<std::string>& words) {
+    const HostReply refused = reply(words);
+    EXPECT_EQ(refused.exitStatus, 2) << ::testing::PrintToString(words);
+    EXPECT_THAT(refused.text, StartsWith("cindral: "));
+    EXPECT_EQ(std::ranges::count(refused.text, '\n'), 1) << refused.text;
+}
+
+TEST(HostOptions, haveDefaults) {
+    const HostOptions plain = options({"tree"});
+    EXPECT_EQ(plain.command, HostCommand::tree);
+    EXPECT_EQ(plain.item, std::nullopt);
+    EXPECT_EQ(plain.storage, "/nowhere/u/Documents");
+    EXPECT_EQ(plain.state, "/nowhere/u/.local/state/cindral");
+    EXPECT_TRUE(plain.applications.empty());
+    EXPECT_TRUE(plain.flatpak);
+    EXPECT_EQ(plain.recorder, RecorderChoice::automatic);
+    EXPECT_FALSE(plain.json);
+    EXPECT_FALSE(plain.intoPackages);
+}
+
+TEST(HostOptions, standBeforeOrAfterTheCommand) {
+    for (const std::vector<std::string>& words : {
+             std::vector<std::string>{"--storage", "/s", "--state=/t", "--json", "--no-flatpak", "--recorder",
+                                      "inotify", "ls", "did=1"},
+             std::vector<std::string>{"ls", "--storage", "/s", "--state=/t", "--json", "--no-flatpak", "--recorder",
+                                      "inotify", "did=1"},
+             std::vector<std::string>{"ls", "did=1", "--storage=/s", "--state", "/t", "--json", "--no-flatpak",
+                                      "--recorder=inotify"},
+         }) {
+        const HostOptions read = options(words);
+        EXPECT_EQ(read.command, HostCommand::ls);
+        EXPECT_EQ(read.item, "did=1");
+        EXPECT_EQ(read.storage, "/s");
+        EXPECT_EQ(read.state, "/t");
+        EXPECT_TRUE(read.json);
+        EXPECT_FALSE(read.flatpak);
+        EXPECT_EQ(read.recorder, RecorderChoice::inotify);
+    }
+}
+
+TEST(HostOptions, knowEveryCommand) {
+    const std::pair<std::vector<std::string>, HostCommand> commands[] = {
+        {{"ls"}, HostCommand::ls},         {{"tree"}, HostCommand::tree},  {{"info", "x"}, HostCommand::info},
+        {{"url", "x"}, HostCommand::url},  {{"id", "x"}, HostCommand::id}, {{"anchor"}, HostCommand::anchor},
+        {{"status"}, HostCommand::status}, {{"rpc"}, HostCommand::rpc},
+    };
+    for (const auto& [words, command] : commands) EXPECT_EQ(options(words).command, command) << words.front();
+}
+
+TEST(HostOptions, makePathsAbsolute) {
+    EXPECT_EQ(options({"ls", "--storage", "docs/"}).storage, "/work/docs");
+    EXPECT_EQ(options({"ls", "--state", "./a//b"}).state, "/work/a/b");
+    EXPECT_THAT(options({"ls", "--apps", "one", "--apps", "/two"}).applications, ElementsAre("/work/one", "/two"));
+}
+
+// What an item is called is nobody's option, command or list.
+TEST(HostOptions, takeAnyItem) {
+    for (const char* item : {"tree", "ls", "a b", "[x,y]", "{1}", "a,b", "#com.example.notes", "did=1", "did=", "a=b",
+                             "--", "\xFF", "a\nb"}) {
+        if (std::string_view(item) == "--") continue;
+        EXPECT_EQ(options({"info", item}).item, item);
+    }
+    EXPECT_EQ(options({"info", "--", "--json"}).item, "--json");
+    EXPECT_EQ(options({"info", "--", "-x"}).item, "-x");
+    EXPECT_EQ(options({"info", "--json", "--", "tree"}).item, "tree");
+    EXPECT_EQ(options({"ls", ""}).item, "");
+}
+
+TEST(HostOptions, showPackagesInATreeOnly) {
+    EXPECT_TRUE(options({"tree", "--packages"}).intoPackages);
+    expectUsageFailure({"ls", "--packages"});
+}
+
+TEST(HostOptions, refuseWordsThatAreOff) {
+    expectUsageFailure({});
+    expectUsageFailure({"frobnicate"});
+    expectUsageFailure({"--json"});
+    expectUsageFailure({"ls", "--frobnicate"});
+    expectUsageFailure({"ls", "one", "two"});
+    expectUsageFailure({"info"});
+    expectUsageFailure({"url"});
+    expectUsageFailure({"id"});
+    expectUsageFailure({"status", "x"});
+    expectUsageFailure({"rpc", "x"});
+    expectUsageFailure({"ls", "--storage"});
+    expectUsageFailure({"ls", "--storage", ""});
+    expectUsageFailure({"ls", "--state="});
+    expectUsageFailure({"ls", "--apps", ""});
+    expectUsageFailure({"ls", "--recorder", "magic"});
+    expectUsageFailure({"ls", "--recorder", "INOTIFY"});
+    expectUsageFailure({"--storage", "/a", "--storage", "/b", "ls"});
+    expectUsageFailure({"frob\nnicate\x1B[2J"});
+}
+
+TEST(HostOptions, sayTheirVersionInOneLine) {
+    const HostReply version = reply({"--version"});
+    EXPECT_EQ(version.exitStatus, 0);
+    EXPECT_THAT(version.text, ::testing::MatchesRegex("cindral [0-9]+\\.[0-9]+\\.[0-9]+\n"));
+}
+
+TEST(HostOptions, helpThemselves) {
+    const HostReply help = reply({"--help"});
+    EXPECT_EQ(help.exitStatus, 0);
+    for (const char* word : {"--storage", "--state", "--apps", "--no-flatpak", "--recorder", "--json", "ls", "tree",
+                             "info", "url", "id", "anchor", "status", "rpc"}) {
+        EXPECT_THAT(help.text, HasSubstr(word));
+    }
+    for (const char* command : {"ls", "tree", "info", "url", "id", "anchor", "status", "rpc"}) {
+        const HostReply ofCommand = reply({command, "--help"});
+        EXPECT_EQ(ofCommand.exitStatus, 0) << command;
+        EXPECT_THAT(ofCommand.text, HasSubstr(command));
+    }
+    EXPECT_THAT(reply({"tree", "--help"}).text, HasSubstr("--packages"));
+}
+
+TEST(HostOptions, sayNothingOfFoldersWhereThereIsNoHome) {
+    HostEnvironment homeless;
+    homeless.workingFolder = "/work";
+    const auto parsed = parseHostOptions(std::vector<std::string>{"ls"}, homeless);
+    EXPECT_EQ(std::get<HostOptions>(parsed).storage, "");
+    EXPECT_EQ(std::get<HostOptions>(parsed).state, "");
+}
+
+}  // namespace
+}  // namespace cindral
