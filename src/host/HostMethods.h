@@ -1,0 +1,25 @@
+#pragma once
+
+#include <functional>
+#include <string>
+
+#include "host/JsonRpcServer.h"
+#include "host/PresentedPaths.h"
+#include "host/ProviderClient.h"
+
+namespace cindral {
+
+/// What the methods of one client work with. Borrowed for as long as a method may run.
+struct HostMethodsContext {
+    ProviderClient& client;
+    const PresentedPaths& paths;
+    std::function<std::string()> statusText;  ///< as JSON
+};
+
+/// The methods of the host interface, for one client.
+JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context);
+
+/// Answers with what a provider refused: its domain and code, and the named texts, paths as clients know them.
+void answerWithError(JsonRpcReply& reply, const KsError& error, const PresentedPaths& paths);
+
+}  // namespace cindral

@@ -1,0 +1,58 @@
+#pragma once
+
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+
+#include "platform/foundation/Dispatch.h"
+#include "platform/foundation/Mutex.h"
+#include "platform/tessel/TesselExtension.h"
+
+namespace cindral {
+
+/// One page of a listing.
+struct ItemsPage {
+    TesselItems items;
+    std::optional<TesselPage> nextPage;  ///< none: the listing is over
+};
+
+/// One client's way to a provider: a connection's, or a command's.
+///
+/// A container is looked up anew at each request, so that a folder that was renamed meanwhile goes on. The containers that stand
+/// for many folders (root, working set, all directories) keep their enumerator for as long as the client lives.
+///
+/// Thread safety: all operations, from any thread. Completions run on any thread, once.
+class ProviderClient {
+public:
+    explicit ProviderClient(std::shared_ptr<TesselExtension> provider) : provider_(std::move(provider)) {}
+    /// Invalidates the kept enumerators, and waits for those that are being let go of. No request may be under way.
+    ~ProviderClient();
+    ProviderClient(const ProviderClient&) = delete;
+    ProviderClient& operator=(const ProviderClient&) = delete;
+
+    TesselExtension& provider() const { return *provider_; }
+
+    using PageCompletion = std::function<void(Result<ItemsPage>)>;
+    void enumerateItems(const TesselItemIdentifier& container, const TesselPage& page, PageCompletion completion);
+    /// None in the result: the provider has no anchor to give.
+    using AnchorCompletion = std::function<void(Result<std::optional<TesselSyncAnchor>>)>;
+    void currentSyncAnchor(const TesselItemIdentifier& container, AnchorCompletion completion);
+
+    /// The same for a caller that has nothing else to do.
+    Result<ItemsPage> itemsOnPage(const TesselItemIdentifier& container, const TesselPage& page);
+    Result<std::optional<TesselSyncAnchor>> anchor(const TesselItemIdentifier& container);
+
+private:
+    class Use;
+    Result<std::shared_ptr<Use>> use(const TesselItemIdentifier& container);
+    Result<std::shared_ptr<TesselEnumerator>> keptEnumerator(const TesselItemIdentifier& container);
+
+    const std::shared_ptr<TesselExtension> provider_;
+    DispatchGroup invalidations_;
+
+    Mutex mutex_;
+    std::map<TesselItemIdentifier, std::shared_ptr<TesselEnumerator>> kept_ GUARDED_BY(mutex_);
+};
+
+}  // namespace cindral

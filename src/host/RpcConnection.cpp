@@ -1,0 +1,61 @@
+#include "host/RpcConnection.h"
+
+#include <vector>
+
+#include "host/Descriptor.h"
+#include "host/HostMethods.h"
+#include "host/LineOutput.h"
+#include "host/LineSplitter.h"
+
+namespace cindral {
+namespace {
+
+constexpr std::size_t kReadBytes = 256 << 10;
+// A page of a listing fits in the pipe, so that the next one is begun while the client reads.
+constexpr std::size_t kPipeBytes = 1 << 20;
+
+class Receiver final : public LineSplitter::Receiver {
+public:
+    explicit Receiver(JsonRpcServer& server) : server_(server) {}
+    void didReadLine(std::string_view line) override { server_.receiveLine(line); }
+    void didSkipLongLine() override { server_.receiveLongLine(); }
+
+private:
+    JsonRpcServer& server_;
+};
+
+/// Reads until the end of input, or until nobody reads the answers.
+Result<void> readAll(int input, int output, const UniqueFd& interrupt, LineSplitter& lines) {
+    std::vector<char> buffer(kReadBytes);
+    while (TRY(descriptor::waitForInput(input, output, interrupt.get())) == descriptor::Readiness::input) {
+        const std::size_t got = TRY(descriptor::read(input, buffer));
+        if (got == 0) {
+            lines.finish();
+            break;
+        }
+        lines.feed({buffer.data(), got});
+    }
+    return {};
+}
+
+}  // namespace
+
+Result<void> serveRpc(int input, int output, const std::shared_ptr<TesselExtension>& provider,
+                      const PresentedPaths& paths, const std::function<std::string()>& statusText) {
+    const UniqueFd interrupt = TRY(descriptor::makeInterrupt());
+    descriptor::enlargePipe(output, kPipeBytes);
+    LineOutput answers(output, interrupt);
+    // Taken down from the last to the first: the server waits for its requests, then the client lets go of its enumerators.
+    ProviderClient client(provider);
+    JsonRpcServer server(makeHostMethods({client, paths, statusText}),
+                         [&](std::string_view line) { answers.write(line); });
+    Receiver receiver(server);
+    LineSplitter lines(receiver, kJsonRpcLineBytesMax);
+
+    auto done = readAll(input, output, interrupt, lines);
+    server.waitUntilIdle();
+    if (const auto error = answers.error()) return *error;
+    return done;
+}
+
+}  // namespace cindral

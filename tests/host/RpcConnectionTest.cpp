@@ -1,0 +1,284 @@
+#include "host/RpcConnection.h"
+
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <filesystem>
+#include <map>
+#include <thread>
+
+#include "host/Descriptor.h"
+#include "host/FakeProvider.h"
+#include "host/JsonRpcMessage.h"
+#include "platform/foundation/Base64.h"
+#include "support/TemporaryFolder.h"
+
+namespace cindral {
+namespace {
+
+using test::FakeItem;
+using ::testing::ElementsAre;
+
+struct Pipe {
+    Pipe() {
+        int fds[2];
+        if (::pipe2(fds, O_CLOEXEC) != 0) std::abort();
+        readEnd.reset(fds[0]);
+        writeEnd.reset(fds[1]);
+    }
+    UniqueFd readEnd;
+    UniqueFd writeEnd;
+};
+
+std::string readToEnd(int fd) {
+    std::string text;
+    std::vector<char> buffer(65'536);
+    while (true) {
+        const auto got = descriptor::read(fd, buffer);
+        if (!got.ok() || *got == 0) return text;
+        text.append(buffer.data(), *got);
+    }
+}
+
+/// A client of a fake provider, whose storage "data" is presented as "Documents" elsewhere.
+class RpcConnectionTest : public ::testing::Test {
+protected:
+    RpcConnectionTest() {
+        std::signal(SIGPIPE, SIG_IGN);
+        std::filesystem::create_directory(real_);
+        item("fid=2", "folder").type = "inode/directory";
+        item("did=3", "a b.txt");
+    }
+
+    FakeItem& item(const std::string& identifier, const std::string& name) {
+        FakeItem& made = provider_->document(identifier, name);
+        made.url = KsURL::fileURL(presented_ + "/" + name);
+        return made;
+    }
+
+    /// What is answered to the lines, by id.
+    std::map<std::string, Json> answersTo(const std::string& lines) {
+        std::map<std::string, Json> answers;
+        const std::string text = exchange(lines);
+        for (std::size_t start = 0; start < text.size();) {
+            const std::size_t end = text.find('\n', start);
+            if (end == std::string::npos) {
+                ADD_FAILURE() << "half a line: " << text.substr(start, 200);
+                break;
+            }
+            const Json answer = Json::parse(text.substr(start, end - start));
+            EXPECT_TRUE(answers.emplace(answer["id"].dump(), answer).second) << answer["id"] << " was answered twice";
+            start = end + 1;
+        }
+        return answers;
+    }
+    std::string exchange(const std::string& lines) {
+        Pipe input;
+        Pipe output;
+        std::string text;
+        std::thread writer([&] {
+            EXPECT_TRUE(descriptor::writeAll(input.writeEnd.get(), lines).ok());
+            input.writeEnd.reset();
+        });
+        std::thread reader([&] { text = readToEnd(output.readEnd.get()); });
+        served_ = serveRpc(input.readEnd.get(), output.writeEnd.get(), provider_, paths_,
+                           [] { return std::string(R"({"version":"x"})"); });
+        output.writeEnd.reset();
+        writer.join();
+        reader.join();
+        return text;
+    }
+    Json answer(const std::string& method, const Json& params) {
+        const Json request{{"jsonrpc", "2.0"}, {"id", 1}, {"method", method}, {"params", params}};
+        return answersTo(request.dump() + "\n")["1"];
+    }
+    Json result(const std::string& method, const Json& params) { return answer(method, params)["result"]; }
+    Json error(const std::string& method, const Json& params) { return answer(method, params)["error"]; }
+    void expectInvalid(const std::string& method, const Json& params) {
+        EXPECT_EQ(error(method, params)["code"], -32602) << method << params;
+    }
+
+    const test::TemporaryFolder folder_;
+    const std::string root_ = std::filesystem::canonical(folder_.path()).string();
+    const std::string real_ = root_ + "/data";
+    const std::string presented_ = "/nowhere/Documents";
+    const PresentedPaths paths_{real_, real_, presented_};
+    const std::shared_ptr<test::FakeProvider> provider_ = std::make_shared<test::FakeProvider>();
+    Result<void> served_;
+};
+
+TEST_F(RpcConnectionTest, findsAnItem) {
+    const Json item = result("itemForIdentifier", {{"identifier", "did=3"}});
+    EXPECT_EQ(item["filename"], "a b.txt");
+    EXPECT_EQ(item["fileURL"], "file://" + real_ + "/a%20b.txt");
+}
+
+TEST_F(RpcConnectionTest, tellsOfAnUnknownItem) {
+    const Json error = this->error("itemForIdentifier", {{"identifier", "did=999"}});
+    EXPECT_EQ(error["code"], -32000);
+    EXPECT_EQ(error["message"], "No such item");
+    EXPECT_EQ(error["data"], (Json{{"domain", "CindralProvider.LocalTesselKitError"}, {"code", 0}}));
+}
+
+TEST_F(RpcConnectionTest, tellsOfAnUnknownContainer) {
+    const Json error = this->error("enumerateItems", {{"container", "fid=999"}});
+    EXPECT_EQ(error["data"], (Json{{"domain", "TesselErrorDomain"}, {"code", -1001}, {"identifier", "fid=999"}}));
+}
+
+TEST_F(RpcConnectionTest, tellsPathsOfErrorsAsClientsKnowThem) {
+    provider_->listingErrors.emplace("fid=2", KsError::posix(EACCES, presented_ + "/folder"));
+    const Json error = this->error("enumerateItems", {{"container", "fid=2"}});
+    EXPECT_EQ(error["data"], (Json{{"domain", "KsPOSIXErrorDomain"}, {"code", EACCES}, {"path", real_ + "/folder"}}));
+    EXPECT_EQ(error["message"], "Permission denied");
+}
+
+TEST_F(RpcConnectionTest, findsTheURLOfAnItem) {
+    EXPECT_EQ(result("URLForItem", {{"identifier", "did=3"}}), (Json{{"url", "file://" + real_ + "/a%20b.txt"}}));
+    EXPECT_EQ(result("URLForItem", {{"identifier", "did=999"}}), (Json{{"url", nullptr}}));
+}
+
+TEST_F(RpcConnectionTest, findsTheIdentifierAtAURLOrPath) {
+    const Json expected{{"identifier", "did=3"}};
+    EXPECT_EQ(result("identifierForItemAtURL", {{"url", "file://" + real_ + "/a%20b.txt"}}), expected);
+    EXPECT_EQ(result("identifierForItemAtURL", {{"path", real_ + "/a b.txt"}}), expected);
+    EXPECT_EQ(result("identifierForItemAtURL", {{"path", presented_ + "/a b.txt"}}), expected);
+    EXPECT_EQ(result("identifierForItemAtURL", {{"path", real_ + "/none"}}), (Json{{"identifier", nullptr}}));
+    EXPECT_EQ(result("identifierForItemAtURL", {{"url", "https://example.com/x"}}), (Json{{"identifier", nullptr}}));
+}
+
+TEST_F(RpcConnectionTest, refusesPathsAndURLsThatNameNoFileHere) {
+    expectInvalid("identifierForItemAtURL", {{"path", "relative"}});
+    expectInvalid("identifierForItemAtURL", {{"path", ""}});
+    expectInvalid("identifierForItemAtURL", {{"path", std::string("/a\0b", 4)}});
+    expectInvalid("identifierForItemAtURL", {{"path", 7}});
+    expectInvalid("identifierForItemAtURL", {{"url", "file:///a%00b"}});
+    expectInvalid("identifierForItemAtURL", {{"url", "file:///a%2"}});
+    expectInvalid("identifierForItemAtURL", {{"url", "/a"}, {"path", "/a"}});
+    expectInvalid("identifierForItemAtURL", Json::object());
+}
+
+TEST_F(RpcConnectionTest, listsAContainerPageByPage) {
+    provider_->folder("fid=20", "many");
+    provider_->documents(7, "fid=20");
+    std::vector<std::string> names;
+    Json params{{"container", "fid=20"}};
+    while (true) {
+        const Json page = result("enumerateItems", params);
+        for (const Json& item : page["items"]) names.push_back(item["filename"]);
+        if (page["nextPage"].is_null()) break;
+        params = {{"container", "fid=20"}, {"page", page["nextPage"]}};
+    }
+    EXPECT_THAT(names, ElementsAre("0000.txt", "0001.txt", "0002.txt", "0003.txt", "0004.txt", "0005.txt", "0006.txt"));
+}
+
+TEST_F(RpcConnectionTest, takesTheOrderOfTheFirstPage) {
+    EXPECT_EQ(result("enumerateItems", {{"container", "fid=2"}, {"sort", "name"}})["items"], Json::array());
+    EXPECT_EQ(result("enumerateItems", {{"container", "fid=2"}, {"sort", "date"}})["items"], Json::array());
+    expectInvalid("enumerateItems", {{"container", "fid=2"}, {"sort", "size"}});
+    expectInvalid("enumerateItems", {{"container", "fid=2"}, {"sort", 1}});
+    expectInvalid("enumerateItems", {{"container", "fid=2"}, {"sort", "name"}, {"page", "MA=="}});
+}
+
+TEST_F(RpcConnectionTest, refusesPagesThatAreNotBase64) {
+    for (const char* page : {"!", "MA", "MA=", "M A==", "MB==", "-_==", "\n"})
+        expectInvalid("enumerateItems", {{"container", "fid=2"}, {"page", page}});
+    expectInvalid("enumerateItems", {{"container", "fid=2"}, {"page", nullptr}});
+    expectInvalid("enumerateItems", {{"page", "MA=="}});
+}
+
+TEST_F(RpcConnectionTest, tellsOfAnExpiredPage) {
+    provider_->expiries = 1;
+    EXPECT_EQ(error("enumerateItems", {{"container", "fid=2"}, {"page", "Mw=="}})["data"],
+              (Json{{"domain", "TesselErrorDomain"}, {"code", -1002}}));
+}
+
+TEST_F(RpcConnectionTest, findsTheAnchorOfAContainer) {
+    EXPECT_EQ(result("currentSyncAnchor", {{"container", "fid=2"}}),
+              (Json{{"anchor", base64Encode(bytesOf("fid=2"))}}));
+    EXPECT_EQ(result("currentSyncAnchor", {{"container", "fid=noanchor"}}), (Json{{"anchor", nullptr}}));
+    EXPECT_EQ(error("currentSyncAnchor", {{"container", "x"}})["data"]["code"], -1001);
+    expectInvalid("currentSyncAnchor", Json::object());
+}
+
+TEST_F(RpcConnectionTest, findsAnApplicationsContainer) {
+    provider_->document("#com.example.notes", "Notes");
+    EXPECT_EQ(result("defaultContainer", {{"bundleIdentifier", "com.example.notes"}})["identifier"],
+              "#com.example.notes");
+    const Json error = this->error("defaultContainer", {{"bundleIdentifier", "none"}});
+    EXPECT_EQ(error["data"],
+              (Json{{"domain", "TSErrorDomain"}, {"code", 1}, {"parameter", "bundleIdentifier"}, {"value", "none"}}));
+}
+
+TEST_F(RpcConnectionTest, answersStatus) {
+    EXPECT_EQ(result("status", Json::object()), (Json{{"version", "x"}}));
+}
+
+TEST_F(RpcConnectionTest, refusesMethodsThatAreNotThere) {
+    for (const char* method :
+         {"enumerateChanges", "startMonitoring", "stopMonitoring", "importDocument", "createDirectory", "renameItem",
+          "reparentItem", "deleteItem", "trashItem", "untrashItem", "removeTrashedItemsOlderThan", "setLastUsedDate",
+          "setTags", "setFavoriteRank", "fetchThumbnails", "cancel", "", "itemforidentifier"}) {
+        EXPECT_EQ(error(method, Json::object())["code"], -32601) << method;
+    }
+}
+
+TEST_F(RpcConnectionTest, takesIdentifiersOfAnyLength) {
+    const std::string identifier(100'000, 'x');
+    EXPECT_EQ(error("enumerateItems", {{"container", identifier}})["data"]["identifier"], identifier);
+}
+
+TEST_F(RpcConnectionTest, livesOnAfterLinesThatAreNoRequests) {
+    const std::string longLine =
+        R"({"jsonrpc":"2.0","id":0,"method":")" + std::string(kJsonRpcLineBytesMax, 'x') + "\"}\n";
+    const auto answers = answersTo(longLine + R"({"jsonrpc":"2.0","id":1,"method":"status"})" + "\n");
+    EXPECT_EQ(answers.at("null")["error"]["code"], -32600);
+    EXPECT_EQ(answers.at("1")["result"]["version"], "x");
+
+    const std::string deep = std::string(10'000, '[') + std::string(10'000, ']') + "\n";
+    const auto afterDeep = answersTo(deep + R"({"jsonrpc":"2.0","id":1,"method":"status"})" + "\n");
+    EXPECT_EQ(afterDeep.at("null")["error"]["code"], -32600);
+    EXPECT_EQ(afterDeep.at("1")["result"]["version"], "x");
+}
+
+TEST_F(RpcConnectionTest, answersWhatIsUnderWayAtTheEndOfInput) {
+    provider_->isAsynchronous = true;
+    std::string lines;
+    for (int i = 0; i < 500; ++i) {
+        lines += fmt::format(R"({{"jsonrpc":"2.0","id":{},"method":"enumerateItems","params":{{"container":"{}"}}}})",
+                             i, i % 2 == 0 ? "fid=2" : "TesselRootContainerItemIdentifier");
+        if (i + 1 < 500) lines += '\n';  // The last line has no newline.
+    }
+    EXPECT_EQ(answersTo(lines).size(), 500U);
+    EXPECT_TRUE(served_.ok());
+    EXPECT_EQ(provider_->enumeratorsInvalidated, provider_->enumeratorsMade);
+    EXPECT_EQ(provider_->enumeratorsMade, 251);
+}
+
+TEST_F(RpcConnectionTest, endsQuietlyWhenNobodyReadsAnswers) {
+    Pipe input;
+    Pipe output;
+    output.readEnd.reset();
+    // The input stays open: the client went away without closing it.
+    const std::string line = R"({"jsonrpc":"2.0","id":1,"method":"status"})"
+                             "\n";
+    ASSERT_TRUE(descriptor::writeAll(input.writeEnd.get(), line).ok());
+    EXPECT_TRUE(
+        serveRpc(input.readEnd.get(), output.writeEnd.get(), provider_, paths_, [] { return std::string("{}"); }).ok());
+}
+
+TEST_F(RpcConnectionTest, tellsOfOutputThatCannotBeWritten) {
+    Pipe input;
+    const UniqueFd full(::open("/dev/full", O_WRONLY | O_CLOEXEC));
+    const std::string line = R"({"jsonrpc":"2.0","id":1,"method":"status"})"
+                             "\n";
+    ASSERT_TRUE(descriptor::writeAll(input.writeEnd.get(), line).ok());
+    const auto served = serveRpc(input.readEnd.get(), full.get(), provider_, paths_, [] { return std::string("{}"); });
+    ASSERT_FALSE(served.ok());
+    EXPECT_TRUE(served.error().isPosix(ENOSPC));
+}
+
+}  // namespace
+}  // namespace cindral
