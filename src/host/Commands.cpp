@@ -1,0 +1,186 @@
+#include "host/Commands.h"
+
+#include <fmt/format.h>
+
+#include <nlohmann/json.hpp>
+
+#include "host/ContainerListing.h"
+#include "host/HostError.h"
+#include "host/ItemWriter.h"
+#include "host/JsonText.h"
+#include "host/TerminalText.h"
+#include "host/TreePrinter.h"
+#include "platform/foundation/Base64.h"
+#include "platform/tessel/TesselErrors.h"
+
+namespace cindral {
+namespace {
+
+bool isManyFolders(const TesselItemIdentifier& container) {
+    return container == kTesselRootContainerItemIdentifier || container == kTesselWorkingSetContainerItemIdentifier ||
+           container == kTesselAllDirectoriesContainerItemIdentifier;
+}
+
+/// Errors that all say: there is nothing of that name.
+bool isNoSuchItem(const KsError& error) {
+    return error.is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::noSuchItem)) ||
+           error.is(kTSErrorDomain, static_cast<std::int64_t>(TSErrorCode::itemNotFound)) ||
+           error.is("CindralProvider.LocalTesselKitError", 0) ||
+           error.is(kKsGeneralErrorDomain, kKsFileNoSuchFileError);
+}
+
+}  // namespace
+
+Commands::Commands(Context context, TextOutput& output)
+    : context_(std::move(context)), output_(output), text_(context_.environment.wantsColor) {}
+
+bool Commands::isIdentifier(std::string_view item) {
+    return item == kTesselRootContainerItemIdentifier || item == kTesselWorkingSetContainerItemIdentifier ||
+           item == kTesselAllDirectoriesContainerItemIdentifier || item == kTesselTemporaryLocalFolderItemIdentifier ||
+           item.starts_with("did=") || item.starts_with("fid=") || item.starts_with('#');
+}
+
+Result<void> Commands::run() {
+    switch (context_.options.command) {
+        case HostCommand::ls: return list();
+        case HostCommand::tree: return tree();
+        case HostCommand::info: return info();
+        case HostCommand::url: return url();
+        case HostCommand::id: return id();
+        case HostCommand::anchor: return anchor();
+        case HostCommand::status: return status();
+        case HostCommand::rpc: break;
+    }
+    return usageFailure("that is no command that prints");
+}
+
+std::string Commands::subject() const {
+    return terminalText(context_.options.item.value_or(context_.paths.real()));
+}
+
+KsError Commands::failure(const KsError& error) const {
+    if (isNoSuchItem(error)) return hostFailure(fmt::format("no such item: {}", subject()));
+    return hostFailure(fmt::format("{}: {}", subject(), messageOf(error)));
+}
+
+Result<TesselItemIdentifier> Commands::identifier() const {
+    const auto& named = context_.options.item;
+    if (!named) return kTesselRootContainerItemIdentifier;
+    return isIdentifier(*named) ? Result<TesselItemIdentifier>(*named) : identifierAt(*named);
+}
+
+Result<TesselItemIdentifier> Commands::identifierAt(const std::string& path) const {
+    // An empty path names nothing, not the working folder.
+    if (path.empty()) return hostFailure("no such item: the path is empty");
+    const std::string absolute = path.front() == '/' ? path : context_.environment.workingFolder + "/" + path;
+    const KsURL url = KsURL::fileURL(context_.paths.presentedPath(absolute));
+    auto identifier = context_.client.provider().persistentIdentifierForItemAtURL(url);
+    if (!identifier) return hostFailure(fmt::format("no such item: {}", subject()));
+    return *std::move(identifier);
+}
+
+Result<std::shared_ptr<const TesselItem>> Commands::item() const {
+    auto found = context_.client.provider().itemForIdentifier(TRY(identifier()));
+    if (!found.ok()) return failure(found.error());
+    return found;
+}
+
+void Commands::printItem(const TesselItem& item) {
+    if (context_.options.json) {
+        ItemWriter(context_.paths).append(output_.buffer(), item);
+    } else {
+        text_.appendLine(output_.buffer(), item);
+    }
+    output_.endLine();
+}
+
+void Commands::printValue(std::string_view key, const std::string& value) {
+    output_.line(context_.options.json ? fmt::format("{{{}:{}}}", jsonString(key), jsonString(value))
+                                       : terminalText(value));
+}
+
+Result<void> Commands::list() {
+    const TesselItemIdentifier container = TRY(identifier());
+    if (!isManyFolders(container)) {
+        const auto named = TRY(item());
+        if (!isContainer(kindOf(*named))) {
+            printItem(*named);
+            return {};
+        }
+    }
+    ContainerListing listing(context_.client, container);
+    while (!output_.isBroken()) {
+        const auto next = listing.next();
+        if (!next.ok()) return failure(next.error());
+        if (*next == nullptr) break;
+        printItem(**next);
+    }
+    return {};
+}
+
+Result<void> Commands::tree() {
+    const TesselItemIdentifier container = TRY(identifier());
+    TreePrinter::Options options;
+    options.json = context_.options.json;
+    options.intoPackages = context_.options.intoPackages;
+    options.title = terminalText(context_.paths.real());
+    if (!isManyFolders(container)) {
+        const auto named = TRY(item());
+        if (!isContainer(kindOf(*named))) {
+            printItem(*named);
+            return {};
+        }
+        options.title = terminalText(named->filename());
+    }
+    TreePrinter printer(context_.client, context_.paths, text_, output_, std::move(options));
+    if (auto printed = printer.print(container); !printed.ok()) return failure(printed.error());
+    return printer.unreadableFolders();
+}
+
+Result<void> Commands::info() {
+    const auto named = TRY(item());
+    if (context_.options.json) {
+        output_.line(ItemWriter(context_.paths).text(*named));
+        return {};
+    }
+    const KsURL* url = named->fileURL();
+    output_.buffer() += text_.allFields(*named, url != nullptr ? context_.paths.realURL(*url) : "");
+    return {};
+}
+
+Result<void> Commands::url() {
+    const auto url = context_.client.provider().URLForItemWithPersistentIdentifier(TRY(identifier()));
+    if (!url) return hostFailure(fmt::format("no such item: {}", subject()));
+    printValue("url", context_.paths.realURL(*url));
+    return {};
+}
+
+Result<void> Commands::id() {
+    // Always a path, whatever it looks like.
+    printValue("identifier", TRY(identifierAt(*context_.options.item)));
+    return {};
+}
+
+Result<void> Commands::anchor() {
+    const auto anchor = context_.client.anchor(TRY(identifier()));
+    if (!anchor.ok()) return failure(anchor.error());
+    if (!*anchor) return hostFailure(fmt::format("there is no anchor for {}", subject()));
+    printValue("anchor", base64Encode(**anchor));
+    return {};
+}
+
+Result<void> Commands::status() {
+    const std::string text = context_.statusText();
+    if (context_.options.json) {
+        output_.line(text);
+        return {};
+    }
+    const auto fields = nlohmann::ordered_json::parse(text, nullptr, /*allow_exceptions=*/false);
+    for (const auto& [key, value] : fields.items()) {
+        const std::string shown = value.is_string() ? value.get<std::string>() : value.dump();
+        output_.line(fmt::format("{:<19} {}", key, terminalText(shown)));
+    }
+    return {};
+}
+
+}  // namespace cindral

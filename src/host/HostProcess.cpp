@@ -1,0 +1,165 @@
+#include "host/HostProcess.h"
+
+#include <fmt/format.h>
+
+#include <cerrno>
+
+#include "host/HostError.h"
+#include "host/HostVersion.h"
+#include "host/JsonText.h"
+#include "host/StorageFolders.h"
+#include "host/TerminalText.h"
+#include "platform/foundation/Log.h"
+#include "platform/foundation/RootDirectories.h"
+#include "platform/foundation/SerialQueue.h"
+#include "platform/revisions/RvStorageManager.h"
+#include "platform/roster/Roster.h"
+#include "platform/tessel/TesselManager.h"
+
+namespace cindral {
+namespace {
+
+constexpr const char* kOwnBundleIdentifier = "com.vemra.CindralStorage";
+
+/// What a provider may ask of this host. Nobody monitors a container yet and there is no search index, so a signal
+/// has nobody to reach and a deletion nothing to delete: both are done as soon as they are asked for.
+class Signals final : public TesselManager::Host {
+public:
+    void signalEnumerator(const TesselItemIdentifier& /*container*/, TesselManager::Completion completion) override {
+        if (completion) completion(std::nullopt);
+    }
+    void deleteSearchableItems(const std::vector<std::string>& /*domains*/,
+                               TesselManager::Completion completion) override {
+        if (completion) completion(std::nullopt);
+    }
+};
+
+Result<std::shared_ptr<VolumeStore>> openStore(const std::string& state) {
+    auto store = VolumeStore::open(state + "/volume");
+    if (store.ok()) return std::shared_ptr<VolumeStore>(*std::move(store));
+    const auto holder = store.error().userInfo().find("holder");
+    if (store.error().isPosix(EBUSY) && holder != store.error().userInfo().end()) {
+        return hostFailure(
+            fmt::format("the state folder {} is in use by process {}", terminalText(state), holder->second));
+    }
+    return hostFailure(fmt::format("can't open the state folder {}: {}", terminalText(state), store.error().reason()));
+}
+
+/// The record of the provider itself: its data container is what holds the storage.
+std::shared_ptr<const RoBundleProxy> ownRecord(const PresentedPaths& paths) {
+    const KsURL storage = KsURL::fileURL(paths.presented());
+    return std::make_shared<const RoBundleProxy>(
+        RoBundleProxy::Values{kOwnBundleIdentifier, storage.deletingLastPathComponent().value_or(storage), "Cindral"});
+}
+
+void appendField(std::string& out, std::string_view key, std::string_view value) {
+    out += out.empty() ? '{' : ',';
+    appendJsonString(out, key);
+    out += ':';
+    out += value;
+}
+
+template <typename Texts>
+std::string listText(const Texts& texts) {
+    std::string out = "[";
+    for (const auto& text : texts) {
+        if (out.size() > 1) out += ',';
+        appendJsonString(out, text);
+    }
+    return out + "]";
+}
+
+std::vector<std::string> rootURLs(const PresentedPaths& paths) {
+    std::vector<std::string> urls;
+    for (const auto& root : RootDirectories::shared().all()) urls.push_back(paths.realURL(KsURL::fileURL(root->path)));
+    return urls;
+}
+
+/// How changes below each root are found out. Without a recorder, by comparing with what was there before.
+std::string coverageText(const std::vector<std::string>& roots) {
+    std::string out = "[";
+    for (const std::string& root : roots) {
+        if (out.size() > 1) out += ',';
+        out += R"({"root":)";
+        appendJsonString(out, root);
+        out += R"(,"how":"comparison","why":"no recorder is running"})";
+    }
+    return out + "]";
+}
+
+}  // namespace
+
+HostProcess::HostProcess(HostOptions options, PresentedPaths paths, std::string state,
+                         std::shared_ptr<VolumeStore> store)
+    : options_(std::move(options)), paths_(std::move(paths)), state_(std::move(state)), store_(std::move(store)) {}
+
+Result<std::unique_ptr<HostProcess>> HostProcess::start(HostOptions options, const HostEnvironment& environment,
+                                                        TesselExtensionFactory makeProvider) {
+    if (options.storage.empty())
+        return hostFailure("there is no home folder: say where the documents are with --storage");
+    if (options.state.empty()) return hostFailure("there is no home folder: say where to keep the state with --state");
+    TRY(storage_folders::checkApart(options.storage, options.state));
+
+    std::string state = TRY(storage_folders::makeState(options.state));
+    auto store = TRY(openStore(state));
+    const std::string real = TRY(storage_folders::makeStorage(options.storage));
+    auto paths = TRY(storage_folders::present(options.storage, real, state, environment));
+    if (!paths.isSame()) logInfo("the storage {} is presented to the provider as {}", paths.real(), paths.presented());
+
+    // The constructor is nobody else's to call.
+    std::unique_ptr<HostProcess> host(
+        new HostProcess(std::move(options), std::move(paths), std::move(state), std::move(store)));
+    TRY(host->connect());
+    host->provider_ = makeProvider();
+    return host;
+}
+
+Result<void> HostProcess::connect() {
+    RvStorageManager::defaultManager().setStore(store_);
+    if (auto root = RootDirectories::shared().add(paths_.presented(), RootPolicy::storage); !root.ok()) {
+        return hostFailure(
+            fmt::format("can't open the storage {}: {}", terminalText(paths_.real()), root.error().reason()));
+    }
+    RoApplicationWorkspace::defaultWorkspace().setOwnRecord(ownRecord(paths_));
+    TesselManager::defaultManager().setDocumentStorageURL(KsURL::fileURL(paths_.presented()));
+    TesselManager::defaultManager().setHost(std::make_shared<Signals>());
+    return {};
+}
+
+HostProcess::~HostProcess() {
+    provider_.reset();
+    // A provider that goes leaves its last work to the main queue.
+    SerialQueue::main().sync([] {});
+    TesselManager::defaultManager().setHost(nullptr);
+    RoApplicationWorkspace::defaultWorkspace().setOwnRecord(nullptr);
+    RootDirectories::shared().remove(paths_.presented());
+    RvStorageManager::defaultManager().setStore(nullptr);
+    store_.reset();
+}
+
+std::string HostProcess::statusText() const {
+    const std::vector<std::string> roots = rootURLs(paths_);
+    const VolumeStore::Counts counts = store_->counts();
+    const std::uint64_t currentEventID = store_->currentEventID();
+
+    std::string out;
+    appendField(out, "version", jsonString(hostVersion()));
+    appendField(out, "storage", jsonString(paths_.real()));
+    appendField(out, "state", jsonString(state_));
+    appendField(out, "recorder", jsonString("none"));
+    appendField(out, "recorderOption", jsonString(recorderChoiceName(options_.recorder)));
+    appendField(out, "applicationFolders", listText(options_.applications));
+    appendField(out, "flatpak", options_.flatpak ? "true" : "false");
+    appendField(out, "roots", listText(roots));
+    appendField(out, "objects", fmt::to_string(counts.objects));
+    appendField(out, "documents", fmt::to_string(counts.documents));
+    // Without a journal there is no event to replay: the history begins, and ends, now.
+    appendField(out, "events", "0");
+    appendField(out, "oldestEventID", fmt::to_string(currentEventID));
+    appendField(out, "currentEventID", fmt::to_string(currentEventID));
+    appendField(out, "volumeUUID", jsonString(store_->uuid().string()));
+    appendField(out, "coverage", coverageText(roots));
+    return out + "}";
+}
+
+}  // namespace cindral

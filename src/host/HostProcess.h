@@ -1,0 +1,46 @@
+#pragma once
+
+#include <memory>
+#include <string>
+
+#include "host/HostOptions.h"
+#include "host/PresentedPaths.h"
+#include "platform/foundation/Result.h"
+#include "platform/revisions/VolumeStore.h"
+#include "platform/tessel/TesselExtension.h"
+
+namespace cindral {
+
+/// The host: the folders, the stores and the provider of one process, set up and taken down in order.
+///
+/// One per process: much of what it sets up is the process's own.
+///
+/// Thread safety: immutable once started.
+class HostProcess {
+public:
+    /// Errors are the host's own, with a line for people.
+    static Result<std::unique_ptr<HostProcess>> start(HostOptions options, const HostEnvironment& environment,
+                                                      TesselExtensionFactory makeProvider);
+    ~HostProcess();
+    HostProcess(const HostProcess&) = delete;
+    HostProcess& operator=(const HostProcess&) = delete;
+
+    const HostOptions& options() const { return options_; }
+    const PresentedPaths& paths() const { return paths_; }
+    const std::shared_ptr<TesselExtension>& provider() const { return provider_; }
+
+    /// What `status` answers, as JSON text.
+    std::string statusText() const;
+
+private:
+    HostProcess(HostOptions options, PresentedPaths paths, std::string state, std::shared_ptr<VolumeStore> store);
+    Result<void> connect();
+
+    const HostOptions options_;
+    const PresentedPaths paths_;
+    const std::string state_;
+    std::shared_ptr<VolumeStore> store_;
+    std::shared_ptr<TesselExtension> provider_;
+};
+
+}  // namespace cindral

@@ -1,0 +1,35 @@
+#pragma once
+
+#include <string>
+#include <string_view>
+
+#include "platform/tessel/TesselItem.h"
+
+namespace cindral {
+
+/// What an item is, for people.
+enum class ItemKind { folder, package, document, link, fifo, socket, characterDevice, blockDevice };
+ItemKind kindOf(const TesselItem& item);
+
+/// Whether the item is listed by what is in it: folders, app libraries and packages.
+bool isContainer(ItemKind kind);
+
+/// Items in the words of the command line.
+///
+/// Thread safety: immutable.
+class ItemText {
+public:
+    explicit ItemText(bool wantsColor) : wantsColor_(wantsColor) {}
+
+    /// The name, escaped, in the colour of its kind.
+    void appendName(std::string& out, const TesselItem& item, ItemKind kind) const;
+    /// "drwmntd      3 items  2026-11-20 09:52  Projects"
+    void appendLine(std::string& out, const TesselItem& item) const;
+    /// Every field that has a value, one a line.
+    std::string allFields(const TesselItem& item, const std::string& realURL) const;
+
+private:
+    bool wantsColor_;
+};
+
+}  // namespace cindral
