@@ -1,0 +1,1 @@
+cindral_fuzz_target(JsonRpcLineFuzz DEPENDS cindral_host)
