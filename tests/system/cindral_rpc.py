@@ -1,0 +1,207 @@
+"""Drives the program from outside: folders of its own, a JSON-RPC client, and what a test can say about both."""
+
+import base64
+import itertools
+import json
+import os
+import queue
+import shutil
+import subprocess
+import tempfile
+import threading
+import unittest
+
+PROGRAM = os.environ.get("CINDRAL_PROGRAM", "")
+ROOT = "TesselRootContainerItemIdentifier"
+WORKING_SET = "TesselWorkingSetContainerItemIdentifier"
+
+# A test that waits this long has failed; nothing is measured by it.
+PATIENCE = 120
+
+
+class RpcError(Exception):
+    """An error that a request was answered with."""
+
+    def __init__(self, error):
+        super().__init__(json.dumps(error))
+        self.code = error["code"]
+        self.data = error.get("data", {})
+        self.domain = self.data.get("domain")
+        self.domain_code = self.data.get("code")
+
+
+class Client:
+    """One process that speaks JSON-RPC on its standard input and output."""
+
+    def __init__(self, arguments, environment, **popen):
+        self.process = subprocess.Popen(
+            [PROGRAM, "rpc", *arguments], stdin=subprocess.PIPE, stdout=subprocess.PIPE, stderr=subprocess.PIPE,
+            env=environment, **popen)
+        self._ids = itertools.count(1)
+        self._answers = queue.Queue()
+        self._early = {}
+        self._errors = []
+        self._readers = [threading.Thread(target=self._read_answers), threading.Thread(target=self._read_errors)]
+        for reader in self._readers:
+            reader.start()
+
+    def __enter__(self):
+        return self
+
+    def __exit__(self, *_):
+        if self.process.poll() is None:
+            self.finish()
+
+    def _read_answers(self):
+        for line in self.process.stdout:
+            self._answers.put(line)
+        self._answers.put(None)
+
+    def _read_errors(self):
+        for line in self.process.stderr:
+            self._errors.append(line.decode("utf-8", "backslashreplace"))
+
+    def send_bytes(self, data):
+        self.process.stdin.write(data)
+        self.process.stdin.flush()
+
+    def send(self, method, identifier=None, **params):
+        """Sends a request and answers its id."""
+        identifier = next(self._ids) if identifier is None else identifier
+        request = {"jsonrpc": "2.0", "id": identifier, "method": method, "params": params}
+        self.send_bytes(json.dumps(request).encode() + b"\n")
+        return identifier
+
+    def next_message(self):
+        """The next line as it comes; None at the end of the output."""
+        line = self._answers.get(timeout=PATIENCE)
+        return None if line is None else json.loads(line)
+
+    def answer(self, identifier):
+        """The answer to one request, whatever comes before it."""
+        while identifier not in self._early:
+            message = self.next_message()
+            if message is None:
+                raise AssertionError("the process ended; it said: " + "".join(self._errors))
+            self._early[message["id"]] = message
+        return self._early.pop(identifier)
+
+    def call(self, method, **params):
+        answer = self.answer(self.send(method, **params))
+        if "error" in answer:
+            raise RpcError(answer["error"])
+        return answer["result"]
+
+    def pages(self, container, **first):
+        """The items of each page."""
+        pages = []
+        params = {"container": container, **first}
+        while True:
+            page = self.call("enumerateItems", **params)
+            pages.append(page["items"])
+            if page["nextPage"] is None:
+                return pages
+            params = {"container": container, "page": page["nextPage"]}
+
+    def items(self, container, **first):
+        return [item for page in self.pages(container, **first) for item in page]
+
+    def named(self, container=ROOT):
+        """The items of a container by name."""
+        return {item["filename"]: item for item in self.items(container)}
+
+    def identifier(self, path):
+        return self.call("identifierForItemAtURL", path=path)["identifier"]
+
+    def finish(self):
+        """Ends the input, and answers the exit status."""
+        try:
+            self.process.stdin.close()
+        except BrokenPipeError:
+            pass
+        status = self.process.wait(timeout=PATIENCE)
+        for reader in self._readers:
+            reader.join()
+        self.process.stdout.close()
+        self.process.stderr.close()
+        return status
+
+    def kill(self):
+        self.process.kill()
+        return self.finish()
+
+    def error_text(self):
+        return "".join(self._errors)
+
+
+class SystemTest(unittest.TestCase):
+    """A storage "Documents" and a state folder of its own, and no trace of the account that runs the test."""
+
+    def setUp(self):
+        self.assertTrue(PROGRAM, "CINDRAL_PROGRAM names the program")
+        self.folder = os.path.realpath(tempfile.mkdtemp(prefix="cindral-"))
+        self.addCleanup(self._remove_folder)
+        self.storage = os.path.join(self.folder, "Documents")
+        self.state = os.path.join(self.folder, "state")
+        os.mkdir(self.storage)
+        self.environment = {
+            name: value for name, value in os.environ.items() if not name.startswith("XDG_") and name != "CINDRAL_LOG"}
+        self.environment["HOME"] = self.folder
+
+    def _remove_folder(self):
+        # What a test locked is opened again, so that also a person without privilege is rid of it.
+        for folder, names, _ in os.walk(os.fsencode(self.folder)):
+            for name in names:
+                path = os.path.join(folder, name)
+                if not os.path.islink(path):
+                    os.chmod(path, 0o700)
+        shutil.rmtree(os.fsencode(self.folder))
+
+    def options(self, storage=None, state=None):
+        return ["--storage", storage or self.storage, "--state", state or self.state]
+
+    def client(self, storage=None, state=None, **popen):
+        client = Client(self.options(storage, state), self.environment, **popen)
+        self.addCleanup(client.__exit__)
+        return client
+
+    def run_program(self, *words, storage=None, state=None, **run):
+        """A command's exit status, standard output and standard error, as bytes."""
+        done = subprocess.run([PROGRAM, *words, *self.options(storage, state)], env=self.environment, timeout=PATIENCE,
+                              stdin=subprocess.DEVNULL, stdout=subprocess.PIPE, stderr=subprocess.PIPE, check=False, **run)
+        return done.returncode, done.stdout, done.stderr
+
+    def path(self, *names):
+        return os.path.join(self.storage, *names)
+
+    def make_file(self, *names, contents=b""):
+        path = os.path.join(os.fsencode(self.storage), *(os.fsencode(name) for name in names))
+        os.makedirs(os.path.dirname(path), exist_ok=True)
+        with open(path, "wb") as file:
+            file.write(contents)
+        return os.fsdecode(path)
+
+    def make_files(self, folder, count):
+        path = self.path(folder)
+        os.makedirs(path, exist_ok=True)
+        for number in range(count):
+            with open(os.path.join(path, f"{number:05}.txt"), "wb"):
+                pass
+        return path
+
+    def assert_error(self, domain, code, call, *arguments, **params):
+        """The call is refused with that error, which is answered for further looks."""
+        with self.assertRaises(RpcError) as raised:
+            call(*arguments, **params)
+        self.assertEqual((raised.exception.code, raised.exception.domain, raised.exception.domain_code), (-32000, domain, code))
+        return raised.exception
+
+    def assert_refused(self, code, call, *arguments, **params):
+        """The request itself is refused with one of JSON-RPC's own codes."""
+        with self.assertRaises(RpcError) as raised:
+            call(*arguments, **params)
+        self.assertEqual(raised.exception.code, code)
+
+
+def base64_text(data):
+    return base64.b64encode(data).decode()
