@@ -233,6 +233,8 @@ Result<bool> KsURL::isPackage() const {
 
 Result<bool> KsURL::isWritable() const {
     if (isWritable_) return *isWritable_;
+    if (directory_ && status_) isWritable_ = sys::isWritableByStatus(*status_, directory_->ownersModeDecides);
+    if (isWritable_) return *isWritable_;
     const Place where = TRY(place());
     isWritable_ = TRY(sys::isWritable(where.directory, where.name));
     return *isWritable_;

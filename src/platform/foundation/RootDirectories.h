@@ -24,6 +24,7 @@ struct DirectoryReference {
     UniqueFd fd;
     std::string path;  ///< absolute, without a trailing slash
     FileStatus status;
+    bool ownersModeDecides = false;  ///< sys::ownersModeDecides of it; false where nobody asked
 };
 
 /// Whether links inside a root may be walked through. What an application can write to is not trusted.

@@ -1,15 +1,21 @@
 #include "platform/foundation/Sys.h"
 
 #include <fmt/format.h>
+#include <linux/magic.h>
 #include <linux/openat2.h>
+#include <sys/inotify.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <sys/syscall.h>
+#include <sys/vfs.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <cerrno>
 #include <climits>
+#include <fstream>
+#include <iterator>
 
 namespace cindral {
 
@@ -133,6 +139,7 @@ Result<FileStatus> statx(int directory, const char* name) {
     if ((raw.stx_mask & STATX_BTIME) != 0) status.birthTime = dateOf(raw.stx_btime);
     status.mode = raw.stx_mode;
     status.owner = raw.stx_uid;
+    status.group = raw.stx_gid;
     return status;
 }
 
@@ -176,6 +183,78 @@ Result<bool> isWritable(int directory, const char* name) {
     if (::faccessat(directory, name, W_OK, flags) == 0) return true;
     if (errno == EACCES || errno == EROFS || errno == EPERM || errno == ETXTBSY) return false;
     return KsError::posix(errno);
+}
+
+namespace {
+
+/// Labels can refuse what the mode allows. Where the kernel has them, every file is asked for.
+bool kernelHasMandatoryLabels() {
+    static const bool has = [] {
+        std::ifstream fileSystems("/proc/filesystems");
+        const std::string text(std::istreambuf_iterator<char>(fileSystems), {});
+        return text.empty() || text.find("selinuxfs") != std::string::npos || text.find("smackfs") != std::string::npos;
+    }();
+    return has;
+}
+
+// An owner or group that has no number here: the kernel then refuses writes whatever the mode says.
+constexpr unsigned kOverflowID = 65'534;
+constexpr long kXfsMagic = 0x58465342;
+constexpr long kF2fsMagic = 0xF2F52010;
+
+}  // namespace
+
+bool ownersModeDecides(int fd) {
+    struct statfs fileSystem;
+    if (kernelHasMandatoryLabels() || ::fstatfs(fd, &fileSystem) != 0 || (fileSystem.f_flags & ST_RDONLY) != 0) return false;
+    switch (fileSystem.f_type) {
+        case EXT4_SUPER_MAGIC:
+        case BTRFS_SUPER_MAGIC:
+        case TMPFS_MAGIC:
+        case kXfsMagic:
+        case kF2fsMagic: return true;
+        default: return false;
+    }
+}
+
+std::optional<bool> isWritableByStatus(const FileStatus& status, bool ownersModeDecides) {
+    static const uid_t user = ::geteuid();
+    if (!ownersModeDecides || status.owner != user || user != ::geteuid() || user == kOverflowID || status.group == kOverflowID) return std::nullopt;
+    // Not granted by the mode may still be granted by privilege; never changing, and what is mounted here, have rules of their own.
+    if ((status.mode & S_IWUSR) == 0 || (status.attributes & (STATX_ATTR_IMMUTABLE | STATX_ATTR_MOUNT_ROOT)) != 0) return std::nullopt;
+    return true;
+}
+
+Result<int> DirectoryWatch::add(int directory) {
+    if (!fd_) {
+        fd_ = UniqueFd(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
+        if (!fd_) return KsError::errorWithPOSIXCode();
+    }
+    constexpr std::uint32_t kEntryChanges = IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR;
+    const int watch = ::inotify_add_watch(fd_.get(), pathThroughDescriptor(directory, "").c_str(), kEntryChanges);
+    if (watch < 0) return KsError::errorWithPOSIXCode();
+    return watch;
+}
+
+void DirectoryWatch::remove(int watch) {
+    // Fails when the directory is gone, and its watch with it.
+    (void)::inotify_rm_watch(fd_.get(), watch);
+}
+
+Result<void> DirectoryWatch::drain(const Change& change) {
+    if (!fd_) return {};
+    alignas(inotify_event) char buffer[4096];
+    while (true) {
+        const ssize_t size = ::read(fd_.get(), buffer, sizeof buffer);
+        if (size < 0 && errno == EINTR) continue;
+        if (size < 0 && errno == EAGAIN) return {};
+        if (size <= 0) return KsError::errorWithPOSIXCode();
+        for (const char* at = buffer; at < buffer + size;) {
+            const auto* event = reinterpret_cast<const inotify_event*>(at);
+            change((event->mask & IN_Q_OVERFLOW) != 0 ? 0 : event->wd);
+            at += sizeof *event + event->len;
+        }
+    }
 }
 
 Result<Bytes> readBeginning(int directory, const char* name, std::size_t count) {

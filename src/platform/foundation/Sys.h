@@ -5,6 +5,7 @@
 #include <sys/types.h>
 
 #include <cstdint>
+#include <functional>
 #include <optional>
 #include <span>
 #include <string>
@@ -28,6 +29,7 @@ struct FileStatus {
     std::optional<KsDate> birthTime;
     mode_t mode = 0;
     uid_t owner = 0;
+    gid_t group = 0;
 
     bool isDirectory() const { return S_ISDIR(mode); }
     bool isRegular() const { return S_ISREG(mode); }
@@ -71,6 +73,32 @@ Result<std::size_t> getxattrat(int directory, const char* name, const char* attr
 
 /// Whether the process may write the entry itself (effective identity, links not followed).
 Result<bool> isWritable(int directory, const char* name);
+
+/// Whether a file system keeps the ordinary promise that an owner may write what the mode lets the owner write: one of this machine's own
+/// (nothing asks a server or a user program), mounted for writing, under a kernel without mandatory labels.
+bool ownersModeDecides(int fd);
+/// The answer of isWritable() from the status alone; none where it must be asked for. `ownersModeDecides` as above, of the file's directory.
+///
+/// For an owner, access lists say nothing and the mode decides; so a listing of one's own files needs no call for each.
+std::optional<bool> isWritableByStatus(const FileStatus& status, bool ownersModeDecides);
+
+/// Changes of the entries of watched directories, told without waiting.
+///
+/// Thread safety: one thread at a time.
+class DirectoryWatch {
+public:
+    /// One change of the entries of a watched directory; 0 when changes were lost and any directory may have changed.
+    using Change = std::function<void(int watch)>;
+
+    /// Watches the open directory; a directory that is watched already has the same number. ENOSPC at the user's limit.
+    Result<int> add(int directory);
+    void remove(int watch);
+    /// Calls back for every change since the last call. POSIX error when it can't be told.
+    Result<void> drain(const Change& change);
+
+private:
+    UniqueFd fd_;
+};
 
 /// Reads from a regular file without touching its access time. EPERM where the process may not ask for that;
 /// ENXIO for anything but a regular file, which is never opened.

@@ -93,8 +93,8 @@ private:
             directory->fd = std::move(*fd);
             // Before the first entry is read, so that a change during the scan shows as a change since.
             Result<FileStatus> status = sys::statx(directory->fd.get(), "");
-            if (status.ok()) directory->status = *status;
             if (!status.ok()) error = status.error();
+            if (status.ok()) describe(*directory, *status);
         }
         if (error) {
             logError("can't open directory at {}; {}", path, error->description());
@@ -107,6 +107,14 @@ private:
         level.directory = std::move(directory);
         levels_.push_back(std::move(level));
         return std::nullopt;
+    }
+
+    void describe(DirectoryReference& directory, const FileStatus& status) const {
+        directory.status = status;
+        // A sub-directory on the same device is of the same file system; asking once is enough.
+        const DirectoryReference* parent = levels_.empty() ? nullptr : levels_.back().directory.get();
+        const bool same = parent != nullptr && parent->status.device == status.device && (status.attributes & STATX_ATTR_MOUNT_ROOT) == 0;
+        directory.ownersModeDecides = same ? parent->ownersModeDecides : sys::ownersModeDecides(directory.fd.get());
     }
 
     /// The next record of the innermost directory, or null at its end.
@@ -195,7 +203,7 @@ private:
     }
 
     /// Opens a directory that was closed on the way down, at the entry after the last one consumed. False, after a line, when it is gone.
-    static bool reopen(Level& level) {
+    bool reopen(Level& level) const {
         auto directory = std::make_shared<DirectoryReference>();
         directory->path = level.path;
         Result<UniqueFd> fd = RootDirectories::openForReading(level.path);
@@ -205,7 +213,7 @@ private:
             logError("can't open directory at {}; {}", level.path, status.ok() ? "it moved while it was listed" : status.error().description());
             return false;
         }
-        directory->status = *status;
+        describe(*directory, *status);
         level.directory = std::move(directory);
         level.mayRepeat = true;
         return true;
@@ -252,7 +260,7 @@ private:
             return false;
         }
         if (::lseek(directory->fd.get(), known.nextOffset, SEEK_SET) < 0) return false;
-        directory->status = *status;
+        describe(*directory, *status);
         Level level;
         level.path = known.path;
         level.fileID = known.fileID;

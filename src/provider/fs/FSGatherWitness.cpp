@@ -12,6 +12,8 @@ namespace cindral {
 namespace {
 
 constexpr std::size_t kListingsMax = 64;
+// For one listing; the user's limit is for all programs.
+constexpr std::size_t kWatchesMax = 16'384;
 // Twice the longest clock tick of the kernels that stamp files by the tick.
 constexpr std::int64_t kCoarseStampNanoseconds = 20'000'000;
 
@@ -25,6 +27,11 @@ bool kernelStampsAreDistinct() {
         return major > 6 || (major == 6 && minor >= 13);
     }();
     return distinct;
+}
+
+bool isSame(const Result<FileStatus>& now, const FileStatus& seen) {
+    return now.ok() && now->fileID == seen.fileID && now->device == seen.device && now->modificationTime == seen.modificationTime &&
+           now->changeTime == seen.changeTime;
 }
 
 bool isProvable(const FileStatus& status) {
@@ -58,14 +65,36 @@ FSGatherWitness::Listing* FSGatherWitness::find(const std::string& key) {
     return &found->second;
 }
 
-bool FSGatherWitness::isUnchanged(const Listing& listing) {
-    return std::ranges::all_of(listing.folders, [](const auto& seen) {
-        const auto& [path, folder] = seen;
-        if (!folder.provable) return false;
-        const Result<FileStatus> now = KsURL::fileURL(path).status();
-        return now.ok() && now->fileID == folder.status.fileID && now->device == folder.status.device &&
-               now->modificationTime == folder.status.modificationTime && now->changeTime == folder.status.changeTime;
+void FSGatherWitness::drain() {
+    const Result<void> drained = watch_.drain([this](int watch) NO_THREAD_SAFETY_ANALYSIS {
+        if (watch == 0) {
+            for (auto& [key, listing] : listings_) listing.changed = true;
+            return;
+        }
+        const auto watchers = watchers_.find(watch);
+        if (watchers == watchers_.end()) return;
+        for (Listing* listing : watchers->second) listing->changed = true;
     });
+    if (drained.ok()) return;
+    for (auto& [key, listing] : listings_) listing.changed = true;
+}
+
+bool FSGatherWitness::isUnchanged(const Listing& listing) {
+    drain();
+    if (listing.changed) return false;
+    return std::ranges::all_of(listing.heldToTheirTimes, [](const auto& held) { return isSame(KsURL::fileURL(held.first).status(), held.second); });
+}
+
+void FSGatherWitness::removeOldest() {
+    const auto oldest = std::ranges::min_element(listings_, {}, [](const auto& entry) { return entry.second.lastUse; });
+    for (const int watch : oldest->second.watches) {
+        const auto watchers = watchers_.find(watch);
+        std::erase(watchers->second, &oldest->second);
+        if (!watchers->second.empty()) continue;
+        watch_.remove(watch);
+        watchers_.erase(watchers);
+    }
+    listings_.erase(oldest);
 }
 
 std::uint64_t FSGatherWitness::begin(const std::vector<KsURL>& urls) {
@@ -80,18 +109,32 @@ std::uint64_t FSGatherWitness::begin(const std::vector<KsURL>& urls) {
         eventID = *next;
         key = keyOf(urls, eventID);
     }
-    if (listings_.size() >= kListingsMax) {
-        listings_.erase(std::ranges::min_element(listings_, {}, [](const auto& entry) { return entry.second.lastUse; }));
-    }
-    Listing& listing = listings_[key];
-    listing.lastUse = ++uses_;
+    if (listings_.size() >= kListingsMax) removeOldest();
+    listings_[key].lastUse = ++uses_;
     return eventID;
+}
+
+/// Watches the folder for the listing. False when it can't be watched.
+bool FSGatherWitness::watch(Listing& listing, const DirectoryReference& folder) {
+    if (listing.watches.size() >= kWatchesMax) return false;
+    const Result<int> watch = watch_.add(folder.fd.get());
+    if (!watch.ok()) return false;
+    listing.watches.push_back(*watch);
+    watchers_[*watch].push_back(&listing);
+    // What happened between the first look at the folder and the watch shows in its times.
+    if (!isProvable(folder.status) || !isSame(sys::statx(folder.fd.get(), ""), folder.status)) listing.changed = true;
+    return true;
 }
 
 void FSGatherWitness::sawFolder(const std::vector<KsURL>& urls, std::uint64_t eventID, const DirectoryReference& folder) {
     const MutexLock lock(mutex_);
+    Listing* listing = find(keyOf(urls, eventID));
     // The first sight stays: what a later page saw of the folder is checked against it.
-    if (Listing* listing = find(keyOf(urls, eventID))) listing->folders.try_emplace(folder.path, folder.status, isProvable(folder.status));
+    if (listing == nullptr || !listing->folders.insert(folder.status.fileID).second) return;
+    const bool isListed = std::ranges::any_of(urls, [&](const KsURL& url) { return url.path() == folder.path; });
+    if (!isListed && watch(*listing, folder)) return;
+    listing->heldToTheirTimes.emplace(folder.path, folder.status);
+    if (!isProvable(folder.status)) listing->changed = true;
 }
 
 bool FSGatherWitness::holds(const std::vector<KsURL>& urls, std::uint64_t eventID) {

@@ -5,11 +5,13 @@
 #include <memory>
 #include <string>
 #include <unordered_map>
+#include <unordered_set>
 #include <vector>
 
 #include "platform/foundation/KsURL.h"
 #include "platform/foundation/Mutex.h"
 #include "platform/foundation/RootDirectories.h"
+#include "platform/foundation/Sys.h"
 
 namespace cindral {
 
@@ -17,6 +19,9 @@ namespace cindral {
 ///
 /// A listing bears the event ID that it began with. Two listings of the same directories that saw different contents never bear the same
 /// one: when the second begins, what the first saw no longer holds, and the event position moves on.
+///
+/// The listed directories themselves are held to their modification and change times. What lies below them is watched, so that the question costs
+/// the same however many folders were read; where the watch limit is reached, the rest is held to its times.
 ///
 /// Thread safety: all operations, from any thread.
 class FSGatherWitness {
@@ -31,22 +36,25 @@ public:
     bool holds(const std::vector<KsURL>& urls, std::uint64_t eventID);
 
 private:
-    struct SeenFolder {
-        FileStatus status;
-        bool provable = true;  ///< a change right after it was seen would show in its times
-    };
     struct Listing {
-        std::string key;
         std::uint64_t lastUse = 0;
-        std::unordered_map<std::string, SeenFolder> folders;
+        bool changed = false;
+        std::unordered_set<std::uint64_t> folders;                    ///< file IDs of all that were seen
+        std::unordered_map<std::string, FileStatus> heldToTheirTimes;  ///< by path
+        std::vector<int> watches;
     };
     static std::string keyOf(const std::vector<KsURL>& urls, std::uint64_t eventID);
-    static bool isUnchanged(const Listing& listing);
     Listing* find(const std::string& key) REQUIRES(mutex_);
+    bool watch(Listing& listing, const DirectoryReference& folder) REQUIRES(mutex_);
+    bool isUnchanged(const Listing& listing) REQUIRES(mutex_);
+    void drain() REQUIRES(mutex_);
+    void removeOldest() REQUIRES(mutex_);
 
     Mutex mutex_;
     std::map<std::string, Listing> listings_ GUARDED_BY(mutex_);
     std::uint64_t uses_ GUARDED_BY(mutex_) = 0;
+    sys::DirectoryWatch watch_ GUARDED_BY(mutex_);
+    std::unordered_map<int, std::vector<Listing*>> watchers_ GUARDED_BY(mutex_);  ///< listings in listings_, which never move
 };
 
 }  // namespace cindral
