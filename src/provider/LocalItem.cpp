@@ -59,10 +59,10 @@ bool LocalItem::build(Customs customs) {
         logDebug("can't create an item for the \"Inbox\" directory");
         return false;
     }
-    readSizeAndDates();
+    readSizeAndDates(customs);
     decideCapabilities();
     readUserMetadata();
-    readStatus();
+    readStatus(customs);
     findApplication(customs);
     fileURL_.detach();
     return true;
@@ -109,12 +109,12 @@ bool LocalItem::name(Customs& customs) {
     return true;
 }
 
-void LocalItem::readSizeAndDates() {
+void LocalItem::readSizeAndDates(const Customs& customs) {
     const Result<FileStatus> status = fileURL_.status();
     const bool isDirectory = status.ok() && status->isDirectory();
     if (!isDirectory) {
         documentSize_ = numberResourceValue(fileURL_, ResourceKey::fileSize);
-    } else if (TypeDatabase::shared().conforms(typeIdentifier_.view(), kPackageTypeIdentifier) && isMeasuredPackage(typeIdentifier_.view())) {
+    } else if (!customs.isOnlyLookedUp && TypeDatabase::shared().conforms(typeIdentifier_.view(), kPackageTypeIdentifier) && isMeasuredPackage(typeIdentifier_.view())) {
         const Result<std::uint64_t> size = ts_directorySize(fileURL_);
         if (size.ok()) documentSize_ = *size;
     }
@@ -147,11 +147,11 @@ void LocalItem::readUserMetadata() {
     if (const auto bytes = initWithValueOfXattr(kXattrFavoriteRankName, fileURL_)) favoriteRank_ = keyed_archive::unarchiveInteger(*bytes);
 }
 
-void LocalItem::readStatus() {
+void LocalItem::readStatus(const Customs& customs) {
     const Result<FileStatus> status = fileURL_.status();
     if (status.ok()) {
         fileID_ = status->fileID;
-        if (status->isDirectory()) {
+        if (status->isDirectory() && !customs.isOnlyLookedUp) {
             const Result<std::uint16_t> links = fileURL_.linkCount();
             if (links.ok()) {
                 childItemCount_ = static_cast<std::uint16_t>(*links - 2);

@@ -26,6 +26,7 @@ public:
         std::optional<TesselItemIdentifier> itemID;
         std::optional<TesselItemIdentifier> parentItemID;
         std::optional<std::string> filename;
+        bool isOnlyLookedUp = false;  ///< for its URL alone: what takes a walk (sizes of packages, counts of children) is left out
         bool hasVistorDomainIdentifier = false;  ///< the item carries its application's identifier as search-index domain
         std::optional<InternedString> bundleIdentifier;
     };
@@ -72,10 +73,10 @@ private:
     std::optional<KsURL> computePutBackURL() const;
     bool identify(Customs& customs);
     bool name(Customs& customs);
-    void readSizeAndDates();
+    void readSizeAndDates(const Customs& customs);
     void decideCapabilities();
     void readUserMetadata();
-    void readStatus();
+    void readStatus(const Customs& customs);
     void findApplication(const Customs& customs);
     bool isAppLibraryIdentifier() const { return itemIdentifier_.starts_with('#'); }
 

@@ -85,18 +85,20 @@ void LocalTesselKit::notificationCallback(const void* observer, std::string_view
     if (provider) provider->appRefreshPacer_.signal();
 }
 
-std::shared_ptr<const LocalItem> LocalTesselKit::resolveItem(const TesselItemIdentifier& identifier) {
+std::shared_ptr<const LocalItem> LocalTesselKit::resolveItem(const TesselItemIdentifier& identifier, LocalItem::Customs customs) {
     if (identifier.starts_with('#')) {
         const auto proxy = RoBundleProxy::bundleProxyForIdentifier(identifier.substr(1));
         return proxy ? LocalAppLibraryItem::initWithBundleProxy(*proxy) : nullptr;
     }
-    if (identifier == kTesselTemporaryLocalFolderItemIdentifier) return LocalItem::initWithURL(temporaryLocalFolderURL());
+    if (identifier == kTesselTemporaryLocalFolderItemIdentifier) return LocalItem::initWithURL(temporaryLocalFolderURL(), std::move(customs));
     std::optional<KsURL> url = fileURLWithItemIdentifier(identifier);
-    return url ? LocalItem::initWithURL(*std::move(url)) : nullptr;
+    return url ? LocalItem::initWithURL(*std::move(url), std::move(customs)) : nullptr;
 }
 
 Result<KsURL> LocalTesselKit::urlForItem(const TesselItemIdentifier& identifier) {
-    const auto item = resolveItem(identifier);
+    LocalItem::Customs customs;
+    customs.isOnlyLookedUp = true;
+    const auto item = resolveItem(identifier, std::move(customs));
     if (!item) return tesselErrorForNonExistentItemWithIdentifier(identifier);
     logDebug("found {}", item->fileURL()->description());
     return *item->fileURL();
@@ -127,7 +129,9 @@ std::optional<TesselItemIdentifier> LocalTesselKit::persistentIdentifierForItemA
     std::optional<TesselItemIdentifier> identifier;
     if (url.lastPathComponent() == kDocumentsName) identifier = CdlFileObjectIdentifier::fromAppLibraryDataContainerURL(url);
     if (!identifier) {
-        const auto item = LocalItem::initWithURL(url);
+        LocalItem::Customs customs;
+        customs.isOnlyLookedUp = true;
+        const auto item = LocalItem::initWithURL(url, std::move(customs));
         if (!item) return std::nullopt;
         identifier = item->itemIdentifier();
     }

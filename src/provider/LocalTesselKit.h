@@ -49,7 +49,7 @@ private:
     static void notificationCallback(const void* observer, std::string_view name);
     std::optional<KsURL> urlForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier);
     std::optional<TesselItemIdentifier> persistentIdentifierForItemAt(const KsURL& url);
-    static std::shared_ptr<const LocalItem> resolveItem(const TesselItemIdentifier& identifier);
+    static std::shared_ptr<const LocalItem> resolveItem(const TesselItemIdentifier& identifier, LocalItem::Customs customs = LocalItem::Customs());
     /// The URL of an item, or the host's no-such-item error.
     static Result<KsURL> urlForItem(const TesselItemIdentifier& identifier);
 

@@ -360,6 +360,36 @@ TEST_F(LocalFileEnumeratorTest, entriesOfEveryKindAndNameAreListed) {
     EXPECT_TRUE(find(items, "new\nline"));
 }
 
+// More changes than the kernel keeps: all that was listed before is in doubt, and nothing that is listed after.
+TEST_F(LocalFileEnumeratorTest, lostChangesExpireEarlierListingsOnly) {
+    for (int j = 0; j < 250; ++j) storage_.file("folder/" + std::to_string(j));
+    const auto listed = workingSet();
+    const ListedPage before = firstPage(*listed);
+    for (int i = 0; i < 20'000; ++i) {
+        ASSERT_EQ(::rename((storage_ / "folder/7").c_str(), (storage_ / "folder/x").c_str()), 0);
+        ASSERT_EQ(::rename((storage_ / "folder/x").c_str(), (storage_ / "folder/7").c_str()), 0);
+    }
+    const ListedPage after = firstPage(*listed);
+    expectExpired(page(*listed, *before.next));
+    EXPECT_FALSE(page(*listed, *after.next).error);
+}
+
+TEST_F(LocalFileEnumeratorTest, manyListingsAreWatchedAtOnce) {
+    for (int i = 0; i < 80; ++i) {
+        for (int j = 0; j < 3; ++j) storage_.file("f" + std::to_string(i) + "/inner/" + std::to_string(j));
+    }
+    for (int i = 0; i < 80; ++i) {
+        const std::string name = "f" + std::to_string(i);
+        const auto one = LocalFileEnumerator::initWithContainer(kTesselWorkingSetContainerItemIdentifier, {url(name)});
+        EXPECT_EQ(all(*one).size(), 4U);
+    }
+    for (int j = 0; j < 250; ++j) storage_.file("f0/inner/more" + std::to_string(j));
+    const auto listed = workingSet();
+    const ListedPage first = firstPage(*listed);
+    ASSERT_TRUE(first.next);
+    EXPECT_FALSE(page(*listed, *first.next).error);
+}
+
 class ChangeObserver : public TesselChangeObserver {
 public:
     void didUpdateItems(TesselItems items) override { updates += items.size(); }

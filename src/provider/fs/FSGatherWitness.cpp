@@ -110,6 +110,8 @@ std::uint64_t FSGatherWitness::begin(const std::vector<KsURL>& urls) {
         key = keyOf(urls, eventID);
     }
     if (listings_.size() >= kListingsMax) removeOldest();
+    // What was lost before it began is nothing to the new listing.
+    drain();
     listings_[key].lastUse = ++uses_;
     return eventID;
 }
