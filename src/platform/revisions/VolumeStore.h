@@ -1,6 +1,8 @@
 #pragma once
 
+#include <chrono>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <span>
@@ -24,12 +26,13 @@ enum class ObjectKind : std::uint8_t { other = 0, file = 1, folder = 2, package 
 /// An object as it was just seen in the file system.
 struct ObjectSighting {
     FileID fileID{};
-    std::int64_t birthTime = 0;      ///< ns since 1970; 0 where the file system has none. With the file ID it is the object's identity.
+    std::int64_t birthTime =
+        0;  ///< ns since 1970; 0 where the file system has none. With the file ID it is the object's identity.
     FileID parent{};
     ObjectKind kind = ObjectKind::other;
-    std::string_view name;           ///< borrowed for the call
+    std::string_view name;  ///< borrowed for the call
     bool wantsDocumentID = false;
-    DocumentID documentID{};         ///< out: the document ID it has or was given
+    DocumentID documentID{};  ///< out: the document ID it has or was given
 };
 
 /// What the store knows of an object.
@@ -46,6 +49,18 @@ struct DocumentRecord {
     std::int64_t birthTime = 0;
 };
 
+/// How a store works. The host uses the defaults; tests ask for less room and for their own time.
+struct VolumeStoreOptions {
+    /// Records that are in memory until a checkpoint has written them. Whoever brings more waits for the checkpoint.
+    std::size_t unsavedRecordsMax = 131'072;
+    /// Address space for the tables. Taken in smaller pieces where the process may not have so much.
+    std::size_t mapBytes = sizeof(void*) == 8 ? std::size_t{1} << 36 : std::size_t{1} << 29;
+    /// Off: a checkpoint is written by checkpoint() and at the end, never by itself.
+    bool checkpointsItself = true;
+    /// Called within a checkpoint after each of its transactions, on the thread that writes it.
+    std::function<void()> onCheckpointStep;
+};
+
 /// The store of what file systems don't keep: which document ID belongs to which object, and where an object was last seen.
 ///
 /// One folder of files (docs/volume-store.md), written by one process at a time. The object records are hints: whoever
@@ -58,11 +73,15 @@ struct DocumentRecord {
 /// Thread safety: all operations, from any thread; readers don't wait for writers.
 class VolumeStore {
 public:
+    /// From the first unsaved record to the checkpoint that begins to save it. Without news there is no checkpoint.
+    static constexpr std::chrono::milliseconds kCheckpointDelay{1000};
+
     /// Opens the store in the folder, making both when missing (0700).
     ///
     /// EBUSY with `holder` (a pid as text) in the user info when another process has it open. A damaged store is set aside
     /// (renamed) and a new one with a new UUID is made, with one error line.
     static Result<std::unique_ptr<VolumeStore>> open(const std::string& folder);
+    static Result<std::unique_ptr<VolumeStore>> open(const std::string& folder, const VolumeStoreOptions& options);
     /// Writes a checkpoint and lets go of the lock.
     ~VolumeStore();
 
@@ -73,6 +92,9 @@ public:
     ///
     /// Costs no write when nothing is new. An object whose birth time differs from the recorded one is another object under a
     /// recycled number: its record, and its document ID, begin anew.
+    ///
+    /// After an error nothing of the call is recorded and no ID was given. EINVAL for a name that no file can have; ENOSPC when the disk
+    /// is full or the last document ID was given.
     Result<void> identify(std::span<ObjectSighting> sightings);
 
     std::optional<ObjectRecord> object(FileID fileID) const;
@@ -89,7 +111,9 @@ public:
     };
     std::optional<RecordedPath> recordedPath(FileID fileID, std::span<const FileID> roots) const;
 
-    /// The volume's event position. Grows by advanceEventID() and never goes back, also not over a power cut.
+    /// The volume's event position: the last ID that advanceEventID() gave, 0 in a new store.
+    ///
+    /// Never goes back, also not over a power cut. After one, or after the process was killed, it goes on beyond every ID that may have been given.
     std::uint64_t currentEventID() const;
     Result<std::uint64_t> advanceEventID();
 
@@ -109,7 +133,7 @@ public:
 
 private:
     VolumeStore();
-    struct Implementation;
+    class Implementation;
     std::unique_ptr<Implementation> implementation_;
 };
 

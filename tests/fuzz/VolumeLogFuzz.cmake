@@ -1,0 +1,1 @@
+cindral_fuzz_target(VolumeLogFuzz DEPENDS cindral_revisions)
