@@ -1,0 +1,5 @@
+if(NOT benchmark_FOUND)
+  return()
+endif()
+add_executable(VolumeStoreBench VolumeStoreBench.cpp)
+target_link_libraries(VolumeStoreBench PRIVATE cindral_revisions benchmark::benchmark)
