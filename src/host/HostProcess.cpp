@@ -35,7 +35,7 @@ public:
 };
 
 Result<std::shared_ptr<VolumeStore>> openStore(const std::string& state) {
-    auto store = VolumeStore::open(state + "/volume");
+    auto store = VolumeStore::open(state + "/store");
     if (store.ok()) return std::shared_ptr<VolumeStore>(*std::move(store));
     const auto holder = store.error().userInfo().find("holder");
     if (store.error().isPosix(EBUSY) && holder != store.error().userInfo().end()) {
