@@ -6,6 +6,7 @@ import json
 import os
 import queue
 import shutil
+import stat
 import subprocess
 import tempfile
 import threading
@@ -65,26 +66,26 @@ class Client:
         self.process.stdin.write(data)
         self.process.stdin.flush()
 
-    def send(self, method, identifier=None, **params):
+    def send(self, method, **params):
         """Sends a request and answers its id."""
-        identifier = next(self._ids) if identifier is None else identifier
-        request = {"jsonrpc": "2.0", "id": identifier, "method": method, "params": params}
+        request_id = next(self._ids)
+        request = {"jsonrpc": "2.0", "id": request_id, "method": method, "params": params}
         self.send_bytes(json.dumps(request).encode() + b"\n")
-        return identifier
+        return request_id
 
     def next_message(self):
         """The next line as it comes; None at the end of the output."""
         line = self._answers.get(timeout=PATIENCE)
         return None if line is None else json.loads(line)
 
-    def answer(self, identifier):
+    def answer(self, request_id):
         """The answer to one request, whatever comes before it."""
-        while identifier not in self._early:
+        while request_id not in self._early:
             message = self.next_message()
             if message is None:
                 raise AssertionError("the process ended; it said: " + "".join(self._errors))
             self._early[message["id"]] = message
-        return self._early.pop(identifier)
+        return self._early.pop(request_id)
 
     def call(self, method, **params):
         answer = self.answer(self.send(method, **params))
@@ -150,11 +151,11 @@ class SystemTest(unittest.TestCase):
 
     def _remove_folder(self):
         # What a test locked is opened again, so that also a person without privilege is rid of it.
-        for folder, names, _ in os.walk(os.fsencode(self.folder)):
+        # By name in an open folder: some paths are longer than a call takes.
+        for _, names, _, folder in os.fwalk(os.fsencode(self.folder)):
             for name in names:
-                path = os.path.join(folder, name)
-                if not os.path.islink(path):
-                    os.chmod(path, 0o700)
+                if stat.S_ISDIR(os.stat(name, dir_fd=folder, follow_symlinks=False).st_mode):
+                    os.chmod(name, 0o700, dir_fd=folder)
         shutil.rmtree(os.fsencode(self.folder))
 
     def options(self, storage=None, state=None):

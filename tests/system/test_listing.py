@@ -397,8 +397,8 @@ class PresentationTest(SystemTest):
 
     def test_clients_see_the_real_place(self):
         client = self.client(storage=self.real)
-        self.assertEqual(os.readlink(os.path.join(self.state, "Documents")), self.real)
         self.assertEqual(client.named()["sub"]["fileURL"], self.url + "/sub")
+        self.assertEqual(os.readlink(os.path.join(self.state, "Documents")), self.real)
         self.assertEqual(client.call("status")["storage"], self.real)
         self.assertEqual(client.call("status")["roots"], [self.url])
         identifier = client.identifier(os.path.join(self.real, "sub", "a b.txt"))
