@@ -110,7 +110,7 @@ class Environment {
 public:
     Environment(const std::string& storage, const std::string& state) : storage_(storage) {
         std::filesystem::create_directories(state);
-        auto store = VolumeStore::open(state + "/volume");
+        auto store = VolumeStore::open(state + "/store");
         if (!store.ok()) fail(store.error().description());
         RvStorageManager::defaultManager().setStore(std::move(*store));
         if (!RootDirectories::shared().add(storage, RootPolicy::storage).ok()) fail("can't open the storage");
