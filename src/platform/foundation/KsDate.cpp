@@ -210,7 +210,8 @@ std::optional<KsDate> KsDate::parseRFC3339(std::string_view text) {
 
     const std::int64_t days = daysFromCivil({.year = year, .month = month, .day = day});
     // A leap second has no number of its own: it is counted as the second that follows it, as the kernel's clock does.
-    const std::int64_t seconds = days * kSecondsPerDay + hour * 3'600 + minute * 60 + second - *offset;
+    const unsigned secondOfDay = hour * 3'600 + minute * 60 + second;
+    const std::int64_t seconds = days * kSecondsPerDay + secondOfDay - *offset;
     if (second == 60 && !mayFollowALeapSecond(seconds)) return std::nullopt;
     return KsDate{.seconds = seconds, .nanoseconds = fraction};
 }

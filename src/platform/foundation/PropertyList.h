@@ -26,7 +26,7 @@ inline constexpr std::uint64_t kPropertyListValuesMax = 16'384;
 /// or dictionary with string keys.
 ///
 /// Strings are bytes, UTF-8 by custom: what is not valid UTF-8 comes through the binary form unharmed. Dates keep what a
-/// double of seconds since 2001 can hold, about 0.1 µs in this century: docs/property-list.md.
+/// double of seconds since 2001 can hold, 0.12 µs until 2069: docs/property-list.md.
 ///
 /// Thread safety: a value.
 class PropertyList {
@@ -35,16 +35,16 @@ public:
     using Dictionary = std::map<std::string, PropertyList, std::less<>>;
 
     PropertyList() : value_(false) {}
-    PropertyList(bool value) : value_(value) {}                   // NOLINT(google-explicit-constructor)
-    PropertyList(std::int64_t value);                             // NOLINT(google-explicit-constructor)
-    PropertyList(std::uint64_t value) : value_(value) {}          // NOLINT(google-explicit-constructor)
-    PropertyList(double value) : value_(value) {}                 // NOLINT(google-explicit-constructor)
-    PropertyList(KsDate value) : value_(value) {}                 // NOLINT(google-explicit-constructor)
-    PropertyList(Bytes value) : value_(std::move(value)) {}       // NOLINT(google-explicit-constructor)
-    PropertyList(std::string value) : value_(std::move(value)) {} // NOLINT(google-explicit-constructor)
+    PropertyList(bool value) : value_(value) {}                      // NOLINT(google-explicit-constructor)
+    PropertyList(std::int64_t value);                                // NOLINT(google-explicit-constructor)
+    PropertyList(std::uint64_t value) : value_(value) {}             // NOLINT(google-explicit-constructor)
+    PropertyList(double value) : value_(value) {}                    // NOLINT(google-explicit-constructor)
+    PropertyList(KsDate value) : value_(value) {}                    // NOLINT(google-explicit-constructor)
+    PropertyList(Bytes value) : value_(std::move(value)) {}          // NOLINT(google-explicit-constructor)
+    PropertyList(std::string value) : value_(std::move(value)) {}    // NOLINT(google-explicit-constructor)
     PropertyList(const char* value) : value_(std::string(value)) {}  // NOLINT(google-explicit-constructor)
-    PropertyList(Array value) : value_(std::move(value)) {}       // NOLINT(google-explicit-constructor)
-    PropertyList(Dictionary value) : value_(std::move(value)) {}  // NOLINT(google-explicit-constructor)
+    PropertyList(Array value) : value_(std::move(value)) {}          // NOLINT(google-explicit-constructor)
+    PropertyList(Dictionary value) : value_(std::move(value)) {}     // NOLINT(google-explicit-constructor)
 
     /// The value as that type, or null. A non-negative integer is always held unsigned.
     const bool* boolean() const { return std::get_if<bool>(&value_); }
