@@ -233,7 +233,7 @@ Result<bool> KsURL::isPackage() const {
 
 Result<bool> KsURL::isWritable() const {
     if (isWritable_) return *isWritable_;
-    if (directory_ && status_) isWritable_ = sys::isWritableByStatus(*status_, directory_->ownersModeDecides);
+    if (directory_ && status_) isWritable_ = sys::isWritableByStatus(*status_, directory_->ownerWhoseModeDecides);
     if (isWritable_) return *isWritable_;
     const Place where = TRY(place());
     isWritable_ = TRY(sys::isWritable(where.directory, where.name));

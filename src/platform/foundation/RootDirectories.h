@@ -24,7 +24,7 @@ struct DirectoryReference {
     UniqueFd fd;
     std::string path;  ///< absolute, without a trailing slash
     FileStatus status;
-    bool ownersModeDecides = false;  ///< sys::ownersModeDecides of it; false where nobody asked
+    std::optional<uid_t> ownerWhoseModeDecides;  ///< as sys:: has it; none also where nobody asked
 };
 
 /// Whether links inside a root may be walked through. What an application can write to is not trusted.

@@ -204,22 +204,21 @@ constexpr long kF2fsMagic = 0xF2F52010;
 
 }  // namespace
 
-bool ownersModeDecides(int fd) {
+std::optional<uid_t> ownerWhoseModeDecides(int directory) {
     struct statfs fileSystem;
-    if (kernelHasMandatoryLabels() || ::fstatfs(fd, &fileSystem) != 0 || (fileSystem.f_flags & ST_RDONLY) != 0) return false;
+    if (kernelHasMandatoryLabels() || ::fstatfs(directory, &fileSystem) != 0 || (fileSystem.f_flags & ST_RDONLY) != 0) return std::nullopt;
     switch (fileSystem.f_type) {
         case EXT4_SUPER_MAGIC:
         case BTRFS_SUPER_MAGIC:
         case TMPFS_MAGIC:
         case kXfsMagic:
-        case kF2fsMagic: return true;
-        default: return false;
+        case kF2fsMagic: return ::geteuid();
+        default: return std::nullopt;
     }
 }
 
-std::optional<bool> isWritableByStatus(const FileStatus& status, bool ownersModeDecides) {
-    static const uid_t user = ::geteuid();
-    if (!ownersModeDecides || status.owner != user || user != ::geteuid() || user == kOverflowID || status.group == kOverflowID) return std::nullopt;
+std::optional<bool> isWritableByStatus(const FileStatus& status, std::optional<uid_t> owner) {
+    if (owner != status.owner || status.owner == kOverflowID || status.group == kOverflowID) return std::nullopt;
     // Not granted by the mode may still be granted by privilege; never changing, and what is mounted here, have rules of their own.
     if ((status.mode & S_IWUSR) == 0 || (status.attributes & (STATX_ATTR_IMMUTABLE | STATX_ATTR_MOUNT_ROOT)) != 0) return std::nullopt;
     return true;

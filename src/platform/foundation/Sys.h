@@ -74,13 +74,14 @@ Result<std::size_t> getxattrat(int directory, const char* name, const char* attr
 /// Whether the process may write the entry itself (effective identity, links not followed).
 Result<bool> isWritable(int directory, const char* name);
 
-/// Whether a file system keeps the ordinary promise that an owner may write what the mode lets the owner write: one of this machine's own
-/// (nothing asks a server or a user program), mounted for writing, under a kernel without mandatory labels.
-bool ownersModeDecides(int fd);
-/// The answer of isWritable() from the status alone; none where it must be asked for. `ownersModeDecides` as above, of the file's directory.
+/// The user of this process, where the file system that holds the directory keeps the ordinary promise that an owner may write what the mode lets
+/// the owner write: one of this machine's own (nothing asks a server or a user program), mounted for writing, under a kernel without
+/// mandatory labels. None elsewhere.
+std::optional<uid_t> ownerWhoseModeDecides(int directory);
+/// The answer of isWritable() from the status alone; none where it must be asked for. `owner` as above, of the entry's directory.
 ///
 /// For an owner, access lists say nothing and the mode decides; so a listing of one's own files needs no call for each.
-std::optional<bool> isWritableByStatus(const FileStatus& status, bool ownersModeDecides);
+std::optional<bool> isWritableByStatus(const FileStatus& status, std::optional<uid_t> owner);
 
 /// Changes of the entries of watched directories, told without waiting.
 ///

@@ -114,7 +114,7 @@ private:
         // A sub-directory on the same device is of the same file system; asking once is enough.
         const DirectoryReference* parent = levels_.empty() ? nullptr : levels_.back().directory.get();
         const bool same = parent != nullptr && parent->status.device == status.device && (status.attributes & STATX_ATTR_MOUNT_ROOT) == 0;
-        directory.ownersModeDecides = same ? parent->ownersModeDecides : sys::ownersModeDecides(directory.fd.get());
+        directory.ownerWhoseModeDecides = same ? parent->ownerWhoseModeDecides : sys::ownerWhoseModeDecides(directory.fd.get());
     }
 
     /// The next record of the innermost directory, or null at its end.
