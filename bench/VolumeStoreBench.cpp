@@ -104,16 +104,18 @@ void reportPerSighting(benchmark::State& state, std::size_t sightings) {
         benchmark::Counter(static_cast<double>(sightings), benchmark::Counter::kIsRate | benchmark::Counter::kInvert);
 }
 
-// A whole listing in which everything is new, the last checkpoint included.
+// A whole listing in which everything is new, the last checkpoint included; with room for so many unsaved records.
 void firstListing(benchmark::State& state) {
     const auto count = static_cast<std::size_t>(state.range(0));
+    VolumeStoreOptions options;
+    options.unsavedRecordsMax = static_cast<std::size_t>(state.range(1));
     Listing listing(count);
     std::size_t sightings = 0;
     std::size_t memory = 0;
     for (auto _ : state) {
         state.PauseTiming();
         const std::string folder = temporaryFolder();
-        auto store = std::move(VolumeStore::open(folder)).value();
+        auto store = std::move(VolumeStore::open(folder, options)).value();
         const std::size_t memoryBefore = anonymousMemory();
         for (std::size_t page = 0; page < listing.pages(); ++page) {
             auto& sighted = listing.page(page);
@@ -134,7 +136,14 @@ void firstListing(benchmark::State& state) {
     reportPerSighting(state, sightings);
     state.counters["memory_KiB"] = static_cast<double>(memory);
 }
-BENCHMARK(firstListing)->Arg(10'000)->Arg(100'000)->Arg(1'000'000)->Unit(benchmark::kMillisecond)->UseRealTime();
+BENCHMARK(firstListing)
+    ->Args({10'000, 131'072})
+    ->Args({100'000, 131'072})
+    ->Args({1'000'000, 32'768})
+    ->Args({1'000'000, 131'072})
+    ->Args({1'000'000, 262'144})
+    ->Unit(benchmark::kMillisecond)
+    ->UseRealTime();
 
 // A page in which nothing is new.
 void nextListing(benchmark::State& state) {

@@ -29,7 +29,8 @@ public:
     static Result<HighWaterFile> open(int folder);
 
     const std::optional<HighWaterMarks>& marks() const { return marks_; }
-    /// On the disk, in both slots, when it returns. Marks are lowered only to give back what was reserved and never given.
+    /// On the disk, in both slots, when it returns. Marks are lowered only to give back what was reserved and never
+    /// given.
     Result<void> write(const HighWaterMarks& marks);
 
 private:

@@ -19,7 +19,8 @@ public:
     /// Goes on at the marks, which are at least the file's.
     NumberSource(HighWaterFile file, const HighWaterMarks& next);
 
-    /// The first of so many document IDs in a row, which are reserved when it returns but not taken. ENOSPC beyond the last one.
+    /// The first of so many document IDs in a row, which are reserved when it returns but not taken. ENOSPC beyond
+    /// the last one.
     Result<std::uint32_t> reserveDocuments(std::size_t count);
     std::uint32_t nextDocument() const;
     void takeDocuments(std::size_t count);

@@ -11,7 +11,6 @@
 #include <cstring>
 
 #include "platform/foundation/Fatal.h"
-#include "platform/foundation/Sys.h"
 #include "platform/revisions/Checksum.h"
 
 namespace cindral {
@@ -20,13 +19,11 @@ namespace {
 
 constexpr std::size_t kMapBytesMin = std::size_t{16} << 20;
 constexpr unsigned kTablesMax = 8;
-// NOTLS: a snapshot belongs to its object, not to its thread. NORDAHEAD: look-ups go all over the file.
-constexpr unsigned kEnvironmentFlags = MDB_NOSUBDIR | MDB_NOTLS | MDB_NORDAHEAD;
-
-// Each object written may change a page of its own, which the library keeps in memory until the commit: 8 MB here.
-constexpr std::size_t kObjectsPerTransactionMax = 2048;
-// Documents lie side by side: two megabytes at most.
-constexpr std::size_t kDocumentsPerTransactionMax = 32768;
+// NOTLS: a snapshot belongs to its object, not to its thread. NORDAHEAD: look-ups go all over the file. NOMETASYNC:
+// pages
+// are on the disk before the head page that names them is written, but that head page waits for the next sync; what is
+// on the disk is whole at any moment.
+constexpr unsigned kEnvironmentFlags = MDB_NOSUBDIR | MDB_NOTLS | MDB_NORDAHEAD | MDB_NOMETASYNC;
 
 // Written to disk: never change one.
 constexpr std::uint32_t kFormatVersion = 1;
@@ -103,26 +100,6 @@ std::optional<DocumentRecord> decodeDocument(ByteView bytes) {
                           loadInteger<std::int64_t>(bytes.data() + 8)};
 }
 
-int putDocument(MDB_txn* transaction, MDB_dbi table, const Overlay::Document& document) {
-    std::array<std::byte, kDocumentBytes> bytes{};
-    storeInteger(bytes.data(), static_cast<std::uint64_t>(document.second.fileID));
-    storeInteger(bytes.data() + 8, document.second.birthTime);
-    IntegerKey<std::uint32_t> key(static_cast<std::uint32_t>(document.first));
-    MDB_val value = valueOf(bytes);
-    return mdb_put(transaction, table, key.value(), &value, 0);
-}
-
-int putObject(MDB_txn* transaction, MDB_dbi table, const Overlay::Object& object) {
-    IntegerKey<std::uint64_t> key(static_cast<std::uint64_t>(object.first));
-    MDB_val value = valueOf(object.second);
-    return mdb_put(transaction, table, key.value(), &value, 0);
-}
-
-Result<void> syncFolderOf(const std::string& path) {
-    const UniqueFd folder = TRY(sys::open(path.substr(0, path.rfind('/') + 1).c_str(), O_RDONLY | O_DIRECTORY));
-    return syncFolder(folder.get());
-}
-
 }  // namespace
 
 // MARK: Opening
@@ -135,7 +112,8 @@ Result<void> ObjectTables::create(const std::string& path, const TablesHead& hea
         ObjectTables tables;
         TRY(tables.openEnvironment(unfinished, kMapBytesMin));
         TRY(tables.openTables(true));
-        TRY(tables.inTransaction(true, [&](MDB_txn* transaction) { return putHead(transaction, tables.meta_, head); }));
+        TRY(tables.inTransaction([&](MDB_txn* transaction) { return putHead(transaction, tables.meta_, head); }));
+        TRY(tables.sync());
     }
     ::unlink((unfinished + "-lock").c_str());
     if (::rename(unfinished.c_str(), path.c_str()) != 0) return KsError::posix(errno, path);
@@ -155,7 +133,8 @@ Result<std::unique_ptr<ObjectTables>> ObjectTables::open(const std::string& path
 }
 
 Result<void> ObjectTables::openEnvironment(const std::string& path, std::size_t mapBytes) {
-    // Only the holder of the store's lock comes here: readers that a crash left in the library's own lock file are nobody.
+    // Only the holder of the store's lock comes here: readers that a crash left in the library's own lock file are
+    // nobody.
     ::unlink((path + "-lock").c_str());
     while (true) {
         if (const int code = mdb_env_create(&environment_); code != 0) return errorOf(code);
@@ -344,10 +323,7 @@ std::uint64_t ObjectTables::documentCount() const {
 
 // MARK: Writing
 
-int ObjectTables::inTransactionOnce(bool synced, const Body& body) {
-    // Pages are on the disk before the head page that names them is written, either way. Only the head page itself may
-    // wait for the next commit.
-    mdb_env_set_flags(environment_, MDB_NOMETASYNC, synced ? 0 : 1);
+int ObjectTables::inTransactionOnce(const Body& body) {
     MDB_txn* transaction = nullptr;
     if (const int code = mdb_txn_begin(environment_, nullptr, 0, &transaction); code != 0) return code;
     if (const int code = body(transaction); code != 0) {
@@ -358,13 +334,19 @@ int ObjectTables::inTransactionOnce(bool synced, const Body& body) {
 }
 
 /// The body is run again, in a larger map, when the map is full.
-Result<void> ObjectTables::inTransaction(bool synced, const Body& body) {
+Result<void> ObjectTables::inTransaction(const Body& body) {
     while (true) {
-        const int code = inTransactionOnce(synced, body);
+        const int code = inTransactionOnce(body);
         if (code == 0) return {};
         if (code != MDB_MAP_FULL) return errorOf(code);
         TRY(growMap());
     }
+}
+
+/// Puts the last commit's head page on the disk; everything else is there already.
+Result<void> ObjectTables::sync() {
+    if (const int code = mdb_env_sync(environment_, 1); code != 0) return errorOf(code);
+    return {};
 }
 
 Result<void> ObjectTables::growMap() {
@@ -397,37 +379,86 @@ int ObjectTables::putHead(MDB_txn* transaction, MDB_dbi table, const TablesHead&
     return mdb_put(transaction, table, &key, &value, 0);
 }
 
-Result<void> ObjectTables::write(const Overlay& overlay, const TablesHead& head, const StepObserver& observer) {
+/// Puts records, and counts the pages that come to be changed by them.
+class ObjectTables::Putter {
+public:
+    Putter(MDB_txn* transaction, std::size_t pageBytes, std::size_t pagesMax)
+        : transaction_(transaction), pageBytes_(pageBytes), pagesMax_(pagesMax) {}
+
+    /// Whether the transaction has about as many pages in memory as it shall.
+    bool isFull() const { return pages_ >= pagesMax_; }
+
+    int put(MDB_dbi table, const Overlay::Document& document) {
+        IntegerKey<std::uint32_t> key(static_cast<std::uint32_t>(document.first));
+        MDB_val place{kDocumentBytes, nullptr};
+        const int code = mdb_put(transaction_, table, key.value(), &place, MDB_RESERVE);
+        if (code != 0) return code;
+        auto* to = count(place);
+        storeInteger(to, static_cast<std::uint64_t>(document.second.fileID));
+        storeInteger(to + 8, document.second.birthTime);
+        return 0;
+    }
+
+    int put(MDB_dbi table, const Overlay::Object& object) {
+        IntegerKey<std::uint64_t> key(static_cast<std::uint64_t>(object.first));
+        MDB_val place{object.second.size(), nullptr};
+        const int code = mdb_put(transaction_, table, key.value(), &place, MDB_RESERVE);
+        if (code != 0) return code;
+        std::memcpy(count(place), object.second.data(), object.second.size());
+        return 0;
+    }
+
+private:
+    // Records come in key order, so a page is changed by several in a row. Where one goes tells whether it is the
+    // page of the one
+    // before; that may be wrong by a few.
+    std::byte* count(const MDB_val& place) {
+        const auto address = reinterpret_cast<std::uintptr_t>(place.mv_data);
+        const std::uintptr_t distance = address > last_ ? address - last_ : last_ - address;
+        if (distance >= pageBytes_) ++pages_;
+        last_ = address;
+        return static_cast<std::byte*>(place.mv_data);
+    }
+
+    MDB_txn* transaction_;
+    std::size_t pageBytes_;
+    std::size_t pagesMax_;
+    std::size_t pages_ = 0;
+    std::uintptr_t last_ = 0;
+};
+
+Result<void> ObjectTables::write(const Overlay& overlay, const TablesHead& head, std::size_t pagesMax,
+                                 const StepObserver& observer) {
     const auto objects = overlay.objectsInKeyOrder();
     const auto& documents = overlay.documents();
-    // Documents beyond one transaction's worth go ahead of the objects. What fits in one goes with the first objects.
     std::size_t document = 0, object = 0;
-    for (bool last = false; !last;) {
-        const std::size_t documentEnd = std::min(documents.size(), document + kDocumentsPerTransactionMax);
-        const std::size_t objectsNow = documentEnd == documents.size() ? kObjectsPerTransactionMax : 0;
-        const std::size_t objectEnd = std::min(objects.size(), object + objectsNow);
-        last = documentEnd == documents.size() && objectEnd == objects.size();
-        TRY(inTransaction(last, [&](MDB_txn* transaction) {
+    for (bool isLast = false; !isLast;) {
+        std::size_t documentEnd = 0, objectEnd = 0;
+        TRY(inTransaction([&](MDB_txn* transaction) {
+            Putter putter(transaction, pageBytes_, pagesMax);
             int code = 0;
-            for (std::size_t i = document; code == 0 && i < documentEnd; ++i) {
-                code = putDocument(transaction, documents_, documents[i]);
+            for (documentEnd = document; code == 0 && documentEnd < documents.size() && !putter.isFull();
+                 ++documentEnd) {
+                code = putter.put(documents_, documents[documentEnd]);
             }
-            for (std::size_t i = object; code == 0 && i < objectEnd; ++i) {
-                code = putObject(transaction, objects_, objects[i]);
+            for (objectEnd = object; code == 0 && objectEnd < objects.size() && !putter.isFull(); ++objectEnd) {
+                code = putter.put(objects_, objects[objectEnd]);
             }
-            if (code == 0 && last) code = putHead(transaction, meta_, head);
+            isLast = documentEnd == documents.size() && objectEnd == objects.size();
+            if (code == 0 && isLast) code = putHead(transaction, meta_, head);
             return code;
         }));
         if (observer) observer();
         document = documentEnd;
         object = objectEnd;
     }
+    TRY(sync());
     head_ = head;
     return {};
 }
 
 Result<void> ObjectTables::removeUnsettledDocuments() {
-    return inTransaction(true, [&](MDB_txn* transaction) {
+    return inTransaction([&](MDB_txn* transaction) {
         MDB_cursor* cursor = nullptr;
         if (const int code = mdb_cursor_open(transaction, documents_, &cursor); code != 0) return code;
         IntegerKey<std::uint32_t> from(static_cast<std::uint32_t>(head_.settledDocument) + 1);

@@ -79,9 +79,11 @@ public:
 
     /// Writes all of the overlay, then the head. On the disk when it returns.
     ///
-    /// Takes several transactions, so that the memory for changed pages stays small; each leaves tables that are good, and doing it
+    /// Takes several transactions, of about `pagesMax` changed pages, which are in memory until it ends; each leaves
+    /// tables that are good, and doing it
     /// again from the start ends the same. Documents come first: an object never names a document that is missing.
-    Result<void> write(const Overlay& overlay, const TablesHead& head, const StepObserver& observer);
+    Result<void> write(const Overlay& overlay, const TablesHead& head, std::size_t pagesMax,
+                       const StepObserver& observer);
 
     /// Takes back the documents above the settled one whose object was not written with them.
     Result<void> removeUnsettledDocuments();
@@ -91,8 +93,10 @@ private:
 
     /// Answers a code of the library, 0 for "commit".
     using Body = std::function<int(MDB_txn*)>;
-    Result<void> inTransaction(bool synced, const Body& body);
-    int inTransactionOnce(bool synced, const Body& body);
+    Result<void> inTransaction(const Body& body);
+    int inTransactionOnce(const Body& body);
+    class Putter;
+    Result<void> sync();
     std::uint64_t entriesOf(MDB_dbi table) const;
 
     Result<void> openEnvironment(const std::string& path, std::size_t mapBytes);

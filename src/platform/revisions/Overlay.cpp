@@ -1,13 +1,16 @@
 #include "platform/revisions/Overlay.h"
 
+#include <sys/mman.h>
+
 #include <algorithm>
 #include <bit>
+#include <new>
 
 namespace cindral {
 
 namespace {
 
-constexpr std::size_t kChunkBytes = 256 * 1024;
+constexpr std::size_t kChunkBytes = std::size_t{256} * 1024;
 constexpr std::size_t kSlotsMin = 64;
 
 // In memory only: file ID u64, size of the packed record u16, the packed record.
@@ -23,10 +26,17 @@ ByteView entryRecord(const std::byte* entry) {
 
 }  // namespace
 
+void Overlay::Unmap::operator()(std::byte* chunk) const {
+    ::munmap(chunk, kChunkBytes);
+}
+
 std::byte* Overlay::allocate(std::size_t size) {
     if (size > chunkLeft_) {
-        // Not initialized: what no record has touched is no memory yet.
-        chunks_.push_back(std::unique_ptr<std::byte[]>(new std::byte[kChunkBytes]));
+        // Mapped, not from the heap: what no record has touched is no memory yet, and what an overlay had is given
+        // back when it goes.
+        void* chunk = ::mmap(nullptr, kChunkBytes, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+        if (chunk == MAP_FAILED) throw std::bad_alloc();
+        chunks_.emplace_back(static_cast<std::byte*>(chunk));
         chunkNext_ = chunks_.back().get();
         chunkLeft_ = kChunkBytes;
     }

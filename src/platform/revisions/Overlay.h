@@ -43,7 +43,10 @@ private:
     std::size_t slotOf(FileID fileID) const;
     void grow();
 
-    std::vector<std::unique_ptr<std::byte[]>> chunks_;
+    struct Unmap {
+        void operator()(std::byte* chunk) const;
+    };
+    std::vector<std::unique_ptr<std::byte, Unmap>> chunks_;
     std::size_t chunkLeft_ = 0;
     std::byte* chunkNext_ = nullptr;
     std::vector<const std::byte*>

@@ -78,9 +78,20 @@ Result<void> syncFolder(int folder) {
 Result<void> makeFolders(const std::string& path) {
     for (std::size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
         const std::string part = path.substr(0, end);
-        if (::mkdir(part.c_str(), 0700) != 0 && errno != EEXIST) return KsError::posix(errno, part);
+        if (::mkdir(part.c_str(), 0700) == 0) {
+            TRY(syncFolderOf(part));
+        } else if (errno != EEXIST) {
+            return KsError::posix(errno, part);
+        }
         if (end == std::string::npos) return {};
     }
+}
+
+Result<void> syncFolderOf(const std::string& path) {
+    const std::size_t slash = path.rfind('/');
+    const std::string above = slash == std::string::npos ? "." : path.substr(0, slash + 1);
+    const UniqueFd folder = TRY(sys::open(above.c_str(), O_RDONLY | O_DIRECTORY));
+    return syncFolder(folder.get());
 }
 
 }  // namespace cindral

@@ -33,7 +33,8 @@ private:
 
 /// Puts the folder's list of names on the disk.
 Result<void> syncFolder(int folder);
-/// Makes the folder and those above it that are missing, 0700.
+Result<void> syncFolderOf(const std::string& path);
+/// Makes the folder and those above it that are missing, 0700, on the disk.
 Result<void> makeFolders(const std::string& path);
 
 }  // namespace cindral

@@ -387,7 +387,8 @@ private:
         return true;
     }
 
-    /// Halves every lookup's range once a round, until each has the last entry whose key is not above its own (or the first).
+    /// Halves every lookup's range once a round, until each has the last entry whose key is not above its own (or the
+    /// first).
     void searchPages(std::span<Lookup> lookups) const {
         for (bool more = true; more;) {
             more = false;

@@ -112,7 +112,7 @@ ByteView BatchWriter::finish(const KsUUID& store, std::uint64_t sequence) {
 
 Result<void> LogFile::append(ByteView batch) {
     if (batch.size() > std::numeric_limits<std::uint32_t>::max()) return KsError::posix(EFBIG);
-    const Result<void> written = file_.writeAt(size_, batch);
+    Result<void> written = file_.writeAt(size_, batch);
     if (!written.ok()) {
         // Where even this fails, the half batch has no good checksum, and the next one is written over it.
         (void)file_.truncate(size_);

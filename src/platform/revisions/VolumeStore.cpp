@@ -70,7 +70,8 @@ namespace {
 
 // A chain this long is no path that the file system could have made; one in a circle gets here, too.
 constexpr std::size_t kPathDepthMax = 4096;
-// Sightings that are looked up at once: enough that memory is never waited for, few enough to stay in the nearest cache.
+// Sightings that are looked up at once: enough that memory is never waited for, few enough to stay in the nearest
+// cache.
 constexpr std::size_t kLookupsAtOnceMax = 128;
 
 bool isSame(const PackedRecord& record, const ObjectSighting& sighting) {
@@ -440,8 +441,8 @@ Result<void> VolumeStore::Implementation::writeCheckpoint() {
         lastBatch = frozenLastBatch_;
     }
     if (!overlay) return {};
-    Result<void> written =
-        tables_->write(*overlay, headFor(*overlay, lastBatch, numbers_->reserved()), options_.onCheckpointStep);
+    Result<void> written = tables_->write(*overlay, headFor(*overlay, lastBatch, numbers_->reserved()),
+                                          options_.checkpointPagesMax, options_.onCheckpointStep);
     if (written.ok()) {
         checkpointSucceeded(lastBatch);
     } else {

@@ -55,6 +55,8 @@ struct VolumeStoreOptions {
     std::size_t unsavedRecordsMax = 131'072;
     /// Address space for the tables. Taken in smaller pieces where the process may not have so much.
     std::size_t mapBytes = sizeof(void*) == 8 ? std::size_t{1} << 36 : std::size_t{1} << 29;
+    /// Pages that a checkpoint changes in one transaction, about; so many are in memory until its end.
+    std::size_t checkpointPagesMax = 512;
     /// Off: a checkpoint is written by checkpoint() and at the end, never by itself.
     bool checkpointsItself = true;
     /// Called within a checkpoint after each of its transactions, on the thread that writes it.

@@ -23,7 +23,8 @@ namespace cindral {
 
 /// The parts of a store and the way of a record through them: log and overlay at once, tables with the next checkpoint.
 ///
-/// There are two log files, each with an overlay of what it holds. One pair takes what is new; the other, once frozen, is
+/// There are two log files, each with an overlay of what it holds. One pair takes what is new; the other, once
+/// frozen, is
 /// written to the tables and emptied.
 ///
 /// Locks are taken in the order checkpointMutex_, writerMutex_, mutex_.

@@ -53,7 +53,8 @@ Result<void> VolumeStore::Implementation::open() {
     return {};
 }
 
-/// Tables and logs as the last holder left them, put together. Answers the first numbers that nobody can have been given.
+/// Tables and logs as the last holder left them, put together. Answers the first numbers that nobody can have been
+/// given.
 Result<HighWaterMarks> VolumeStore::Implementation::openState(const std::optional<HighWaterMarks>& marks) {
     TRY(openTables(marks));
     Overlay unsaved;
@@ -81,7 +82,8 @@ Result<void> VolumeStore::Implementation::openTables(const std::optional<HighWat
     return {};
 }
 
-/// Tables of a store that begins, under a UUID of its own, behind every number that one before it in this folder may have given.
+/// Tables of a store that begins, under a UUID of its own, behind every number that one before it in this folder may
+/// have given.
 Result<void> VolumeStore::Implementation::createTables(const std::optional<HighWaterMarks>& marks) {
     TablesHead head;
     head.uuid = KsUUID::random();
@@ -129,7 +131,8 @@ Result<void> VolumeStore::Implementation::setAside(const KsError& damage) {
 
 // MARK: The logs
 
-/// Reads what the logs hold beyond the tables: their batches in the order of their numbers, up to the first that is missing or torn.
+/// Reads what the logs hold beyond the tables: their batches in the order of their numbers, up to the first that is
+/// missing or torn.
 Result<void> VolumeStore::Implementation::readLogs(Overlay& unsaved) {
     const MutexLock writerLock(writerMutex_);
     std::array<Bytes, 2> bytes;
@@ -166,7 +169,8 @@ Result<void> VolumeStore::Implementation::saveReplayed(const Overlay& unsaved, c
     TRY(tables_->removeUnsettledDocuments());
     const std::uint64_t lastBatch = nextBatch_ - 1;
     if (!unsaved.empty()) {
-        TRY(tables_->write(unsaved, headFor(unsaved, lastBatch, next), options_.onCheckpointStep));
+        TRY(tables_->write(unsaved, headFor(unsaved, lastBatch, next), options_.checkpointPagesMax,
+                           options_.onCheckpointStep));
     }
     // On the disk, because numbers go on here: a batch of the tail that was cut off shall never follow one that is new.
     for (LogFile& log : logs_) TRY(log.clearDurably());
@@ -206,7 +210,7 @@ Result<void> VolumeStore::Implementation::saveMarks() {
     TablesHead head = tables_->head();
     if (head.marks == numbers_->reserved()) return {};
     head.marks = numbers_->reserved();
-    return tables_->write(Overlay(), head, {});
+    return tables_->write(Overlay(), head, options_.checkpointPagesMax, {});
 }
 
 }  // namespace cindral

@@ -40,7 +40,7 @@ protected:
                             {.parent = FileID{2}, .birthTime = 5, .documentID = id, .name = nameOf(keys[i])});
                 overlay.addDocument(id, {FileID{keys[i]}, 5});
             }
-            EXPECT_TRUE(tables->write(overlay, tables->head(), {}).ok());
+            EXPECT_TRUE(tables->write(overlay, tables->head(), 100, {}).ok());
         }
         return {keys.begin(), keys.end()};
     }

@@ -546,11 +546,12 @@ TEST_F(VolumeStoreTest, findsEverythingAfterBeingKilledWithinACheckpoint) {
         killedChild([&](int) {
             int step = 0;
             VolumeStoreOptions options = onRequest();
+            options.checkpointPagesMax = 20;
             options.onCheckpointStep = [&] {
                 if (++step == dieAt) ::raise(SIGKILL);
             };
             auto store = std::move(VolumeStore::open(path, options)).value();
-            Page page = Page::of(1000, 7000);  // Four transactions.
+            Page page = Page::of(1000, 7000);  // More than four transactions.
             (void)store->identify(page.all());
             (void)store->checkpoint();
         });
@@ -676,6 +677,7 @@ TEST_F(VolumeStoreTest, neverGivesAnIDAgainThatAPowerCutTookBack) {
 TEST_F(VolumeStoreTest, keepsObjectsAndDocumentsInStepOverAPowerCutWithinACheckpoint) {
     int step = 0;
     VolumeStoreOptions options = onRequest();
+    options.checkpointPagesMax = 40;
     options.onCheckpointStep = [&] {
         const std::string copy = copyOfFolder("step-" + std::to_string(++step));
         std::filesystem::remove(copy + "/log.0");
