@@ -37,6 +37,8 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 constexpr int kRounds = 5;
+constexpr long kSampleEntries = 50'000;
+constexpr int kFirstsMax = 10;  // Each needs a state of its own.
 
 double seconds(const std::function<void()>& work) {
     const auto begin = Clock::now();
@@ -265,6 +267,13 @@ Row measure(Tree& tree, const Listing& listing, const std::string& program) {
         return listing.everything ? listAll(*environment.workingSet()) : listTree(environment, listing.folder, listing.folders);
     };
     row.entries = floor_list(path.c_str(), descend);  // And once to warm the caches.
+    // A short listing is repeated within its sample, so that no sample is a few milliseconds of somebody else's work.
+    const int repeats = static_cast<int>(std::max(1L, kSampleEntries / row.entries));
+    const auto repeated = [repeats](const std::function<void()>& work) {
+        return seconds([&] {
+            for (int i = 0; i < repeats; ++i) work();
+        }) / repeats;
+    };
     std::vector<double> floors;
     std::vector<double> firsts;
     std::vector<double> seconds_;
@@ -272,13 +281,17 @@ Row measure(Tree& tree, const Listing& listing, const std::string& program) {
     for (int round = 0; round < kRounds; ++round) {
         const std::string state = tree.freshState();
         std::size_t count = 0;
-        floors.push_back(seconds([&] { (void)floor_list(path.c_str(), descend); }));
+        floors.push_back(repeated([&] { (void)floor_list(path.c_str(), descend); }));
+        for (int i = 1; i < std::min(repeats, kFirstsMax); ++i) {
+            const Environment environment(tree.storage(), state + "-" + std::to_string(i));
+            firsts.push_back(seconds([&] { count = list(environment); }));
+        }
         {
             const Environment environment(tree.storage(), state);
             firsts.push_back(seconds([&] { count = list(environment); }));
             if (count != static_cast<std::size_t>(row.entries)) fail(fmt::format("{} of {} entries listed", count, row.entries));
-            floors.push_back(seconds([&] { (void)floor_list(path.c_str(), descend); }));
-            seconds_.push_back(seconds([&] { count = list(environment); }));
+            floors.push_back(repeated([&] { (void)floor_list(path.c_str(), descend); }));
+            seconds_.push_back(repeated([&] { count = list(environment); }));
         }
         if (!program.empty()) {
             Program host(program, tree.storage(), state);
@@ -289,7 +302,7 @@ Row measure(Tree& tree, const Listing& listing, const std::string& program) {
                 containers.push_back(host.container(path));
                 for (long i = 0; i < listing.folders; ++i) containers.push_back(host.container(path + "/" + std::to_string(i)));
             }
-            rpcs.push_back(seconds([&] {
+            rpcs.push_back(repeated([&] {
                 for (const std::string& container : containers) (void)host.listAll(container);
             }));
         }

@@ -7,14 +7,9 @@ namespace cindral {
 
 namespace {
 
-// A block is as long as what was taken so far: a process that is killed loses at most as many IDs as it gave, or the
-// least block, and one that gives a million goes to the disk twenty times.
-constexpr std::uint64_t kBlockMin = 1024;
-constexpr std::uint64_t kBlockMax = 65'536;
-
-std::uint64_t blockAfter(std::uint64_t taken) {
-    return std::clamp(taken, kBlockMin, kBlockMax);
-}
+// What a process that is killed loses: of four thousand million document IDs, few enough; and what a listing gives before it goes to
+// the disk again, which costs as much as listing a thousand files.
+constexpr std::uint64_t kBlock = 65'536;
 
 }  // namespace
 
@@ -33,9 +28,15 @@ Result<std::uint32_t> NumberSource::reserveDocuments(std::size_t count) {
     const std::uint64_t end = next_.document + count;
     if (end > kEnd) return KsError::posix(ENOSPC).with("message", "every document ID has been given");
     if (end > reserved_.document) {
-        TRY(reserve({std::min(end + blockAfter(documentsTaken_), kEnd), reserved_.event}));
+        TRY(reserve({std::min(end + kBlock, kEnd), reserved_.event}));
     }
     return static_cast<std::uint32_t>(next_.document);
+}
+
+Result<void> NumberSource::reserveAhead() {
+    const MutexLock lock(mutex_);
+    if (next_.document < reserved_.document || reserved_.document + kBlock > kLastDocumentID) return {};
+    return reserve({reserved_.document + kBlock, reserved_.event});
 }
 
 std::uint32_t NumberSource::nextDocument() const {
@@ -46,7 +47,6 @@ std::uint32_t NumberSource::nextDocument() const {
 void NumberSource::takeDocuments(std::size_t count) {
     const MutexLock lock(mutex_);
     next_.document += count;
-    documentsTaken_ += count;
 }
 
 std::uint64_t NumberSource::currentEvent() const {
@@ -57,9 +57,8 @@ std::uint64_t NumberSource::currentEvent() const {
 Result<std::uint64_t> NumberSource::advanceEvent() {
     const MutexLock lock(mutex_);
     if (next_.event == reserved_.event) {
-        TRY(reserve({reserved_.document, reserved_.event + blockAfter(eventsTaken_)}));
+        TRY(reserve({reserved_.document, reserved_.event + kBlock}));
     }
-    ++eventsTaken_;
     return next_.event++;
 }
 

@@ -22,6 +22,8 @@ public:
     /// The first of so many document IDs in a row, which are reserved when it returns but not taken. ENOSPC beyond
     /// the last one.
     Result<std::uint32_t> reserveDocuments(std::size_t count);
+    /// Has a block of document IDs ready, so that the first to be given waits for no disk.
+    Result<void> reserveAhead();
     std::uint32_t nextDocument() const;
     void takeDocuments(std::size_t count);
 
@@ -41,8 +43,6 @@ private:
     HighWaterFile file_ GUARDED_BY(mutex_);
     HighWaterMarks next_ GUARDED_BY(mutex_);
     HighWaterMarks reserved_ GUARDED_BY(mutex_);
-    std::uint64_t documentsTaken_ GUARDED_BY(mutex_) = 0;
-    std::uint64_t eventsTaken_ GUARDED_BY(mutex_) = 0;
 };
 
 }  // namespace cindral
