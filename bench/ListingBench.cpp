@@ -1,8 +1,10 @@
-// Listings beside what the kernel charges for them, in one run: the floor (Floor.c), the provider's enumerators, and JSON-RPC.
+// Listings beside what the kernel charges for them, in one run: the floor (Floor.c), the provider's enumerators, and
+// JSON-RPC.
 //
 //   listing_bench [--quick] [--program PATH/TO/cindral]
 //
-// Every figure is the median of several rounds in which the sides take turns; every ratio is of two such figures of the same run.
+// Every figure is the median of several rounds in which the sides take turns; every ratio is of two such figures of the
+// same run.
 
 #include <fcntl.h>
 #include <fmt/format.h>
@@ -88,7 +90,8 @@ public:
         std::filesystem::create_directories(storage() + "/" + folder);
         const UniqueFd directory(::open((storage() + "/" + folder).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         for (long i = 0; i < count; ++i) {
-            const UniqueFd file(::openat(directory.get(), fmt::format("document-{:07}.txt", i).c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0644));
+            const UniqueFd file(::openat(directory.get(), fmt::format("document-{:07}.txt", i).c_str(),
+                                         O_CREAT | O_WRONLY | O_CLOEXEC, 0644));
             if (!file) fail("can't make a file");
         }
     }
@@ -117,8 +120,8 @@ public:
         RvStorageManager::defaultManager().setStore(std::move(*store));
         if (!RootDirectories::shared().add(storage, RootPolicy::storage).ok()) fail("can't open the storage");
         TesselManager::defaultManager().setDocumentStorageURL(KsURL::fileURL(storage));
-        RoApplicationWorkspace::defaultWorkspace().setOwnRecord(std::make_shared<RoBundleProxy>(
-            RoBundleProxy::Values{"com.vemra.CindralStorage", KsURL::fileURL(storage).deletingLastPathComponent(), "Documents"}));
+        RoApplicationWorkspace::defaultWorkspace().setOwnRecord(std::make_shared<RoBundleProxy>(RoBundleProxy::Values{
+            "com.vemra.CindralStorage", KsURL::fileURL(storage).deletingLastPathComponent(), "Documents"}));
     }
     ~Environment() {
         RvStorageManager::defaultManager().setStore(nullptr);
@@ -132,7 +135,8 @@ public:
         return LocalFileEnumerator::initWithContainer(itemIdentifier(url).value_or("none"), {url});
     }
     std::shared_ptr<LocalFileEnumerator> workingSet() const {
-        return LocalFileEnumerator::initWithContainer(kTesselWorkingSetContainerItemIdentifier, {KsURL::fileURL(storage_)});
+        return LocalFileEnumerator::initWithContainer(kTesselWorkingSetContainerItemIdentifier,
+                                                      {KsURL::fileURL(storage_)});
     }
 
 private:
@@ -164,7 +168,8 @@ public:
         if (process_ == 0) {
             ::dup2(in[0], 0);
             ::dup2(out[1], 1);
-            ::execl(program.c_str(), program.c_str(), "rpc", "--storage", storage.c_str(), "--state", state.c_str(), nullptr);
+            ::execl(program.c_str(), program.c_str(), "rpc", "--storage", storage.c_str(), "--state", state.c_str(),
+                    nullptr);
             ::_exit(127);
         }
         ::close(in[0]);
@@ -183,7 +188,8 @@ public:
 
     /// The answer's line, whole.
     const std::string& call(std::string_view method, const std::string& params) {
-        const std::string request = fmt::format(R"({{"jsonrpc":"2.0","id":1,"method":"{}","params":{}}})", method, params) + "\n";
+        const std::string request =
+            fmt::format(R"({{"jsonrpc":"2.0","id":1,"method":"{}","params":{}}})", method, params) + "\n";
         for (std::size_t sent = 0; sent < request.size();) {
             const ssize_t size = ::write(to_.get(), request.data() + sent, request.size() - sent);
             if (size <= 0) fail("the program went away");
@@ -245,16 +251,18 @@ struct Row {
 };
 
 void print(const Row& row) {
-    const auto ratio = [&](double value) { return value == 0 ? std::string("-") : fmt::format("{:.2f}", value / row.floor); };
-    fmt::print("| {} | {:.2f} | {} | {} | {} |\n", row.name, row.floor * 1e6 / static_cast<double>(row.entries), ratio(row.first), ratio(row.second),
-               ratio(row.rpc));
+    const auto ratio = [&](double value) {
+        return value == 0 ? std::string("-") : fmt::format("{:.2f}", value / row.floor);
+    };
+    fmt::print("| {} | {:.2f} | {} | {} | {} |\n", row.name, row.floor * 1e6 / static_cast<double>(row.entries),
+               ratio(row.first), ratio(row.second), ratio(row.rpc));
     std::fflush(stdout);
 }
 
 struct Listing {
     std::string name;
-    std::string folder;  ///< in the storage
-    long folders = 0;    ///< numbered sub-folders, each listed as a container
+    std::string folder;       ///< in the storage
+    long folders = 0;         ///< numbered sub-folders, each listed as a container
     bool everything = false;  ///< as the working set
 };
 
@@ -264,15 +272,17 @@ Row measure(Tree& tree, const Listing& listing, const std::string& program) {
     const std::string path = tree.storage() + (listing.everything ? "" : "/" + listing.folder);
     const bool descend = listing.folders > 0 || listing.everything;
     const auto list = [&](const Environment& environment) {
-        return listing.everything ? listAll(*environment.workingSet()) : listTree(environment, listing.folder, listing.folders);
+        return listing.everything ? listAll(*environment.workingSet())
+                                  : listTree(environment, listing.folder, listing.folders);
     };
     row.entries = floor_list(path.c_str(), descend);  // And once to warm the caches.
     // A short listing is repeated within its sample, so that no sample is a few milliseconds of somebody else's work.
     const int repeats = static_cast<int>(std::max(1L, kSampleEntries / row.entries));
     const auto repeated = [repeats](const std::function<void()>& work) {
         return seconds([&] {
-            for (int i = 0; i < repeats; ++i) work();
-        }) / repeats;
+                   for (int i = 0; i < repeats; ++i) work();
+               }) /
+               repeats;
     };
     std::vector<double> floors;
     std::vector<double> firsts;
@@ -289,7 +299,8 @@ Row measure(Tree& tree, const Listing& listing, const std::string& program) {
         {
             const Environment environment(tree.storage(), state);
             firsts.push_back(seconds([&] { count = list(environment); }));
-            if (count != static_cast<std::size_t>(row.entries)) fail(fmt::format("{} of {} entries listed", count, row.entries));
+            if (count != static_cast<std::size_t>(row.entries))
+                fail(fmt::format("{} of {} entries listed", count, row.entries));
             floors.push_back(repeated([&] { (void)floor_list(path.c_str(), descend); }));
             seconds_.push_back(repeated([&] { count = list(environment); }));
         }
@@ -300,7 +311,8 @@ Row measure(Tree& tree, const Listing& listing, const std::string& program) {
                 containers.push_back(kTesselWorkingSetContainerItemIdentifier);
             } else {
                 containers.push_back(host.container(path));
-                for (long i = 0; i < listing.folders; ++i) containers.push_back(host.container(path + "/" + std::to_string(i)));
+                for (long i = 0; i < listing.folders; ++i)
+                    containers.push_back(host.container(path + "/" + std::to_string(i)));
             }
             rpcs.push_back(repeated([&] {
                 for (const std::string& container : containers) (void)host.listAll(container);
@@ -341,8 +353,8 @@ void measurePages(const Environment& environment, const std::string& folder) {
         firsts.push_back(cost(0));
         lates.push_back(cost(late));
     }
-    fmt::print("\nPage {} of {}: {:.2f} ms, page 1: {:.2f} ms, ratio {:.2f}\n", late + 1, pages.size(), median(lates) * 1e3, median(firsts) * 1e3,
-               median(lates) / median(firsts));
+    fmt::print("\nPage {} of {}: {:.2f} ms, page 1: {:.2f} ms, ratio {:.2f}\n", late + 1, pages.size(),
+               median(lates) * 1e3, median(firsts) * 1e3, median(lates) / median(firsts));
     fmt::print("Anonymous memory while paging, in process: {:.1f} MB\n", peak);
 }
 
@@ -355,7 +367,8 @@ void measurePaths(const Environment& environment, const std::string& storage, co
     std::vector<std::uint64_t> numbers;
     for (long i = 0; i < 10'000; ++i) {
         const long which = (i * 7919) % count;
-        numbers.push_back(KsURL::fileURL(fmt::format("{}/{}/document-{:07}.txt", storage, folder, which)).status().value().fileID);
+        numbers.push_back(
+            KsURL::fileURL(fmt::format("{}/{}/document-{:07}.txt", storage, folder, which)).status().value().fileID);
     }
     std::vector<double> lookups;
     std::vector<double> verified;
@@ -372,8 +385,8 @@ void measurePaths(const Environment& environment, const std::string& storage, co
         }));
     }
     const auto each = static_cast<double>(numbers.size());
-    fmt::print("File ID to path, {} objects: look-up {:.2f} us, with verification {:.2f} us\n", count, median(lookups) * 1e6 / each,
-               median(verified) * 1e6 / each);
+    fmt::print("File ID to path, {} objects: look-up {:.2f} us, with verification {:.2f} us\n", count,
+               median(lookups) * 1e6 / each, median(verified) * 1e6 / each);
 }
 
 void measureProgramMemory(Tree& tree, const std::string& folder, const std::string& program) {
@@ -390,7 +403,8 @@ void measureProgramMemory(Tree& tree, const std::string& folder, const std::stri
 }  // namespace
 
 int run(bool quick, const std::string& program) {
-    const std::vector<long> sizes = quick ? std::vector<long>{1'000, 10'000, 100'000} : std::vector<long>{1'000, 10'000, 100'000, 1'000'000};
+    const std::vector<long> sizes =
+        quick ? std::vector<long>{1'000, 10'000, 100'000} : std::vector<long>{1'000, 10'000, 100'000, 1'000'000};
     fmt::print("| folder | floor, us an entry | first listing | second listing | JSON-RPC |\n|---|---|---|---|---|\n");
     {
         Tree tree;

@@ -33,7 +33,8 @@ public:
     /// Does what the options say; `rpc` is not among it.
     Result<void> run();
 
-    /// How an item is named on the command line: an identifier has a well-known name or begins like one; all else is a path.
+    /// How an item is named on the command line: an identifier has a well-known name or begins like one; all else is a
+    /// path.
     static bool isIdentifier(std::string_view item);
 
 private:

@@ -13,8 +13,8 @@ namespace cindral {
 ///
 /// The root container lists the children of every root; what a person sees at the top is what has the root as parent.
 ///
-/// Where the provider says that a page has expired, because something was deleted meanwhile, the listing begins again and leaves
-/// out what it has given before: each item comes once. Costs the memory of a page, and eight bytes an item.
+/// Where the provider says that a page has expired, because something was deleted meanwhile, the listing begins again
+/// and leaves out what it has given before: each item comes once. Costs the memory of a page, and eight bytes an item.
 ///
 /// Thread safety: for one thread at a time.
 class ContainerListing {

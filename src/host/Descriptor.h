@@ -7,8 +7,8 @@
 #include "platform/foundation/Result.h"
 #include "platform/foundation/UniqueFd.h"
 
-/// Reading and writing of descriptors that may be pipes, terminals or sockets. EINTR and EAGAIN are dealt with here; errors are
-/// of the POSIX domain.
+/// Reading and writing of descriptors that may be pipes, terminals or sockets. EINTR and EAGAIN are dealt with here;
+/// errors are of the POSIX domain.
 namespace cindral::descriptor {
 
 /// Bytes read, at least one; 0 at the end of the stream.

@@ -56,7 +56,8 @@ std::optional<std::string> assignedValue(std::string_view line, std::string_view
     return quotedValue(withoutLeadingBlanks(line.substr(1)));
 }
 
-/// What a small file holds; empty for anything but a file. A link to one will do: people keep their settings elsewhere and link them.
+/// What a small file holds; empty for anything but a file. A link to one will do: people keep their settings elsewhere
+/// and link them.
 std::string beginningOf(const std::string& path) {
     std::error_code error;
     if (!std::filesystem::is_regular_file(path, error)) return {};

@@ -25,9 +25,11 @@ struct HostEnvironment {
     static HostEnvironment ofProcess();
 };
 
-/// The documents folder that the person chose in user-dirs.dirs, else "Documents" in the home folder; empty without a home.
+/// The documents folder that the person chose in user-dirs.dirs, else "Documents" in the home folder; empty without a
+/// home.
 std::string documentsFolder(const HostEnvironment& environment);
-/// The same from the file's text. What is neither absolute nor below $HOME counts as not said; nothing is expanded or run.
+/// The same from the file's text. What is neither absolute nor below $HOME counts as not said; nothing is expanded or
+/// run.
 std::optional<std::string> documentsFolderFrom(std::string_view userDirectories, std::string_view home);
 
 }  // namespace cindral

@@ -5,7 +5,8 @@
 namespace cindral {
 namespace {
 
-// As the provider hands its own errors over: by ordinal. The host knows them by the interface, not by the provider's headers.
+// As the provider hands its own errors over: by ordinal. The host knows them by the interface, not by the provider's
+// headers.
 constexpr std::string_view kProviderErrorDomain = "CindralProvider.LocalTesselKitError";
 
 std::string_view providerMessage(std::int64_t code) {

@@ -10,8 +10,8 @@ namespace cindral {
 
 /// Writes items as the host interface has them: JSON objects, absent values as absent keys.
 ///
-/// Written straight into the answer's text, because a listing is mostly this. Items of one folder share the folder's part of
-/// the URL, which is encoded once.
+/// Written straight into the answer's text, because a listing is mostly this. Items of one folder share the folder's
+/// part of the URL, which is encoded once.
 ///
 /// Thread safety: for one thread at a time.
 class ItemWriter {
@@ -19,7 +19,8 @@ public:
     /// `paths` is borrowed for life.
     explicit ItemWriter(const PresentedPaths& paths) : paths_(paths) {}
 
-    /// Makes room for that many items of ordinary length, and a little more. Growing a page's text on the way costs more than writing it.
+    /// Makes room for that many items of ordinary length, and a little more. Growing a page's text on the way costs
+    /// more than writing it.
     static void reserve(std::string& out, std::size_t items);
 
     void append(std::string& out, const TesselItem& item);

@@ -54,13 +54,14 @@ struct JsonRpcLine {
 /// Reads one line.
 ///
 /// No line can exhaust the process: nesting and the number of values are checked before anything is built. An id is
-/// a string, a number that can be echoed exactly (integers of 64 bits, signed or unsigned; fractions), or null. Of a key that
-/// stands twice in an object the last one counts.
+/// a string, a number that can be echoed exactly (integers of 64 bits, signed or unsigned; fractions), or null. Of a
+/// key that stands twice in an object the last one counts.
 ///
 /// Thread safety: a function without state.
 JsonRpcLine decodeJsonRpcLine(std::string_view line);
 
-/// Whether the text is nested deeper than that, or holds more values, brackets in strings not counted. The text need not be JSON.
+/// Whether the text is nested deeper than that, or holds more values, brackets in strings not counted. The text need
+/// not be JSON.
 bool isJsonTooComplex(std::string_view text, std::size_t depthMax, std::size_t valuesMax);
 
 /// One answer as JSON text, without a newline.

@@ -8,7 +8,8 @@ namespace cindral {
 
 /// Appends the text as a JSON string, quotes and all.
 ///
-/// Any bytes will do: control characters are escaped, and what is not UTF-8 becomes U+FFFD, one for each maximal subpart.
+/// Any bytes will do: control characters are escaped, and what is not UTF-8 becomes U+FFFD, one for each maximal
+/// subpart.
 void appendJsonString(std::string& out, std::string_view text);
 std::string jsonString(std::string_view text);
 

@@ -10,14 +10,15 @@ namespace cindral {
 
 /// The two names of the storage: where it really is, and the path that the provider knows it by.
 ///
-/// The provider finds trash folders by a path component "Documents", the last and only one of the storage's path. Where the real
-/// path is otherwise, the storage is presented through a link of that name, and every path and URL that crosses the
-/// host's boundary changes its beginning here.
+/// The provider finds trash folders by a path component "Documents", the last and only one of the storage's path. Where
+/// the real path is otherwise, the storage is presented through a link of that name, and every path and URL that
+/// crosses the host's boundary changes its beginning here.
 ///
 /// Thread safety: immutable.
 class PresentedPaths {
 public:
-    /// All absolute and without trailing slashes. `given` is the storage as the person named it, `real` has no links in it.
+    /// All absolute and without trailing slashes. `given` is the storage as the person named it, `real` has no links in
+    /// it.
     PresentedPaths(std::string given, std::string real, std::string presented);
 
     const std::string& real() const { return real_; }
@@ -33,8 +34,8 @@ public:
     std::string realURL(const KsURL& url) const;
     void appendRealURL(std::string& out, const KsURL& url) const;
 
-    /// The path that the provider knows for one that a client named: below the storage by any of its names, links in the
-    /// parent resolved. The last component is never followed. A path outside of the storage stays what it is.
+    /// The path that the provider knows for one that a client named: below the storage by any of its names, links in
+    /// the parent resolved. The last component is never followed. A path outside of the storage stays what it is.
     std::string presentedPath(std::string_view path) const;
     KsURL presentedURL(const KsURL& url) const;
 

@@ -68,8 +68,8 @@ private:
 
 }  // namespace
 
-/// An enumerator for the time of one request. One that is not kept is invalidated when the call has returned and the request is
-/// answered, whichever comes later, and never from within a call of the enumerator's.
+/// An enumerator for the time of one request. One that is not kept is invalidated when the call has returned and the
+/// request is answered, whichever comes later, and never from within a call of the enumerator's.
 class ProviderClient::Use {
 public:
     Use(std::shared_ptr<TesselEnumerator> enumerator, DispatchGroup* invalidations)

@@ -19,8 +19,9 @@ struct ItemsPage {
 
 /// One client's way to a provider: a connection's, or a command's.
 ///
-/// A container is looked up anew at each request, so that a folder that was renamed meanwhile goes on. The containers that stand
-/// for many folders (root, working set, all directories) keep their enumerator for as long as the client lives.
+/// A container is looked up anew at each request, so that a folder that was renamed meanwhile goes on. The containers
+/// that stand for many folders (root, working set, all directories) keep their enumerator for as long as the client
+/// lives.
 ///
 /// Thread safety: all operations, from any thread. Completions run on any thread, once.
 class ProviderClient {

@@ -45,7 +45,8 @@ Result<void> serveRpc(int input, int output, const std::shared_ptr<TesselExtensi
     const UniqueFd interrupt = TRY(descriptor::makeInterrupt());
     descriptor::enlargePipe(output, kPipeBytes);
     LineOutput answers(output, interrupt);
-    // Taken down from the last to the first: the server waits for its requests, then the client lets go of its enumerators.
+    // Taken down from the last to the first: the server waits for its requests, then the client lets go of its
+    // enumerators.
     ProviderClient client(provider);
     JsonRpcServer server(makeHostMethods({client, paths, statusText}),
                          [&](std::string_view line) { answers.write(line); });

@@ -12,8 +12,8 @@ namespace cindral {
 
 /// Serves one client on a pair of descriptors until its input ends, or it no longer reads.
 ///
-/// At the end of input what is under way is answered before this returns. A client that has stopped reading is no error; output
-/// that can't be written for another reason is.
+/// At the end of input what is under way is answered before this returns. A client that has stopped reading is no
+/// error; output that can't be written for another reason is.
 Result<void> serveRpc(int input, int output, const std::shared_ptr<TesselExtension>& provider,
                       const PresentedPaths& paths, const std::function<std::string()>& statusText);
 

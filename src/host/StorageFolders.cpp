@@ -34,7 +34,8 @@ std::string resolvedAsFarAsItExists(const std::string& path) {
 Result<void> makeFolders(const std::string& path, mode_t mode) {
     for (std::size_t slash = path.find('/', 1);; slash = path.find('/', slash + 1)) {
         if (::mkdir(path.substr(0, slash).c_str(), mode) != 0 && errno != EEXIST) {
-            // One on the way that exists may refuse in other ways (EROFS, EACCES); what counts is whether the end is there.
+            // One on the way that exists may refuse in other ways (EROFS, EACCES); what counts is whether the end is
+            // there.
             const int reason = errno;
             struct stat status {};
             if (::stat(path.substr(0, slash).c_str(), &status) != 0) return KsError::posix(reason);

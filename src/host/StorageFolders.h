@@ -23,8 +23,9 @@ Result<std::string> makeState(const std::string& path);
 
 /// The paths of the storage: as it is where that is presentable, else through a link, which is made or pointed to it.
 ///
-/// The link is STATE/Documents; where the state's own path holds a component of that name, it is in a folder of the state's own
-/// in the runtime folder or, failing that, in /tmp, for its owner alone. To be called by who holds the state's lock.
+/// The link is STATE/Documents; where the state's own path holds a component of that name, it is in a folder of the
+/// state's own in the runtime folder or, failing that, in /tmp, for its owner alone. To be called by who holds the
+/// state's lock.
 Result<PresentedPaths> present(const std::string& given, const std::string& real, const std::string& realState,
                                const HostEnvironment& environment);
 

@@ -10,8 +10,9 @@ namespace cindral {
 
 /// A name as a terminal may show it, on one line.
 ///
-/// Control characters, characters that turn the direction of what follows, and bytes that are not UTF-8 become \xNN, and a
-/// backslash becomes two: no name can move the cursor, colour the screen or look like another one that is escaped.
+/// Control characters, characters that turn the direction of what follows, and bytes that are not UTF-8 become \xNN,
+/// and a backslash becomes two: no name can move the cursor, colour the screen or look like another one that is
+/// escaped.
 std::string terminalText(std::string_view text);
 void appendTerminalText(std::string& out, std::string_view text);
 

@@ -29,7 +29,8 @@ public:
 
     /// Nothing that is printed from now on arrives: there is no use in working on.
     bool isBroken() const { return isBroken_; }
-    /// Writes what is left. What went wrong, also earlier; none where nothing did, and where only the reader has gone away.
+    /// Writes what is left. What went wrong, also earlier; none where nothing did, and where only the reader has gone
+    /// away.
     std::optional<KsError> finish();
 
 private:

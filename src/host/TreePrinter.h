@@ -13,8 +13,8 @@ namespace cindral {
 
 /// Prints a folder and what is below it, depth first, while it is read.
 ///
-/// One page of each folder on the way down is in memory at a time. Links are shown, never followed. A folder that can't be
-/// read is marked so, and the rest goes on.
+/// One page of each folder on the way down is in memory at a time. Links are shown, never followed. A folder that can't
+/// be read is marked so, and the rest goes on.
 ///
 /// Thread safety: for one thread at a time.
 class TreePrinter {

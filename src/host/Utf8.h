@@ -14,8 +14,8 @@ struct Utf8Step {
 
 /// Reads the first character of a text that is not empty.
 ///
-/// What is no character is cut where the Unicode standard recommends (maximal subparts): the longest beginning of a well-formed
-/// sequence, or else one byte. So every decoder that follows it shows the same number of U+FFFD.
+/// What is no character is cut where the Unicode standard recommends (maximal subparts): the longest beginning of a
+/// well-formed sequence, or else one byte. So every decoder that follows it shows the same number of U+FFFD.
 Utf8Step utf8Step(std::string_view text);
 
 bool isUtf8(std::string_view text);

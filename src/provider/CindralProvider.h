@@ -8,8 +8,8 @@ namespace cindral {
 
 /// The provider's factory: what the host loads it through.
 ///
-/// Before the first call the host sets the manager's documentStorageURL, connects the document store, adds the storage to the root
-/// directories and gives the application registry its own record.
+/// Before the first call the host sets the manager's documentStorageURL, connects the document store, adds the storage
+/// to the root directories and gives the application registry its own record.
 std::shared_ptr<TesselExtension> makeCindralProvider();
 
 }  // namespace cindral

@@ -66,17 +66,20 @@ void cacheValue(KsURL& url, ResourceKey key, std::uint64_t value) {
 std::optional<TesselItemIdentifier> identifierFromFileSystem(KsURL& url) {
     const Result<bool> isPackage = url.isPackage();
     if (!isPackage.ok()) {
-        logPlain(LogLevel::error, "can't get resource KsURLIsPackageKey for \"{}\"; {}", url.path(), isPackage.error().description());
+        logPlain(LogLevel::error, "can't get resource KsURLIsPackageKey for \"{}\"; {}", url.path(),
+                 isPackage.error().description());
         return std::nullopt;
     }
     const Result<UniqueFd> fd = url.open(kEventOnlyFlags);
     if (!fd.ok()) {
-        logPlain(LogLevel::error, "can't open file at \"{}\"; {}", url.path(), errnoText(static_cast<int>(fd.error().code())));
+        logPlain(LogLevel::error, "can't open file at \"{}\"; {}", url.path(),
+                 errnoText(static_cast<int>(fd.error().code())));
         return std::nullopt;
     }
     const Result<FileStatus> status = sys::statx(fd->get(), "");
     if (!status.ok()) {
-        logPlain(LogLevel::error, "can't get attribute list for \"{}\"; {}", url.path(), errnoText(static_cast<int>(status.error().code())));
+        logPlain(LogLevel::error, "can't get attribute list for \"{}\"; {}", url.path(),
+                 errnoText(static_cast<int>(status.error().code())));
         return std::nullopt;
     }
     if (status->isRegular() || (status->isDirectory() && *isPackage)) {
@@ -89,8 +92,9 @@ std::optional<TesselItemIdentifier> identifierFromFileSystem(KsURL& url) {
         return CdlFileObjectIdentifier::fromDocumentID(documentID);
     }
     if (!status->isDirectory()) return CdlFileObjectIdentifier::fromFileID(status->fileID);
-    // Reached only for a folder whose cached file number was absent. The digits are the boxed number's reference value: such an identifier is
-    // good for one listing's lifetime only, and clients that hold one from before depend on nothing else.
+    // Reached only for a folder whose cached file number was absent. The digits are the boxed number's reference value:
+    // such an identifier is good for one listing's lifetime only, and clients that hold one from before depend on
+    // nothing else.
     const auto boxed = std::make_unique<BoxedNumber>(BoxedNumber{status->fileID});
     cacheValue(url, ResourceKey::fileID, boxed->value);
     return CdlFileObjectIdentifier::fromFileID(reinterpret_cast<std::uintptr_t>(boxed.get()));
@@ -107,14 +111,16 @@ constexpr NumberKind kDocumentNumber{ResourceKey::documentIdentifier, "KsURLDocu
 void assertNumber(const NumberKind& kind, const ResourceValue& value) {
 #ifndef NDEBUG
     if (std::holds_alternative<std::uint64_t>(value)) return;
-    fmt::print(stderr, "unexpected class for {} (expected: KsNumber, actual: {})\n", kind.what, resourceValueClass(value));
+    fmt::print(stderr, "unexpected class for {} (expected: KsNumber, actual: {})\n", kind.what,
+               resourceValueClass(value));
     std::abort();
 #else
     (void)kind, (void)value;
 #endif
 }
 
-/// The lenient reading of an integer: leading blanks and a sign, then digits up to the first other character; 0 without digits. Saturates.
+/// The lenient reading of an integer: leading blanks and a sign, then digits up to the first other character; 0 without
+/// digits. Saturates.
 std::int64_t lenientInteger(const std::string& text) {
     return std::strtoll(text.c_str(), nullptr, 10);
 }
@@ -148,7 +154,8 @@ std::optional<TesselItemIdentifier> itemIdentifier(KsURL& url) {
     const std::string_view path = properPath(url.path(), rewritten);
     const std::optional<MatchedRoot> root = matchRoot(path);
     if (!root) {
-        logPlain(LogLevel::debug, "can't compute file object identifier because \"{}\" is not part of Cindral Storage", path);
+        logPlain(LogLevel::debug, "can't compute file object identifier because \"{}\" is not part of Cindral Storage",
+                 path);
         return std::nullopt;
     }
     std::string rewrittenRoot;
@@ -166,7 +173,8 @@ std::optional<TesselItemIdentifier> itemIdentifier(KsURL& url) {
     if (*value) {
         assertNumber(kind, **value);
         if (const auto* number = std::get_if<std::uint64_t>(&**value)) {
-            return isFolder ? CdlFileObjectIdentifier::fromFileID(*number) : CdlFileObjectIdentifier::fromDocumentID(*number);
+            return isFolder ? CdlFileObjectIdentifier::fromFileID(*number)
+                            : CdlFileObjectIdentifier::fromDocumentID(*number);
         }
     }
     return identifierFromFileSystem(url);
@@ -180,12 +188,14 @@ std::uint32_t storageDevice() {
     std::optional<KsError> error;
     const std::uint32_t device = deviceIDWithError(storage, &error);
     if (device == 0) {
-        logPlain(LogLevel::error, "can't get device ID for \"{}\"; {}", storage.path(), errnoText(error ? static_cast<int>(error->code()) : 0));
+        logPlain(LogLevel::error, "can't get device ID for \"{}\"; {}", storage.path(),
+                 errnoText(error ? static_cast<int>(error->code()) : 0));
     }
     return device;
 }
 
-/// The file ID of a document, or 0 after a log line. Rests and asks again while the store is busy or what it knows is stale.
+/// The file ID of a document, or 0 after a log line. Rests and asks again while the store is busy or what it knows is
+/// stale.
 std::uint64_t fileIDOfDocument(std::int64_t documentID, std::uint32_t device) {
     for (int retries = 0;; ++retries) {
         errno = 0;
@@ -225,7 +235,8 @@ std::optional<KsURL> fileURLWithItemIdentifier(const TesselItemIdentifier& ident
     const std::uint32_t device = storageDevice();
     if (device == 0) return std::nullopt;
     const std::int64_t number = lenientInteger(identifier.substr(separator + 1));
-    const std::uint64_t fileID = host == kFileHost ? static_cast<std::uint64_t>(number) : fileIDOfDocument(number, device);
+    const std::uint64_t fileID =
+        host == kFileHost ? static_cast<std::uint64_t>(number) : fileIDOfDocument(number, device);
     if (host == kDocumentHost && fileID == 0) return std::nullopt;
     return fileURLWithFileIdentifierOnDevice(fileID, device);
 }
@@ -277,7 +288,8 @@ bool readNumber(const char*& at, std::int64_t* number) {
 
 }  // namespace
 
-bool parseDocIDChangePath(const char* path, std::int64_t* documentID, std::int64_t* sourceFileID, std::int64_t* destinationFileID) {
+bool parseDocIDChangePath(const char* path, std::int64_t* documentID, std::int64_t* sourceFileID,
+                          std::int64_t* destinationFileID) {
     const char* at = path;
     while (*at == '/') ++at;
     if (!skipText(at, ".docid/")) return false;
@@ -285,8 +297,8 @@ bool parseDocIDChangePath(const char* path, std::int64_t* documentID, std::int64
         std::int64_t device = 0;
         if (!readNumber(at, &device) || !skipText(at, "/")) return false;
     }
-    return skipText(at, "changed/") && readNumber(at, documentID) && skipText(at, "/src=") && readNumber(at, sourceFileID) &&
-           skipText(at, ",dst=") && readNumber(at, destinationFileID) && *at == '\0';
+    return skipText(at, "changed/") && readNumber(at, documentID) && skipText(at, "/src=") &&
+           readNumber(at, sourceFileID) && skipText(at, ",dst=") && readNumber(at, destinationFileID) && *at == '\0';
 }
 
 }  // namespace cindral

@@ -29,16 +29,20 @@ namespace {
 constexpr std::string_view kTrashName = ".Trash";
 
 bool listsEverythingBelow(const TesselItemIdentifier& container) {
-    return container == kTesselWorkingSetContainerItemIdentifier || container == kTesselAllDirectoriesContainerItemIdentifier;
+    return container == kTesselWorkingSetContainerItemIdentifier ||
+           container == kTesselAllDirectoriesContainerItemIdentifier;
 }
 
-EnumeratorOptions enumeratorOptions(const TesselItemIdentifier& container, const std::vector<KsURL>& urls, std::uint64_t offset) {
+EnumeratorOptions enumeratorOptions(const TesselItemIdentifier& container, const std::vector<KsURL>& urls,
+                                    std::uint64_t offset) {
     EnumeratorOptions options;
     options.urls = urls;
     options.recursively = listsEverythingBelow(container);
     options.offset = offset;
     options.limit = kGatherPageEntriesMax;
-    options.directoryEnumerationOptionsFor = [](const KsURL&) { return DirectoryEnumerationOptions::skipsPackageDescendants; };
+    options.directoryEnumerationOptionsFor = [](const KsURL&) {
+        return DirectoryEnumerationOptions::skipsPackageDescendants;
+    };
     options.positions = &FSListingPositions::shared();
     options.positionsKey = options.recursively ? "below" : "in";
     for (const KsURL& url : urls) {
@@ -77,7 +81,8 @@ public:
         context.folder = folder;
         KsURL url = KsURL::fileURL(folder->path);
         context.identifier = itemIdentifier(url);
-        if (const auto proxy = RoBundleProxy::proxyWithContaining(entry)) context.bundleIdentifier = InternedString(proxy->bundleIdentifier());
+        if (const auto proxy = RoBundleProxy::proxyWithContaining(entry))
+            context.bundleIdentifier = InternedString(proxy->bundleIdentifier());
         return contexts_.emplace_back(std::move(context));
     }
 
@@ -85,7 +90,8 @@ private:
     std::vector<FolderContext> contexts_;
 };
 
-std::shared_ptr<LocalFileEnumerator> LocalFileEnumerator::initWithContainer(TesselItemIdentifier container, std::vector<KsURL> urls) {
+std::shared_ptr<LocalFileEnumerator> LocalFileEnumerator::initWithContainer(TesselItemIdentifier container,
+                                                                            std::vector<KsURL> urls) {
     if (urls.empty()) {
         std::fputs("can't create enumerator for an empty list of URLs\n", stderr);
         std::abort();
@@ -94,13 +100,16 @@ std::shared_ptr<LocalFileEnumerator> LocalFileEnumerator::initWithContainer(Tess
 }
 
 LocalFileEnumerator::LocalFileEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls)
-    : container_(std::move(container)), enumeratedItemURL_(urls.size() == 1 ? std::optional(urls.front()) : std::nullopt), urls_(std::move(urls)) {}
+    : container_(std::move(container)),
+      enumeratedItemURL_(urls.size() == 1 ? std::optional(urls.front()) : std::nullopt),
+      urls_(std::move(urls)) {}
 
 std::string LocalFileEnumerator::enumeratedItemName() const {
     return enumeratedItemURL_ ? std::string(enumeratedItemURL_->lastPathComponent()) : container_;
 }
 
-void LocalFileEnumerator::enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer, const TesselPage& page) {
+void LocalFileEnumerator::enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer,
+                                                    const TesselPage& page) {
     FSChangeToken token;
     std::string pageName;
     if (page == tesselInitialPageSortedByDate()) {
@@ -128,13 +137,15 @@ void LocalFileEnumerator::gather(TesselEnumerationObserver& observer, FSChangeTo
     std::vector<KsURL> entries;
     entries.reserve(kGatherPageEntriesMax);
     FSDirectoryEnumerator enumerator;
-    const Result<void> listed = enumerator.enumerate(enumeratorOptions(container_, urls_, token->offset), [&entries](KsURL entry) -> Result<void> {
-        entries.push_back(std::move(entry));
-        return {};
-    });
+    const Result<void> listed = enumerator.enumerate(enumeratorOptions(container_, urls_, token->offset),
+                                                     [&entries](KsURL entry) -> Result<void> {
+                                                         entries.push_back(std::move(entry));
+                                                         return {};
+                                                     });
     if (!listed.ok()) return observer.finishEnumeratingWithError(listed.error());
     // A container that is one folder is nothing without it; of several, each is listed as far as it can be.
-    if (urls_.size() == 1 && enumerator.openError()) return observer.finishEnumeratingWithError(*enumerator.openError());
+    if (urls_.size() == 1 && enumerator.openError())
+        return observer.finishEnumeratingWithError(*enumerator.openError());
 
     Result<TesselItems> items = itemsOf(std::move(entries), token->streamEventID);
     if (!items.ok()) return observer.finishEnumeratingWithError(items.error());
@@ -154,7 +165,8 @@ void LocalFileEnumerator::gather(TesselEnumerationObserver& observer, FSChangeTo
     observer.finishEnumeratingUpToPage(std::nullopt);
 }
 
-std::optional<FSChangeToken> LocalFileEnumerator::gatherToken(TesselEnumerationObserver& observer, FSChangeToken token) {
+std::optional<FSChangeToken> LocalFileEnumerator::gatherToken(TesselEnumerationObserver& observer,
+                                                              FSChangeToken token) {
     const std::optional<KsUUID> volume = EventStream::volumeUUID(urls_.front());
     if (!volume) {
         logError("can't get volume UUID for {}", urls_.front().description());
@@ -196,7 +208,8 @@ Result<TesselItems> LocalFileEnumerator::itemsOf(std::vector<KsURL> entries, std
     const DirectoryReference* seen = nullptr;
     std::optional<KsError> unreadable;
     std::erase_if(entries, [&](const KsURL& entry) {
-        if (entry.directory().get() != seen) FSGatherWitness::shared().sawFolder(urls_, eventID, *(seen = entry.directory().get()));
+        if (entry.directory().get() != seen)
+            FSGatherWitness::shared().sawFolder(urls_, eventID, *(seen = entry.directory().get()));
         if (entry.lastPathComponent() == kTrashName) return true;
         const Result<FileStatus> status = entry.status();
         if (!status.ok() && !status.error().isPosix(ENOENT)) {
@@ -225,7 +238,8 @@ Result<TesselItems> LocalFileEnumerator::itemsOf(std::vector<KsURL> entries, std
     return items;
 }
 
-void LocalFileEnumerator::enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer, const TesselSyncAnchor& anchor) {
+void LocalFileEnumerator::enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,
+                                                      const TesselSyncAnchor& anchor) {
     const std::optional<FSChangeToken> token = FSChangeToken::decode(anchor);
     if (!token) {
         logError("can't create change token from anchor data, resetting");
@@ -237,11 +251,13 @@ void LocalFileEnumerator::enumerateChangesForObserver(std::shared_ptr<TesselChan
         logError("can't get volume UUID for {}", urls_.front().description());
         return observer->finishEnumeratingWithError(errorFor(LocalTesselKitError::unableToGetDeviceUUID));
     }
-    if (token->deviceUUID != *volume) logInfo("device UUID changed ({} -> {})", token->deviceUUID.string(), volume->string());
+    if (token->deviceUUID != *volume)
+        logInfo("device UUID changed ({} -> {})", token->deviceUUID.string(), volume->string());
     observer->finishEnumeratingWithError(tesselErrorForExpiredPage());
 }
 
-void LocalFileEnumerator::currentSyncAnchorWithCompletionHandler(std::function<void(std::optional<TesselSyncAnchor>)> completion) {
+void LocalFileEnumerator::currentSyncAnchorWithCompletionHandler(
+    std::function<void(std::optional<TesselSyncAnchor>)> completion) {
     const std::optional<KsUUID> volume = EventStream::volumeUUID(urls_.front());
     if (!volume) {
         logError("can't get volume UUID for \"{}\"", urls_.front().description());

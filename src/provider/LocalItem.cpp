@@ -24,7 +24,8 @@ constexpr std::string_view kInboxName = "Inbox";
 constexpr std::string_view kMeasuredPackagePrefixes[] = {"com.vemra.folio", "com.vemra.tonemill"};
 
 bool isMeasuredPackage(std::string_view type) {
-    return std::ranges::any_of(kMeasuredPackagePrefixes, [type](std::string_view prefix) { return type.starts_with(prefix); });
+    return std::ranges::any_of(kMeasuredPackagePrefixes,
+                               [type](std::string_view prefix) { return type.starts_with(prefix); });
 }
 
 /// Whether a relative path names something below the folder that it is appended to.
@@ -81,7 +82,8 @@ bool LocalItem::identify(Customs& customs) {
 
     std::optional<TesselItemIdentifier> parent = std::move(customs.parentItemID);
     if (!parent) {
-        if (std::optional<KsURL> folder = fileURL_.deletingLastPathComponent()) parent = cindral::itemIdentifier(*folder);
+        if (std::optional<KsURL> folder = fileURL_.deletingLastPathComponent())
+            parent = cindral::itemIdentifier(*folder);
     }
     if (!parent) {
         logError("can't create an item without a parent ID (itemIdentifier: {})", itemIdentifier_);
@@ -95,14 +97,17 @@ bool LocalItem::name(Customs& customs) {
     std::optional<std::string> filename = std::move(customs.filename);
     if (!filename) filename = stringResourceValue(fileURL_, ResourceKey::name);
     if (!filename) {
-        logError("can't create an item without a filename (itemIdentifier: {}, parentItemIdentifier: {})", itemIdentifier_, parentItemIdentifier_);
+        logError("can't create an item without a filename (itemIdentifier: {}, parentItemIdentifier: {})",
+                 itemIdentifier_, parentItemIdentifier_);
         return false;
     }
     filename_ = *std::move(filename);
     const Result<InternedString> type = fileURL_.typeIdentifier();
     if (!type.ok() || type->empty()) {
-        logError("can't create an item without a type identifier (itemIdentifier: {}, parentItemIdentifier: {}, filename: {})", itemIdentifier_,
-                 parentItemIdentifier_, filename_);
+        logError(
+            "can't create an item without a type identifier (itemIdentifier: {}, parentItemIdentifier: {}, filename: "
+            "{})",
+            itemIdentifier_, parentItemIdentifier_, filename_);
         return false;
     }
     typeIdentifier_ = *type;
@@ -114,7 +119,9 @@ void LocalItem::readSizeAndDates(const Customs& customs) {
     const bool isDirectory = status.ok() && status->isDirectory();
     if (!isDirectory) {
         documentSize_ = numberResourceValue(fileURL_, ResourceKey::fileSize);
-    } else if (!customs.isOnlyLookedUp && TypeDatabase::shared().conforms(typeIdentifier_.view(), kPackageTypeIdentifier) && isMeasuredPackage(typeIdentifier_.view())) {
+    } else if (!customs.isOnlyLookedUp &&
+               TypeDatabase::shared().conforms(typeIdentifier_.view(), kPackageTypeIdentifier) &&
+               isMeasuredPackage(typeIdentifier_.view())) {
         const Result<std::uint64_t> size = ts_directorySize(fileURL_);
         if (size.ok()) documentSize_ = *size;
     }
@@ -142,9 +149,12 @@ void LocalItem::readUserMetadata() {
     if (isAppLibraryIdentifier()) return;
     // Most files bear no attribute at all: one look spares three.
     fileURL_.loadAttributeNames();
-    if (const auto bytes = initWithValueOfXattr(kXattrLastUsedDateName, fileURL_)) lastUsedDate_ = keyed_archive::unarchiveDate(*bytes);
-    if (const auto bytes = initWithValueOfXattr(kXattrTagDataName, fileURL_)) tags_ = keyed_archive::unarchiveStrings(*bytes);
-    if (const auto bytes = initWithValueOfXattr(kXattrFavoriteRankName, fileURL_)) favoriteRank_ = keyed_archive::unarchiveInteger(*bytes);
+    if (const auto bytes = initWithValueOfXattr(kXattrLastUsedDateName, fileURL_))
+        lastUsedDate_ = keyed_archive::unarchiveDate(*bytes);
+    if (const auto bytes = initWithValueOfXattr(kXattrTagDataName, fileURL_))
+        tags_ = keyed_archive::unarchiveStrings(*bytes);
+    if (const auto bytes = initWithValueOfXattr(kXattrFavoriteRankName, fileURL_))
+        favoriteRank_ = keyed_archive::unarchiveInteger(*bytes);
 }
 
 void LocalItem::readStatus(const Customs& customs) {
@@ -208,7 +218,8 @@ std::optional<KsURL> LocalItem::computePutBackURL() const {
     }
     const auto proxy = RoBundleProxy::proxyWithContaining(fileURL_);
     const auto container = proxy ? proxy->dataContainerURL() : std::nullopt;
-    const std::optional<KsURL> library = container ? std::optional(container->appendingPathComponent("Documents")) : std::nullopt;
+    const std::optional<KsURL> library =
+        container ? std::optional(container->appendingPathComponent("Documents")) : std::nullopt;
     logDebug("putback: '{}' library: '{}'", *putBack, library ? library->description() : "");
     // The record is the file's own attribute, which any program may have written: it must not lead out of the library.
     if (!library || !isPathBelow(*putBack)) {
@@ -219,7 +230,8 @@ std::optional<KsURL> LocalItem::computePutBackURL() const {
 }
 
 std::string LocalItem::description() const {
-    return fmt::format("<LocalItem {} in {} \"{}\" {}>", itemIdentifier_, parentItemIdentifier_, filename_, typeIdentifier_.view());
+    return fmt::format("<LocalItem {} in {} \"{}\" {}>", itemIdentifier_, parentItemIdentifier_, filename_,
+                       typeIdentifier_.view());
 }
 
 }  // namespace cindral

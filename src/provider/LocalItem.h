@@ -13,9 +13,11 @@
 
 namespace cindral {
 
-/// The record of one file or folder, built from its URL: a snapshot of resource values, one stat and the user's metadata.
+/// The record of one file or folder, built from its URL: a snapshot of resource values, one stat and the user's
+/// metadata.
 ///
-/// Thread safety: built on one thread; read-only afterwards, except for putBackURL(), which callers ask for on one thread.
+/// Thread safety: built on one thread; read-only afterwards, except for putBackURL(), which callers ask for on one
+/// thread.
 class LocalItem : public TesselItem {
 protected:
     struct Passkey {};
@@ -26,8 +28,10 @@ public:
         std::optional<TesselItemIdentifier> itemID;
         std::optional<TesselItemIdentifier> parentItemID;
         std::optional<std::string> filename;
-        bool isOnlyLookedUp = false;  ///< for its URL alone: what takes a walk (sizes of packages, counts of children) is left out
-        bool hasVistorDomainIdentifier = false;  ///< the item carries its application's identifier as search-index domain
+        bool isOnlyLookedUp =
+            false;  ///< for its URL alone: what takes a walk (sizes of packages, counts of children) is left out
+        bool hasVistorDomainIdentifier =
+            false;  ///< the item carries its application's identifier as search-index domain
         std::optional<InternedString> bundleIdentifier;
     };
 

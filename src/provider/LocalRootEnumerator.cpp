@@ -23,9 +23,11 @@ std::shared_ptr<LocalRootEnumerator> LocalRootEnumerator::initWithContainer(Tess
 }
 
 LocalRootEnumerator::LocalRootEnumerator(TesselItemIdentifier container)
-    : container_(std::move(container)), localFileEnumerator_(LocalFileEnumerator::initWithContainer(container_, monitoredRoots())) {}
+    : container_(std::move(container)),
+      localFileEnumerator_(LocalFileEnumerator::initWithContainer(container_, monitoredRoots())) {}
 
-void LocalRootEnumerator::enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer, const TesselPage& page) {
+void LocalRootEnumerator::enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer,
+                                                    const TesselPage& page) {
     enumQueue_.async([self = shared_from_this(), observer = std::move(observer), page] {
         const LogSection section("enumerate root items for {}", self->container_);
         if (page == tesselInitialPageSortedByName() || page == tesselInitialPageSortedByDate()) {
@@ -36,14 +38,16 @@ void LocalRootEnumerator::enumerateItemsForObserver(std::shared_ptr<TesselEnumer
     });
 }
 
-void LocalRootEnumerator::enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer, const TesselSyncAnchor& anchor) {
+void LocalRootEnumerator::enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,
+                                                      const TesselSyncAnchor& anchor) {
     enumQueue_.async([self = shared_from_this(), observer = std::move(observer), anchor] {
         const LogSection section("enumerate root changes for {}", self->container_);
         self->localFileEnumerator_->enumerateChangesForObserver(observer, anchor);
     });
 }
 
-void LocalRootEnumerator::currentSyncAnchorWithCompletionHandler(std::function<void(std::optional<TesselSyncAnchor>)> completion) {
+void LocalRootEnumerator::currentSyncAnchorWithCompletionHandler(
+    std::function<void(std::optional<TesselSyncAnchor>)> completion) {
     localFileEnumerator_->currentSyncAnchorWithCompletionHandler(std::move(completion));
 }
 

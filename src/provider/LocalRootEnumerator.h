@@ -8,16 +8,21 @@
 
 namespace cindral {
 
-/// Lists the root, the working set or all directories: the files under the document storage and under every app library's root.
+/// Lists the root, the working set or all directories: the files under the document storage and under every app
+/// library's root.
 ///
-/// Thread safety: all operations, from any thread. Listings return at once and are worked on one at a time, in the order of the calls.
+/// Thread safety: all operations, from any thread. Listings return at once and are worked on one at a time, in the
+/// order of the calls.
 class LocalRootEnumerator : public TesselEnumerator, public std::enable_shared_from_this<LocalRootEnumerator> {
 public:
     static std::shared_ptr<LocalRootEnumerator> initWithContainer(TesselItemIdentifier container);
 
-    void enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer, const TesselPage& page) override;
-    void enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer, const TesselSyncAnchor& anchor) override;
-    void currentSyncAnchorWithCompletionHandler(std::function<void(std::optional<TesselSyncAnchor>)> completion) override;
+    void enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer,
+                                   const TesselPage& page) override;
+    void enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,
+                                     const TesselSyncAnchor& anchor) override;
+    void currentSyncAnchorWithCompletionHandler(
+        std::function<void(std::optional<TesselSyncAnchor>)> completion) override;
     void invalidate() override;
 
     const TesselItemIdentifier& container() const { return container_; }

@@ -54,7 +54,8 @@ private:
 };
 
 LocalTesselKit::LocalTesselKit()
-    : appRefreshPacer_("cindral.app-refresh.pacer", appRefreshQueue_, kAppRefreshIntervalMin), installedAppsProxy_(std::make_shared<InstalledAppsProxy>()) {
+    : appRefreshPacer_("cindral.app-refresh.pacer", appRefreshQueue_, kAppRefreshIntervalMin),
+      installedAppsProxy_(std::make_shared<InstalledAppsProxy>()) {
     // Captures nothing of the provider: a refresh may outlast it.
     appRefreshPacer_.setEventBlock(refreshApps);
     appRefreshPacer_.resume();
@@ -76,7 +77,8 @@ std::shared_ptr<LocalTesselKit> LocalTesselKit::init() {
 
 LocalTesselKit::~LocalTesselKit() {
     // A notification that comes in between finds the proxy without a provider, and is dropped.
-    SerialQueue::main().async([proxy = std::move(installedAppsProxy_)] { requiredDistributedCenter().removeEveryObserver(proxy.get()); });
+    SerialQueue::main().async(
+        [proxy = std::move(installedAppsProxy_)] { requiredDistributedCenter().removeEveryObserver(proxy.get()); });
 }
 
 void LocalTesselKit::notificationCallback(const void* observer, std::string_view /*name*/) {
@@ -85,12 +87,14 @@ void LocalTesselKit::notificationCallback(const void* observer, std::string_view
     if (provider) provider->appRefreshPacer_.signal();
 }
 
-std::shared_ptr<const LocalItem> LocalTesselKit::resolveItem(const TesselItemIdentifier& identifier, LocalItem::Customs customs) {
+std::shared_ptr<const LocalItem> LocalTesselKit::resolveItem(const TesselItemIdentifier& identifier,
+                                                             LocalItem::Customs customs) {
     if (identifier.starts_with('#')) {
         const auto proxy = RoBundleProxy::bundleProxyForIdentifier(identifier.substr(1));
         return proxy ? LocalAppLibraryItem::initWithBundleProxy(*proxy) : nullptr;
     }
-    if (identifier == kTesselTemporaryLocalFolderItemIdentifier) return LocalItem::initWithURL(temporaryLocalFolderURL(), std::move(customs));
+    if (identifier == kTesselTemporaryLocalFolderItemIdentifier)
+        return LocalItem::initWithURL(temporaryLocalFolderURL(), std::move(customs));
     std::optional<KsURL> url = fileURLWithItemIdentifier(identifier);
     return url ? LocalItem::initWithURL(*std::move(url), std::move(customs)) : nullptr;
 }
@@ -127,7 +131,8 @@ std::optional<TesselItemIdentifier> LocalTesselKit::persistentIdentifierForItemA
 std::optional<TesselItemIdentifier> LocalTesselKit::persistentIdentifierForItemAt(const KsURL& url) {
     const LogSection section("fetching item identifier for \"{}\"", url.description());
     std::optional<TesselItemIdentifier> identifier;
-    if (url.lastPathComponent() == kDocumentsName) identifier = CdlFileObjectIdentifier::fromAppLibraryDataContainerURL(url);
+    if (url.lastPathComponent() == kDocumentsName)
+        identifier = CdlFileObjectIdentifier::fromAppLibraryDataContainerURL(url);
     if (!identifier) {
         LocalItem::Customs customs;
         customs.isOnlyLookedUp = true;
@@ -150,7 +155,8 @@ Result<std::shared_ptr<const TesselItem>> LocalTesselKit::itemForIdentifier(cons
     return item;
 }
 
-Result<std::shared_ptr<TesselEnumerator>> LocalTesselKit::enumeratorForContainerItemIdentifier(const TesselItemIdentifier& container) {
+Result<std::shared_ptr<TesselEnumerator>> LocalTesselKit::enumeratorForContainerItemIdentifier(
+    const TesselItemIdentifier& container) {
     const LogSection section("enumerator for {}", container);
     if (container == kTesselRootContainerItemIdentifier || container == kTesselWorkingSetContainerItemIdentifier ||
         container == kTesselAllDirectoriesContainerItemIdentifier) {
@@ -174,7 +180,8 @@ void LocalTesselKit::itemChangedAtURL(const KsURL& url) {
     stopProvidingItemAtURL(url);
 }
 
-void LocalTesselKit::defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier, ItemCompletion completion) {
+void LocalTesselKit::defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier,
+                                                                    ItemCompletion completion) {
     const LogSection section("default location for {}", bundleIdentifier);
     const auto proxy = RoBundleProxy::bundleProxyForIdentifier(bundleIdentifier);
     if (!proxy) {

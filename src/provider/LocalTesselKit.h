@@ -20,15 +20,16 @@ namespace cindral {
 /// Thread safety: all operations, from any thread, at the same time.
 class LocalTesselKit : public TesselExtension {
 public:
-    /// A provider that listens for changes of the application registry, and has signalled the working set once. A missing notification centre stops
-    /// the process.
+    /// A provider that listens for changes of the application registry, and has signalled the working set once. A
+    /// missing notification centre stops the process.
     static std::shared_ptr<LocalTesselKit> init();
     ~LocalTesselKit() override;
 
     std::optional<KsURL> URLForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier) override;
     std::optional<TesselItemIdentifier> persistentIdentifierForItemAtURL(const KsURL& url) override;
     Result<std::shared_ptr<const TesselItem>> itemForIdentifier(const TesselItemIdentifier& identifier) override;
-    Result<std::shared_ptr<TesselEnumerator>> enumeratorForContainerItemIdentifier(const TesselItemIdentifier& container) override;
+    Result<std::shared_ptr<TesselEnumerator>> enumeratorForContainerItemIdentifier(
+        const TesselItemIdentifier& container) override;
 
     /// Documents are ordinary files, always there: nothing is written, and the completion is called at once.
     void providePlaceholderAtURL(const KsURL& url, Completion completion) override;
@@ -36,7 +37,8 @@ public:
     void stopProvidingItemAtURL(const KsURL& url) override;
     void itemChangedAtURL(const KsURL& url) override;
 
-    void defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier, ItemCompletion completion) override;
+    void defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier,
+                                                        ItemCompletion completion) override;
 
     SerialQueue& appRefreshQueue() { return appRefreshQueue_; }
     TSPacer& appRefreshPacer() { return appRefreshPacer_; }
@@ -49,7 +51,8 @@ private:
     static void notificationCallback(const void* observer, std::string_view name);
     std::optional<KsURL> urlForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier);
     std::optional<TesselItemIdentifier> persistentIdentifierForItemAt(const KsURL& url);
-    static std::shared_ptr<const LocalItem> resolveItem(const TesselItemIdentifier& identifier, LocalItem::Customs customs = LocalItem::Customs());
+    static std::shared_ptr<const LocalItem> resolveItem(const TesselItemIdentifier& identifier,
+                                                        LocalItem::Customs customs = LocalItem::Customs());
     /// The URL of an item, or the host's no-such-item error.
     static Result<KsURL> urlForItem(const TesselItemIdentifier& identifier);
 

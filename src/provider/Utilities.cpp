@@ -50,7 +50,8 @@ template <typename T>
 std::optional<T> typedResourceValue(const KsURL& url, ResourceKey key) {
     Result<std::optional<ResourceValue>> value = url.resourceValue(key);
     if (!value.ok()) {
-        logError("can't get resource \"{}\" for \"{}\"; {}", resourceKeyName(key), url.description(), value.error().description());
+        logError("can't get resource \"{}\" for \"{}\"; {}", resourceKeyName(key), url.description(),
+                 value.error().description());
         return std::nullopt;
     }
     if (!*value) return std::nullopt;
@@ -155,7 +156,8 @@ KsURL temporaryLocalFolderURL() {
     const KsURL storage = TesselManager::defaultManager().documentStorageURL();
     const KsURL folder = storage.appendingPathComponent(kName);
     const Result<UniqueFd> parent = storage.open(O_PATH | O_DIRECTORY);
-    const bool made = parent.ok() && (::mkdirat(parent->get(), std::string(kName).c_str(), 0700) == 0 || errno == EEXIST);
+    const bool made =
+        parent.ok() && (::mkdirat(parent->get(), std::string(kName).c_str(), 0700) == 0 || errno == EEXIST);
     if (!made) {
         const KsError error = parent.ok() ? KsError::errorWithPOSIXCode() : parent.error();
         logError("can't create temporary directory; {}", error.description());

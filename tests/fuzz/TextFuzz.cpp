@@ -1,4 +1,5 @@
-// Dates, base64 and identifiers as text: what is read is written as what reads the same, and base64 to the last character.
+// Dates, base64 and identifiers as text: what is read is written as what reads the same, and base64 to the last
+// character.
 
 #include <algorithm>
 #include <cstdlib>

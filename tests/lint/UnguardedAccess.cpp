@@ -1,6 +1,7 @@
 #include "platform/foundation/Mutex.h"
 
-// Wrong on purpose, and part of no program: the thread-safety check is good for something only as long as it refuses this.
+// Wrong on purpose, and part of no program: the thread-safety check is good for something only as long as it refuses
+// this.
 
 namespace cindral {
 

@@ -37,7 +37,8 @@ protected:
     Names list(const EnumeratorOptions& options) {
         Names names;
         const auto listed = enumerator_.enumerate(options, [&](const KsURL& entry) -> Result<void> {
-            names.push_back(entry.path().starts_with(root_.path() + "/") ? entry.path().substr(root_.path().size() + 1) : entry.path());
+            names.push_back(entry.path().starts_with(root_.path() + "/") ? entry.path().substr(root_.path().size() + 1)
+                                                                         : entry.path());
             return {};
         });
         EXPECT_TRUE(listed.ok());
@@ -63,7 +64,8 @@ protected:
         for (int i = 0; i < 12; ++i) {
             const std::string folder = "f" + std::to_string(i);
             root_.folder(folder);
-            for (int j = 0; j < i; ++j) root_.file(folder + "/sub" + std::to_string(j % 3) + "/file" + std::to_string(j));
+            for (int j = 0; j < i; ++j)
+                root_.file(folder + "/sub" + std::to_string(j % 3) + "/file" + std::to_string(j));
             root_.file("top" + std::to_string(i));
         }
     }
@@ -130,7 +132,8 @@ TEST_F(FSDirectoryEnumeratorTest, packagesAndFoldersAreEnteredAsTheBitsSay) {
     root_.file("report.folio/index");
     root_.file("folder/a");
     EXPECT_EQ(sorted(list(options(true))), (Names{"folder", "folder/a", "report.folio", "report.folio/index"}));
-    EXPECT_EQ(sorted(list(with(options(true), DirectoryEnumerationOptions::skipsPackageDescendants))), (Names{"folder", "folder/a", "report.folio"}));
+    EXPECT_EQ(sorted(list(with(options(true), DirectoryEnumerationOptions::skipsPackageDescendants))),
+              (Names{"folder", "folder/a", "report.folio"}));
     EXPECT_EQ(sorted(list(with(options(true), DirectoryEnumerationOptions::skipsFolderDescendants))),
               (Names{"folder", "report.folio", "report.folio/index"}));
 }

@@ -3,9 +3,9 @@
 
 #include <cerrno>
 
+#include "platform/tessel/TesselManager.h"
 #include "provider/KsURL+CdlFileObjectIdentifier.h"
 #include "provider/ProviderFixture.h"
-#include "platform/tessel/TesselManager.h"
 
 namespace cindral::test {
 namespace {
@@ -71,8 +71,8 @@ TEST_F(FileObjectIdentifierTest, aSiblingThatBeginsWithTheRootsPathIsInside) {
 TEST_F(FileObjectIdentifierTest, whatIsOutsideHasNone) {
     KsURL outside = KsURL::fileURL(storage_.outside().file("elsewhere.txt"));
     EXPECT_EQ(itemIdentifier(outside), std::nullopt);
-    EXPECT_TRUE(log_.contains(LogLevel::debug,
-                              "can't compute file object identifier because \"" + outside.path() + "\" is not part of Cindral Storage"));
+    EXPECT_TRUE(log_.contains(LogLevel::debug, "can't compute file object identifier because \"" + outside.path() +
+                                                   "\" is not part of Cindral Storage"));
 }
 
 TEST_F(FileObjectIdentifierTest, aURLOfAnotherSchemeHasNone) {
@@ -109,7 +109,8 @@ TEST_F(FileObjectIdentifierTest, aNumberOfAnotherClassStopsTheProcess) {
     storage_.file("a.txt");
     KsURL folder = url("folder");
     folder.setCachedResourceValue(ResourceKey::fileID, std::string("7"));
-    EXPECT_DEATH((void)itemIdentifier(folder), "unexpected class for file ID \\(expected: KsNumber, actual: KsString\\)");
+    EXPECT_DEATH((void)itemIdentifier(folder),
+                 "unexpected class for file ID \\(expected: KsNumber, actual: KsString\\)");
     KsURL file = url("a.txt");
     file.setCachedResourceValue(ResourceKey::documentIdentifier, std::string("7"));
     EXPECT_DEATH((void)itemIdentifier(file), "unexpected class for doc ID \\(expected: KsNumber, actual: KsString\\)");
@@ -168,8 +169,9 @@ TEST_F(FileObjectIdentifierTest, aBusyDocumentIsAskedForSixTimes) {
         EXPECT_EQ(fileURLWithItemIdentifier("did=12"), std::nullopt);
         EXPECT_EQ(manager.attempts, 6);
         EXPECT_EQ(log_.count("let's try again after resting") - rests, 5U);
-        EXPECT_TRUE(log_.contains(LogLevel::debug, "doc ID resolution failed with errno(" + std::to_string(errorNumber) +
-                                                       "), let's try again after resting"));
+        EXPECT_TRUE(log_.contains(
+            LogLevel::debug,
+            "doc ID resolution failed with errno(" + std::to_string(errorNumber) + "), let's try again after resting"));
     }
     EXPECT_EQ(log_.count("can't resolve doc ID \"12\" after five attempts"), 3U);
 }
@@ -226,7 +228,8 @@ TEST_F(FileObjectIdentifierTest, aPathBeyondTheBufferIsNotResolvable) {
     const std::string path = storage_.folder(name);
     EXPECT_EQ(identifierOf(name), fid(path));
     EXPECT_EQ(fileURLWithItemIdentifier(fid(path)), std::nullopt);
-    EXPECT_TRUE(log_.contains(LogLevel::debug, "can't resolve path matching file ID \"" + fid(path).substr(4) + "\"; ENAMETOOLONG (36)"));
+    EXPECT_TRUE(log_.contains(
+        LogLevel::debug, "can't resolve path matching file ID \"" + fid(path).substr(4) + "\"; ENAMETOOLONG (36)"));
 }
 
 TEST_F(FileObjectIdentifierTest, aLinkSwappedIntoThePathLeadsNowhere) {
@@ -267,8 +270,8 @@ DocIDChange parsed(const char* path) {
 }
 
 TEST(ParseDocIDChangePath, readsTheNumbers) {
-    for (const char* path : {"/.docid/7/changed/42/src=100,dst=200", "/.docid/changed/42/src=100,dst=200", "//.docid/7/changed/42/src=100,dst=200",
-                             ".docid/changed/42/src=100,dst=200"}) {
+    for (const char* path : {"/.docid/7/changed/42/src=100,dst=200", "/.docid/changed/42/src=100,dst=200",
+                             "//.docid/7/changed/42/src=100,dst=200", ".docid/changed/42/src=100,dst=200"}) {
         const DocIDChange change = parsed(path);
         EXPECT_TRUE(change.ok) << path;
         EXPECT_EQ(change.document, 42);
@@ -278,9 +281,11 @@ TEST(ParseDocIDChangePath, readsTheNumbers) {
 }
 
 TEST(ParseDocIDChangePath, refusesEverythingElse) {
-    for (const char* path : {"", "/", "/.docid", "/.docid/changed/1/src=2,dst=3/x", "/.docid/7changed/1/src=2,dst=3", "/.docid/changed/1/src=2", "/.docid/changed/1/dst=3",
-                             "/.docid/changed/1/src=,dst=3", "/.docid/changed//src=2,dst=3", "/.docid/99999999999999999999/changed/1/src=2,dst=3",
-                             "/.docid/changed/99999999999999999999/src=2,dst=3", "/.docid/changed/1/src=2,dst=3 ", "/docid/changed/1/src=2,dst=3"}) {
+    for (const char* path : {"", "/", "/.docid", "/.docid/changed/1/src=2,dst=3/x", "/.docid/7changed/1/src=2,dst=3",
+                             "/.docid/changed/1/src=2", "/.docid/changed/1/dst=3", "/.docid/changed/1/src=,dst=3",
+                             "/.docid/changed//src=2,dst=3", "/.docid/99999999999999999999/changed/1/src=2,dst=3",
+                             "/.docid/changed/99999999999999999999/src=2,dst=3", "/.docid/changed/1/src=2,dst=3 ",
+                             "/docid/changed/1/src=2,dst=3"}) {
         EXPECT_FALSE(parsed(path).ok) << path;
     }
 }

@@ -18,7 +18,8 @@ namespace {
 class LocalFileEnumeratorTest : public ProviderTest {
 protected:
     std::shared_ptr<LocalFileEnumerator> enumerator(std::string_view folder = "") {
-        if (folder.empty()) return LocalFileEnumerator::initWithContainer(kTesselRootContainerItemIdentifier, {storageURL()});
+        if (folder.empty())
+            return LocalFileEnumerator::initWithContainer(kTesselRootContainerItemIdentifier, {storageURL()});
         KsURL container = url(folder);
         return LocalFileEnumerator::initWithContainer(*itemIdentifier(container), {container});
     }
@@ -36,7 +37,8 @@ protected:
     }
     static FSChangeToken anchorOf(TesselEnumerator& listed) {
         std::optional<TesselSyncAnchor> anchor;
-        listed.currentSyncAnchorWithCompletionHandler([&](std::optional<TesselSyncAnchor> given) { anchor = std::move(given); });
+        listed.currentSyncAnchorWithCompletionHandler(
+            [&](std::optional<TesselSyncAnchor> given) { anchor = std::move(given); });
         return *FSChangeToken::decode(*anchor);
     }
     static void expectExpired(const ListedPage& page) {
@@ -50,7 +52,8 @@ protected:
 using LocalFileEnumeratorDeathTest = LocalFileEnumeratorTest;
 
 TEST_F(LocalFileEnumeratorDeathTest, needsAURL) {
-    EXPECT_DEATH((void)LocalFileEnumerator::initWithContainer("fid=1", {}), "can't create enumerator for an empty list of URLs");
+    EXPECT_DEATH((void)LocalFileEnumerator::initWithContainer("fid=1", {}),
+                 "can't create enumerator for an empty list of URLs");
 }
 
 TEST_F(LocalFileEnumeratorTest, twoHundredEntriesAreAFullPageAndAnEmptyOne) {
@@ -115,7 +118,8 @@ TEST_F(LocalFileEnumeratorTest, aListingIsWhatALookupSays) {
 TEST_F(LocalFileEnumeratorTest, bothInitialPagesListAlike) {
     files(10);
     const auto listed = enumerator();
-    EXPECT_EQ(page(*listed, tesselInitialPageSortedByDate()).names(), page(*listed, tesselInitialPageSortedByName()).names());
+    EXPECT_EQ(page(*listed, tesselInitialPageSortedByDate()).names(),
+              page(*listed, tesselInitialPageSortedByName()).names());
     EXPECT_TRUE(log_.containsPart(LogLevel::debug, "enumerate items for Documents with page initialPageSortedByDate"));
 }
 
@@ -174,7 +178,8 @@ TEST_F(LocalFileEnumeratorTest, aPageExpiresWhenSomethingChanged) {
     const ListedPage first = firstPage(*listed);
     ASSERT_EQ(::unlink((storage_ / "file17").c_str()), 0);
     expectExpired(page(*listed, *first.next));
-    EXPECT_TRUE(log_.contains(LogLevel::info, "[INFO] can't replay historical FSEvents, need to re-start gather phase from scratch"));
+    EXPECT_TRUE(log_.contains(LogLevel::info,
+                              "[INFO] can't replay historical FSEvents, need to re-start gather phase from scratch"));
     EXPECT_EQ(all(*listed).size(), 249U);
     expectExpired(page(*listed, *first.next));
 }
@@ -249,7 +254,8 @@ TEST_F(LocalFileEnumeratorTest, withoutAStoreThereIsNoVolume) {
         EXPECT_FALSE(anchor);
     });
     EXPECT_TRUE(called);
-    EXPECT_TRUE(log_.contains(LogLevel::error, "[ERROR] can't get volume UUID for \"" + storageURL().description() + "\""));
+    EXPECT_TRUE(
+        log_.contains(LogLevel::error, "[ERROR] can't get volume UUID for \"" + storageURL().description() + "\""));
 }
 
 TEST_F(LocalFileEnumeratorTest, aContainerThatIsGoneIsAPosixError) {
@@ -311,7 +317,8 @@ TEST_F(LocalFileEnumeratorTest, theWorkingSetListsEverythingBelow) {
     storage_.file(".Trash/old.txt");
     storage_.file(".Trash/gone/older.txt");
     const auto listed = workingSet();
-    EXPECT_EQ(allNames(*listed), (std::vector<std::string>{"b.txt", "folder", "gone", "inner", "old.txt", "older.txt", "report.folio"}));
+    EXPECT_EQ(allNames(*listed),
+              (std::vector<std::string>{"b.txt", "folder", "gone", "inner", "old.txt", "older.txt", "report.folio"}));
     EXPECT_TRUE(find(all(*listed), "older.txt")->isTrashed());
     EXPECT_EQ(find(all(*listed), "b.txt")->parentItemIdentifier(), find(all(*listed), "inner")->itemIdentifier());
 }
@@ -320,8 +327,9 @@ TEST_F(LocalFileEnumeratorTest, allDirectoriesListsPlainFolders) {
     storage_.file("folder/inner/b.txt");
     storage_.file("report.folio/Media/a.png");
     ASSERT_EQ(::symlink("folder", (storage_ / "link").c_str()), 0);
-    EXPECT_EQ(allNames(*LocalFileEnumerator::initWithContainer(kTesselAllDirectoriesContainerItemIdentifier, {storageURL()})),
-              (std::vector<std::string>{"folder", "inner"}));
+    EXPECT_EQ(
+        allNames(*LocalFileEnumerator::initWithContainer(kTesselAllDirectoriesContainerItemIdentifier, {storageURL()})),
+        (std::vector<std::string>{"folder", "inner"}));
 }
 
 TEST_F(LocalFileEnumeratorTest, theWorkingSetIsPagedWithoutLossOnANestedTree) {
@@ -393,8 +401,12 @@ TEST_F(LocalFileEnumeratorTest, manyListingsAreWatchedAtOnce) {
 class ChangeObserver : public TesselChangeObserver {
 public:
     void didUpdateItems(TesselItems items) override { updates += items.size(); }
-    void didDeleteItemsWithIdentifiers(std::vector<TesselItemIdentifier> identifiers) override { deletions += identifiers.size(); }
-    void finishEnumeratingChangesUpToSyncAnchor(TesselSyncAnchor /*anchor*/, bool /*moreComing*/) override { finished = true; }
+    void didDeleteItemsWithIdentifiers(std::vector<TesselItemIdentifier> identifiers) override {
+        deletions += identifiers.size();
+    }
+    void finishEnumeratingChangesUpToSyncAnchor(TesselSyncAnchor /*anchor*/, bool /*moreComing*/) override {
+        finished = true;
+    }
     void finishEnumeratingWithError(const KsError& given) override { error = given; }
     std::size_t updates = 0;
     std::size_t deletions = 0;

@@ -151,7 +151,8 @@ TEST_F(LocalItemTest, anItemWithoutAParentIsNone) {
     LocalItem::Customs customs;
     customs.itemID = "fid=1";
     EXPECT_FALSE(LocalItem::initWithURL(KsURL::fileURL("/nowhere/at/all"), customs));
-    EXPECT_TRUE(log_.contains(LogLevel::error, "[ERROR] can't create an item without a parent ID (itemIdentifier: fid=1)"));
+    EXPECT_TRUE(
+        log_.contains(LogLevel::error, "[ERROR] can't create an item without a parent ID (itemIdentifier: fid=1)"));
 }
 
 TEST_F(LocalItemTest, anItemWithoutAFilenameIsNone) {
@@ -161,16 +162,20 @@ TEST_F(LocalItemTest, anItemWithoutAFilenameIsNone) {
     LocalItem::Customs customs;
     customs.itemID = "did=1";
     EXPECT_FALSE(LocalItem::initWithURL(nameless, customs));
-    EXPECT_TRUE(log_.contains(LogLevel::error, "[ERROR] can't create an item without a filename (itemIdentifier: did=1, parentItemIdentifier: "
-                                               "TesselRootContainerItemIdentifier)"));
+    EXPECT_TRUE(
+        log_.contains(LogLevel::error,
+                      "[ERROR] can't create an item without a filename (itemIdentifier: did=1, parentItemIdentifier: "
+                      "TesselRootContainerItemIdentifier)"));
 }
 
 TEST_F(LocalItemTest, anItemWithoutATypeIsNone) {
     LocalItem::Customs customs;
     customs.itemID = "did=1";
     EXPECT_FALSE(LocalItem::initWithURL(url("missing"), customs));
-    EXPECT_TRUE(log_.contains(LogLevel::error, "[ERROR] can't create an item without a type identifier (itemIdentifier: did=1, parentItemIdentifier: "
-                                               "TesselRootContainerItemIdentifier, filename: missing)"));
+    EXPECT_TRUE(log_.contains(
+        LogLevel::error,
+        "[ERROR] can't create an item without a type identifier (itemIdentifier: did=1, parentItemIdentifier: "
+        "TesselRootContainerItemIdentifier, filename: missing)"));
 }
 
 TEST_F(LocalItemTest, theInboxOfAnAppLibraryIsNone) {
@@ -230,7 +235,8 @@ TEST_F(LocalItemTest, putBackURLIsBelowTheLibrary) {
 TEST_F(LocalItemTest, withoutAPutBackRecordThereIsNone) {
     storage_.file(".Trash/a.txt");
     EXPECT_EQ(item(".Trash/a.txt")->putBackURL(), std::nullopt);
-    EXPECT_TRUE(log_.contains(LogLevel::error, "[ERROR] couldn't find putback xattr for " + url(".Trash/a.txt").description()));
+    EXPECT_TRUE(
+        log_.contains(LogLevel::error, "[ERROR] couldn't find putback xattr for " + url(".Trash/a.txt").description()));
 }
 
 TEST_F(LocalItemTest, aPutBackRecordMustNotLeadOut) {
@@ -245,7 +251,8 @@ TEST_F(LocalItemTest, aPutBackRecordMustNotLeadOut) {
 class LocalAppLibraryItemTest : public LocalItemTest {
 protected:
     static std::shared_ptr<const LocalAppLibraryItem> library(const TemporaryFolder& container) {
-        return LocalAppLibraryItem::initWithBundleProxy(RoBundleProxy({"org.example.App", KsURL::fileURL(container.path()), "Example"}));
+        return LocalAppLibraryItem::initWithBundleProxy(
+            RoBundleProxy({"org.example.App", KsURL::fileURL(container.path()), "Example"}));
     }
 };
 
@@ -285,7 +292,8 @@ TEST_F(LocalAppLibraryItemTest, hasNoUserMetadata) {
 
 TEST_F(LocalAppLibraryItemTest, withoutADataContainerThereIsNone) {
     EXPECT_FALSE(LocalAppLibraryItem::initWithBundleProxy(RoBundleProxy({"org.example.App", std::nullopt, "Example"})));
-    EXPECT_TRUE(log_.contains(LogLevel::error, "[ERROR] can't create an app library item without a data container URL"));
+    EXPECT_TRUE(
+        log_.contains(LogLevel::error, "[ERROR] can't create an app library item without a data container URL"));
 }
 
 }  // namespace

@@ -25,7 +25,10 @@ public:
         }
         completion(std::nullopt);
     }
-    void deleteSearchableItems(const std::vector<std::string>& /*domains*/, TesselManager::Completion completion) override { completion(std::nullopt); }
+    void deleteSearchableItems(const std::vector<std::string>& /*domains*/,
+                               TesselManager::Completion completion) override {
+        completion(std::nullopt);
+    }
     std::vector<TesselItemIdentifier> signalled() const {
         const MutexLock lock(mutex_);
         return signalled_;
@@ -47,7 +50,9 @@ protected:
         SerialQueue::main().sync([] {});
         TesselManager::defaultManager().setHost(nullptr);
     }
-    std::string identifierOf(std::string_view name) { return provider_->persistentIdentifierForItemAtURL(url(name)).value_or("none"); }
+    std::string identifierOf(std::string_view name) {
+        return provider_->persistentIdentifierForItemAtURL(url(name)).value_or("none");
+    }
 
     LogCapture log_;
     std::shared_ptr<RecordingHost> host_ = std::make_shared<RecordingHost>();
@@ -56,7 +61,8 @@ protected:
 
 TEST_F(LocalTesselKitTest, signalsTheWorkingSetOnceAtStart) {
     EXPECT_EQ(host_->signalled(), std::vector<TesselItemIdentifier>{kTesselWorkingSetContainerItemIdentifier});
-    EXPECT_TRUE(log_.contains(LogLevel::info, "[INFO] auto notify changes on TesselWorkingSetContainerItemIdentifier at startup"));
+    EXPECT_TRUE(log_.contains(LogLevel::info,
+                              "[INFO] auto notify changes on TesselWorkingSetContainerItemIdentifier at startup"));
     // The signal of the start has had its event, and there was one only.
     provider_->appRefreshQueue().sync([] {});
     EXPECT_FALSE(provider_->appRefreshPacer().isSignalPending());
@@ -90,7 +96,8 @@ TEST_F(LocalTesselKitTest, looksItemsUpByIdentifier) {
 }
 
 TEST_F(LocalTesselKitTest, anUnknownIdentifierIsInvalid) {
-    for (const std::string identifier : {"fid=1", "did=4000000000", "#org.example.Unknown", "#", "", "x", "xid=5", "did=1=2"}) {
+    for (const std::string identifier :
+         {"fid=1", "did=4000000000", "#org.example.Unknown", "#", "", "x", "xid=5", "did=1=2"}) {
         const auto item = provider_->itemForIdentifier(identifier);
         ASSERT_FALSE(item.ok()) << identifier;
         EXPECT_EQ(item.error(), errorFor(LocalTesselKitError::invalidItemIdentifier));
@@ -132,8 +139,8 @@ TEST_F(LocalTesselKitTest, aFolderNamedDocumentsIsAnItemLikeAnother) {
 }
 
 TEST_F(LocalTesselKitTest, theThreeTopContainersHaveOneClass) {
-    for (const auto& container :
-         {kTesselRootContainerItemIdentifier, kTesselWorkingSetContainerItemIdentifier, kTesselAllDirectoriesContainerItemIdentifier}) {
+    for (const auto& container : {kTesselRootContainerItemIdentifier, kTesselWorkingSetContainerItemIdentifier,
+                                  kTesselAllDirectoriesContainerItemIdentifier}) {
         const auto enumerator = provider_->enumeratorForContainerItemIdentifier(container);
         ASSERT_TRUE(enumerator.ok());
         const auto* root = dynamic_cast<const LocalRootEnumerator*>(enumerator->get());
@@ -174,12 +181,13 @@ TEST_F(LocalTesselKitTest, placeholdersSucceedForAnyURL) {
 
 TEST_F(LocalTesselKitTest, anUnknownApplicationHasNoDefaultContainer) {
     int calls = 0;
-    provider_->defaultApplicationContainerForBundleIdentifier("org.example.App", [&](const Result<std::shared_ptr<const TesselItem>>& item) {
-        ++calls;
-        ASSERT_FALSE(item.ok());
-        EXPECT_TRUE(item.error().is("TSErrorDomain", 1));
-        EXPECT_EQ(item.error().userInfo().at("value"), "org.example.App");
-    });
+    provider_->defaultApplicationContainerForBundleIdentifier(
+        "org.example.App", [&](const Result<std::shared_ptr<const TesselItem>>& item) {
+            ++calls;
+            ASSERT_FALSE(item.ok());
+            EXPECT_TRUE(item.error().is("TSErrorDomain", 1));
+            EXPECT_EQ(item.error().userInfo().at("value"), "org.example.App");
+        });
     EXPECT_EQ(calls, 1);
     EXPECT_TRUE(log_.contains(LogLevel::error, "[ERROR] can't create bundle proxy with 'org.example.App'"));
 }
@@ -192,7 +200,8 @@ TEST_F(LocalTesselKitTest, everySectionThatOpensCloses) {
     for (const auto& [level, message] : log_.lines()) {
         static constexpr std::string_view kOpening = "[DEBUG] ┏";
         static constexpr std::string_view kClosing = "[DEBUG] ┗";
-        if (message.starts_with(kOpening)) open.push_back(message.substr(kOpening.size(), message.find(' ', kOpening.size()) - kOpening.size()));
+        if (message.starts_with(kOpening))
+            open.push_back(message.substr(kOpening.size(), message.find(' ', kOpening.size()) - kOpening.size()));
         if (!message.starts_with(kClosing)) continue;
         const auto found = std::ranges::find(open, message.substr(kClosing.size()));
         ASSERT_NE(found, open.end()) << message;

@@ -48,7 +48,9 @@ protected:
     void reopenStore();
 
     static ListedPage page(TesselEnumerator& enumerator, const TesselPage& page);
-    static ListedPage firstPage(TesselEnumerator& enumerator) { return page(enumerator, tesselInitialPageSortedByName()); }
+    static ListedPage firstPage(TesselEnumerator& enumerator) {
+        return page(enumerator, tesselInitialPageSortedByName());
+    }
     /// All pages; fails the test when one ends with an error.
     static TesselItems all(TesselEnumerator& enumerator);
     static std::shared_ptr<const TesselItem> find(const TesselItems& items, std::string_view name);

@@ -69,7 +69,8 @@ TEST_F(UtilitiesTest, aFailedWriteIsAPosixErrorAndALine) {
     EXPECT_TRUE(log_.containsPart(LogLevel::error, "[ERROR] can't set xattr \"com.vemra.trash.time#PS\"; "));
 }
 
-// Permissions bind only whom they are about: as root, the write is made by a child that has dropped to an ordinary user.
+// Permissions bind only whom they are about: as root, the write is made by a child that has dropped to an ordinary
+// user.
 TEST_F(UtilitiesTest, writingWithoutPermissionIsLoggedAtDebugLevel) {
     const std::string path = storage_.file("a.txt");
     ASSERT_EQ(::chmod(path.c_str(), 0444), 0);

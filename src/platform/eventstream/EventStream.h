@@ -11,15 +11,16 @@ namespace cindral {
 
 /// The positions of the volume's event history.
 ///
-/// Nothing records events: the position moves on only when a listing has seen that something changed (noteChange), so that two listings
-/// between which something changed never bear the same position.
+/// Nothing records events: the position moves on only when a listing has seen that something changed (noteChange), so
+/// that two listings between which something changed never bear the same position.
 ///
 /// Thread safety: all operations, from any thread.
 class EventStream {
 public:
     /// 0 when no store is connected.
     static std::uint64_t currentEventID();
-    /// The UUID of the event history of the volume that holds the URL; none when the URL can't be read or the history is another volume's.
+    /// The UUID of the event history of the volume that holds the URL; none when the URL can't be read or the history
+    /// is another volume's.
     static std::optional<KsUUID> volumeUUID(const KsURL& url);
     /// Moves the position on, and answers the new one.
     static Result<std::uint64_t> noteChange();

@@ -12,12 +12,12 @@ namespace cindral {
 
 /// One typed root object as self-describing bytes: docs/keyed-archive.md.
 ///
-/// A binary property list whose top is a dictionary of `archiver` ("KsKeyedArchiver"), `version` (1) and `root`. Strings,
-/// numbers, dates, bytes, arrays and dictionaries stand as property-list values; an object of an archived class as a
-/// dictionary with `class` and its fields.
+/// A binary property list whose top is a dictionary of `archiver` ("KsKeyedArchiver"), `version` (1) and `root`.
+/// Strings, numbers, dates, bytes, arrays and dictionaries stand as property-list values; an object of an archived
+/// class as a dictionary with `class` and its fields.
 ///
-/// Decoding names the class that it allows, exactly; anything else (another archiver or version, another class, bytes that are no
-/// property list) is absent.
+/// Decoding names the class that it allows, exactly; anything else (another archiver or version, another class, bytes
+/// that are no property list) is absent.
 ///
 /// Thread safety: functions without state.
 namespace keyed_archive {
@@ -30,7 +30,8 @@ std::optional<KsDate> unarchiveDate(ByteView bytes);
 std::optional<std::string> unarchiveString(ByteView bytes);
 std::optional<std::vector<std::string>> unarchiveStrings(ByteView bytes);
 
-/// A number as archived: exact for integers of 64 bits, signed or unsigned; a real counts when it is a whole number that fits.
+/// A number as archived: exact for integers of 64 bits, signed or unsigned; a real counts when it is a whole number
+/// that fits.
 std::optional<std::int64_t> unarchiveInteger(ByteView bytes);
 
 }  // namespace keyed_archive

@@ -282,11 +282,13 @@ Result<std::size_t> KsURL::attribute(const char* name, std::span<std::byte> buff
 
 Result<std::optional<ResourceValue>> KsURL::resourceValue(ResourceKey key) const {
     if (overrides_) {
-        const auto found = std::ranges::find(overrides_->values, key, &std::pair<ResourceKey, std::optional<ResourceValue>>::first);
+        const auto found =
+            std::ranges::find(overrides_->values, key, &std::pair<ResourceKey, std::optional<ResourceValue>>::first);
         if (found != overrides_->values.end()) return found->second;
     }
     Result<std::optional<ResourceValue>> value = readResourceValue(key);
-    if (!value.ok() && isNotFound(value.error())) return KsError(kKsGeneralErrorDomain, kKsFileNoSuchFileError, {{"path", path_}});
+    if (!value.ok() && isNotFound(value.error()))
+        return KsError(kKsGeneralErrorDomain, kKsFileNoSuchFileError, {{"path", path_}});
     return value;
 }
 
@@ -313,7 +315,8 @@ Result<std::optional<ResourceValue>> KsURL::readResourceValue(ResourceKey key) c
 }
 
 void KsURL::setCachedResourceValue(ResourceKey key, std::optional<ResourceValue> value) {
-    if (key == ResourceKey::documentIdentifier && !overrides_ && value && std::holds_alternative<std::uint64_t>(*value)) {
+    if (key == ResourceKey::documentIdentifier && !overrides_ && value &&
+        std::holds_alternative<std::uint64_t>(*value)) {
         documentIdentifier_ = static_cast<std::uint32_t>(std::get<std::uint64_t>(*value));
         return;
     }

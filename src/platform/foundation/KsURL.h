@@ -37,11 +37,12 @@ std::string_view resourceValueClass(const ResourceValue& value);
 
 /// The name of a file, with what has been read about it.
 ///
-/// A file URL holds an absolute path as bytes, without trailing slashes; "." and ".." stay as they are. Anything else is kept as
-/// text and names no file. Values read about the object are cached in the URL and in every copy made afterwards, until
-/// removeCachedResourceValues(); they are of the object itself, never of what a link points to.
+/// A file URL holds an absolute path as bytes, without trailing slashes; "." and ".." stay as they are. Anything else
+/// is kept as text and names no file. Values read about the object are cached in the URL and in every copy made
+/// afterwards, until removeCachedResourceValues(); they are of the object itself, never of what a link points to.
 ///
-/// A URL made by child() reads through the directory's descriptor (cheaper, and of any path length) until it is detached.
+/// A URL made by child() reads through the directory's descriptor (cheaper, and of any path length) until it is
+/// detached.
 ///
 /// Thread safety: a value, for one thread at a time: also reading fills the cache.
 class KsURL {
@@ -66,7 +67,9 @@ public:
     static void appendAbsoluteString(std::string& out, std::string_view path);
     std::string description() const { return absoluteString(); }
 
-    friend bool operator==(const KsURL& a, const KsURL& b) { return a.path_ == b.path_ && a.isFileURL_ == b.isFileURL_; }
+    friend bool operator==(const KsURL& a, const KsURL& b) {
+        return a.path_ == b.path_ && a.isFileURL_ == b.isFileURL_;
+    }
 
     /// A value that was set or read before, or what the file system says now. None is "no value".
     ///
@@ -81,7 +84,8 @@ public:
     Result<InternedString> typeIdentifier() const;
     Result<bool> isPackage() const;
     Result<bool> isWritable() const;
-    /// A folder's entries plus 2, saturating at what 16 bits hold: link counts don't count files here. 1 for anything else.
+    /// A folder's entries plus 2, saturating at what 16 bits hold: link counts don't count files here. 1 for anything
+    /// else.
     Result<std::uint16_t> linkCount() const;
 
     /// The folder test of the host: a directory that is no package. False when it can't be told.

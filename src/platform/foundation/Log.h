@@ -22,11 +22,12 @@ enum class LogChannel {
 
 /// The log of the process.
 ///
-/// Lines go to standard error as "TIME LEVEL MESSAGE", one line each with one write: TIME is RFC 3339 in UTC, LEVEL is debug,
-/// info or error; control characters of the message, line separators and bytes that are no UTF-8 are escaped as \xNN.
-/// Where standard error is the service manager's journal (JOURNAL_STREAM names it), "<N>", the syslog priority, stands in place
-/// of the time, which the journal keeps itself. CINDRAL_LOG (debug, info, error) chooses the lowest level that is written;
-/// anything else is info. A line that is dropped costs one comparison. A line that standard error does not take is lost.
+/// Lines go to standard error as "TIME LEVEL MESSAGE", one line each with one write: TIME is RFC 3339 in UTC, LEVEL is
+/// debug, info or error; control characters of the message, line separators and bytes that are no UTF-8 are escaped as
+/// \xNN. Where standard error is the service manager's journal (JOURNAL_STREAM names it), "<N>", the syslog priority,
+/// stands in place of the time, which the journal keeps itself. CINDRAL_LOG (debug, info, error) chooses the lowest
+/// level that is written; anything else is info. A line that is dropped costs one comparison. A line that standard
+/// error does not take is lost.
 ///
 /// Thread safety: all of it, from any thread.
 namespace log {
@@ -47,8 +48,9 @@ void configureFromEnvironment();
 /// Writes one line, without a prefix of its own, where the level is enabled.
 void write(LogLevel level, std::string_view message, LogChannel channel = LogChannel::store);
 
-/// Sees every line that is written, or would be if standard error took it; null takes it away. For tests and for the host's status.
-/// Called on the thread that logs, by one at a time; must not log. A call never outlasts the setObserver() that replaces it.
+/// Sees every line that is written, or would be if standard error took it; null takes it away. For tests and for the
+/// host's status. Called on the thread that logs, by one at a time; must not log. A call never outlasts the
+/// setObserver() that replaces it.
 using Observer = std::function<void(LogLevel, std::string_view message, LogChannel)>;
 void setObserver(Observer observer);
 
@@ -82,14 +84,16 @@ void logFrameworkDefault(LogLevel level, fmt::format_string<Args...> format, Arg
         log::write(level, fmt::format(format, std::forward<Args>(args)...), LogChannel::frameworkDefault);
 }
 
-/// The next section number, from 1; strictly increasing over the process. Not to be called on the queue "cindral.log-section".
+/// The next section number, from 1; strictly increasing over the process. Not to be called on the queue
+/// "cindral.log-section".
 std::uint64_t newLogSection();
 /// "[DEBUG] ┏NUMBER TITLE"
 void openLogSection(std::uint64_t number, std::string_view title);
 /// "[DEBUG] ┗NUMBER"
 void closeLogSection(std::uint64_t number);
 
-/// Brackets a scope with an opening and a closing line of one new section number. Draws none where debug lines are dropped.
+/// Brackets a scope with an opening and a closing line of one new section number. Draws none where debug lines are
+/// dropped.
 class LogSection {
 public:
     template <typename... Args>

@@ -36,8 +36,8 @@ constexpr unsigned kLengthFollows = 0xF;
 
 constexpr std::int64_t kSecondsFrom1970To2001 = 978'307'200;
 
-// Bounds of the dates that are read: 292 billion years from now, some decades inside of what 64 bits of seconds hold, so
-// that the change of epoch can't overflow. Dates beyond are written as the nearest bound.
+// Bounds of the dates that are read: 292 billion years from now, some decades inside of what 64 bits of seconds hold,
+// so that the change of epoch can't overflow. Dates beyond are written as the nearest bound.
 constexpr double kDateMin = -0x1p63;
 constexpr double kDateMax = 0x1p63 - 0x1p30;
 static_assert(0x1p30 > kSecondsFrom1970To2001);
@@ -62,8 +62,8 @@ std::optional<KsDate> dateFrom(double secondsSince2001) {
 
 // --- Texts -----------------------------------------------------------------------------------------------------------
 
-// A byte that belongs to no valid UTF-8 stands in UTF-16 as this code unit plus its value: 0xDC80 to 0xDCFF. Alone, these
-// are halves of pairs that no text holds, so that names of files, which are any bytes, are never changed or lost.
+// A byte that belongs to no valid UTF-8 stands in UTF-16 as this code unit plus its value: 0xDC80 to 0xDCFF. Alone,
+// these are halves of pairs that no text holds, so that names of files, which are any bytes, are never changed or lost.
 constexpr char32_t kStrayByte = 0xDC00;
 
 bool isASCII(std::string_view text) {

@@ -18,15 +18,15 @@ namespace cindral {
 inline constexpr unsigned kPropertyListDepthMax = 128;
 
 /// Values that a binary property list may unfold to, each counted once for every reference to it; a text or data counts
-/// as one more for every 16 of its bytes. A list of more bytes than this may unfold to as many values as it has bytes, which
-/// nothing that encodeBinary() writes can reach.
+/// as one more for every 16 of its bytes. A list of more bytes than this may unfold to as many values as it has bytes,
+/// which nothing that encodeBinary() writes can reach.
 inline constexpr std::uint64_t kPropertyListValuesMax = 16'384;
 
 /// A value of a property list: bool, integer (signed or unsigned 64 bits), real, date, data, string, array
 /// or dictionary with string keys.
 ///
-/// Strings are bytes, UTF-8 by custom: what is not valid UTF-8 comes through the binary form unharmed. Dates keep what a
-/// double of seconds since 2001 can hold, 0.12 µs until 2069: docs/property-list.md.
+/// Strings are bytes, UTF-8 by custom: what is not valid UTF-8 comes through the binary form unharmed. Dates keep what
+/// a double of seconds since 2001 can hold, 0.12 µs until 2069: docs/property-list.md.
 ///
 /// Thread safety: a value.
 class PropertyList {
@@ -67,7 +67,8 @@ public:
     ///
     /// EINVAL (POSIX domain) with a message for anything malformed: every offset, length and reference is checked
     /// before it is used; cycles, nesting beyond kPropertyListDepthMax and references that would unfold to more
-    /// values than kPropertyListValuesMax allows are refused, so that no input costs more than a small multiple of its size.
+    /// values than kPropertyListValuesMax allows are refused, so that no input costs more than a small multiple of its
+    /// size.
     static Result<PropertyList> decodeBinary(ByteView bytes);
 
     friend bool operator==(const PropertyList&, const PropertyList&) = default;

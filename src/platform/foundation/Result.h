@@ -19,11 +19,11 @@ class [[nodiscard]] Result {
 public:
     using Value = T;
 
-    Result(T value) : state_(std::in_place_index<0>, std::move(value)) {}         // NOLINT(google-explicit-constructor)
+    Result(T value) : state_(std::in_place_index<0>, std::move(value)) {}        // NOLINT(google-explicit-constructor)
     Result(KsError error) : state_(std::in_place_index<1>, std::move(error)) {}  // NOLINT(google-explicit-constructor)
 
     template <typename U>
-        requires(std::is_constructible_v<T, U &&> && !std::is_same_v<std::remove_cvref_t<U>, Result> &&
+        requires(std::is_constructible_v<T, U&&> && !std::is_same_v<std::remove_cvref_t<U>, Result> &&
                  !std::is_same_v<std::remove_cvref_t<U>, KsError> && !std::is_same_v<std::remove_cvref_t<U>, T>)
     Result(U&& value)  // NOLINT(google-explicit-constructor)
         : state_(std::in_place_index<0>, std::forward<U>(value)) {}
@@ -71,16 +71,17 @@ private:
 
 }  // namespace cindral
 
-#define CINDRAL_TRY(expression, result)                  \
-    __extension__({                                      \
-        auto result = (expression);                      \
-        if (!result.ok()) [[unlikely]]                   \
-            return std::move(result).error();            \
-        std::move(result).value();                       \
+#define CINDRAL_TRY(expression, result)       \
+    __extension__({                           \
+        auto result = (expression);           \
+        if (!result.ok()) [[unlikely]]        \
+            return std::move(result).error(); \
+        std::move(result).value();            \
     })
 #define CINDRAL_JOINED(a, b) a##b
 #define CINDRAL_TRY_NUMBERED(expression, number) CINDRAL_TRY(expression, CINDRAL_JOINED(tryResult, number))
 
 /// The value of a Result, or a return of its error from the enclosing function.
-/// The statement expression is a compiler extension that both of our compilers have; the number lets one stand inside another.
+/// The statement expression is a compiler extension that both of our compilers have; the number lets one stand inside
+/// another.
 #define TRY(expression) CINDRAL_TRY_NUMBERED(expression, __COUNTER__)

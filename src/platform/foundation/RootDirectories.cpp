@@ -25,7 +25,8 @@ using Roots = std::vector<std::shared_ptr<const RootDirectory>>;
 
 DirectoryReference::~DirectoryReference() {
     if (!fd) return;
-    if (::close(fd.release()) != 0) logError("can't close directory at {}; {}", path, KsError::errorWithPOSIXCode().description());
+    if (::close(fd.release()) != 0)
+        logError("can't close directory at {}; {}", path, KsError::errorWithPOSIXCode().description());
 }
 
 RootDirectories& RootDirectories::shared() {
@@ -77,7 +78,8 @@ std::shared_ptr<const RootDirectory> RootDirectories::rootHolding(std::string_vi
 
 bool RootDirectories::noteLeftOut(const std::string& path, const std::string& why) {
     const MutexLock lock(mutex_);
-    if (leftOut_.size() >= kLeftOutMax || std::ranges::find(leftOut_, path, &LeftOut::path) != leftOut_.end()) return false;
+    if (leftOut_.size() >= kLeftOutMax || std::ranges::find(leftOut_, path, &LeftOut::path) != leftOut_.end())
+        return false;
     leftOut_.push_back({path, why});
     return true;
 }

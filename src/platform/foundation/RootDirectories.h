@@ -36,19 +36,21 @@ struct RootDirectory : DirectoryReference {
 
 /// The directories whose contents are published, each held open.
 ///
-/// Every access to something below a root starts at the root's descriptor and stays beneath it, so that no link, swapped
-/// at any moment, leads outside.
+/// Every access to something below a root starts at the root's descriptor and stays beneath it, so that no link,
+/// swapped at any moment, leads outside.
 ///
 /// Thread safety: all operations, from any thread.
 class RootDirectories {
 public:
     static RootDirectories& shared();
 
-    /// Opens the directory (links in the path itself are followed) and publishes it under `path`, replacing an earlier one of that path.
+    /// Opens the directory (links in the path itself are followed) and publishes it under `path`, replacing an earlier
+    /// one of that path.
     Result<std::shared_ptr<const RootDirectory>> add(const std::string& path, RootPolicy policy);
     void remove(std::string_view path);
 
-    /// The root that is or holds the path, by whole components; the innermost when there are several; null when there is none.
+    /// The root that is or holds the path, by whole components; the innermost when there are several; null when there
+    /// is none.
     std::shared_ptr<const RootDirectory> rootHolding(std::string_view path) const;
     std::vector<std::shared_ptr<const RootDirectory>> all() const;
 
@@ -62,7 +64,8 @@ public:
 
     /// Opens a directory to be listed, as open() does, leaving its access time alone where the process may.
     static Result<UniqueFd> openForReading(const std::string& path);
-    /// Opens what is at the path: beneath its root, or, where no root holds it, from the top without following a final link.
+    /// Opens what is at the path: beneath its root, or, where no root holds it, from the top without following a final
+    /// link.
     static Result<UniqueFd> open(const std::string& path, int flags);
 
 private:

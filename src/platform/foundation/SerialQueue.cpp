@@ -66,7 +66,8 @@ struct SerialQueue::State {
 
 namespace {
 
-/// The queues whose tasks the thread is in, innermost first: more than one where a task entered another queue with sync().
+/// The queues whose tasks the thread is in, innermost first: more than one where a task entered another queue with
+/// sync().
 struct Frame {
     const SerialQueue::State* state;
     const Frame* outer;
@@ -105,7 +106,8 @@ void scheduleDrain(std::shared_ptr<SerialQueue::State> state) {
 
 void drain(const std::shared_ptr<SerialQueue::State>& state) {
     for (int i = 0; i < kTasksPerTurnMax; ++i) {
-        // Inside the frame also when the task is destroyed: what it held may be the last reference to the queue's owner.
+        // Inside the frame also when the task is destroyed: what it held may be the last reference to the queue's
+        // owner.
         const FrameScope frame(*state);
         SerialQueue::Task task;
         if (!state->takeTask(task)) return;

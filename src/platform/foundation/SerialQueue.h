@@ -10,10 +10,10 @@ namespace cindral {
 
 /// Runs tasks one at a time, in the order in which they came.
 ///
-/// Queues share a small pool of threads; a queue without tasks costs none. While a thread of the pool runs a task, it bears the
-/// queue's label as its name (cut to the kernel's 15 bytes); sync() runs its task on the caller's thread, once it is its turn.
-/// The pool grows when its threads block in sync() or in a wait of DispatchGroup or DispatchSemaphore, so that waiting for
-/// another queue never starves it.
+/// Queues share a small pool of threads; a queue without tasks costs none. While a thread of the pool runs a task, it
+/// bears the queue's label as its name (cut to the kernel's 15 bytes); sync() runs its task on the caller's thread,
+/// once it is its turn. The pool grows when its threads block in sync() or in a wait of DispatchGroup or
+/// DispatchSemaphore, so that waiting for another queue never starves it.
 ///
 /// An exception that leaves a task ends the process.
 ///
@@ -32,8 +32,8 @@ public:
 
     const std::string& label() const;
     void async(Task task);
-    /// Runs the task on the queue and returns when it is done. Aborts with a message when called from a task of this queue:
-    /// it would wait for itself.
+    /// Runs the task on the queue and returns when it is done. Aborts with a message when called from a task of this
+    /// queue: it would wait for itself.
     void sync(const Task& task);
     /// Whether the caller is a task of this queue, also where that task has entered another queue with sync().
     bool isCurrent() const;

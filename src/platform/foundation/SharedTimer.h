@@ -8,7 +8,8 @@
 
 namespace cindral {
 
-/// Calls back at given moments, on one thread that all share and that sleeps until the next of them; without any, it is not woken up.
+/// Calls back at given moments, on one thread that all share and that sleeps until the next of them; without any, it is
+/// not woken up.
 ///
 /// Lives as long as the process.
 ///
@@ -19,8 +20,8 @@ public:
 
     static SharedTimer& shared();
 
-    /// Calls back once at or after the moment; in the order of the moments, then of the calls. The callback holds up all others:
-    /// it only passes on, to a queue.
+    /// Calls back once at or after the moment; in the order of the moments, then of the calls. The callback holds up
+    /// all others: it only passes on, to a queue.
     void callAt(TimePoint moment, std::function<void()> callback);
 
 private:

@@ -21,7 +21,8 @@ namespace cindral {
 
 namespace {
 
-// The *xattrat calls of Linux 6.13; the C library has no names for them yet. The numbers are those of every architecture but alpha.
+// The *xattrat calls of Linux 6.13; the C library has no names for them yet. The numbers are those of every
+// architecture but alpha.
 constexpr long kGetxattratCall = 464;
 constexpr long kListxattratCall = 465;
 
@@ -32,17 +33,22 @@ struct XattrArguments {
 };
 
 bool hasXattratCalls() {
-    // A kernel that knows the call refuses the descriptor; one that doesn't, or a filter that forbids it, answers something else.
-    static const bool known = ::syscall(kListxattratCall, -1, "", AT_EMPTY_PATH, nullptr, std::size_t{0}) < 0 && errno == EBADF;
+    // A kernel that knows the call refuses the descriptor; one that doesn't, or a filter that forbids it, answers
+    // something else.
+    static const bool known =
+        ::syscall(kListxattratCall, -1, "", AT_EMPTY_PATH, nullptr, std::size_t{0}) < 0 && errno == EBADF;
     return known;
 }
 
-/// "/proc/self/fd/N" or "/proc/self/fd/N/name": the way to an entry of an open directory for calls that take no descriptor.
+/// "/proc/self/fd/N" or "/proc/self/fd/N/name": the way to an entry of an open directory for calls that take no
+/// descriptor.
 std::string pathThroughDescriptor(int directory, const char* name) {
-    return *name == '\0' ? fmt::format("/proc/self/fd/{}", directory) : fmt::format("/proc/self/fd/{}/{}", directory, name);
+    return *name == '\0' ? fmt::format("/proc/self/fd/{}", directory)
+                         : fmt::format("/proc/self/fd/{}/{}", directory, name);
 }
 
-// With an empty name the path through /proc is the only way: a descriptor opened with O_PATH is no open file to the *at calls.
+// With an empty name the path through /proc is the only way: a descriptor opened with O_PATH is no open file to the *at
+// calls.
 ssize_t listxattrOnce(int directory, const char* name, char* buffer, std::size_t size) {
     if (*name != '\0' && hasXattratCalls()) {
         return ::syscall(kListxattratCall, directory, name, AT_SYMLINK_NOFOLLOW, buffer, size);
@@ -54,7 +60,8 @@ ssize_t listxattrOnce(int directory, const char* name, char* buffer, std::size_t
 ssize_t getxattrOnce(int directory, const char* name, const char* attribute, void* buffer, std::size_t size) {
     if (*name != '\0' && hasXattratCalls()) {
         XattrArguments arguments{reinterpret_cast<std::uint64_t>(buffer), static_cast<std::uint32_t>(size), 0};
-        return ::syscall(kGetxattratCall, directory, name, AT_SYMLINK_NOFOLLOW, attribute, &arguments, sizeof arguments);
+        return ::syscall(kGetxattratCall, directory, name, AT_SYMLINK_NOFOLLOW, attribute, &arguments,
+                         sizeof arguments);
     }
     const std::string path = pathThroughDescriptor(directory, name);
     return *name == '\0' ? ::getxattr(path.c_str(), attribute, buffer, size)
@@ -206,7 +213,8 @@ constexpr long kF2fsMagic = 0xF2F52010;
 
 std::optional<uid_t> ownerWhoseModeDecides(int directory) {
     struct statfs fileSystem;
-    if (kernelHasMandatoryLabels() || ::fstatfs(directory, &fileSystem) != 0 || (fileSystem.f_flags & ST_RDONLY) != 0) return std::nullopt;
+    if (kernelHasMandatoryLabels() || ::fstatfs(directory, &fileSystem) != 0 || (fileSystem.f_flags & ST_RDONLY) != 0)
+        return std::nullopt;
     switch (fileSystem.f_type) {
         case EXT4_SUPER_MAGIC:
         case BTRFS_SUPER_MAGIC:
@@ -219,8 +227,10 @@ std::optional<uid_t> ownerWhoseModeDecides(int directory) {
 
 std::optional<bool> isWritableByStatus(const FileStatus& status, std::optional<uid_t> owner) {
     if (owner != status.owner || status.owner == kOverflowID || status.group == kOverflowID) return std::nullopt;
-    // Not granted by the mode may still be granted by privilege; never changing, and what is mounted here, have rules of their own.
-    if ((status.mode & S_IWUSR) == 0 || (status.attributes & (STATX_ATTR_IMMUTABLE | STATX_ATTR_MOUNT_ROOT)) != 0) return std::nullopt;
+    // Not granted by the mode may still be granted by privilege; never changing, and what is mounted here, have rules
+    // of their own.
+    if ((status.mode & S_IWUSR) == 0 || (status.attributes & (STATX_ATTR_IMMUTABLE | STATX_ATTR_MOUNT_ROOT)) != 0)
+        return std::nullopt;
     return true;
 }
 
@@ -229,7 +239,8 @@ Result<int> DirectoryWatch::add(int directory) {
         fd_ = UniqueFd(::inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
         if (!fd_) return KsError::errorWithPOSIXCode();
     }
-    constexpr std::uint32_t kEntryChanges = IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR;
+    constexpr std::uint32_t kEntryChanges =
+        IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR;
     const int watch = ::inotify_add_watch(fd_.get(), pathThroughDescriptor(directory, "").c_str(), kEntryChanges);
     if (watch < 0) return KsError::errorWithPOSIXCode();
     return watch;
@@ -258,7 +269,8 @@ Result<void> DirectoryWatch::drain(const Change& change) {
 
 Result<Bytes> readBeginning(int directory, const char* name, std::size_t count) {
     // O_PATH: a handle to the file itself; what it is can be told before anything is opened.
-    const UniqueFd handle = TRY(*name == '\0' ? openBeneath(directory, "", O_PATH) : openat(directory, name, O_PATH | O_NOFOLLOW));
+    const UniqueFd handle =
+        TRY(*name == '\0' ? openBeneath(directory, "", O_PATH) : openat(directory, name, O_PATH | O_NOFOLLOW));
     if (!TRY(statx(handle.get(), "")).isRegular()) return KsError::posix(ENXIO);
     const std::string path = pathThroughDescriptor(handle.get(), "");
     const UniqueFd file = TRY(open(path.c_str(), O_RDONLY | O_NOATIME | O_NONBLOCK));

@@ -21,8 +21,8 @@ namespace cindral {
 /// What one statx says of an object. Never of what a link points to.
 struct FileStatus {
     std::uint64_t fileID = 0;
-    std::uint64_t device = 0;  ///< st_dev; valid until the next boot only
-    std::uint64_t size = 0;    ///< bytes
+    std::uint64_t device = 0;      ///< st_dev; valid until the next boot only
+    std::uint64_t size = 0;        ///< bytes
     std::uint64_t attributes = 0;  ///< STATX_ATTR_ bits
     KsDate modificationTime;
     KsDate changeTime;
@@ -74,11 +74,12 @@ Result<std::size_t> getxattrat(int directory, const char* name, const char* attr
 /// Whether the process may write the entry itself (effective identity, links not followed).
 Result<bool> isWritable(int directory, const char* name);
 
-/// The user of this process, where the file system that holds the directory keeps the ordinary promise that an owner may write what the mode lets
-/// the owner write: one of this machine's own (nothing asks a server or a user program), mounted for writing, under a kernel without
-/// mandatory labels. None elsewhere.
+/// The user of this process, where the file system that holds the directory keeps the ordinary promise that an owner
+/// may write what the mode lets the owner write: one of this machine's own (nothing asks a server or a user program),
+/// mounted for writing, under a kernel without mandatory labels. None elsewhere.
 std::optional<uid_t> ownerWhoseModeDecides(int directory);
-/// The answer of isWritable() from the status alone; none where it must be asked for. `owner` as above, of the entry's directory.
+/// The answer of isWritable() from the status alone; none where it must be asked for. `owner` as above, of the entry's
+/// directory.
 ///
 /// For an owner, access lists say nothing and the mode decides; so a listing of one's own files needs no call for each.
 std::optional<bool> isWritableByStatus(const FileStatus& status, std::optional<uid_t> owner);
@@ -105,12 +106,13 @@ private:
 /// ENXIO for anything but a regular file, which is never opened.
 Result<Bytes> readBeginning(int directory, const char* name, std::size_t count);
 
-/// Opens a directory to be listed, leaving its access time alone where the process may. `name` "" is not allowed; "." is the directory itself.
+/// Opens a directory to be listed, leaving its access time alone where the process may. `name` "" is not allowed; "."
+/// is the directory itself.
 Result<UniqueFd> openDirectoryForReading(int directory, const char* name, int extraFlags = 0);
 /// The same for a directory at a path below another; a final link is refused.
 Result<UniqueFd> openDirectoryBeneath(int directory, std::string_view relativePath, std::uint64_t resolve = 0);
-/// Where a link of /proc/self/fd leads: the path of an open descriptor as the kernel knows it; "/" or a path with " (deleted)" where
-/// it knows none. Check what comes back.
+/// Where a link of /proc/self/fd leads: the path of an open descriptor as the kernel knows it; "/" or a path with "
+/// (deleted)" where it knows none. Check what comes back.
 Result<std::string> pathOfDescriptor(int fd);
 /// Fills the buffer with DirectoryRecords; 0 at the end.
 Result<std::size_t> getdents(int directory, std::span<std::byte> buffer);

@@ -15,7 +15,8 @@ namespace {
 thread_local bool isPoolThread = false;
 
 void nameThread(std::string_view name) {
-    // Saves a system call where one queue comes after itself. Names that are equal as far as the kernel shows them may differ here.
+    // Saves a system call where one queue comes after itself. Names that are equal as far as the kernel shows them may
+    // differ here.
     static thread_local std::string currentName;
     if (name == currentName) return;
     currentName = name;

@@ -11,9 +11,10 @@ namespace cindral {
 
 /// The threads that all queues share.
 ///
-/// As many jobs run at once as the machine has processors, at least two. A job that waits inside a BlockingRegion does not
-/// count, so that another takes its place; there are never more than kThreadsMax threads, far above what waits at once in
-/// practice. Threads without work sleep until there is some, and go when there are more of them than processors.
+/// As many jobs run at once as the machine has processors, at least two. A job that waits inside a BlockingRegion does
+/// not count, so that another takes its place; there are never more than kThreadsMax threads, far above what waits at
+/// once in practice. Threads without work sleep until there is some, and go when there are more of them than
+/// processors.
 ///
 /// Lives as long as the process: threads may still run while static objects are destroyed.
 ///
@@ -62,8 +63,8 @@ private:
     Mutex mutex_;
     Condition woken_;
     std::deque<Work> ready_ GUARDED_BY(mutex_);
-    // Every thread is one of running, parked or blocked. One that was chosen to run counts as running before it has woken up:
-    // otherwise two jobs in quick succession would both count on the same sleeper.
+    // Every thread is one of running, parked or blocked. One that was chosen to run counts as running before it has
+    // woken up: otherwise two jobs in quick succession would both count on the same sleeper.
     std::size_t threads_ GUARDED_BY(mutex_) = 0;
     std::size_t running_ GUARDED_BY(mutex_) = 0;
     std::size_t parked_ GUARDED_BY(mutex_) = 0;

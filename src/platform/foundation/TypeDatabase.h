@@ -24,16 +24,18 @@ public:
     /// A type that is declared by file extension. Of folders only: "report.folio" that is a regular file is what the
     /// MIME database says of it.
     struct Declaration {
-        std::string extension;      ///< without the dot; compared without case
-        std::string identifier;     ///< reverse-DNS name
-        std::string conformsTo;     ///< identifier of the parent type
+        std::string extension;   ///< without the dot; compared without case
+        std::string identifier;  ///< reverse-DNS name
+        std::string conformsTo;  ///< identifier of the parent type
     };
 
     /// The database of this machine: every "mime" folder of XDG_DATA_HOME and XDG_DATA_DIRS, read once.
     static const TypeDatabase& shared();
 
-    /// From the given data directories (each holding a "mime" folder), most important first; missing files count as empty.
-    static std::unique_ptr<TypeDatabase> load(std::span<const std::string> dataDirectories, std::span<const Declaration> declared);
+    /// From the given data directories (each holding a "mime" folder), most important first; missing files count as
+    /// empty.
+    static std::unique_ptr<TypeDatabase> load(std::span<const std::string> dataDirectories,
+                                              std::span<const Declaration> declared);
     static std::span<const Declaration> builtInDeclarations();
 
     /// Bytes of the file from its beginning, at most as many as asked for; none when they can't be read.
@@ -45,7 +47,8 @@ public:
 
     /// Type of a regular file by its name alone; empty when the name says nothing.
     InternedString typeOfName(std::string_view name) const;
-    /// Type by the first bytes alone; empty when they say nothing. `text/plain` or `application/octet-stream` are the caller's.
+    /// Type by the first bytes alone; empty when they say nothing. `text/plain` or `application/octet-stream` are the
+    /// caller's.
     InternedString typeOfContents(ByteView beginning) const;
     /// Bytes that typeOfContents can make use of.
     std::size_t contentBytesMax() const;

@@ -7,8 +7,8 @@ namespace cindral {
 
 namespace {
 
-// What a process that is killed loses: of four thousand million document IDs, few enough; and what a listing gives before it goes to
-// the disk again, which costs as much as listing a thousand files.
+// What a process that is killed loses: of four thousand million document IDs, few enough; and what a listing gives
+// before it goes to the disk again, which costs as much as listing a thousand files.
 constexpr std::uint64_t kBlock = 65'536;
 
 }  // namespace

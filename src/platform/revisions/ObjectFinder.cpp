@@ -36,10 +36,12 @@ struct NumberHandle {
 Result<UniqueFd> openByNumber(int mountDirectory, FileID fileID) {
     struct statfs fileSystem;
     if (::fstatfs(mountDirectory, &fileSystem) != 0) return KsError::errorWithPOSIXCode();
-    if (fileSystem.f_type != EXT4_SUPER_MAGIC || static_cast<std::uint64_t>(fileID) > UINT32_MAX) return KsError::posix(EOPNOTSUPP);
+    if (fileSystem.f_type != EXT4_SUPER_MAGIC || static_cast<std::uint64_t>(fileID) > UINT32_MAX)
+        return KsError::posix(EOPNOTSUPP);
     NumberHandle handle;
     handle.number = static_cast<std::uint32_t>(fileID);
-    const int fd = ::open_by_handle_at(mountDirectory, reinterpret_cast<file_handle*>(&handle), O_PATH | O_NOFOLLOW | O_CLOEXEC);
+    const int fd =
+        ::open_by_handle_at(mountDirectory, reinterpret_cast<file_handle*>(&handle), O_PATH | O_NOFOLLOW | O_CLOEXEC);
     if (fd < 0) return KsError::errorWithPOSIXCode();
     return UniqueFd(fd);
 }
@@ -60,7 +62,8 @@ ObjectFinder::ObjectFinder(VolumeStore& store, std::uint32_t device) : store_(st
     }
 }
 
-Result<FoundObject> ObjectFinder::check(std::shared_ptr<const RootDirectory> root, std::string relativePath, FileID fileID) const {
+Result<FoundObject> ObjectFinder::check(std::shared_ptr<const RootDirectory> root, std::string relativePath,
+                                        FileID fileID) const {
     // No link is part of a path that leads to an object by its parents; one that is there now was put there since.
     const UniqueFd fd = TRY(sys::openBeneath(root->fd.get(), relativePath, kFindFlags, RESOLVE_NO_SYMLINKS));
     const FileStatus status = TRY(sys::statx(fd.get(), ""));
@@ -91,7 +94,9 @@ Result<FoundObject> ObjectFinder::findByHandle(FileID fileID) const {
         const std::string objectPath = TRY(sys::pathOfDescriptor(fd.get()));
         const std::string rootPath = TRY(sys::pathOfDescriptor(root->fd.get()));
         // "/" comes back, without an error, for a file whose directory entry is not cached.
-        if (!objectPath.starts_with(rootPath) || objectPath.size() <= rootPath.size() + 1 || objectPath[rootPath.size()] != '/') continue;
+        if (!objectPath.starts_with(rootPath) || objectPath.size() <= rootPath.size() + 1 ||
+            objectPath[rootPath.size()] != '/')
+            continue;
         Result<FoundObject> found = check(root, objectPath.substr(rootPath.size() + 1), fileID);
         if (found.ok()) return found;
     }
@@ -105,7 +110,8 @@ Result<FoundObject> ObjectFinder::findByReading(FileID fileID) const {
         while (!folders.empty()) {
             const std::string folder = std::move(folders.back());
             folders.pop_back();
-            const Result<UniqueFd> fd = sys::openDirectoryBeneath(root->fd.get(), folder, RESOLVE_NO_SYMLINKS | RESOLVE_NO_XDEV);
+            const Result<UniqueFd> fd =
+                sys::openDirectoryBeneath(root->fd.get(), folder, RESOLVE_NO_SYMLINKS | RESOLVE_NO_XDEV);
             if (!fd.ok()) continue;  // Gone since, unreadable, or of another device: nothing in it can be told.
             while (true) {
                 const Result<std::size_t> size = sys::getdents(fd->get(), buffer);
@@ -119,7 +125,8 @@ Result<FoundObject> ObjectFinder::findByReading(FileID fileID) const {
                         if (found.ok()) return found;
                         return KsError::posix(ESTALE);
                     }
-                    if (entry->type == DT_DIR || entry->type == DT_UNKNOWN) folders.push_back(joined(folder, entry->name));
+                    if (entry->type == DT_DIR || entry->type == DT_UNKNOWN)
+                        folders.push_back(joined(folder, entry->name));
                 }
             }
         }
@@ -133,7 +140,8 @@ Result<void> ObjectFinder::record(const FoundObject& object) const {
     const std::string parentPath = atTop ? "" : object.relativePath.substr(0, slash);
     const std::string name = atTop ? object.relativePath : object.relativePath.substr(slash + 1);
     if (name.empty()) return {};  // The root itself ends every chain.
-    const UniqueFd parent = TRY(sys::openBeneath(object.root->fd.get(), parentPath, O_PATH | O_DIRECTORY, RESOLVE_NO_SYMLINKS));
+    const UniqueFd parent =
+        TRY(sys::openBeneath(object.root->fd.get(), parentPath, O_PATH | O_DIRECTORY, RESOLVE_NO_SYMLINKS));
     const FileStatus parentStatus = TRY(sys::statx(parent.get(), ""));
     TRY(recordFolder(parentPath.empty() ? object.root->path : object.root->path + "/" + parentPath, parentStatus));
 
@@ -141,7 +149,8 @@ Result<void> ObjectFinder::record(const FoundObject& object) const {
     sighting.fileID = FileID{object.status.fileID};
     sighting.birthTime = object.status.birthStamp();
     sighting.parent = FileID{parentStatus.fileID};
-    sighting.kind = objectKindOf(object.status, object.status.isDirectory() && TypeDatabase::shared().isPackageName(name));
+    sighting.kind =
+        objectKindOf(object.status, object.status.isDirectory() && TypeDatabase::shared().isPackageName(name));
     sighting.name = name;
     return store_.identify({&sighting, 1});
 }
@@ -151,20 +160,24 @@ Result<void> ObjectFinder::recordFolder(const std::string& path, const FileStatu
     if (!root || path.size() <= root->path.size()) return {};
     const std::string relative = path.substr(root->path.size() + 1);
     const auto recorded = store_.recordedPath(FileID{folder.fileID}, rootIDs_);
-    if (recorded && recorded->path == relative && recorded->birthTime == folder.birthStamp() && roots_[recorded->rootIndex] == root) return {};
+    if (recorded && recorded->path == relative && recorded->birthTime == folder.birthStamp() &&
+        roots_[recorded->rootIndex] == root)
+        return {};
 
     std::vector<ObjectSighting> sightings;
     FileID parent{root->status.fileID};
     for (std::size_t begin = 0; begin < relative.size();) {
         const std::size_t end = std::min(relative.find('/', begin), relative.size());
-        const UniqueFd fd = TRY(sys::openBeneath(root->fd.get(), std::string_view(relative).substr(0, end), kFindFlags));
+        const UniqueFd fd =
+            TRY(sys::openBeneath(root->fd.get(), std::string_view(relative).substr(0, end), kFindFlags));
         const FileStatus status = TRY(sys::statx(fd.get(), ""));
         ObjectSighting sighting;
         sighting.fileID = FileID{status.fileID};
         sighting.birthTime = status.birthStamp();
         sighting.parent = parent;
         sighting.name = std::string_view(relative).substr(begin, end - begin);
-        sighting.kind = objectKindOf(status, status.isDirectory() && TypeDatabase::shared().isPackageName(sighting.name));
+        sighting.kind =
+            objectKindOf(status, status.isDirectory() && TypeDatabase::shared().isPackageName(sighting.name));
         parent = sighting.fileID;
         sightings.push_back(sighting);
         begin = end + 1;

@@ -22,9 +22,10 @@ struct FoundObject {
 
 /// Finds an object by its file number: the store's records first, then the file system itself.
 ///
-/// A path is handed out only after the object at it was seen to have the number. In order: the recorded parents (about a
-/// microsecond, and one look); a file handle, where the process may open one by number alone; reading the folders below the
-/// roots, which costs what the tree costs and is how an object is found that was moved by others since it was last seen.
+/// A path is handed out only after the object at it was seen to have the number. In order: the recorded parents (about
+/// a microsecond, and one look); a file handle, where the process may open one by number alone; reading the folders
+/// below the roots, which costs what the tree costs and is how an object is found that was moved by others since it was
+/// last seen.
 ///
 /// Thread safety: all operations, from any thread.
 class ObjectFinder {
@@ -32,10 +33,12 @@ public:
     /// `store` is borrowed for life. Only roots of the device are looked at.
     ObjectFinder(VolumeStore& store, std::uint32_t device);
 
-    /// ENOENT when nothing below the roots has the number; ESTALE when it was found and had moved again before it could be checked.
+    /// ENOENT when nothing below the roots has the number; ESTALE when it was found and had moved again before it could
+    /// be checked.
     Result<FoundObject> find(FileID fileID) const;
 
-    /// Records where a folder is, and every folder above it, unless the store knows already. For folders outside of the roots nothing is done.
+    /// Records where a folder is, and every folder above it, unless the store knows already. For folders outside of the
+    /// roots nothing is done.
     Result<void> recordFolder(const std::string& path, const FileStatus& status) const;
 
 private:

@@ -15,12 +15,16 @@ namespace {
 
 std::atomic<RvStorageManager*> replacement{nullptr};
 
-/// Records the folders of a page that are not themselves among its entries, so that the entries' recorded parents lead to a root.
-Result<void> recordFolders(VolumeStore& store, std::vector<const DirectoryReference*>& folders, std::span<const ObjectSighting> sightings) {
+/// Records the folders of a page that are not themselves among its entries, so that the entries' recorded parents lead
+/// to a root.
+Result<void> recordFolders(VolumeStore& store, std::vector<const DirectoryReference*>& folders,
+                           std::span<const ObjectSighting> sightings) {
     std::ranges::sort(folders);
     folders.erase(std::ranges::unique(folders).begin(), folders.end());
     for (const DirectoryReference* folder : folders) {
-        const auto isFolder = [&](const ObjectSighting& sighting) { return sighting.fileID == FileID{folder->status.fileID}; };
+        const auto isFolder = [&](const ObjectSighting& sighting) {
+            return sighting.fileID == FileID{folder->status.fileID};
+        };
         if (folders.size() > 1 && std::ranges::any_of(sightings, isFolder)) continue;
         TRY(ObjectFinder(store, folder->status.deviceID()).recordFolder(folder->path, folder->status));
     }
@@ -137,7 +141,8 @@ Result<void> RvStorageManager::identify(std::span<KsURL> entries) {
     TRY(store->identify(sightings));
     for (std::size_t i = 0; i < sightings.size(); ++i) {
         if (!sightings[i].wantsDocumentID) continue;
-        sighted[i]->setCachedResourceValue(ResourceKey::documentIdentifier, std::uint64_t{static_cast<std::uint32_t>(sightings[i].documentID)});
+        sighted[i]->setCachedResourceValue(ResourceKey::documentIdentifier,
+                                           std::uint64_t{static_cast<std::uint32_t>(sightings[i].documentID)});
     }
     return {};
 }

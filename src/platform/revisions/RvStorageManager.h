@@ -18,7 +18,8 @@ namespace cindral {
 class RvStorageManager {
 public:
     static RvStorageManager& defaultManager();
-    /// Puts another manager in the default's place; null brings the default back. For tests; the manager outlives its use.
+    /// Puts another manager in the default's place; null brings the default back. For tests; the manager outlives its
+    /// use.
     static void replaceDefaultManager(RvStorageManager* manager);
 
     virtual ~RvStorageManager() = default;
@@ -28,24 +29,25 @@ public:
     std::shared_ptr<VolumeStore> store() const;
 
     /// The file ID of the document on the device, checked against the file system; 0 with errno otherwise:
-    /// ENOENT no such document, or its file is gone; ESTALE it moved while it was looked for, ask again; EAGAIN no store is
-    /// connected yet; EXDEV another device than the storage's; EINVAL no document number.
+    /// ENOENT no such document, or its file is gone; ESTALE it moved while it was looked for, ask again; EAGAIN no
+    /// store is connected yet; EXDEV another device than the storage's; EINVAL no document number.
     virtual std::uint64_t resolveDocumentID(std::int64_t documentID, std::uint32_t device);
 
     /// The document ID of the open file (O_PATH will do), given now if it has none; 0 with errno otherwise.
     virtual std::uint32_t documentIDForDescriptor(int fd);
 
-    /// Gives entries of open folders (KsURL::child) their document IDs, and records where they were seen, in one transaction.
+    /// Gives entries of open folders (KsURL::child) their document IDs, and records where they were seen, in one
+    /// transaction.
     ///
-    /// The URLs' cached document identifiers are set. Entries that are gone, and those of another device than their folder, are
-    /// left as they are.
+    /// The URLs' cached document identifiers are set. Entries that are gone, and those of another device than their
+    /// folder, are left as they are.
     Result<void> identify(std::span<KsURL> entries);
 
-    /// The path of an object by its number, as presented: by the recorded parents, or, where they don't lead to it, by asking the file system.
-    /// What is handed out was checked against the file system.
+    /// The path of an object by its number, as presented: by the recorded parents, or, where they don't lead to it, by
+    /// asking the file system. What is handed out was checked against the file system.
     ///
-    /// POSIX errors: ENOENT when nothing below the roots has the number, ESTALE when it moved while it was looked for, ENAMETOOLONG
-    /// when the path does not fit `sizeMax` bytes with its NUL.
+    /// POSIX errors: ENOENT when nothing below the roots has the number, ESTALE when it moved while it was looked for,
+    /// ENAMETOOLONG when the path does not fit `sizeMax` bytes with its NUL.
     Result<std::string> pathOfFileID(std::uint64_t fileID, std::uint32_t device, std::size_t sizeMax);
 
 private:

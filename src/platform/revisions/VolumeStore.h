@@ -63,14 +63,16 @@ struct VolumeStoreOptions {
     std::function<void()> onCheckpointStep;
 };
 
-/// The store of what file systems don't keep: which document ID belongs to which object, and where an object was last seen.
+/// The store of what file systems don't keep: which document ID belongs to which object, and where an object was last
+/// seen.
 ///
 /// One folder of files (docs/volume-store.md), written by one process at a time. The object records are hints: whoever
 /// hands out a path checks it against the file system first. The document table is the truth of its own: an ID once
 /// given is never given to another document, also not after a crash or a power cut at any instruction.
 ///
 /// Durable when: what identify() answered survives the death of the process at once, and a power cut after the next
-/// checkpoint (at most kCheckpointDelay later); IDs given after the last checkpoint before a power cut are skipped, never given again.
+/// checkpoint (at most kCheckpointDelay later); IDs given after the last checkpoint before a power cut are skipped,
+/// never given again.
 ///
 /// Thread safety: all operations, from any thread; readers don't wait for writers.
 class VolumeStore {
@@ -80,8 +82,8 @@ public:
 
     /// Opens the store in the folder, making both when missing (0700).
     ///
-    /// EBUSY with `holder` (a pid as text) in the user info when another process has it open. A damaged store is set aside
-    /// (renamed) and a new one with a new UUID is made, with one error line.
+    /// EBUSY with `holder` (a pid as text) in the user info when another process has it open. A damaged store is set
+    /// aside (renamed) and a new one with a new UUID is made, with one error line.
     static Result<std::unique_ptr<VolumeStore>> open(const std::string& folder);
     static Result<std::unique_ptr<VolumeStore>> open(const std::string& folder, const VolumeStoreOptions& options);
     /// Writes a checkpoint and lets go of the lock.
@@ -90,22 +92,24 @@ public:
     /// Made anew when the store is created or found damaged; every older token expires with it.
     KsUUID uuid() const;
 
-    /// Records where objects were seen, in one transaction, and gives a document ID to each that wants one and has none.
+    /// Records where objects were seen, in one transaction, and gives a document ID to each that wants one and has
+    /// none.
     ///
-    /// Costs no write when nothing is new. An object whose birth time differs from the recorded one is another object under a
-    /// recycled number: its record, and its document ID, begin anew.
+    /// Costs no write when nothing is new. An object whose birth time differs from the recorded one is another object
+    /// under a recycled number: its record, and its document ID, begin anew.
     ///
-    /// After an error nothing of the call is recorded and no ID was given. EINVAL for a name that no file can have; ENOSPC when the disk
-    /// is full or the last document ID was given.
+    /// After an error nothing of the call is recorded and no ID was given. EINVAL for a name that no file can have;
+    /// ENOSPC when the disk is full or the last document ID was given.
     Result<void> identify(std::span<ObjectSighting> sightings);
 
     std::optional<ObjectRecord> object(FileID fileID) const;
     std::optional<DocumentRecord> document(DocumentID documentID) const;
 
-    /// Path of the object below a root, by the recorded parents: names joined with "/", without a leading one. Empty for the root itself.
+    /// Path of the object below a root, by the recorded parents: names joined with "/", without a leading one. Empty
+    /// for the root itself.
     ///
-    /// None when a record of the chain is missing, the chain does not end in one of the roots, or it is longer than any real one.
-    /// `rootIndex` tells which of `roots` it ended in.
+    /// None when a record of the chain is missing, the chain does not end in one of the roots, or it is longer than any
+    /// real one. `rootIndex` tells which of `roots` it ended in.
     struct RecordedPath {
         std::string path;
         std::size_t rootIndex = 0;
@@ -115,7 +119,8 @@ public:
 
     /// The volume's event position: the last ID that advanceEventID() gave, 0 in a new store.
     ///
-    /// Never goes back, also not over a power cut. After one, or after the process was killed, it goes on beyond every ID that may have been given.
+    /// Never goes back, also not over a power cut. After one, or after the process was killed, it goes on beyond every
+    /// ID that may have been given.
     std::uint64_t currentEventID() const;
     Result<std::uint64_t> advanceEventID();
 

@@ -47,7 +47,8 @@ Result<void> VolumeStore::Implementation::open() {
         const MutexLock lock(mutex_);
         counts_ = {.objects = tables_->objectCount(), .documents = tables_->documentCount()};
     }
-    // A store without objects is about to be told of some. Where that can't be written now, the first to be given says so.
+    // A store without objects is about to be told of some. Where that can't be written now, the first to be given says
+    // so.
     if (tables_->objectCount() == 0) (void)numbers_->reserveAhead().ok();
     opened_ = true;
     checkpointThread_ = std::thread([this] { writeCheckpointsWhenDue(); });

@@ -33,10 +33,12 @@ public:
 
     /// The record of the installed application with that identifier, or null.
     static std::shared_ptr<const RoBundleProxy> bundleProxyForIdentifier(const std::string& bundleIdentifier);
-    /// The record of the installed application whose data container, or the Documents folder in it, is at the URL; or null.
+    /// The record of the installed application whose data container, or the Documents folder in it, is at the URL; or
+    /// null.
     static std::shared_ptr<const RoBundleProxy> proxyAt(const KsURL& url);
-    /// The record whose data container is at the URL or above it, by whole components, the provider's own among them; or null.
-    /// Null for a path with a ".." in it below the container: what that names is not for text to say. Cheap: asked for each listed item.
+    /// The record whose data container is at the URL or above it, by whole components, the provider's own among them;
+    /// or null. Null for a path with a ".." in it below the container: what that names is not for text to say. Cheap:
+    /// asked for each listed item.
     static std::shared_ptr<const RoBundleProxy> proxyWithContaining(const KsURL& url);
 
 private:
@@ -51,7 +53,8 @@ public:
 
 /// The registry of installed applications.
 ///
-/// No source of applications is connected: it knows the provider's own record alone, and answers "none" for every other question.
+/// No source of applications is connected: it knows the provider's own record alone, and answers "none" for every other
+/// question.
 ///
 /// Thread safety: all operations, from any thread.
 class RoApplicationWorkspace {
@@ -66,7 +69,8 @@ public:
     std::shared_ptr<const RoBundleProxy> recordContaining(const KsURL& url) const;
 
     using Block = std::function<void(const std::shared_ptr<const RoBundleProxy>&)>;
-    /// Calls the block for each installed application of the type (0 user-installed, 2 system-wide and other), in a stable order.
+    /// Calls the block for each installed application of the type (0 user-installed, 2 system-wide and other), in a
+    /// stable order.
     void enumerateApplicationsOfType(unsigned type, const Block& block) const;
 
 private:

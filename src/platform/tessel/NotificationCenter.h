@@ -19,10 +19,10 @@ enum class SuspensionBehavior { drop, coalesce, deliverImmediately };
 
 /// Posts named notifications to whoever asked for them, within the process.
 ///
-/// An observer is a token, an address that the centre never looks behind: who registers keeps what is at the address alive for as long
-/// as the callback may need it. Callbacks run on the thread that posts (or resumes), in the order of registration.
-/// removeEveryObserver() returns when no callback with that token is running any more, unless it is called from one.
-/// Callbacks may use the centre; two that remove each other's tokens at the same time wait for ever.
+/// An observer is a token, an address that the centre never looks behind: who registers keeps what is at the address
+/// alive for as long as the callback may need it. Callbacks run on the thread that posts (or resumes), in the order of
+/// registration. removeEveryObserver() returns when no callback with that token is running any more, unless it is
+/// called from one. Callbacks may use the centre; two that remove each other's tokens at the same time wait for ever.
 ///
 /// Thread safety: all operations, from any thread.
 class NotificationCenter {
@@ -36,7 +36,8 @@ public:
     void removeEveryObserver(const void* observer);
     void post(std::string_view name);
 
-    /// While suspended, posts wait as their observers asked; resuming delivers what was kept, once a registration for `coalesce`.
+    /// While suspended, posts wait as their observers asked; resuming delivers what was kept, once a registration for
+    /// `coalesce`.
     void suspend();
     void resume();
 

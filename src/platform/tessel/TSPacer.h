@@ -11,9 +11,10 @@ class SerialQueue;
 
 /// Turns any number of signals into events that are at least an interval apart.
 ///
-/// The first signal after a pause of the interval or longer fires at once; signals that come sooner fire together, once, when
-/// the interval since the last event is over. The last signal is never dropped: an event always begins after it. The interval
-/// counts from one beginning to the next. Starts suspended; signals before resume(), or before there is an event block, count.
+/// The first signal after a pause of the interval or longer fires at once; signals that come sooner fire together,
+/// once, when the interval since the last event is over. The last signal is never dropped: an event always begins after
+/// it. The interval counts from one beginning to the next. Starts suspended; signals before resume(), or before there
+/// is an event block, count.
 ///
 /// Thread safety: all operations, from any thread. Events run on the queue, one at a time.
 class TSPacer {

@@ -41,9 +41,12 @@ public:
 class TesselEnumerator {
 public:
     virtual ~TesselEnumerator() = default;
-    virtual void enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer, const TesselPage& page) = 0;
-    virtual void enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer, const TesselSyncAnchor& anchor) = 0;
-    virtual void currentSyncAnchorWithCompletionHandler(std::function<void(std::optional<TesselSyncAnchor>)> completion) = 0;
+    virtual void enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer,
+                                           const TesselPage& page) = 0;
+    virtual void enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,
+                                             const TesselSyncAnchor& anchor) = 0;
+    virtual void currentSyncAnchorWithCompletionHandler(
+        std::function<void(std::optional<TesselSyncAnchor>)> completion) = 0;
     virtual void invalidate() = 0;
 };
 

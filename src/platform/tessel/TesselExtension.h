@@ -27,7 +27,8 @@ public:
     virtual std::optional<KsURL> URLForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier) = 0;
     virtual std::optional<TesselItemIdentifier> persistentIdentifierForItemAtURL(const KsURL& url) = 0;
     virtual Result<std::shared_ptr<const TesselItem>> itemForIdentifier(const TesselItemIdentifier& identifier) = 0;
-    virtual Result<std::shared_ptr<TesselEnumerator>> enumeratorForContainerItemIdentifier(const TesselItemIdentifier& container) = 0;
+    virtual Result<std::shared_ptr<TesselEnumerator>> enumeratorForContainerItemIdentifier(
+        const TesselItemIdentifier& container) = 0;
 
     virtual void providePlaceholderAtURL(const KsURL& url, Completion completion) = 0;
     virtual void startProvidingItemAtURL(const KsURL& url, Completion completion) = 0;
@@ -35,7 +36,8 @@ public:
     virtual void itemChangedAtURL(const KsURL& url) = 0;
 
     /// The default save location of an application.
-    virtual void defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier, ItemCompletion completion) = 0;
+    virtual void defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier,
+                                                                ItemCompletion completion) = 0;
 };
 
 /// Makes a provider. Each provider library exports one function of this type.

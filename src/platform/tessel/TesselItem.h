@@ -36,9 +36,9 @@ public:
     virtual std::optional<std::int64_t> favoriteRank() const = 0;
     virtual std::optional<std::uint64_t> fileID() const = 0;
     virtual std::optional<std::uint64_t> docID() const = 0;
-    virtual const KsURL* fileURL() const = 0;  ///< null when there is none
+    virtual const KsURL* fileURL() const = 0;                             ///< null when there is none
     virtual const std::string* appContainerBundleIdentifier() const = 0;  ///< null when there is none
-    virtual const std::string* vistorDomainIdentifier() const = 0;        ///< search-index domain; null when there is none
+    virtual const std::string* vistorDomainIdentifier() const = 0;  ///< search-index domain; null when there is none
 
     /// For log lines.
     virtual std::string description() const = 0;

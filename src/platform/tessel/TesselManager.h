@@ -22,7 +22,8 @@ class TesselManager {
 public:
     using Completion = std::function<void(std::optional<KsError>)>;
 
-    /// What the host does when a provider calls. Called on the provider's threads; each completion is to be called once.
+    /// What the host does when a provider calls. Called on the provider's threads; each completion is to be called
+    /// once.
     class Host {
     public:
         virtual ~Host() = default;

@@ -10,8 +10,8 @@ const TesselPage* pageOfText(std::string_view text) {
 
 }  // namespace
 
-// An encoded position is a binary property list, which begins otherwise. Never destroyed: threads that still run while the process
-// ends may ask.
+// An encoded position is a binary property list, which begins otherwise. Never destroyed: threads that still run while
+// the process ends may ask.
 const TesselPage& tesselInitialPageSortedByName() {
     static const TesselPage& page = *pageOfText("TesselInitialPageSortedByName");
     return page;

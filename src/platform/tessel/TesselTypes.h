@@ -13,8 +13,10 @@ using TesselItemIdentifier = std::string;
 
 inline const TesselItemIdentifier kTesselRootContainerItemIdentifier = "TesselRootContainerItemIdentifier";
 inline const TesselItemIdentifier kTesselWorkingSetContainerItemIdentifier = "TesselWorkingSetContainerItemIdentifier";
-inline const TesselItemIdentifier kTesselAllDirectoriesContainerItemIdentifier = "TesselAllDirectoriesContainerItemIdentifier";
-inline const TesselItemIdentifier kTesselTemporaryLocalFolderItemIdentifier = "TesselTemporaryLocalFolderItemIdentifier";
+inline const TesselItemIdentifier kTesselAllDirectoriesContainerItemIdentifier =
+    "TesselAllDirectoriesContainerItemIdentifier";
+inline const TesselItemIdentifier kTesselTemporaryLocalFolderItemIdentifier =
+    "TesselTemporaryLocalFolderItemIdentifier";
 
 /// Positions in an enumeration: opaque to the host, which only hands them back.
 using TesselPage = Bytes;
@@ -27,8 +29,8 @@ const TesselPage& tesselInitialPageSortedByDate();
 /// What the host may do with an item. Part of the host interface: add bits, never change one.
 enum class TesselItemCapabilities : std::uint32_t {
     none = 0,
-    allowsReading = 1,   ///< or enumerating content
-    allowsWriting = 2,   ///< or adding sub-items
+    allowsReading = 1,  ///< or enumerating content
+    allowsWriting = 2,  ///< or adding sub-items
     allowsReparenting = 4,
     allowsRenaming = 8,
     allowsTrashing = 16,

@@ -12,8 +12,9 @@ namespace cindral {
 
 /// A client's place in an enumeration: which changes it has seen, on which volume, and how far its listing came.
 ///
-/// It is the content of every page and every sync anchor that the provider hands out. A page carries the event ID of the
-/// moment at which its listing began and the offset that it reached; an anchor carries the current event ID and offset 0.
+/// It is the content of every page and every sync anchor that the provider hands out. A page carries the event ID of
+/// the moment at which its listing began and the offset that it reached; an anchor carries the current event ID and
+/// offset 0.
 ///
 /// Encoded form: docs/change-token.md. Equal tokens have equal bytes.
 ///
@@ -34,8 +35,9 @@ struct FSChangeToken {
     Bytes encode() const;
     /// Reads what encode() wrote.
     ///
-    /// Returns none, after one error line, when the bytes are no property list, lack a key, hold a value of another type or
-    /// a text that is no UUID, are more than kEncodedSizeMax, or are a token of another version. Keys beyond the five are ignored.
+    /// Returns none, after one error line, when the bytes are no property list, lack a key, hold a value of another
+    /// type or a text that is no UUID, are more than kEncodedSizeMax, or are a token of another version. Keys beyond
+    /// the five are ignored.
     static std::optional<FSChangeToken> decode(ByteView bytes);
 
     /// All fields, for log lines.

@@ -37,7 +37,8 @@ std::uint64_t checkedSum(std::uint64_t a, std::uint64_t b) {
 /// One enumeration: the directories that are being scanned, from the listed one down to the innermost.
 class FSDirectoryEnumerator::Scan {
 public:
-    Scan(FSDirectoryEnumerator& owner, const EnumeratorOptions& options, const Body& body) : owner_(owner), options_(options), body_(body) {}
+    Scan(FSDirectoryEnumerator& owner, const EnumeratorOptions& options, const Body& body)
+        : owner_(owner), options_(options), body_(body) {}
 
     Result<void> run() {
         std::size_t urlIndex = resume();
@@ -62,11 +63,13 @@ private:
         std::int64_t nextOffset = 0;  ///< after the last entry consumed
         std::string lastName;         ///< of the last entry consumed; kept up to date only where nameIsStale is false
         std::size_t lastRecord = 0;
-        bool nameIsStale = false;     ///< lastName is to be taken from the record at lastRecord
-        bool mayRepeat = false;       ///< the next entry may be the last one consumed, again
+        bool nameIsStale = false;  ///< lastName is to be taken from the record at lastRecord
+        bool mayRepeat = false;    ///< the next entry may be the last one consumed, again
     };
 
-    bool limitReached() const { return owner_.counter_ >= options_.offset && owner_.counter_ - options_.offset >= options_.limit; }
+    bool limitReached() const {
+        return owner_.counter_ >= options_.offset && owner_.counter_ - options_.offset >= options_.limit;
+    }
 
     DirectoryEnumerationOptions optionsFor(const KsURL& url) const {
         if (!options_.directoryEnumerationOptionsFor) return DirectoryEnumerationOptions::none;
@@ -74,7 +77,8 @@ private:
     }
 
     void pushTop(const KsURL& url) {
-        const std::optional<KsError> error = push(RootDirectories::openForReading(url.path()), url.path(), optionsFor(url));
+        const std::optional<KsError> error =
+            push(RootDirectories::openForReading(url.path()), url.path(), optionsFor(url));
         if (error && !owner_.openError_) owner_.openError_ = error;
     }
 
@@ -113,8 +117,10 @@ private:
         directory.status = status;
         // A sub-directory on the same device is of the same file system; asking once is enough.
         const DirectoryReference* parent = levels_.empty() ? nullptr : levels_.back().directory.get();
-        const bool same = parent != nullptr && parent->status.device == status.device && (status.attributes & STATX_ATTR_MOUNT_ROOT) == 0;
-        directory.ownerWhoseModeDecides = same ? parent->ownerWhoseModeDecides : sys::ownerWhoseModeDecides(directory.fd.get());
+        const bool same = parent != nullptr && parent->status.device == status.device &&
+                          (status.attributes & STATX_ATTR_MOUNT_ROOT) == 0;
+        directory.ownerWhoseModeDecides =
+            same ? parent->ownerWhoseModeDecides : sys::ownerWhoseModeDecides(directory.fd.get());
     }
 
     /// The next record of the innermost directory, or null at its end.
@@ -122,7 +128,8 @@ private:
         while (true) {
             if (level.at >= level.filled) {
                 keepName(level);
-                const std::uint64_t last = options_.limit > UINT64_MAX - options_.offset ? UINT64_MAX : options_.offset + options_.limit;
+                const std::uint64_t last =
+                    options_.limit > UINT64_MAX - options_.offset ? UINT64_MAX : options_.offset + options_.limit;
                 const bool few = last - std::min(last, owner_.counter_) <= kSmallBufferEntriesMax;
                 level.buffer.resize(few ? kSmallBufferSize : kLargeBufferSize);
                 const Result<std::size_t> size = sys::getdents(level.directory->fd.get(), level.buffer);
@@ -173,7 +180,8 @@ private:
 
         const bool descend = options_.recursively && isDirectory(record->type, entry) && shouldDescend(level, entry);
         const std::string path = descend ? entry.path() : std::string();
-        const DirectoryEnumerationOptions childOptions = descend ? optionsFor(entry) : DirectoryEnumerationOptions::none;
+        const DirectoryEnumerationOptions childOptions =
+            descend ? optionsFor(entry) : DirectoryEnumerationOptions::none;
         if (delivered) TRY(body_(std::move(entry)));
         if (descend) pushChild(path, record->name, childOptions);
         if (options_.positions != nullptr && limitReached()) savePosition();
@@ -191,8 +199,8 @@ private:
         if (!isPackage.ok()) return false;
         const Result<FileStatus> status = entry.status();
         if (!status.ok() || status->device != level.directory->status.device) return false;
-        return !(level.options &
-                 (*isPackage ? DirectoryEnumerationOptions::skipsPackageDescendants : DirectoryEnumerationOptions::skipsFolderDescendants));
+        return !(level.options & (*isPackage ? DirectoryEnumerationOptions::skipsPackageDescendants
+                                             : DirectoryEnumerationOptions::skipsFolderDescendants));
     }
 
     static void close(Level& level) {
@@ -202,15 +210,19 @@ private:
         level.at = level.filled = 0;
     }
 
-    /// Opens a directory that was closed on the way down, at the entry after the last one consumed. False, after a line, when it is gone.
+    /// Opens a directory that was closed on the way down, at the entry after the last one consumed. False, after a
+    /// line, when it is gone.
     bool reopen(Level& level) const {
         auto directory = std::make_shared<DirectoryReference>();
         directory->path = level.path;
         Result<UniqueFd> fd = RootDirectories::openForReading(level.path);
         if (fd.ok()) directory->fd = std::move(*fd);
-        const Result<FileStatus> status = fd.ok() ? sys::statx(directory->fd.get(), "") : Result<FileStatus>(fd.error());
-        if (!status.ok() || status->fileID != level.fileID || ::lseek(directory->fd.get(), level.nextOffset, SEEK_SET) < 0) {
-            logError("can't open directory at {}; {}", level.path, status.ok() ? "it moved while it was listed" : status.error().description());
+        const Result<FileStatus> status =
+            fd.ok() ? sys::statx(directory->fd.get(), "") : Result<FileStatus>(fd.error());
+        if (!status.ok() || status->fileID != level.fileID ||
+            ::lseek(directory->fd.get(), level.nextOffset, SEEK_SET) < 0) {
+            logError("can't open directory at {}; {}", level.path,
+                     status.ok() ? "it moved while it was listed" : status.error().description());
             return false;
         }
         describe(*directory, *status);
@@ -226,14 +238,15 @@ private:
             if (!level.directory) return;  // Too deep for a hint; the next page counts.
             keepName(level);
             const FileStatus& status = level.directory->status;
-            position.directories.push_back({level.path, status.fileID, status.device, status.modificationTime, status.changeTime,
-                                            static_cast<std::int64_t>(level.options), level.nextOffset, level.lastName});
+            position.directories.push_back({level.path, status.fileID, status.device, status.modificationTime,
+                                            status.changeTime, static_cast<std::int64_t>(level.options),
+                                            level.nextOffset, level.lastName});
         }
         options_.positions->put(options_.positionsKey, owner_.counter_, std::move(position));
     }
 
-    /// Takes the scan to its offset without counting, where a position is known and its directories are what they were. Answers the index of
-    /// the listed directory to go on with.
+    /// Takes the scan to its offset without counting, where a position is known and its directories are what they were.
+    /// Answers the index of the listed directory to go on with.
     std::size_t resume() {
         if (options_.positions == nullptr || options_.offset == 0) return 0;
         const auto position = options_.positions->find(options_.positionsKey, options_.offset);

@@ -27,27 +27,29 @@ constexpr bool operator&(DirectoryEnumerationOptions a, DirectoryEnumerationOpti
 
 /// What to list, from where, and how much of it.
 struct EnumeratorOptions {
-    std::vector<KsURL> urls;      ///< the directories, in this order
+    std::vector<KsURL> urls;  ///< the directories, in this order
     bool recursively = false;
-    std::uint64_t offset = 0;     ///< entries to skip before the first one delivered, over all directories and levels
+    std::uint64_t offset = 0;  ///< entries to skip before the first one delivered, over all directories and levels
     std::uint64_t limit = UINT64_MAX;  ///< entries to deliver at most
     /// Chooses the option bits of a directory before it is scanned, the `urls` among them; none is no bits.
     std::function<std::optional<DirectoryEnumerationOptions>(const KsURL&)> directoryEnumerationOptionsFor;
-    /// Where listings of this kind left off, so that a later page need not count from the start; null does without. `positionsKey` tells one kind
-    /// of listing (directories and options) from another.
+    /// Where listings of this kind left off, so that a later page need not count from the start; null does without.
+    /// `positionsKey` tells one kind of listing (directories and options) from another.
     FSListingPositions* positions = nullptr;
     std::string positionsKey;
 };
 
 /// Lists the entries of directories in the order in which the file system returns them, "." and ".." left out.
 ///
-/// An entry is delivered before what is below it (pre-order). Offset and limit count over the whole enumeration, so that pages of N entries,
-/// one after the other, deliver exactly what one enumeration without a limit delivers, as long as nothing changes.
+/// An entry is delivered before what is below it (pre-order). Offset and limit count over the whole enumeration, so
+/// that pages of N entries, one after the other, deliver exactly what one enumeration without a limit delivers, as long
+/// as nothing changes.
 ///
-/// A listing is not a snapshot. An entry that exists through the whole scan is delivered exactly once; one that appears or disappears
-/// meanwhile is delivered or not.
+/// A listing is not a snapshot. An entry that exists through the whole scan is delivered exactly once; one that appears
+/// or disappears meanwhile is delivered or not.
 ///
-/// Links are never followed, and directories of other devices not entered. At most a few dozen descriptors are open at a time, however deep the tree.
+/// Links are never followed, and directories of other devices not entered. At most a few dozen descriptors are open at
+/// a time, however deep the tree.
 ///
 /// Thread safety: one enumeration at a time an object.
 class FSDirectoryEnumerator {
@@ -55,7 +57,8 @@ public:
     /// Gets each delivered entry, its directory still open (KsURL::directory). A failure stops the enumeration.
     using Body = std::function<Result<void>(KsURL entry)>;
 
-    /// The body's error, unchanged. A directory that can't be opened yields no entries and an error line; see also openError().
+    /// The body's error, unchanged. A directory that can't be opened yields no entries and an error line; see also
+    /// openError().
     Result<void> enumerate(const EnumeratorOptions& options, const Body& body);
 
     /// The offset that follows the last entry consumed.

@@ -4,7 +4,8 @@
 
 namespace cindral {
 
-FSEventReaderGatherPhaseResumeStatus FSEventReader::canResumeGatherPhase(const std::vector<KsURL>& on, std::uint64_t previousEventID) {
+FSEventReaderGatherPhaseResumeStatus FSEventReader::canResumeGatherPhase(const std::vector<KsURL>& on,
+                                                                         std::uint64_t previousEventID) {
     if (FSGatherWitness::shared().holds(on, previousEventID)) return CanResume();
     return CantReplayHistoricalFSEvents();
 }

@@ -30,14 +30,15 @@ bool kernelStampsAreDistinct() {
 }
 
 bool isSame(const Result<FileStatus>& now, const FileStatus& seen) {
-    return now.ok() && now->fileID == seen.fileID && now->device == seen.device && now->modificationTime == seen.modificationTime &&
-           now->changeTime == seen.changeTime;
+    return now.ok() && now->fileID == seen.fileID && now->device == seen.device &&
+           now->modificationTime == seen.modificationTime && now->changeTime == seen.changeTime;
 }
 
 bool isProvable(const FileStatus& status) {
     if (kernelStampsAreDistinct()) return true;
     const KsDate now = KsDate::now();
-    const std::int64_t age = (now.seconds - status.changeTime.seconds) * 1'000'000'000 + now.nanoseconds - status.changeTime.nanoseconds;
+    const std::int64_t age =
+        (now.seconds - status.changeTime.seconds) * 1'000'000'000 + now.nanoseconds - status.changeTime.nanoseconds;
     return age > kCoarseStampNanoseconds;
 }
 
@@ -82,7 +83,9 @@ void FSGatherWitness::drain() {
 bool FSGatherWitness::isUnchanged(const Listing& listing) {
     drain();
     if (listing.changed) return false;
-    return std::ranges::all_of(listing.heldToTheirTimes, [](const auto& held) { return isSame(KsURL::fileURL(held.first).status(), held.second); });
+    return std::ranges::all_of(listing.heldToTheirTimes, [](const auto& held) {
+        return isSame(KsURL::fileURL(held.first).status(), held.second);
+    });
 }
 
 void FSGatherWitness::removeOldest() {
@@ -128,7 +131,8 @@ bool FSGatherWitness::watch(Listing& listing, const DirectoryReference& folder) 
     return true;
 }
 
-void FSGatherWitness::sawFolder(const std::vector<KsURL>& urls, std::uint64_t eventID, const DirectoryReference& folder) {
+void FSGatherWitness::sawFolder(const std::vector<KsURL>& urls, std::uint64_t eventID,
+                                const DirectoryReference& folder) {
     const MutexLock lock(mutex_);
     Listing* listing = find(keyOf(urls, eventID));
     // The first sight stays: what a later page saw of the folder is checked against it.

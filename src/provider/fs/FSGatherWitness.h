@@ -17,11 +17,13 @@ namespace cindral {
 
 /// Remembers the folders that the listings of this process have read, and tells whether they are still what they were.
 ///
-/// A listing bears the event ID that it began with. Two listings of the same directories that saw different contents never bear the same
-/// one: when the second begins, what the first saw no longer holds, and the event position moves on.
+/// A listing bears the event ID that it began with. Two listings of the same directories that saw different contents
+/// never bear the same one: when the second begins, what the first saw no longer holds, and the event position moves
+/// on.
 ///
-/// The listed directories themselves are held to their modification and change times. What lies below them is watched, so that the question costs
-/// the same however many folders were read; where the watch limit is reached, the rest is held to its times.
+/// The listed directories themselves are held to their modification and change times. What lies below them is watched,
+/// so that the question costs the same however many folders were read; where the watch limit is reached, the rest is
+/// held to its times.
 ///
 /// Thread safety: all operations, from any thread.
 class FSGatherWitness {
@@ -32,14 +34,15 @@ public:
     std::uint64_t begin(const std::vector<KsURL>& urls);
     /// The listing read this folder, which was in this state before its first entry was read.
     void sawFolder(const std::vector<KsURL>& urls, std::uint64_t eventID, const DirectoryReference& folder);
-    /// True when every folder that the listing has read is unchanged; false when one changed, or nothing is known of such a listing.
+    /// True when every folder that the listing has read is unchanged; false when one changed, or nothing is known of
+    /// such a listing.
     bool holds(const std::vector<KsURL>& urls, std::uint64_t eventID);
 
 private:
     struct Listing {
         std::uint64_t lastUse = 0;
         bool changed = false;
-        std::unordered_set<std::uint64_t> folders;                    ///< file IDs of all that were seen
+        std::unordered_set<std::uint64_t> folders;                     ///< file IDs of all that were seen
         std::unordered_map<std::string, FileStatus> heldToTheirTimes;  ///< by path
         std::vector<int> watches;
     };
@@ -54,7 +57,8 @@ private:
     std::map<std::string, Listing> listings_ GUARDED_BY(mutex_);
     std::uint64_t uses_ GUARDED_BY(mutex_) = 0;
     sys::DirectoryWatch watch_ GUARDED_BY(mutex_);
-    std::unordered_map<int, std::vector<Listing*>> watchers_ GUARDED_BY(mutex_);  ///< listings in listings_, which never move
+    std::unordered_map<int, std::vector<Listing*>> watchers_
+        GUARDED_BY(mutex_);  ///< listings in listings_, which never move
 };
 
 }  // namespace cindral

@@ -25,7 +25,8 @@ struct DirectoryPosition {
     std::string lastName;         ///< of the last entry consumed: some file systems return it again at that position
 };
 
-/// Where a scan stood: the directories from the top one to the innermost, and which of the listed directories the top one is.
+/// Where a scan stood: the directories from the top one to the innermost, and which of the listed directories the top
+/// one is.
 struct ListingPosition {
     std::size_t urlIndex = 0;
     std::vector<DirectoryPosition> directories;

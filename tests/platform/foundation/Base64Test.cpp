@@ -62,7 +62,8 @@ TEST(Base64, decodesExactlyWhatItWouldHaveWritten) {
             }
         }
     }
-    // Seven of the characters are digits. The one before "=" has two bits beyond the last byte, the one before "==" four.
+    // Seven of the characters are digits. The one before "=" has two bits beyond the last byte, the one before "=="
+    // four.
     constexpr std::size_t kDigits = 7;
     std::size_t twoBitsClear = 0;
     std::size_t fourBitsClear = 0;

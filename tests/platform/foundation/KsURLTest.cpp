@@ -43,7 +43,8 @@ TEST(KsURL, readsWhatItWrote) {
 }
 
 TEST(KsURL, refusesFileURLsThatNameNoLocalPath) {
-    for (const char* text : {"file://host/a", "file:a", "file://", "file:///a%", "file:///a%2", "file:///a%zz", "file:///a%00b", "file:///a?b", "file:///a#b"}) {
+    for (const char* text : {"file://host/a", "file:a", "file://", "file:///a%", "file:///a%2", "file:///a%zz",
+                             "file:///a%00b", "file:///a?b", "file:///a#b"}) {
         EXPECT_FALSE(KsURL::parse(text)) << text;
     }
 }
@@ -131,7 +132,8 @@ TEST_F(KsURLValuesTest, onlyPlainDirectoriesAreFolders) {
     folder_.file("a");
     ASSERT_EQ(::symlink("f", (folder_ / "link").c_str()), 0);
     EXPECT_TRUE(url("f").ts_isFolder());
-    for (const char* name : {"x.folio", "y.folio", "a", "link", "missing"}) EXPECT_FALSE(url(name).ts_isFolder()) << name;
+    for (const char* name : {"x.folio", "y.folio", "a", "link", "missing"})
+        EXPECT_FALSE(url(name).ts_isFolder()) << name;
 }
 
 TEST_F(KsURLValuesTest, attributeNamesAreLookedAtOnce) {
@@ -202,7 +204,8 @@ TEST_F(RootDirectoriesTest, noLinkLeadsOutOfARoot) {
     ASSERT_EQ(::symlink("/proc/self/cwd", (root() + "/magic").c_str()), 0);
     for (const char* name : {"relative", "absolute", "magic"}) {
         EXPECT_FALSE(KsURL::fileURL(root() + "/" + name + "/a.txt").status().ok()) << name;
-        EXPECT_TRUE(S_ISLNK(KsURL::fileURL(root() + "/" + name).status().value().mode)) << "the link itself is an object like another";
+        EXPECT_TRUE(S_ISLNK(KsURL::fileURL(root() + "/" + name).status().value().mode))
+            << "the link itself is an object like another";
     }
     EXPECT_FALSE(KsURL::fileURL(root() + "/../secret/a.txt").status().ok());
 }

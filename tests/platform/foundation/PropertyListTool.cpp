@@ -1,5 +1,6 @@
-// Reads binary property lists from standard input, one a line in hexadecimal digits, and says of each what it holds and how
-// we write it: "VALUE BYTES", or "refused". For plistlib_check.py, which compares both with an independent implementation.
+// Reads binary property lists from standard input, one a line in hexadecimal digits, and says of each what it holds and
+// how we write it: "VALUE BYTES", or "refused". For plistlib_check.py, which compares both with an independent
+// implementation.
 
 #include <fmt/format.h>
 

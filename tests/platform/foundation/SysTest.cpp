@@ -50,7 +50,8 @@ TEST_F(SysTest, beginningsAreReadFromRegularFilesOnly) {
     const UniqueFd parent = directory();
     EXPECT_EQ(textOf(sys::readBeginning(parent.get(), "a", 3).value()), "hel");
     EXPECT_EQ(textOf(sys::readBeginning(parent.get(), "a", 100).value()), "hello");
-    for (const char* name : {"fifo", "link", "."}) EXPECT_TRUE(sys::readBeginning(parent.get(), name, 3).error().isPosix(ENXIO)) << name;
+    for (const char* name : {"fifo", "link", "."})
+        EXPECT_TRUE(sys::readBeginning(parent.get(), name, 3).error().isPosix(ENXIO)) << name;
 }
 
 TEST_F(SysTest, countsEntriesUpToTheMost) {

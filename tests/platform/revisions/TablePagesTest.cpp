@@ -110,7 +110,8 @@ TEST_F(TablePagesTest, findsFlippedBitsBeforeTheLibraryDoes) {
     std::size_t found = 0, harmless = 0;
     std::optional<std::size_t> changed;
     for (std::size_t page = 0; page < good.size(); page += 4096) {
-        // The page's head, its first offsets, the end with the first entries that were written; in head pages all of it.
+        // The page's head, its first offsets, the end with the first entries that were written; in head pages all of
+        // it.
         for (std::size_t at = 0; at < 4096; at += at == 40 && page >= 8192 ? 4000 : 1) {
             if (page < 8192 && at == 160) break;
             if (changed) setByte(*changed, good[*changed]);
