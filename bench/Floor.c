@@ -42,13 +42,13 @@ static long list_here(int directory, int descend) {
             if (e->type == DT_DIR) {
                 const int inner = openat(directory, e->name, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
                 if (inner < 0) continue;
+                _Alignas(8) char scratch[32768];
+                sink += syscall(SYS_getdents64, inner, scratch, sizeof scratch);
                 if (descend) {
+                    lseek(inner, 0, SEEK_SET);
                     const long below = list_here(inner, descend);
                     if (below < 0 || fchdir(directory) != 0) return -1;
                     count += below;
-                } else {
-                    _Alignas(8) char scratch[32768];
-                    sink += syscall(SYS_getdents64, inner, scratch, sizeof scratch);
                 }
                 close(inner);
             }

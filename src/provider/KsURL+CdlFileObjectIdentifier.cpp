@@ -33,7 +33,7 @@ constexpr int kEventOnlyFlags = O_PATH | O_NOFOLLOW;
 
 /// The root that a proper path is inside of, as text.
 struct MatchedRoot {
-    KsURL url;
+    std::shared_ptr<const KsURL> url;
     bool isStorage = false;
 };
 
@@ -41,10 +41,10 @@ std::optional<MatchedRoot> matchRoot(std::string_view path) {
     std::string rewritten;
     const auto begins = [&](const KsURL& root) { return path.starts_with(properPath(root.path(), rewritten)); };
     for (const KsURL& root : CdlAppLibraryManager::rootURLsForAppLibraries()) {
-        if (begins(root)) return MatchedRoot{root, false};
+        if (begins(root)) return MatchedRoot{std::make_shared<const KsURL>(root), false};
     }
-    KsURL storage = TesselManager::defaultManager().documentStorageURL();
-    if (begins(storage)) return MatchedRoot{std::move(storage), true};
+    auto storage = TesselManager::defaultManager().sharedDocumentStorageURL();
+    if (begins(*storage)) return MatchedRoot{std::move(storage), true};
     return std::nullopt;
 }
 
@@ -159,9 +159,9 @@ std::optional<TesselItemIdentifier> itemIdentifier(KsURL& url) {
         return std::nullopt;
     }
     std::string rewrittenRoot;
-    if (path == properPath(root->url.path(), rewrittenRoot)) {
+    if (path == properPath(root->url->path(), rewrittenRoot)) {
         if (root->isStorage) return kTesselRootContainerItemIdentifier;
-        return CdlFileObjectIdentifier::fromAppLibraryDataContainerURL(root->url);
+        return CdlFileObjectIdentifier::fromAppLibraryDataContainerURL(*root->url);
     }
     const bool isFolder = url.ts_isFolder();
     const NumberKind& kind = isFolder ? kFolderNumber : kDocumentNumber;

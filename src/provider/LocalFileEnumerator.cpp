@@ -79,7 +79,7 @@ public:
         if (found != contexts_.rend()) return *found;
         FolderContext context;
         context.folder = folder;
-        KsURL url = KsURL::fileURL(folder->path);
+        KsURL url = KsURL::of(*folder);
         context.identifier = itemIdentifier(url);
         if (const auto proxy = RoBundleProxy::proxyWithContaining(entry))
             context.bundleIdentifier = InternedString(proxy->bundleIdentifier());

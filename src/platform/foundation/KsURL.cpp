@@ -127,6 +127,12 @@ KsURL KsURL::child(std::shared_ptr<const DirectoryReference> directory, std::str
     return url;
 }
 
+KsURL KsURL::of(const DirectoryReference& directory) {
+    KsURL url = fileURL(directory.path);
+    url.status_ = directory.status;
+    return url;
+}
+
 std::optional<KsURL> KsURL::parse(std::string_view text) {
     static constexpr std::string_view kScheme = "file:";
     if (!text.starts_with(kScheme)) {

@@ -50,6 +50,8 @@ public:
     static KsURL fileURL(std::string path);
     /// The entry of an open directory. `directory` stays open for as long as the URL is not detached.
     static KsURL child(std::shared_ptr<const DirectoryReference> directory, std::string_view name);
+    /// The open directory itself, with its status as it is known already.
+    static KsURL of(const DirectoryReference& directory);
     /// Reads a URL as text. None for a file URL that is malformed, relative, of another machine, or holds a NUL.
     static std::optional<KsURL> parse(std::string_view text);
 

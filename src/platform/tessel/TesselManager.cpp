@@ -11,15 +11,16 @@ TesselManager& TesselManager::defaultManager() {
     return manager;
 }
 
-KsURL TesselManager::documentStorageURL() const {
+std::shared_ptr<const KsURL> TesselManager::sharedDocumentStorageURL() const {
     const MutexLock lock(mutex_);
     if (!documentStorageURL_) fatal("the document storage was asked for before the host has set it");
-    return *documentStorageURL_;
+    return documentStorageURL_;
 }
 
 void TesselManager::setDocumentStorageURL(KsURL url) {
+    auto shared = std::make_shared<const KsURL>(std::move(url));
     const MutexLock lock(mutex_);
-    documentStorageURL_ = std::move(url);
+    documentStorageURL_.swap(shared);
 }
 
 void TesselManager::setHost(std::shared_ptr<Host> host) {

@@ -34,7 +34,9 @@ public:
     static TesselManager& defaultManager();
 
     /// The root of the document storage, as presented. Aborts when the host has not set it.
-    KsURL documentStorageURL() const;
+    KsURL documentStorageURL() const { return *sharedDocumentStorageURL(); }
+    /// The same without a copy, for what is asked for every item.
+    std::shared_ptr<const KsURL> sharedDocumentStorageURL() const;
     void setDocumentStorageURL(KsURL url);
     /// Null takes the host away: signals are then answered without an error and go nowhere.
     void setHost(std::shared_ptr<Host> host);
@@ -47,7 +49,7 @@ private:
     std::shared_ptr<Host> host() const;
 
     mutable Mutex mutex_;
-    std::optional<KsURL> documentStorageURL_ GUARDED_BY(mutex_);
+    std::shared_ptr<const KsURL> documentStorageURL_ GUARDED_BY(mutex_);
     std::shared_ptr<Host> host_ GUARDED_BY(mutex_);
 };
 
