@@ -168,7 +168,7 @@ void enumerateItems(const HostMethodsContext& context, const Json& params, const
     if (!container) return;
     const auto page = given.page();
     if (!page) return;
-    context.client.enumerateItems(*container, *page, [reply, &paths = context.paths](Result<ItemsPage> result) {
+    context.client.enumerateItems(*container, *page, [reply, &paths = context.paths](const Result<ItemsPage>& result) {
         answerPage(*reply, result, paths);
     });
 }
@@ -187,7 +187,7 @@ void defaultContainer(const HostMethodsContext& context, const Json& params, con
     const auto bundleIdentifier = Params(params, *reply).string("bundleIdentifier");
     if (!bundleIdentifier) return;
     context.client.provider().defaultApplicationContainerForBundleIdentifier(
-        *bundleIdentifier, [reply, &paths = context.paths](Result<std::shared_ptr<const TesselItem>> item) {
+        *bundleIdentifier, [reply, &paths = context.paths](const Result<std::shared_ptr<const TesselItem>>& item) {
             answerItem(*reply, item, paths);
         });
 }

@@ -17,6 +17,14 @@ constexpr const char* kItemHelp =
     "An identifier (did=NUMBER, fid=NUMBER, #APPLICATION, or a container's well-known name), or a path. "
     "./did=1 is the file of that name. Without it: the root container.";
 
+constexpr const char* kColumnsHelp =
+    "The columns of a listing:\n"
+    "  kind   d folder, - document, p package, l link, f FIFO, s socket, c and b devices\n"
+    "  mark   what may be done with it: r read, w write, m move, n rename, t trash, d delete\n"
+    "  size   or the number of items in a folder\n"
+    "  date   of the last change, in local time\n"
+    "  name   with control characters, and what is not UTF-8, as \\xNN";
+
 /// The words as they stand, before what they mean is worked out.
 struct Words {
     std::string storage;
@@ -29,31 +37,25 @@ struct Words {
     std::string item;
 };
 
+enum class Argument { none, optionalItem, item, path };
+
 struct CommandDescription {
-    HostCommand command;
     const char* name;
     const char* description;
-    enum class Argument { none, optionalItem, item, path } argument;
+    HostCommand command;
+    Argument argument;
 };
 
-using Argument = CommandDescription::Argument;
-
 constexpr CommandDescription kCommands[] = {
-    {HostCommand::ls, "ls",
-     "List what a folder holds, a page at a time.\n\nThe columns: kind (d folder, - document, p package, l link, f "
-     "FIFO, s socket, "
-     "c and b devices) and what may be done with the item (r read, w write, m move, n rename, t trash, d delete); "
-     "size, or the "
-     "number of items in a folder; date of the last change; name.",
+    {"ls", "List what a folder holds, a page at a time.", HostCommand::ls, Argument::optionalItem},
+    {"tree", "Show what a folder holds, and what is below it, as a tree, a page at a time.", HostCommand::tree,
      Argument::optionalItem},
-    {HostCommand::tree, "tree", "Show what a folder holds, and what is below it, as a tree, a page at a time.",
-     Argument::optionalItem},
-    {HostCommand::info, "info", "Show all that is known of an item.", Argument::item},
-    {HostCommand::url, "url", "Print the URL of an item.", Argument::item},
-    {HostCommand::id, "id", "Print the identifier of the item at a path.", Argument::path},
-    {HostCommand::anchor, "anchor", "Print the current sync anchor of a container, in base64.", Argument::optionalItem},
-    {HostCommand::status, "status", "Show where the host works and what it knows.", Argument::none},
-    {HostCommand::rpc, "rpc", "Speak JSON-RPC 2.0 on standard input and output, one message a line.", Argument::none},
+    {"info", "Show all that is known of an item.", HostCommand::info, Argument::item},
+    {"url", "Print the URL of an item.", HostCommand::url, Argument::item},
+    {"id", "Print the identifier of the item at a path.", HostCommand::id, Argument::path},
+    {"anchor", "Print the current sync anchor of a container, in base64.", HostCommand::anchor, Argument::optionalItem},
+    {"status", "Show where the host works and what it knows.", HostCommand::status, Argument::none},
+    {"rpc", "Speak JSON-RPC 2.0 on standard input and output, one message a line.", HostCommand::rpc, Argument::none},
 };
 
 RecorderChoice recorderOf(const std::string& name) {
@@ -106,6 +108,7 @@ void addCommands(CLI::App& app, Words& words) {
         CLI::App* command = app.add_subcommand(description.name, description.description);
         command->fallthrough();
         addArgument(*command, description.argument, words);
+        if (description.command == HostCommand::ls) command->footer(kColumnsHelp);
         if (description.command == HostCommand::tree) {
             command->add_flag("--packages", words.intoPackages, "Also show what is in packages.");
         }
@@ -147,6 +150,22 @@ HostReply usageReply(std::string_view message) {
     return {kExitUsage, fmt::format("cindral: {}\n", terminalText(message))};
 }
 
+std::string helpText(const CLI::App& app) {
+    const auto chosen = app.get_subcommands();
+    if (chosen.empty()) return app.help();
+    // The options stand with the program, before or after any command.
+    return chosen.front()->help(app.get_name()) + "\nOptions of every command: cindral --help\n";
+}
+
+/// What is wrong where no command was found. The library says that one is missing also of a word that is none.
+std::string missingCommandText(const CLI::App& app, const CLI::ParseError& error) {
+    if (error.get_name() != "RequiredError") return error.what();
+    const std::vector<std::string> rest = app.remaining();
+    const std::string what =
+        rest.empty() ? "a command is missing" : fmt::format("there is no command \"{}\"", rest.front());
+    return what + "; cindral --help says which there are";
+}
+
 }  // namespace
 
 std::string_view recorderChoiceName(RecorderChoice choice) {
@@ -171,19 +190,18 @@ std::variant<HostOptions, HostReply> parseHostOptions(std::span<const std::strin
     app.require_subcommand(1);
     app.footer("Exit status: 0 done; 1 the operation failed; 2 the call's words are off.");
 
+    app.get_formatter()->label("SUBCOMMAND", "COMMAND");
+    app.get_formatter()->label("Subcommands", "Commands");
+
     try {
         // The library takes words from the end of the list.
         app.parse(std::vector<std::string>(words.rbegin(), words.rend()));
     } catch (const CLI::CallForHelp&) {
-        const auto chosen = app.get_subcommands();
-        // The options stand with the program; a command's help says them too.
-        return HostReply{kExitDone, chosen.empty()
-                                        ? app.help()
-                                        : chosen.front()->help() + "\nOptions of every command: cindral --help\n"};
+        return HostReply{kExitDone, helpText(app)};
     } catch (const CLI::CallForVersion& version) {
         return HostReply{kExitDone, std::string(version.what()) + "\n"};
     } catch (const CLI::ParseError& error) {
-        return usageReply(error.what());
+        return usageReply(app.get_subcommands().empty() ? missingCommandText(app, error) : error.what());
     }
     return optionsOf(app, parsed, environment);
 }

@@ -57,7 +57,7 @@ void appendJsonString(std::string& out, std::string_view text) {
     out += '"';
     while (true) {
         const std::size_t plain = plainLength(text, kPlainInJson);
-        out.append(text.data(), plain);
+        out += text.substr(0, plain);
         text.remove_prefix(plain);
         if (text.empty()) break;
 
@@ -67,7 +67,7 @@ void appendJsonString(std::string& out, std::string_view text) {
         } else if (step.length == 1) {
             appendEscaped(out, text.front());
         } else {
-            out.append(text.data(), step.length);
+            out += text.substr(0, step.length);
         }
         text.remove_prefix(step.length);
     }
@@ -93,7 +93,7 @@ void appendJsonNumber(std::string& out, std::int64_t value) {
 void appendPercentEncoded(std::string& out, std::string_view path) {
     while (true) {
         const std::size_t plain = plainLength(path, kPlainInURL);
-        out.append(path.data(), plain);
+        out += path.substr(0, plain);
         if (plain == path.size()) return;
         const auto byte = static_cast<std::uint8_t>(path[plain]);
         const char escape[3] = {'%', kHexUpper[byte >> 4], kHexUpper[byte & 15]};

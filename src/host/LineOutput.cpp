@@ -2,9 +2,13 @@
 
 #include <cerrno>
 
+#include "platform/foundation/ThreadPool.h"
+
 namespace cindral {
 
 void LineOutput::write(std::string_view line) {
+    // A reader that is slow, or another's line: meanwhile the pool may do something else.
+    const ThreadPool::BlockingRegion region;
     const MutexLock lock(mutex_);
     if (isBroken_.load()) return;
     if (auto written = descriptor::writeAll(fd_, line); !written.ok()) {

@@ -135,6 +135,13 @@ TEST(HostOptions, refuseWordsThatAreOff) {
     expectUsageFailure({"frob\nnicate\x1B[2J"});
 }
 
+TEST(HostOptions, sayWhichWordIsNoCommand) {
+    EXPECT_EQ(reply({}).text, "cindral: a command is missing; cindral --help says which there are\n");
+    EXPECT_EQ(reply({"frob\nnicate"}).text,
+              "cindral: there is no command \"frob\\x0Anicate\"; cindral --help says which there are\n");
+    EXPECT_EQ(reply({"--frob", "ls"}).text, "cindral: The following argument was not expected: --frob\n");
+}
+
 TEST(HostOptions, sayTheirVersionInOneLine) {
     const HostReply version = reply({"--version"});
     EXPECT_EQ(version.exitStatus, 0);
@@ -151,7 +158,7 @@ TEST(HostOptions, helpThemselves) {
     for (const char* command : {"ls", "tree", "info", "url", "id", "anchor", "status", "rpc"}) {
         const HostReply ofCommand = reply({command, "--help"});
         EXPECT_EQ(ofCommand.exitStatus, 0) << command;
-        EXPECT_THAT(ofCommand.text, HasSubstr(command));
+        EXPECT_THAT(ofCommand.text, HasSubstr(std::string("Usage: cindral ") + command));
     }
     EXPECT_THAT(reply({"tree", "--help"}).text, HasSubstr("--packages"));
 }
