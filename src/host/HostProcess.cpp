@@ -75,14 +75,21 @@ std::vector<std::string> rootURLs(const PresentedPaths& paths) {
     return urls;
 }
 
-/// How changes below each root are found out. Without a recorder, by comparing with what was there before.
-std::string coverageText(const std::vector<std::string>& roots) {
+/// How changes below each root are found out (without a recorder, by comparing with what was there before), and what
+/// below them is not published at all.
+std::string coverageText(const std::vector<std::string>& roots, const PresentedPaths& paths) {
     std::string out = "[";
-    for (const std::string& root : roots) {
+    const auto append = [&out](std::string_view key, std::string_view url, std::string_view how, std::string_view why) {
         if (out.size() > 1) out += ',';
-        out += R"({"root":)";
-        appendJsonString(out, root);
-        out += R"(,"how":"comparison","why":"no recorder is running"})";
+        out += fmt::format(R"({{"{}":)", key);
+        appendJsonString(out, url);
+        out += fmt::format(R"(,"how":"{}","why":)", how);
+        appendJsonString(out, why);
+        out += '}';
+    };
+    for (const std::string& root : roots) append("root", root, "comparison", "no recorder is running");
+    for (const auto& [path, why] : RootDirectories::shared().leftOut()) {
+        append("url", paths.realURL(KsURL::fileURL(path)), "left out", why);
     }
     return out + "]";
 }
@@ -158,7 +165,7 @@ std::string HostProcess::statusText() const {
     appendField(out, "oldestEventID", fmt::to_string(currentEventID));
     appendField(out, "currentEventID", fmt::to_string(currentEventID));
     appendField(out, "volumeUUID", jsonString(store_->uuid().string()));
-    appendField(out, "coverage", coverageText(roots));
+    appendField(out, "coverage", coverageText(roots, paths_));
     return out + "}";
 }
 

@@ -260,6 +260,25 @@ class KindsTest(SystemTest):
         self.assertEqual(stamps(), before)
 
 
+class MountsTest(SystemTest):
+    """The system's folder of devices: it holds mounts of other file systems, and devices that must not be touched."""
+
+    def test_what_is_mounted_below_is_left_out_and_told(self):
+        names = set(os.listdir("/dev"))
+        device = os.lstat("/dev").st_dev
+        mounted = {name for name in names if os.lstat("/dev/" + name).st_dev != device}
+        self.assertTrue(mounted, "a Linux system mounts something below /dev")
+        client = self.client(storage="/dev")
+        listed = client.named()
+        self.assertEqual(set(listed), names - mounted)
+        self.assertEqual(listed["null"]["typeIdentifier"], "inode/chardevice")
+        self.assertTrue(listed["null"]["identifier"].startswith("fid="))
+        left_out = {entry["url"] for entry in client.call("status")["coverage"] if entry["how"] == "left out"}
+        self.assertEqual(left_out, {"file:///dev/" + name for name in mounted})
+        self.assertEqual(client.finish(), 0)
+        self.assertEqual(client.error_text().count("leaving out"), len(mounted))
+
+
 class LookupsTest(SystemTest):
     def test_every_item_is_found_by_identifier_url_and_path(self):
         for names in (("a.txt",), ("sub", "b.txt"), ("sub", "deeper", "c d.txt")):
