@@ -1,6 +1,7 @@
 #include "platform/foundation/KsURL.h"
 
 #include <fcntl.h>
+#include <strings.h>
 
 #include <algorithm>
 #include <array>
@@ -135,7 +136,7 @@ KsURL KsURL::of(const DirectoryReference& directory) {
 
 std::optional<KsURL> KsURL::parse(std::string_view text) {
     static constexpr std::string_view kScheme = "file:";
-    if (!text.starts_with(kScheme)) {
+    if (text.size() < kScheme.size() || ::strncasecmp(text.data(), kScheme.data(), kScheme.size()) != 0) {
         KsURL url;
         url.path_ = text;
         url.isFileURL_ = false;
@@ -239,7 +240,8 @@ Result<bool> KsURL::isPackage() const {
 
 Result<bool> KsURL::isWritable() const {
     if (isWritable_) return *isWritable_;
-    if (directory_ && status_) isWritable_ = sys::isWritableByStatus(*status_, directory_->ownerWhoseModeDecides);
+    if (directory_ && status_)
+        isWritable_ = sys::isWritableByStatus(*status_, directory_->traits.ownerWhoseModeDecides);
     if (isWritable_) return *isWritable_;
     const Place where = TRY(place());
     isWritable_ = TRY(sys::isWritable(where.directory, where.name));

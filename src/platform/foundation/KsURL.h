@@ -93,7 +93,7 @@ public:
     /// The folder test of the host: a directory that is no package. False when it can't be told.
     bool ts_isFolder() const;  // NOLINT(readability-identifier-naming)
 
-    /// One look at which attributes there are; hasAttribute() then answers without a system call.
+    /// One look at which attributes there are; mayHaveAttribute() then answers without a system call.
     void loadAttributeNames() const;
     /// False when it is known that the attribute is absent. `name` with its namespace ("user.…").
     bool mayHaveAttribute(std::string_view name) const;

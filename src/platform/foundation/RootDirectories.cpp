@@ -76,6 +76,11 @@ std::shared_ptr<const RootDirectory> RootDirectories::rootHolding(std::string_vi
     return found == roots->end() ? nullptr : *found;
 }
 
+bool RootDirectories::isPublishedDevice(std::uint64_t device) const {
+    const MutexLock lock(mutex_);
+    return roots_ && std::ranges::any_of(*roots_, [device](const auto& root) { return root->status.device == device; });
+}
+
 bool RootDirectories::noteLeftOut(const std::string& path, const std::string& why) {
     const MutexLock lock(mutex_);
     if (leftOut_.size() >= kLeftOutMax || std::ranges::find(leftOut_, path, &LeftOut::path) != leftOut_.end())

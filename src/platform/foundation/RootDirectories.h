@@ -24,7 +24,8 @@ struct DirectoryReference {
     UniqueFd fd;
     std::string path;  ///< absolute, without a trailing slash
     FileStatus status;
-    std::optional<uid_t> ownerWhoseModeDecides;  ///< as sys:: has it; none also where nobody asked
+    KsDate seenAt;                 ///< when the status was taken
+    sys::FileSystemTraits traits;  ///< nothing to rely on where nobody asked
 };
 
 /// Whether links inside a root may be walked through. What an application can write to is not trusted.
@@ -53,6 +54,9 @@ public:
     /// is none.
     std::shared_ptr<const RootDirectory> rootHolding(std::string_view path) const;
     std::vector<std::shared_ptr<const RootDirectory>> all() const;
+
+    /// Whether a root lies on the device: numbers of another name nothing that is published.
+    bool isPublishedDevice(std::uint64_t device) const;
 
     /// Tells that something below a root is not published, and why. True the first time that is said of the path.
     bool noteLeftOut(const std::string& path, const std::string& why);

@@ -7,6 +7,7 @@
 #include <sys/stat.h>
 #include <sys/statvfs.h>
 #include <sys/syscall.h>
+#include <sys/utsname.h>
 #include <sys/vfs.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -14,6 +15,7 @@
 #include <atomic>
 #include <cerrno>
 #include <climits>
+#include <cstdio>
 #include <fstream>
 #include <iterator>
 
@@ -147,6 +149,7 @@ Result<FileStatus> statx(int directory, const char* name) {
     status.mode = raw.stx_mode;
     status.owner = raw.stx_uid;
     status.group = raw.stx_gid;
+    status.names = raw.stx_nlink;
     return status;
 }
 
@@ -204,6 +207,17 @@ bool kernelHasMandatoryLabels() {
     return has;
 }
 
+bool kernelStampsAreDistinct() {
+    static const bool distinct = [] {
+        utsname name{};
+        int major = 0;
+        int minor = 0;
+        if (::uname(&name) != 0 || std::sscanf(name.release, "%d.%d", &major, &minor) != 2) return false;
+        return major > 6 || (major == 6 && minor >= 13);
+    }();
+    return distinct;
+}
+
 // An owner or group that has no number here: the kernel then refuses writes whatever the mode says.
 constexpr unsigned kOverflowID = 65'534;
 constexpr long kXfsMagic = 0x58465342;
@@ -211,17 +225,21 @@ constexpr long kF2fsMagic = 0xF2F52010;
 
 }  // namespace
 
-std::optional<uid_t> ownerWhoseModeDecides(int directory) {
+FileSystemTraits fileSystemTraits(int directory) {
     struct statfs fileSystem;
-    if (kernelHasMandatoryLabels() || ::fstatfs(directory, &fileSystem) != 0 || (fileSystem.f_flags & ST_RDONLY) != 0)
-        return std::nullopt;
+    if (::fstatfs(directory, &fileSystem) != 0) return {};
+    FileSystemTraits traits;
     switch (fileSystem.f_type) {
         case EXT4_SUPER_MAGIC:
         case BTRFS_SUPER_MAGIC:
         case TMPFS_MAGIC:
-        case kXfsMagic:
-        case kF2fsMagic: return ::geteuid();
-        default: return std::nullopt;
+        case kXfsMagic: traits.stampsAreDistinct = kernelStampsAreDistinct(); [[fallthrough]];
+        case kF2fsMagic: {
+            const bool readOnly = (fileSystem.f_flags & ST_RDONLY) != 0;
+            if (!readOnly && !kernelHasMandatoryLabels()) traits.ownerWhoseModeDecides = ::geteuid();
+            return traits;
+        }
+        default: return {};
     }
 }
 
@@ -269,10 +287,11 @@ Result<void> DirectoryWatch::drain(const Change& change) {
 
 Result<Bytes> readBeginning(int directory, const char* name, std::size_t count) {
     // O_PATH: a handle to the file itself; what it is can be told before anything is opened.
-    const UniqueFd handle =
-        TRY(*name == '\0' ? openBeneath(directory, "", O_PATH) : openat(directory, name, O_PATH | O_NOFOLLOW));
-    if (!TRY(statx(handle.get(), "")).isRegular()) return KsError::posix(ENXIO);
-    const std::string path = pathThroughDescriptor(handle.get(), "");
+    UniqueFd own;
+    if (*name != '\0') own = TRY(openat(directory, name, O_PATH | O_NOFOLLOW));
+    const int handle = own ? own.get() : directory;
+    if (!TRY(statx(handle, "")).isRegular()) return KsError::posix(ENXIO);
+    const std::string path = pathThroughDescriptor(handle, "");
     const UniqueFd file = TRY(open(path.c_str(), O_RDONLY | O_NOATIME | O_NONBLOCK));
     Bytes bytes(count);
     std::size_t filled = 0;

@@ -30,6 +30,7 @@ struct FileStatus {
     mode_t mode = 0;
     uid_t owner = 0;
     gid_t group = 0;
+    std::uint32_t names = 1;  ///< hard links
 
     bool isDirectory() const { return S_ISDIR(mode); }
     bool isRegular() const { return S_ISREG(mode); }
@@ -74,10 +75,17 @@ Result<std::size_t> getxattrat(int directory, const char* name, const char* attr
 /// Whether the process may write the entry itself (effective identity, links not followed).
 Result<bool> isWritable(int directory, const char* name);
 
-/// The user of this process, where the file system that holds the directory keeps the ordinary promise that an owner
-/// may write what the mode lets the owner write: one of this machine's own (nothing asks a server or a user program),
-/// mounted for writing, under a kernel without mandatory labels. None elsewhere.
-std::optional<uid_t> ownerWhoseModeDecides(int directory);
+/// What can be relied on in the file system that holds a directory.
+struct FileSystemTraits {
+    /// The user of this process, where an owner may write what the mode lets the owner write: on one of this machine's
+    /// own file systems (nothing asks a server or a user program), mounted for writing, under a kernel without
+    /// mandatory labels. None elsewhere.
+    std::optional<uid_t> ownerWhoseModeDecides;
+    /// A stamp that was looked at is followed by a distinct one, however soon the next change comes (Linux 6.13, and
+    /// file systems that take part). Elsewhere stamps go by the clock's tick.
+    bool stampsAreDistinct = false;
+};
+FileSystemTraits fileSystemTraits(int directory);
 /// The answer of isWritable() from the status alone; none where it must be asked for. `owner` as above, of the entry's
 /// directory.
 ///
