@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "platform/foundation/Mutex.h"
 #include "platform/foundation/TypeDatabase.h"
 
 namespace cindral {
@@ -54,7 +55,7 @@ ObjectKind objectKindOf(const FileStatus& status, bool isPackage) {
     return isPackage ? ObjectKind::package : ObjectKind::folder;
 }
 
-ObjectFinder::ObjectFinder(VolumeStore& store, std::uint32_t device) : store_(store) {
+ObjectFinder::ObjectFinder(const VolumeStore& store, std::uint32_t device) : store_(store) {
     for (auto& root : RootDirectories::shared().all()) {
         if (root->status.deviceID() != device) continue;
         rootIDs_.push_back(FileID{root->status.fileID});
@@ -76,15 +77,15 @@ Result<FoundObject> ObjectFinder::find(FileID fileID) const {
     if (found.ok()) return found;
     found = findByHandle(fileID);
     if (!found.ok() && (found.error().isPosix(ESTALE) || found.error().isPosix(ENOENT))) return KsError::posix(ENOENT);
-    if (!found.ok()) found = findByReading(fileID);
-    if (found.ok()) TRY(record(*found));
-    return found;
+    return found.ok() ? found : findByReading(fileID);
 }
 
 Result<FoundObject> ObjectFinder::findByRecords(FileID fileID) const {
     std::optional<VolumeStore::RecordedPath> recorded = store_.recordedPath(fileID, rootIDs_);
     if (!recorded) return KsError::posix(ENOENT);
-    return check(roots_[recorded->rootIndex], std::move(recorded->path), fileID);
+    FoundObject found = TRY(check(roots_[recorded->rootIndex], std::move(recorded->path), fileID));
+    found.isRecorded = true;
+    return found;
 }
 
 /// ENOENT and ESTALE say for certain that there is no such object; any other error, that this is no way to find out.
@@ -104,6 +105,10 @@ Result<FoundObject> ObjectFinder::findByHandle(FileID fileID) const {
 }
 
 Result<FoundObject> ObjectFinder::findByReading(FileID fileID) const {
+    // One at a time: who asks for many numbers that nothing has must not keep every thread reading.
+    static Mutex& reading = *new Mutex;
+    const MutexLock lock(reading);
+    bool moved = false;
     alignas(8) std::byte buffer[32'768];
     for (const auto& root : roots_) {
         std::vector<std::string> folders{""};
@@ -123,7 +128,7 @@ Result<FoundObject> ObjectFinder::findByReading(FileID fileID) const {
                     if (FileID{entry->fileID} == fileID) {
                         Result<FoundObject> found = check(root, joined(folder, entry->name), fileID);
                         if (found.ok()) return found;
-                        return KsError::posix(ESTALE);
+                        moved = true;  // Or another object's number, which layered file systems show here.
                     }
                     if (entry->type == DT_DIR || entry->type == DT_UNKNOWN)
                         folders.push_back(joined(folder, entry->name));
@@ -131,10 +136,10 @@ Result<FoundObject> ObjectFinder::findByReading(FileID fileID) const {
             }
         }
     }
-    return KsError::posix(ENOENT);
+    return KsError::posix(moved ? ESTALE : ENOENT);
 }
 
-Result<void> ObjectFinder::record(const FoundObject& object) const {
+Result<void> ObjectFinder::record(VolumeStore& store, const FoundObject& object) const {
     const std::size_t slash = object.relativePath.rfind('/');
     const bool atTop = slash == std::string::npos;
     const std::string parentPath = atTop ? "" : object.relativePath.substr(0, slash);
@@ -143,7 +148,8 @@ Result<void> ObjectFinder::record(const FoundObject& object) const {
     const UniqueFd parent =
         TRY(sys::openBeneath(object.root->fd.get(), parentPath, O_PATH | O_DIRECTORY, RESOLVE_NO_SYMLINKS));
     const FileStatus parentStatus = TRY(sys::statx(parent.get(), ""));
-    TRY(recordFolder(parentPath.empty() ? object.root->path : object.root->path + "/" + parentPath, parentStatus));
+    TRY(recordFolder(store, parentPath.empty() ? object.root->path : object.root->path + "/" + parentPath,
+                     parentStatus));
 
     ObjectSighting sighting;
     sighting.fileID = FileID{object.status.fileID};
@@ -152,10 +158,10 @@ Result<void> ObjectFinder::record(const FoundObject& object) const {
     sighting.kind =
         objectKindOf(object.status, object.status.isDirectory() && TypeDatabase::shared().isPackageName(name));
     sighting.name = name;
-    return store_.identify({&sighting, 1});
+    return store.identify({&sighting, 1});
 }
 
-Result<void> ObjectFinder::recordFolder(const std::string& path, const FileStatus& folder) const {
+Result<void> ObjectFinder::recordFolder(VolumeStore& store, const std::string& path, const FileStatus& folder) const {
     const auto root = RootDirectories::shared().rootHolding(path);
     if (!root || path.size() <= root->path.size()) return {};
     const std::string relative = path.substr(root->path.size() + 1);
@@ -182,7 +188,7 @@ Result<void> ObjectFinder::recordFolder(const std::string& path, const FileStatu
         sightings.push_back(sighting);
         begin = end + 1;
     }
-    return store_.identify(sightings);
+    return store.identify(sightings);
 }
 
 }  // namespace cindral

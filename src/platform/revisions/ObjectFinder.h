@@ -16,6 +16,7 @@ struct FoundObject {
     std::shared_ptr<const RootDirectory> root;
     std::string relativePath;  ///< empty for the root itself
     FileStatus status;
+    bool isRecorded = false;  ///< it is where the records say
 
     std::string path() const { return relativePath.empty() ? root->path : root->path + "/" + relativePath; }
 };
@@ -31,24 +32,27 @@ struct FoundObject {
 class ObjectFinder {
 public:
     /// `store` is borrowed for life. Only roots of the device are looked at.
-    ObjectFinder(VolumeStore& store, std::uint32_t device);
+    ObjectFinder(const VolumeStore& store, std::uint32_t device);
 
+    /// What was found where the records did not have it is to be recorded: record().
+    ///
     /// ENOENT when nothing below the roots has the number; ESTALE when it was found and had moved again before it could
     /// be checked.
     Result<FoundObject> find(FileID fileID) const;
 
     /// Records where a folder is, and every folder above it, unless the store knows already. For folders outside of the
     /// roots nothing is done.
-    Result<void> recordFolder(const std::string& path, const FileStatus& status) const;
+    Result<void> recordFolder(VolumeStore& store, const std::string& path, const FileStatus& status) const;
+    Result<void> record(VolumeStore& store, const FoundObject& object) const;
+
+    /// Where the records say, if the object is there; any error otherwise.
+    Result<FoundObject> findByRecords(FileID fileID) const;
 
 private:
-    Result<FoundObject> findByRecords(FileID fileID) const;
     Result<FoundObject> findByHandle(FileID fileID) const;
     Result<FoundObject> findByReading(FileID fileID) const;
     Result<FoundObject> check(std::shared_ptr<const RootDirectory> root, std::string relativePath, FileID fileID) const;
-    Result<void> record(const FoundObject& object) const;
-
-    VolumeStore& store_;
+    const VolumeStore& store_;
     std::vector<std::shared_ptr<const RootDirectory>> roots_;
     std::vector<FileID> rootIDs_;  ///< of roots_, in the same order
 };

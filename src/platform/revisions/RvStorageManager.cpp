@@ -5,8 +5,10 @@
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <unordered_map>
 #include <vector>
 
+#include "platform/foundation/Log.h"
 #include "platform/revisions/ObjectFinder.h"
 
 namespace cindral {
@@ -26,10 +28,44 @@ Result<void> recordFolders(VolumeStore& store, std::vector<const DirectoryRefere
             return sighting.fileID == FileID{folder->status.fileID};
         };
         if (folders.size() > 1 && std::ranges::any_of(sightings, isFolder)) continue;
-        TRY(ObjectFinder(store, folder->status.deviceID()).recordFolder(folder->path, folder->status));
+        TRY(ObjectFinder(store, folder->status.deviceID()).recordFolder(store, folder->path, folder->status));
     }
     return {};
 }
+
+/// Finds an object, and records where it is now. A record is a hint: one that can't be written is no reason not to answer.
+Result<FoundObject> findAndRecord(VolumeStore& store, std::uint32_t device, FileID fileID) {
+    const ObjectFinder finder(store, device);
+    FoundObject found = TRY(finder.find(fileID));
+    if (found.isRecorded) return found;
+    const Result<void> recorded = finder.record(store, found);
+    if (!recorded.ok()) logError("can't record where {} is; {}", found.path(), recorded.error().description());
+    return found;
+}
+
+/// Tells the names of objects with several from the one that each is listed under.
+class OtherNames {
+public:
+    explicit OtherNames(const VolumeStore& store) : store_(store) {}
+
+    bool isOne(const KsURL& entry) {
+        const Result<FileStatus> status = entry.status();
+        if (!status.ok() || status->isDirectory() || status->names < 2) return false;
+        // Two names of one page: the first seen is the one.
+        const auto [seen, isNew] = seen_.emplace(status->fileID, entry.path());
+        if (!isNew) return seen->second != entry.path();
+        const auto record = store_.object(FileID{status->fileID});
+        if (!record || record->birthTime != status->birthStamp()) return false;
+        const bool isRecordedName =
+            record->name == entry.lastPathComponent() && record->parent == FileID{entry.directory()->status.fileID};
+        if (isRecordedName) return false;
+        return ObjectFinder(store_, status->deviceID()).findByRecords(FileID{status->fileID}).ok();
+    }
+
+private:
+    const VolumeStore& store_;
+    std::unordered_map<std::uint64_t, std::string> seen_;
+};
 
 int errnoOf(const KsError& error) {
     return error.domain() == kKsPOSIXErrorDomain ? static_cast<int>(error.code()) : EIO;
@@ -50,6 +86,8 @@ void RvStorageManager::replaceDefaultManager(RvStorageManager* manager) {
 
 void RvStorageManager::setStore(std::shared_ptr<VolumeStore> store) {
     KsURL::setDocumentIdentifierSource([store](const FileStatus& status) -> std::uint32_t {
+        // A number of another device names something else here.
+        if (!RootDirectories::shared().isPublishedDevice(status.device)) return 0;
         const auto object = store ? store->object(FileID{status.fileID}) : std::nullopt;
         return object && object->birthTime == status.birthStamp() ? static_cast<std::uint32_t>(object->documentID) : 0;
     });
@@ -72,7 +110,7 @@ std::uint64_t RvStorageManager::resolveDocumentID(std::int64_t documentID, std::
     if (documentID <= 0 || documentID > UINT32_MAX) return fail(EINVAL);
     const auto document = store->document(DocumentID{static_cast<std::uint32_t>(documentID)});
     if (!document) return fail(ENOENT);
-    const Result<FoundObject> found = ObjectFinder(*store, device).find(document->fileID);
+    const Result<FoundObject> found = findAndRecord(*store, device, document->fileID);
     if (!found.ok()) return fail(errnoOf(found.error()));
     // The number went to another object: the document's own is gone.
     if (found->status.birthStamp() != document->birthTime) return fail(ENOENT);
@@ -88,6 +126,7 @@ std::uint32_t RvStorageManager::documentIDForDescriptor(int fd) {
     if (!store) return fail(EAGAIN);
     const Result<FileStatus> status = sys::statx(fd, "");
     if (!status.ok()) return fail(errnoOf(status.error()));
+    if (!RootDirectories::shared().isPublishedDevice(status->device)) return fail(EXDEV);
 
     ObjectSighting sighting;
     sighting.fileID = FileID{status->fileID};
@@ -115,9 +154,11 @@ std::uint32_t RvStorageManager::documentIDForDescriptor(int fd) {
     return static_cast<std::uint32_t>(sighting.documentID);
 }
 
-Result<void> RvStorageManager::identify(std::span<KsURL> entries) {
+Result<void> RvStorageManager::identify(std::vector<KsURL>& entries) {
     const auto store = this->store();
     if (!store) return KsError::posix(EAGAIN);
+    OtherNames otherNames(*store);
+    std::erase_if(entries, [&](const KsURL& entry) { return otherNames.isOne(entry); });
     std::vector<ObjectSighting> sightings;
     std::vector<KsURL*> sighted;
     std::vector<const DirectoryReference*> folders;
@@ -150,7 +191,7 @@ Result<void> RvStorageManager::identify(std::span<KsURL> entries) {
 Result<std::string> RvStorageManager::pathOfFileID(std::uint64_t fileID, std::uint32_t device, std::size_t sizeMax) {
     const auto store = this->store();
     if (!store) return KsError::posix(EAGAIN);
-    const FoundObject found = TRY(ObjectFinder(*store, device).find(FileID{fileID}));
+    const FoundObject found = TRY(findAndRecord(*store, device, FileID{fileID}));
     std::string path = found.path();
     if (path.size() >= sizeMax) return KsError::posix(ENAMETOOLONG, path);
     return path;

@@ -3,8 +3,8 @@
 #include <cstdint>
 #include <memory>
 #include <optional>
-#include <span>
 #include <string>
+#include <vector>
 
 #include "platform/foundation/KsURL.h"
 #include "platform/foundation/Mutex.h"
@@ -39,9 +39,10 @@ public:
     /// Gives entries of open folders (KsURL::child) their document IDs, and records where they were seen, in one
     /// transaction.
     ///
-    /// The URLs' cached document identifiers are set. Entries that are gone, and those of another device than their
-    /// folder, are left as they are.
-    Result<void> identify(std::span<KsURL> entries);
+    /// The URLs' cached document identifiers are set. Entries that are gone are left as they are. An object with several
+    /// names is one item under the name it was first seen by, for as long as that leads to it: its other names are taken
+    /// out of `entries`.
+    Result<void> identify(std::vector<KsURL>& entries);
 
     /// The path of an object by its number, as presented: by the recorded parents, or, where they don't lead to it, by
     /// asking the file system. What is handed out was checked against the file system.

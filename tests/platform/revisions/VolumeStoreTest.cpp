@@ -718,7 +718,7 @@ TEST_F(VolumeStoreTest, losesAsFewIDsAsItGaveWhenKilled) {
         std::filesystem::rename(copy, folder());
         open();
     }
-    EXPECT_LT(number(documentOf(5000, "a")), 20U * 1100);
+    EXPECT_LE(number(documentOf(5000, "a")), 20U * 65'537 + 1);  // A block each time, and what was given of it.
     const std::uint32_t before = number(documentOf(5001, "a"));
     reopen();
     EXPECT_EQ(number(documentOf(5002, "a")), before + 1);  // Nothing is lost when it is closed.
@@ -750,6 +750,9 @@ TEST_F(VolumeStoreTest, recordsNothingOfAPageThatTheDiskHasNoRoomFor) {
 
 TEST_F(VolumeStoreTest, givesNoIDThatItCanNotReserve) {
     open();
+    Page earlier = Page::of(100, 1);
+    identify(earlier);
+    reopen();  // A store that has objects reserves only when it must.
     Page page = Page::of(20, 1);
     {
         const FullDisk full(4096);  // One slot of the numbers' file, but not the other.
@@ -759,7 +762,7 @@ TEST_F(VolumeStoreTest, givesNoIDThatItCanNotReserve) {
     EXPECT_EQ(page[0].documentID, DocumentID{});
     EXPECT_EQ(store_->currentEventID(), 0U);
     identify(page);
-    EXPECT_EQ(page[0].documentID, DocumentID{1});
+    EXPECT_EQ(page[0].documentID, DocumentID{2});
     EXPECT_EQ(*store_->advanceEventID(), 1U);
 }
 
