@@ -13,6 +13,7 @@
 #include "platform/foundation/Log.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/foundation/Sys.h"
+#include "platform/tessel/TesselErrors.h"
 #include "provider/fs/FSListingPositions.h"
 
 namespace cindral {
@@ -40,6 +41,7 @@ public:
     Scan(FSDirectoryEnumerator& owner, const EnumeratorOptions& options, const Body& body)
         : owner_(owner), options_(options), body_(body) {}
 
+    /// The scan's own failure, or the body's.
     Result<void> run() {
         std::size_t urlIndex = resume();
         for (; urlIndex < options_.urls.size(); ++urlIndex) {
@@ -88,39 +90,34 @@ private:
     }
 
     std::optional<KsError> push(Result<UniqueFd> fd, const std::string& path, DirectoryEnumerationOptions options) {
-        auto directory = std::make_shared<DirectoryReference>();
-        directory->path = path;
-        std::optional<KsError> error;
-        if (!fd.ok()) {
-            error = fd.error();
-        } else {
-            directory->fd = std::move(*fd);
-            // Before the first entry is read, so that a change during the scan shows as a change since.
-            Result<FileStatus> status = sys::statx(directory->fd.get(), "");
-            if (!status.ok()) error = status.error();
-            if (status.ok()) describe(*directory, *status);
-        }
-        if (error) {
-            logError("can't open directory at {}; {}", path, error->description());
-            return error->with("path", path);
+        auto directory = described(std::move(fd), path);
+        if (!directory.ok()) {
+            logError("can't open directory at {}; {}", path, directory.error().description());
+            return directory.error().with("path", path);
         }
         Level level;
         level.path = path;
-        level.fileID = directory->status.fileID;
+        level.fileID = (*directory)->status.fileID;
         level.options = options;
-        level.directory = std::move(directory);
+        level.directory = std::move(*directory);
         levels_.push_back(std::move(level));
         return std::nullopt;
     }
 
-    void describe(DirectoryReference& directory, const FileStatus& status) const {
-        directory.status = status;
+    /// The open directory with its status, which is taken before the first entry is read, so that a change during the
+    /// scan shows as a change since.
+    Result<std::shared_ptr<DirectoryReference>> described(Result<UniqueFd> fd, const std::string& path) const {
+        auto directory = std::make_shared<DirectoryReference>();
+        directory->path = path;
+        directory->fd = TRY(std::move(fd));
+        directory->seenAt = KsDate::now();
+        directory->status = TRY(sys::statx(directory->fd.get(), ""));
         // A sub-directory on the same device is of the same file system; asking once is enough.
         const DirectoryReference* parent = levels_.empty() ? nullptr : levels_.back().directory.get();
-        const bool same = parent != nullptr && parent->status.device == status.device &&
-                          (status.attributes & STATX_ATTR_MOUNT_ROOT) == 0;
-        directory.ownerWhoseModeDecides =
-            same ? parent->ownerWhoseModeDecides : sys::ownerWhoseModeDecides(directory.fd.get());
+        const bool isMount = (directory->status.attributes & STATX_ATTR_MOUNT_ROOT) != 0;
+        const bool same = parent != nullptr && parent->status.device == directory->status.device && !isMount;
+        directory->traits = same ? parent->traits : sys::fileSystemTraits(directory->fd.get());
+        return directory;
     }
 
     /// The next record of the innermost directory, or null at its end.
@@ -133,7 +130,8 @@ private:
                 const bool few = last - std::min(last, owner_.counter_) <= kSmallBufferEntriesMax;
                 level.buffer.resize(few ? kSmallBufferSize : kLargeBufferSize);
                 const Result<std::size_t> size = sys::getdents(level.directory->fd.get(), level.buffer);
-                if (!size.ok()) logError("can't read directory at {}; {}", level.path, size.error().description());
+                // A directory that was removed while it was read has no more entries: that is its end.
+                if (!size.ok() && !size.error().isPosix(ENOENT)) failedToRead(level, size.error());
                 if (!size.ok() || *size == 0) return nullptr;
                 level.filled = *size;
                 level.at = 0;
@@ -146,6 +144,11 @@ private:
         }
     }
 
+    void failedToRead(const Level& level, const KsError& error) {
+        logError("can't read directory at {}; {}", level.path, error.description());
+        if (levels_.size() == 1 && !owner_.openError_) owner_.openError_ = error.with("path", level.path);
+    }
+
     static void keepName(Level& level) {
         if (!std::exchange(level.nameIsStale, false)) return;
         level.lastName = reinterpret_cast<const DirectoryRecord*>(level.buffer.data() + level.lastRecord)->name;
@@ -153,10 +156,8 @@ private:
 
     Result<void> step() {
         Level& level = levels_.back();
-        if (!level.directory && !reopen(level)) {
-            levels_.pop_back();
-            return {};
-        }
+        // What is left of a directory that moved can't be told: the listing begins anew rather than miss it.
+        if (!level.directory && !reopen(level)) return tesselErrorForExpiredPage();
         const DirectoryRecord* record = next(level);
         if (record == nullptr) {
             levels_.pop_back();
@@ -211,22 +212,15 @@ private:
     }
 
     /// Opens a directory that was closed on the way down, at the entry after the last one consumed. False, after a
-    /// line, when it is gone.
+    /// line, when another is there now, or none.
     bool reopen(Level& level) const {
-        auto directory = std::make_shared<DirectoryReference>();
-        directory->path = level.path;
-        Result<UniqueFd> fd = RootDirectories::openForReading(level.path);
-        if (fd.ok()) directory->fd = std::move(*fd);
-        const Result<FileStatus> status =
-            fd.ok() ? sys::statx(directory->fd.get(), "") : Result<FileStatus>(fd.error());
-        if (!status.ok() || status->fileID != level.fileID ||
-            ::lseek(directory->fd.get(), level.nextOffset, SEEK_SET) < 0) {
-            logError("can't open directory at {}; {}", level.path,
-                     status.ok() ? "it moved while it was listed" : status.error().description());
+        auto directory = described(RootDirectories::openForReading(level.path), level.path);
+        if (!directory.ok() || (*directory)->status.fileID != level.fileID ||
+            ::lseek((*directory)->fd.get(), level.nextOffset, SEEK_SET) < 0) {
+            logInfo("directory at {} moved while it was listed", level.path);
             return false;
         }
-        describe(*directory, *status);
-        level.directory = std::move(directory);
+        level.directory = std::move(*directory);
         level.mayRepeat = true;
         return true;
     }
@@ -262,23 +256,19 @@ private:
     }
 
     bool resumeLevel(const DirectoryPosition& known) {
-        auto directory = std::make_shared<DirectoryReference>();
-        directory->path = known.path;
-        Result<UniqueFd> fd = RootDirectories::openForReading(known.path);
-        if (!fd.ok()) return false;
-        directory->fd = std::move(*fd);
-        const Result<FileStatus> status = sys::statx(directory->fd.get(), "");
-        if (!status.ok() || status->fileID != known.fileID || status->device != known.device ||
-            status->modificationTime != known.modificationTime || status->changeTime != known.changeTime) {
+        auto directory = described(RootDirectories::openForReading(known.path), known.path);
+        if (!directory.ok()) return false;
+        const FileStatus& status = (*directory)->status;
+        if (status.fileID != known.fileID || status.device != known.device ||
+            status.modificationTime != known.modificationTime || status.changeTime != known.changeTime ||
+            ::lseek((*directory)->fd.get(), known.nextOffset, SEEK_SET) < 0) {
             return false;
         }
-        if (::lseek(directory->fd.get(), known.nextOffset, SEEK_SET) < 0) return false;
-        describe(*directory, *status);
         Level level;
         level.path = known.path;
         level.fileID = known.fileID;
         level.options = static_cast<DirectoryEnumerationOptions>(known.options);
-        level.directory = std::move(directory);
+        level.directory = std::move(*directory);
         level.nextOffset = known.nextOffset;
         level.lastName = known.lastName;
         level.mayRepeat = !known.lastName.empty();

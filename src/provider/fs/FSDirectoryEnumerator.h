@@ -57,7 +57,8 @@ public:
     /// Gets each delivered entry, its directory still open (KsURL::directory). A failure stops the enumeration.
     using Body = std::function<Result<void>(KsURL entry)>;
 
-    /// The body's error, unchanged. A directory that can't be opened yields no entries and an error line; see also
+    /// The body's error, unchanged; or an expired page, when a directory moved away from under a deep scan. A directory
+    /// that can't be opened yields no entries and an error line; see also
     /// openError().
     Result<void> enumerate(const EnumeratorOptions& options, const Body& body);
 
@@ -65,7 +66,7 @@ public:
     std::uint64_t counter() const { return counter_; }
     /// False when the limit stopped the scan and more entries remain.
     bool isComplete() const { return complete_; }
-    /// Why the first of `urls` that can't be opened couldn't be.
+    /// Why the first of `urls` that can't be opened, or be read to its end, couldn't be.
     const std::optional<KsError>& openError() const { return openError_; }
 
 private:

@@ -1,9 +1,6 @@
 #include "provider/fs/FSGatherWitness.h"
 
-#include <sys/utsname.h>
-
 #include <algorithm>
-#include <cstdio>
 
 #include "platform/eventstream/EventStream.h"
 
@@ -11,34 +8,24 @@ namespace cindral {
 
 namespace {
 
-constexpr std::size_t kListingsMax = 64;
-// For one listing; the user's limit is for all programs.
-constexpr std::size_t kWatchesMax = 16'384;
+// Each is a few hundred bytes, and its watches: a client that walks a tree lists thousands of folders between two pages.
+constexpr std::size_t kListingsMax = 4'096;
+// For all listings; the user's limit is for all programs.
+constexpr std::size_t kWatchesMax = 32'768;
 // Twice the longest clock tick of the kernels that stamp files by the tick.
 constexpr std::int64_t kCoarseStampNanoseconds = 20'000'000;
-
-/// Since 6.13 a stamp that was looked at is followed by a distinct one, however soon the next change comes.
-bool kernelStampsAreDistinct() {
-    static const bool distinct = [] {
-        utsname name{};
-        int major = 0;
-        int minor = 0;
-        if (::uname(&name) != 0 || std::sscanf(name.release, "%d.%d", &major, &minor) != 2) return false;
-        return major > 6 || (major == 6 && minor >= 13);
-    }();
-    return distinct;
-}
 
 bool isSame(const Result<FileStatus>& now, const FileStatus& seen) {
     return now.ok() && now->fileID == seen.fileID && now->device == seen.device &&
            now->modificationTime == seen.modificationTime && now->changeTime == seen.changeTime;
 }
 
-bool isProvable(const FileStatus& status) {
-    if (kernelStampsAreDistinct()) return true;
-    const KsDate now = KsDate::now();
-    const std::int64_t age =
-        (now.seconds - status.changeTime.seconds) * 1'000'000'000 + now.nanoseconds - status.changeTime.nanoseconds;
+/// Whether a change right after the folder was seen would show in its times.
+bool isProvable(const DirectoryReference& folder) {
+    if (folder.traits.stampsAreDistinct) return true;
+    const KsDate& changed = folder.status.changeTime;
+    const KsDate& seen = folder.seenAt;
+    const std::int64_t age = (seen.seconds - changed.seconds) * 1'000'000'000 + seen.nanoseconds - changed.nanoseconds;
     return age > kCoarseStampNanoseconds;
 }
 
@@ -90,6 +77,7 @@ bool FSGatherWitness::isUnchanged(const Listing& listing) {
 
 void FSGatherWitness::removeOldest() {
     const auto oldest = std::ranges::min_element(listings_, {}, [](const auto& entry) { return entry.second.lastUse; });
+    watches_ -= oldest->second.watches.size();
     for (const int watch : oldest->second.watches) {
         const auto watchers = watchers_.find(watch);
         std::erase(watchers->second, &oldest->second);
@@ -100,47 +88,54 @@ void FSGatherWitness::removeOldest() {
     listings_.erase(oldest);
 }
 
-std::uint64_t FSGatherWitness::begin(const std::vector<KsURL>& urls) {
+Result<std::uint64_t> FSGatherWitness::begin(const std::vector<KsURL>& urls,
+                                             std::span<const DirectoryReference* const> folders) {
     const MutexLock lock(mutex_);
-    std::uint64_t eventID = EventStream::currentEventID();
-    std::string key = keyOf(urls, eventID);
-    if (const Listing* earlier = find(key)) {
-        if (isUnchanged(*earlier)) return eventID;
-        const Result<std::uint64_t> next = EventStream::noteChange();
-        // Without a new position the earlier listing can't be told from this one: neither may go on.
-        if (!next.ok()) return eventID;
-        eventID = *next;
-        key = keyOf(urls, eventID);
+    const std::optional<KsUUID> volume = EventStream::volumeUUID(urls.front());
+    if (volume != namedIn_) {
+        TRY(EventStream::noteChange());
+        namedIn_ = volume;
     }
-    if (listings_.size() >= kListingsMax) removeOldest();
+    std::uint64_t eventID = EventStream::currentEventID();
+    const Listing* earlier = find(keyOf(urls, eventID));
+    if (earlier != nullptr && !isUnchanged(*earlier)) eventID = TRY(EventStream::noteChange());
+    if (earlier == nullptr && listings_.size() >= kListingsMax) removeOldest();
     // What was lost before it began is nothing to the new listing.
     drain();
-    listings_[key].lastUse = ++uses_;
+    Listing& listing = listings_[keyOf(urls, eventID)];
+    listing.lastUse = ++uses_;
+    for (const DirectoryReference* folder : folders) see(listing, urls, *folder);
     return eventID;
 }
 
 /// Watches the folder for the listing. False when it can't be watched.
 bool FSGatherWitness::watch(Listing& listing, const DirectoryReference& folder) {
-    if (listing.watches.size() >= kWatchesMax) return false;
+    if (watches_ >= kWatchesMax) return false;
     const Result<int> watch = watch_.add(folder.fd.get());
     if (!watch.ok()) return false;
+    ++watches_;
     listing.watches.push_back(*watch);
     watchers_[*watch].push_back(&listing);
     // What happened between the first look at the folder and the watch shows in its times.
-    if (!isProvable(folder.status) || !isSame(sys::statx(folder.fd.get(), ""), folder.status)) listing.changed = true;
+    if (!isProvable(folder) || !isSame(sys::statx(folder.fd.get(), ""), folder.status)) listing.changed = true;
     return true;
 }
 
-void FSGatherWitness::sawFolder(const std::vector<KsURL>& urls, std::uint64_t eventID,
-                                const DirectoryReference& folder) {
+void FSGatherWitness::see(Listing& listing, const std::vector<KsURL>& urls, const DirectoryReference& folder) {
+    // The first sight stays: what a later page saw of the folder is checked against it.
+    if (!listing.folders.insert(folder.status.fileID).second) return;
+    const bool isListed = std::ranges::any_of(urls, [&](const KsURL& url) { return url.path() == folder.path; });
+    if (!isListed && watch(listing, folder)) return;
+    listing.heldToTheirTimes.emplace(folder.path, folder.status);
+    if (!isProvable(folder)) listing.changed = true;
+}
+
+void FSGatherWitness::sawFolders(const std::vector<KsURL>& urls, std::uint64_t eventID,
+                                 std::span<const DirectoryReference* const> folders) {
     const MutexLock lock(mutex_);
     Listing* listing = find(keyOf(urls, eventID));
-    // The first sight stays: what a later page saw of the folder is checked against it.
-    if (listing == nullptr || !listing->folders.insert(folder.status.fileID).second) return;
-    const bool isListed = std::ranges::any_of(urls, [&](const KsURL& url) { return url.path() == folder.path; });
-    if (!isListed && watch(*listing, folder)) return;
-    listing->heldToTheirTimes.emplace(folder.path, folder.status);
-    if (!isProvable(folder.status)) listing->changed = true;
+    if (listing == nullptr) return;
+    for (const DirectoryReference* folder : folders) see(*listing, urls, *folder);
 }
 
 bool FSGatherWitness::holds(const std::vector<KsURL>& urls, std::uint64_t eventID) {
