@@ -48,6 +48,13 @@ std::optional<MatchedRoot> matchRoot(std::string_view path) {
     return std::nullopt;
 }
 
+/// Numbers of another device than the roots' name nothing that is published. Entries of an open folder were asked before.
+bool isOfAnotherDevice(const KsURL& url) {
+    if (url.directory()) return false;
+    const Result<FileStatus> status = url.status();
+    return status.ok() && !RootDirectories::shared().isPublishedDevice(status->device);
+}
+
 void logMissingResource(std::string_view key, const KsError& error) {
     const LogLevel level = error.is(kKsGeneralErrorDomain, kKsFileNoSuchFileError) ? LogLevel::debug : LogLevel::error;
     logPlain(level, "can't get resource value for {}; {}", key, error.description());
@@ -120,9 +127,12 @@ void assertNumber(const NumberKind& kind, const ResourceValue& value) {
 }
 
 /// The lenient reading of an integer: leading blanks and a sign, then digits up to the first other character; 0 without
-/// digits. Saturates.
+/// digits. What is written is unsigned, so numbers beyond the signed ones keep their bits; beyond those, it saturates.
 std::int64_t lenientInteger(const std::string& text) {
-    return std::strtoll(text.c_str(), nullptr, 10);
+    errno = 0;
+    const std::int64_t number = std::strtoll(text.c_str(), nullptr, 10);
+    if (errno != ERANGE || number < 0) return number;
+    return static_cast<std::int64_t>(std::strtoull(text.c_str(), nullptr, 10));
 }
 
 }  // namespace
@@ -162,6 +172,10 @@ std::optional<TesselItemIdentifier> itemIdentifier(KsURL& url) {
     if (path == properPath(root->url->path(), rewrittenRoot)) {
         if (root->isStorage) return kTesselRootContainerItemIdentifier;
         return CdlFileObjectIdentifier::fromAppLibraryDataContainerURL(*root->url);
+    }
+    if (isOfAnotherDevice(url)) {
+        logPlain(LogLevel::debug, "can't compute file object identifier because \"{}\" is on another device", path);
+        return std::nullopt;
     }
     const bool isFolder = url.ts_isFolder();
     const NumberKind& kind = isFolder ? kFolderNumber : kDocumentNumber;

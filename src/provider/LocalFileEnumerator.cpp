@@ -131,7 +131,7 @@ void LocalFileEnumerator::enumerateItemsForObserver(std::shared_ptr<TesselEnumer
 }
 
 void LocalFileEnumerator::gather(TesselEnumerationObserver& observer, FSChangeToken incoming) {
-    const std::optional<FSChangeToken> token = gatherToken(observer, incoming);
+    std::optional<FSChangeToken> token = gatherToken(observer, incoming);
     if (!token) return;
 
     std::vector<KsURL> entries;
@@ -144,25 +144,45 @@ void LocalFileEnumerator::gather(TesselEnumerationObserver& observer, FSChangeTo
                                                      });
     if (!listed.ok()) return observer.finishEnumeratingWithError(listed.error());
     // A container that is one folder is nothing without it; of several, each is listed as far as it can be.
-    if (urls_.size() == 1 && enumerator.openError())
+    if (urls_.size() == 1 && enumerator.openError()) {
         return observer.finishEnumeratingWithError(*enumerator.openError());
+    }
 
-    Result<TesselItems> items = itemsOf(std::move(entries), token->streamEventID);
+    const std::uint64_t reached = enumerator.counter();
+    const bool isFull = reached >= token->offset && reached - token->offset == kGatherPageEntriesMax;
+    const Result<void> witnessed = witness(*token, entries, isFull);
+    if (!witnessed.ok()) return observer.finishEnumeratingWithError(witnessed.error());
+    Result<TesselItems> items = itemsOf(std::move(entries));
     if (!items.ok()) return observer.finishEnumeratingWithError(items.error());
     observer.didEnumerateItems(std::move(*items));
 
-    const std::uint64_t reached = enumerator.counter();
     if (reached < token->offset) {
         logInfo("enumerator returned an offset ({}) smaller than the initial offset {}", reached, token->offset);
         return observer.finishEnumeratingWithError(tesselErrorForExpiredPage());
     }
-    if (reached - token->offset == kGatherPageEntriesMax) {
-        FSChangeToken next = *token;
-        next.offset = reached;
-        return observer.finishEnumeratingUpToPage(next.encode());
+    if (isFull) {
+        token->offset = reached;
+        return observer.finishEnumeratingUpToPage(token->encode());
     }
     logDebug("gather phase finished for {}", urls_.front().description());
     observer.finishEnumeratingUpToPage(std::nullopt);
+}
+
+/// Keeps what the page has seen, for the question whether the next may follow. A listing that ends with its first page
+/// needs no witness.
+Result<void> LocalFileEnumerator::witness(FSChangeToken& token, const std::vector<KsURL>& entries, bool isFull) const {
+    const bool isFirst = token.offset == 0;
+    if (isFirst && !isFull) return {};
+    std::vector<const DirectoryReference*> folders;
+    for (const KsURL& entry : entries) {
+        if (folders.empty() || folders.back() != entry.directory().get()) folders.push_back(entry.directory().get());
+    }
+    if (isFirst) {
+        token.streamEventID = TRY(FSGatherWitness::shared().begin(urls_, folders));
+    } else {
+        FSGatherWitness::shared().sawFolders(urls_, token.streamEventID, folders);
+    }
+    return {};
 }
 
 std::optional<FSChangeToken> LocalFileEnumerator::gatherToken(TesselEnumerationObserver& observer,
@@ -184,7 +204,7 @@ std::optional<FSChangeToken> LocalFileEnumerator::gatherToken(TesselEnumerationO
     }
     token.version = FSChangeToken::kCurrentVersion;
     token.deviceUUID = *volume;
-    token.streamEventID = FSGatherWitness::shared().begin(urls_);
+    token.streamEventID = EventStream::currentEventID();
     return token;
 }
 
@@ -204,31 +224,28 @@ bool LocalFileEnumerator::mayResume(TesselEnumerationObserver& observer, const F
     return false;
 }
 
-Result<TesselItems> LocalFileEnumerator::itemsOf(std::vector<KsURL> entries, std::uint64_t eventID) const {
-    const DirectoryReference* seen = nullptr;
+Result<TesselItems> LocalFileEnumerator::itemsOf(std::vector<KsURL> entries) const {
+    const bool foldersOnly = container_ == kTesselAllDirectoriesContainerItemIdentifier;
     std::optional<KsError> unreadable;
     std::erase_if(entries, [&](const KsURL& entry) {
-        if (entry.directory().get() != seen)
-            FSGatherWitness::shared().sawFolder(urls_, eventID, *(seen = entry.directory().get()));
         if (entry.lastPathComponent() == kTrashName) return true;
         const Result<FileStatus> status = entry.status();
         if (!status.ok() && !status.error().isPosix(ENOENT)) {
             logError("can't read \"{}\"; {}", entry.path(), status.error().description());
             unreadable = status.error().with("path", entry.path());
         }
-        return !status.ok() || isOfAnotherDevice(entry, *status);
+        return !status.ok() || isOfAnotherDevice(entry, *status) || (foldersOnly && !entry.ts_isFolder());
     });
     // A folder that may be listed but not searched has entries of which nothing can be told: that is no empty folder.
-    if (entries.empty() && unreadable) return *unreadable;
+    // Among others, it is one that can't be read.
+    if (entries.empty() && unreadable && !listsEverythingBelow(container_)) return *unreadable;
     // Without document IDs there are no items: better no page than one that misses files.
     TRY(RvStorageManager::defaultManager().identify(entries));
 
-    const bool foldersOnly = container_ == kTesselAllDirectoriesContainerItemIdentifier;
     TesselItems items;
     items.reserve(entries.size());
     FolderContexts contexts;
     for (KsURL& entry : entries) {
-        if (foldersOnly && !entry.ts_isFolder()) continue;
         const FolderContext& context = contexts.of(entry);
         LocalItem::Customs customs;
         customs.parentItemID = context.identifier;

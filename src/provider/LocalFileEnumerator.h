@@ -56,7 +56,8 @@ private:
     /// None when the observer has been finished.
     std::optional<FSChangeToken> gatherToken(TesselEnumerationObserver& observer, FSChangeToken token);
     bool mayResume(TesselEnumerationObserver& observer, const FSChangeToken& token) const;
-    Result<TesselItems> itemsOf(std::vector<KsURL> entries, std::uint64_t eventID) const;
+    Result<void> witness(FSChangeToken& token, const std::vector<KsURL>& entries, bool isFull) const;
+    Result<TesselItems> itemsOf(std::vector<KsURL> entries) const;
 
     const TesselItemIdentifier container_;
     const std::optional<KsURL> enumeratedItemURL_;  ///< where a single folder is listed

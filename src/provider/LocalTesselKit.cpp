@@ -104,7 +104,6 @@ Result<KsURL> LocalTesselKit::urlForItem(const TesselItemIdentifier& identifier)
     customs.isOnlyLookedUp = true;
     const auto item = resolveItem(identifier, std::move(customs));
     if (!item) return tesselErrorForNonExistentItemWithIdentifier(identifier);
-    logDebug("found {}", item->fileURL()->description());
     return *item->fileURL();
 }
 
@@ -115,7 +114,10 @@ std::optional<KsURL> LocalTesselKit::URLForItemWithPersistentIdentifier(const Te
 std::optional<KsURL> LocalTesselKit::urlForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier) {
     const LogSection section("fetching URL for \"{}\"", identifier);
     Result<KsURL> url = urlForItem(identifier);
-    if (url.ok()) return *std::move(url);
+    if (url.ok()) {
+        logDebug("found {}", url->description());
+        return *std::move(url);
+    }
     if (url.error().code() == static_cast<std::int64_t>(LocalTesselKitError::itemNotFound)) {
         logDebug("can't find URL matching identifier {}; {}", identifier, url.error().description());
     } else {

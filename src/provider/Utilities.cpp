@@ -46,6 +46,16 @@ std::optional<KsError> xattrWriteFailure(std::string_view verb, std::string_view
     return error;
 }
 
+/// Makes a folder unless it is there. What is there otherwise is an error: a link or a file would lead elsewhere.
+Result<void> makeFolderIn(const KsURL& folder, std::string_view name) {
+    const UniqueFd parent = TRY(folder.open(O_PATH | O_DIRECTORY));
+    const std::string text(name);
+    if (::mkdirat(parent.get(), text.c_str(), 0700) == 0) return {};
+    const KsError error = KsError::errorWithPOSIXCode();
+    if (!error.isPosix(EEXIST) || !TRY(sys::statx(parent.get(), text.c_str())).isDirectory()) return error;
+    return {};
+}
+
 template <typename T>
 std::optional<T> typedResourceValue(const KsURL& url, ResourceKey key) {
     Result<std::optional<ResourceValue>> value = url.resourceValue(key);
@@ -155,13 +165,8 @@ KsURL temporaryLocalFolderURL() {
     static constexpr std::string_view kName = ".TemporaryLocalFolder";
     const KsURL storage = TesselManager::defaultManager().documentStorageURL();
     const KsURL folder = storage.appendingPathComponent(kName);
-    const Result<UniqueFd> parent = storage.open(O_PATH | O_DIRECTORY);
-    const bool made =
-        parent.ok() && (::mkdirat(parent->get(), std::string(kName).c_str(), 0700) == 0 || errno == EEXIST);
-    if (!made) {
-        const KsError error = parent.ok() ? KsError::errorWithPOSIXCode() : parent.error();
-        logError("can't create temporary directory; {}", error.description());
-    }
+    const Result<void> made = makeFolderIn(storage, kName);
+    if (!made.ok()) logError("can't create temporary directory; {}", made.error().description());
     return folder;
 }
 

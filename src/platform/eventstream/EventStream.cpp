@@ -13,7 +13,8 @@ std::uint64_t EventStream::currentEventID() {
 
 std::optional<KsUUID> EventStream::volumeUUID(const KsURL& url) {
     const auto store = RvStorageManager::defaultManager().store();
-    if (!store || !url.status().ok()) return std::nullopt;
+    const Result<FileStatus> status = url.status();
+    if (!store || !status.ok() || !RootDirectories::shared().isPublishedDevice(status->device)) return std::nullopt;
     return store->uuid();
 }
 

@@ -11,8 +11,7 @@ namespace cindral {
 
 /// The positions of the volume's event history.
 ///
-/// Nothing records events: the position moves on only when a listing has seen that something changed (noteChange), so
-/// that two listings between which something changed never bear the same position.
+/// Nothing records events: the position moves on only when somebody saw that something changed (noteChange).
 ///
 /// Thread safety: all operations, from any thread.
 class EventStream {
