@@ -72,6 +72,9 @@ Result<TesselItemIdentifier> Commands::identifier() const {
 Result<TesselItemIdentifier> Commands::identifierAt(const std::string& path) const {
     // An empty path names nothing, not the working folder.
     if (path.empty()) return hostFailure("no such item: the path is empty");
+    if (path.front() != '/' && context_.environment.workingFolder.empty()) {
+        return hostFailure("the working folder is gone: a path must be absolute");
+    }
     const std::string absolute = path.front() == '/' ? path : context_.environment.workingFolder + "/" + path;
     const KsURL url = KsURL::fileURL(context_.paths.presentedPath(absolute));
     auto identifier = context_.client.provider().persistentIdentifierForItemAtURL(url);

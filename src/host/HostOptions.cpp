@@ -64,7 +64,8 @@ RecorderChoice recorderOf(const std::string& name) {
 }
 
 std::string absolutePath(const std::string& path, const HostEnvironment& environment) {
-    if (path.empty()) return {};
+    // In a folder that was removed, a relative path names nothing.
+    if (path.empty() || (path.front() != '/' && environment.workingFolder.empty())) return {};
     return tidyPath(path.front() == '/' ? path : environment.workingFolder + "/" + path);
 }
 

@@ -1,5 +1,6 @@
 #include "host/PresentedPaths.h"
 
+#include <climits>
 #include <filesystem>
 
 #include "host/JsonText.h"
@@ -21,10 +22,22 @@ void eachComponent(std::string_view path, Visit visit) {
     }
 }
 
+// Trees deeper than the kernel's own limit on a path are walked in pieces; a real one has some thousand bytes more.
+constexpr std::size_t kWalkedPathMax = 65'536;
+
+bool isWalkable(std::string_view path) {
+    bool walkable = path.size() <= kWalkedPathMax;
+    eachComponent(path,
+                  [&](std::string_view component) { return walkable = walkable && component.size() <= NAME_MAX; });
+    return walkable;
+}
+
 /// The parent with its links resolved, and the last component as it is. Unchanged where the parent can't be walked.
 std::string withRealParent(const std::string& path) {
     const std::size_t slash = path.rfind('/');
     const std::string_view name = std::string_view(path).substr(slash + 1);
+    // No folder that exists has so long a path or such a component; walking it would cost many times its length.
+    if (!isWalkable(path)) return path;
     // ".." has no name of its own: the folder that it leads to has.
     const bool isWalked = name == ".." || name.empty();
     std::error_code error;

@@ -55,7 +55,8 @@ TEST_F(LocalItemTest, describesAFile) {
 TEST_F(LocalItemTest, versionFollowsModificationAndChange) {
     const std::string path = storage_.file("a.txt", "x");
     const auto version = [&] {
-        const auto view = *item("a.txt")->versionIdentifier();
+        const auto read = item("a.txt");
+        const auto view = *read->versionIdentifier();
         return Bytes(view.begin(), view.end());
     };
     const Bytes before = version();

@@ -260,6 +260,73 @@ class KindsTest(SystemTest):
         self.assertEqual(stamps(), before)
 
 
+class RestartTest(SystemTest):
+    def test_a_page_of_an_earlier_process_has_expired(self):
+        self.make_files(self.path(), 400)
+        client = self.client()
+        first = client.call("enumerateItems", container=ROOT)
+        self.assertEqual(client.finish(), 0)
+        for item in first["items"][:50]:
+            os.unlink(self.path(item["filename"]))
+        client = self.client()
+        self.assertNotEqual(client.call("enumerateItems", container=ROOT)["nextPage"], first["nextPage"])
+        self.assert_error("TesselErrorDomain", -1002, client.call, "enumerateItems", container=ROOT, page=first["nextPage"])
+        self.assertEqual(len(client.items(ROOT)), 350)
+
+    def test_other_listings_between_two_pages_do_no_harm(self):
+        for number in range(250):
+            os.mkdir(self.path("folder%d" % number))
+            for inner in range(3):
+                self.make_file("folder%d/%d" % (number, inner))
+        client = self.client()
+        first = client.call("enumerateItems", container=ROOT)
+        for item in first["items"]:
+            self.assertEqual(len(client.items(item["identifier"])), 3)
+        second = client.call("enumerateItems", container=ROOT, page=first["nextPage"])
+        self.assertEqual(len(second["items"]), 50)
+
+
+class SameAnswersTest(SystemTest):
+    def test_a_listing_and_a_lookup_say_the_same(self):
+        self.make_file("picture", contents=b"\x89PNG\r\n\x1a\n" + bytes(100))
+        self.make_file("script", contents=b"#!/bin/sh\necho\n")
+        self.make_file("text", contents=b"hello\n")
+        self.make_file("empty")
+        self.make_file("report.folio/index", contents=b"x")
+        self.make_file("folder/a.txt", contents=b"x")
+        os.symlink("text", self.path("link"))
+        client = self.client()
+        items = client.items(ROOT)
+        self.assertEqual({item["filename"]: item["typeIdentifier"] for item in items}["picture"], "image/png")
+        self.assertEqual(len(items), 7)
+        for item in items:
+            self.assertEqual(client.call("itemForIdentifier", identifier=item["identifier"]), item)
+
+    def test_a_file_with_several_names_is_one_item(self):
+        self.make_file("a", contents=b"x")
+        os.mkdir(self.path("folder"))
+        os.link(self.path("a"), self.path("b"))
+        os.link(self.path("a"), self.path("folder/c"))
+        client = self.client()
+        for _ in range(2):
+            listed = client.items(WORKING_SET)
+            identifiers = [item["identifier"] for item in listed]
+            self.assertEqual(len(listed), 2, listed)
+            self.assertEqual(len(set(identifiers)), 2)
+        name = next(item["fileURL"] for item in listed if item["identifier"].startswith("did="))
+        os.unlink(urllib.parse.unquote(name.removeprefix("file://")))
+        left = client.items(WORKING_SET)
+        self.assertEqual([item["identifier"] for item in left if item["identifier"].startswith("did=")],
+                         [identifier for identifier in identifiers if identifier.startswith("did=")])
+
+    def test_a_path_of_many_components_costs_little(self):
+        client = self.client()
+        self.assertIsNone(client.call("identifierForItemAtURL", path="/a" * 3_000_000)["identifier"])
+        with open("/proc/%d/status" % client.process.pid, encoding="ascii") as status:
+            peak = next(int(line.split()[1]) for line in status if line.startswith("VmHWM:"))
+        self.assertLess(peak, 200 * 1024, "kB")
+
+
 class MountsTest(SystemTest):
     """The system's folder of devices: it holds mounts of other file systems, and devices that must not be touched."""
 
@@ -273,6 +340,8 @@ class MountsTest(SystemTest):
         self.assertEqual(set(listed), names - mounted)
         self.assertEqual(listed["null"]["typeIdentifier"], "inode/chardevice")
         self.assertTrue(listed["null"]["identifier"].startswith("fid="))
+        for name in mounted:
+            self.assertIsNone(client.call("identifierForItemAtURL", path="/dev/" + name)["identifier"], name)
         left_out = {entry["url"] for entry in client.call("status")["coverage"] if entry["how"] == "left out"}
         self.assertEqual(left_out, {"file:///dev/" + name for name in mounted})
         self.assertEqual(client.finish(), 0)
@@ -611,6 +680,19 @@ class UnprivilegedTest(SystemTest):
         self.assertEqual(set(items), {"closed", "open"})
         self.assert_error(POSIX, errno.EACCES, client.call, "enumerateItems", container=items["closed"]["identifier"])
         self.assertEqual(set(client.named(items["open"]["identifier"])), {"y.txt"})
+
+    def test_one_folder_that_may_not_be_searched_hides_no_other(self):
+        os.mkdir(self.path("locked"))
+        for number in range(450):
+            self.make_file("locked/%d" % number)
+        for number in range(300):
+            self.make_file("open/%d" % number)
+        os.chmod(self.path("locked"), 0o444)
+        try:
+            names = [item["filename"] for item in self.unprivileged_client().items(WORKING_SET)]
+        finally:
+            os.chmod(self.path("locked"), 0o755)
+        self.assertEqual(len(names), 302)
 
     def test_a_file_that_may_not_be_read_is_listed(self):
         self.make_file("secret.txt", contents=b"123")
