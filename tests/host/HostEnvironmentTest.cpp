@@ -16,7 +16,7 @@ HostEnvironment environment(const Variables& variables, bool outputIsTerminal = 
         const auto found = variables.find(name);
         return found != variables.end() ? std::optional(found->second) : std::nullopt;
     };
-    return HostEnvironment::from(lookup, "/account", "/work", outputIsTerminal);
+    return HostEnvironment::from(lookup, "/account", "/desk", outputIsTerminal);
 }
 
 std::optional<std::string> chosen(std::string_view text) {

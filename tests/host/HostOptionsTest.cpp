@@ -15,7 +15,7 @@ HostEnvironment environment() {
     environment.home = "/nowhere/u";
     environment.configHome = "/nowhere/u/.config";
     environment.stateHome = "/nowhere/u/.local/state";
-    environment.workingFolder = "/work";
+    environment.workingFolder = "/desk";
     return environment;
 }
 
@@ -91,9 +91,9 @@ TEST(HostOptions, knowEveryCommand) {
 }
 
 TEST(HostOptions, makePathsAbsolute) {
-    EXPECT_EQ(options({"ls", "--storage", "docs/"}).storage, "/work/docs");
-    EXPECT_EQ(options({"ls", "--state", "./a//b"}).state, "/work/a/b");
-    EXPECT_THAT(options({"ls", "--apps", "one", "--apps", "/two"}).applications, ElementsAre("/work/one", "/two"));
+    EXPECT_EQ(options({"ls", "--storage", "docs/"}).storage, "/desk/docs");
+    EXPECT_EQ(options({"ls", "--state", "./a//b"}).state, "/desk/a/b");
+    EXPECT_THAT(options({"ls", "--apps", "one", "--apps", "/two"}).applications, ElementsAre("/desk/one", "/two"));
 }
 
 // What an item is called is nobody's option, command or list.
@@ -165,7 +165,7 @@ TEST(HostOptions, helpThemselves) {
 
 TEST(HostOptions, sayNothingOfFoldersWhereThereIsNoHome) {
     HostEnvironment homeless;
-    homeless.workingFolder = "/work";
+    homeless.workingFolder = "/desk";
     const auto parsed = parseHostOptions(std::vector<std::string>{"ls"}, homeless);
     EXPECT_EQ(std::get<HostOptions>(parsed).storage, "");
     EXPECT_EQ(std::get<HostOptions>(parsed).state, "");
