@@ -10,6 +10,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/foundation/Data.h"
 #include "platform/foundation/KsUUID.h"
 #include "platform/foundation/Result.h"
 
@@ -48,6 +49,11 @@ struct DocumentRecord {
     FileID fileID{};
     std::int64_t birthTime = 0;
 };
+
+// VolumeIndex.h
+struct IndexedObject;
+struct JournalEvent;
+class IndexChanges;
 
 /// How a store works. The host uses the defaults; tests ask for less room and for their own time.
 struct VolumeStoreOptions {
@@ -124,9 +130,60 @@ public:
     std::uint64_t currentEventID() const;
     Result<std::uint64_t> advanceEventID();
 
+    // The directory index and the event journal. One thread at a time changes them: the recorder's.
+
+    /// Carries the changes out, and journals what they mean, in one transaction: durable like identify(). Answers the
+    /// last event's ID.
+    ///
+    /// An object that nobody was given an identifier of departs without an event, and its own event goes with it: an
+    /// object that came and went leaves nothing behind. `roots` are where paths begin.
+    ///
+    /// After an error nothing of the call is recorded.
+    Result<std::uint64_t> apply(const IndexChanges& changes, std::span<const FileID> roots);
+
+    /// Called with an object's name borrowed for the call.
+    using ObjectReceiver = std::function<void(const IndexedObject&)>;
+    /// Calls back and answers true, or answers false when the object is unknown.
+    bool indexed(FileID fileID, const ObjectReceiver& receive) const;
+    /// Many at once, several times faster: calls back with the place of each file ID, and null for one that is unknown.
+    Result<void> indexed(std::span<const FileID> fileIDs,
+                         const std::function<void(std::size_t, const IndexedObject*)>& receive) const;
+    /// The object that is recorded under the name, also where that is one of its other names.
+    bool child(FileID parent, std::string_view name, const ObjectReceiver& receive) const;
+    /// Every object whose recorded place is in the folder, in no order. What changes meanwhile is told or not.
+    Result<void> children(FileID parent, const ObjectReceiver& receive) const;
+    std::uint64_t childCount(FileID parent) const;
+    /// The names of an object beside its recorded one.
+    struct Name {
+        FileID parent{};
+        std::string name;
+    };
+    std::vector<Name> otherNames(FileID fileID) const;
+
+    /// The attributes that a document had when they were last looked at, as given to rememberAttributes(): bytes that
+    /// the store doesn't read. Empty for none.
+    Bytes attributes(DocumentID document) const;
+    Result<void> rememberAttributes(DocumentID document, ByteView attributes);
+
+    /// Events of objects (`present` and `departed`) with an ID above `after`, oldest first, at most `max`.
+    Result<std::vector<JournalEvent>> events(std::uint64_t after, std::size_t max) const;
+    /// Events of documents, the same way.
+    Result<std::vector<JournalEvent>> documentEvents(std::uint64_t after, std::size_t max) const;
+
+    /// The smallest ID after which every event is still there; none before beginHistory().
+    std::optional<std::uint64_t> historyBegin() const;
+    /// Says that the index is complete: from the ID that it answers on, what happens is journalled. Forgets older
+    /// events.
+    Result<std::uint64_t> beginHistory();
+    /// Takes a new UUID, and forgets the events: every token of before expires.
+    Result<void> renewUUID();
+    /// Forgets the oldest events beyond the count, and those that were journalled longer ago than the age.
+    Result<void> trimJournal(std::uint64_t eventsMax, std::chrono::seconds ageMax);
+
     struct Counts {
         std::uint64_t objects = 0;
         std::uint64_t documents = 0;
+        std::uint64_t events = 0;  ///< in the journal
     };
     Counts counts() const;
 
