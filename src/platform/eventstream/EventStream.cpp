@@ -59,7 +59,11 @@ struct EventStream::State : std::enable_shared_from_this<EventStream::State> {
     }
     bool isWatched(const Event& event) const {
         if (isOfDocuments) return true;
-        return std::ranges::any_of(paths, [&](const std::string& path) { return holds(path, event.path); });
+        // What left, or is in doubt, above a path may be what the path leads through.
+        const bool isOfAncestorsToo = event.flags & (EventFlags::removed | EventFlags::mustScanSubdirectories);
+        return std::ranges::any_of(paths, [&](const std::string& path) {
+            return holds(path, event.path) || (isOfAncestorsToo && holds(event.path, path));
+        });
     }
 };
 

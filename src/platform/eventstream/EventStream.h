@@ -35,7 +35,8 @@ class EventStream {
 public:
     using Callback = std::function<void(std::span<const Event>)>;
 
-    /// Of the directories at the paths and everything below them.
+    /// Of the directories at the paths and everything below them; and of what is above them that left its place, or is
+    /// to be scanned.
     static std::shared_ptr<EventStream> create(std::vector<std::string> paths, std::uint64_t since,
                                                std::chrono::milliseconds latency, std::uint32_t creationFlags,
                                                Callback callback);
