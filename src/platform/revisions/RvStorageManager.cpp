@@ -154,6 +154,21 @@ std::uint32_t RvStorageManager::documentIDForDescriptor(int fd) {
     return static_cast<std::uint32_t>(sighting.documentID);
 }
 
+Result<std::uint32_t> RvStorageManager::permanentStorageForItem(const KsURL& url, AllocateIfNone allocate) {
+    const auto store = this->store();
+    if (!store) return KsError::posix(EAGAIN);
+    const FileStatus status = TRY(url.status());
+    if (!RootDirectories::shared().isPublishedDevice(status.device)) return KsError::posix(EXDEV);
+    const auto known = store->object(FileID{status.fileID});
+    if (known && known->birthTime == status.birthStamp() && known->documentID != DocumentID{})
+        return static_cast<std::uint32_t>(known->documentID);
+    if (allocate == AllocateIfNone::no) return KsError::posix(ENOENT);
+    const UniqueFd fd = TRY(url.open(O_PATH | O_NOFOLLOW));
+    const std::uint32_t documentID = documentIDForDescriptor(fd.get());
+    if (documentID == 0) return KsError::errorWithPOSIXCode();
+    return documentID;
+}
+
 Result<void> RvStorageManager::identify(std::vector<KsURL>& entries) {
     const auto store = this->store();
     if (!store) return KsError::posix(EAGAIN);

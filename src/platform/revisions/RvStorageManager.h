@@ -36,6 +36,12 @@ public:
     /// The document ID of the open file (O_PATH will do), given now if it has none; 0 with errno otherwise.
     virtual std::uint32_t documentIDForDescriptor(int fd);
 
+    enum class AllocateIfNone { no, yes };
+    /// The document ID of the file or package at the URL, as recorded for the object that the URL knows or finds there,
+    /// given now if it has none and one is to be allocated. Costs no system call where the URL's status is known and the
+    /// record is up to date. ENOENT where it has none, POSIX errors otherwise.
+    virtual Result<std::uint32_t> permanentStorageForItem(const KsURL& url, AllocateIfNone allocate);
+
     /// Gives entries of open folders (KsURL::child) their document IDs, and records where they were seen, in one
     /// transaction.
     ///
