@@ -35,6 +35,20 @@ std::uint64_t checkedSum(std::uint64_t a, std::uint64_t b) {
 
 }  // namespace
 
+Result<std::shared_ptr<const DirectoryReference>> describedDirectory(UniqueFd fd, std::string path,
+                                                                     const DirectoryReference* parent) {
+    auto directory = std::make_shared<DirectoryReference>();
+    directory->path = std::move(path);
+    directory->fd = std::move(fd);
+    directory->seenAt = KsDate::now();
+    directory->status = TRY(sys::statx(directory->fd.get(), ""));
+    // A sub-directory on the same device is of the same file system; asking once is enough.
+    const bool isMount = (directory->status.attributes & STATX_ATTR_MOUNT_ROOT) != 0;
+    const bool same = parent != nullptr && parent->status.device == directory->status.device && !isMount;
+    directory->traits = same ? parent->traits : sys::fileSystemTraits(directory->fd.get());
+    return std::shared_ptr<const DirectoryReference>(std::move(directory));
+}
+
 /// One enumeration: the directories that are being scanned, from the listed one down to the innermost.
 class FSDirectoryEnumerator::Scan {
 public:
@@ -104,20 +118,8 @@ private:
         return std::nullopt;
     }
 
-    /// The open directory with its status, which is taken before the first entry is read, so that a change during the
-    /// scan shows as a change since.
-    Result<std::shared_ptr<DirectoryReference>> described(Result<UniqueFd> fd, const std::string& path) const {
-        auto directory = std::make_shared<DirectoryReference>();
-        directory->path = path;
-        directory->fd = TRY(std::move(fd));
-        directory->seenAt = KsDate::now();
-        directory->status = TRY(sys::statx(directory->fd.get(), ""));
-        // A sub-directory on the same device is of the same file system; asking once is enough.
-        const DirectoryReference* parent = levels_.empty() ? nullptr : levels_.back().directory.get();
-        const bool isMount = (directory->status.attributes & STATX_ATTR_MOUNT_ROOT) != 0;
-        const bool same = parent != nullptr && parent->status.device == directory->status.device && !isMount;
-        directory->traits = same ? parent->traits : sys::fileSystemTraits(directory->fd.get());
-        return directory;
+    Result<std::shared_ptr<const DirectoryReference>> described(Result<UniqueFd> fd, const std::string& path) const {
+        return describedDirectory(TRY(std::move(fd)), path, levels_.empty() ? nullptr : levels_.back().directory.get());
     }
 
     /// The next record of the innermost directory, or null at its end.

@@ -9,6 +9,7 @@
 
 #include "platform/foundation/KsURL.h"
 #include "platform/foundation/Result.h"
+#include "platform/foundation/RootDirectories.h"
 
 namespace cindral {
 
@@ -38,6 +39,11 @@ struct EnumeratorOptions {
     FSListingPositions* positions = nullptr;
     std::string positionsKey;
 };
+
+/// An open directory with its status, which is taken before the first entry is read, so that a change during a scan shows
+/// as a change since. `parent`, where it is known, spares asking for what directories of one file system share.
+Result<std::shared_ptr<const DirectoryReference>> describedDirectory(UniqueFd fd, std::string path,
+                                                                     const DirectoryReference* parent);
 
 /// Lists the entries of directories in the order in which the file system returns them, "." and ".." left out.
 ///
