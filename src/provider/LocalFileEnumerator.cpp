@@ -1,22 +1,21 @@
 #include "provider/LocalFileEnumerator.h"
 
-#include <fmt/format.h>
-
-#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <utility>
 
+#include "platform/eventstream/EventHistory.h"
 #include "platform/eventstream/EventStream.h"
-#include "platform/foundation/InternedString.h"
 #include "platform/foundation/Log.h"
+#include "platform/foundation/ThreadPool.h"
 #include "platform/revisions/RvStorageManager.h"
-#include "platform/roster/Roster.h"
 #include "platform/tessel/TesselErrors.h"
-#include "provider/KsURL+CdlFileObjectIdentifier.h"
-#include "provider/LocalItem.h"
+#include "provider/ContainerContents.h"
+#include "provider/LocalChangesObserverContext.h"
 #include "provider/LocalTesselKitError.h"
+#include "provider/fs/FSChangesEnumerator.h"
+#include "provider/fs/FSChangesNotifier.h"
 #include "provider/fs/FSDirectoryEnumerator.h"
 #include "provider/fs/FSEventReader.h"
 #include "provider/fs/FSGatherWitness.h"
@@ -26,23 +25,11 @@ namespace cindral {
 
 namespace {
 
-constexpr std::string_view kTrashName = ".Trash";
-
-bool listsEverythingBelow(const TesselItemIdentifier& container) {
-    return container == kTesselWorkingSetContainerItemIdentifier ||
-           container == kTesselAllDirectoriesContainerItemIdentifier;
-}
-
-EnumeratorOptions enumeratorOptions(const TesselItemIdentifier& container, const std::vector<KsURL>& urls,
-                                    std::uint64_t offset) {
-    EnumeratorOptions options;
-    options.urls = urls;
-    options.recursively = listsEverythingBelow(container);
+EnumeratorOptions pageOptions(const TesselItemIdentifier& container, const std::vector<KsURL>& urls,
+                              std::uint64_t offset) {
+    EnumeratorOptions options = container_contents::scanOptions(container, urls);
     options.offset = offset;
     options.limit = kGatherPageEntriesMax;
-    options.directoryEnumerationOptionsFor = [](const KsURL&) {
-        return DirectoryEnumerationOptions::skipsPackageDescendants;
-    };
     options.positions = &FSListingPositions::shared();
     options.positionsKey = options.recursively ? "below" : "in";
     for (const KsURL& url : urls) {
@@ -52,42 +39,32 @@ EnumeratorOptions enumeratorOptions(const TesselItemIdentifier& container, const
     return options;
 }
 
-/// Below a root, what is mounted from elsewhere has numbers that name nothing here.
-bool isOfAnotherDevice(const KsURL& entry, const FileStatus& status) {
-    if (status.device == entry.directory()->status.device) return false;
-    if (RootDirectories::shared().noteLeftOut(entry.path(), "it is on another device than the storage")) {
-        logInfo("leaving out {}; it is on another device than the storage", entry.description());
-    }
-    return true;
+/// The event history, where it can tell what happened since the event.
+std::shared_ptr<EventHistory> historyAfter(std::uint64_t eventID) {
+    auto history = EventHistory::shared();
+    return history && history->canReplayAfter(eventID) ? history : nullptr;
+}
+
+/// False, after an error line, when what was complete before the call may not be in the history.
+bool drain(EventHistory& history) {
+    const ThreadPool::BlockingRegion region;
+    const Result<void> drained = history.drain();
+    if (!drained.ok()) logError("can't bring the event history up to date; {}", drained.error().description());
+    return drained.ok();
+}
+
+std::shared_ptr<FSChangesNotifier> makeNotifier(const TesselItemIdentifier& container, const std::vector<KsURL>& urls) {
+    auto notifier = FSChangesNotifier::create(container, urls);
+    if (!notifier) logError("can't watch {}; enumeration will have no live update", urls.front().description());
+    return notifier;
 }
 
 }  // namespace
 
-struct LocalFileEnumerator::FolderContext {
-    const DirectoryReference* folder = nullptr;
-    std::optional<TesselItemIdentifier> identifier;
-    InternedString bundleIdentifier;
-};
-
-/// The contexts of a page's folders, each worked out once.
-class LocalFileEnumerator::FolderContexts {
-public:
-    const FolderContext& of(const KsURL& entry) {
-        const DirectoryReference* folder = entry.directory().get();
-        // Entries of one folder mostly follow each other.
-        const auto found = std::ranges::find(contexts_.rbegin(), contexts_.rend(), folder, &FolderContext::folder);
-        if (found != contexts_.rend()) return *found;
-        FolderContext context;
-        context.folder = folder;
-        KsURL url = KsURL::of(*folder);
-        context.identifier = itemIdentifier(url);
-        if (const auto proxy = RoBundleProxy::proxyWithContaining(entry))
-            context.bundleIdentifier = InternedString(proxy->bundleIdentifier());
-        return contexts_.emplace_back(std::move(context));
-    }
-
-private:
-    std::vector<FolderContext> contexts_;
+struct LocalFileEnumerator::Gathered {
+    std::vector<KsURL> entries;
+    std::uint64_t reached = 0;
+    bool isFull = false;
 };
 
 std::shared_ptr<LocalFileEnumerator> LocalFileEnumerator::initWithContainer(TesselItemIdentifier container,
@@ -102,7 +79,13 @@ std::shared_ptr<LocalFileEnumerator> LocalFileEnumerator::initWithContainer(Tess
 LocalFileEnumerator::LocalFileEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls)
     : container_(std::move(container)),
       enumeratedItemURL_(urls.size() == 1 ? std::optional(urls.front()) : std::nullopt),
-      urls_(std::move(urls)) {}
+      urls_(std::move(urls)),
+      notifier_(makeNotifier(container_, urls_)),
+      shouldUpdateFileIDInPalimp_(container_ == kTesselWorkingSetContainerItemIdentifier) {}
+
+LocalFileEnumerator::~LocalFileEnumerator() {
+    if (notifier_) notifier_->stop();
+}
 
 std::string LocalFileEnumerator::enumeratedItemName() const {
     return enumeratedItemURL_ ? std::string(enumeratedItemURL_->lastPathComponent()) : container_;
@@ -127,32 +110,22 @@ void LocalFileEnumerator::enumerateItemsForObserver(std::shared_ptr<TesselEnumer
         pageName = token.description();
     }
     const LogSection section("enumerate items for {} with page {}", enumeratedItemName(), pageName);
+    hostEnumerates();
     gather(*observer, token);
 }
 
 void LocalFileEnumerator::gather(TesselEnumerationObserver& observer, FSChangeToken incoming) {
     std::optional<FSChangeToken> token = gatherToken(observer, incoming);
     if (!token) return;
+    Result<Gathered> gathered = gatherEntries(*token);
+    if (gathered.ok() && gathered->isFull && token->offset == 0 && settle(*token)) gathered = gatherEntries(*token);
+    if (!gathered.ok()) return observer.finishEnumeratingWithError(gathered.error());
+    const std::uint64_t reached = gathered->reached;
+    const bool isFull = gathered->isFull;
 
-    std::vector<KsURL> entries;
-    entries.reserve(kGatherPageEntriesMax);
-    FSDirectoryEnumerator enumerator;
-    const Result<void> listed = enumerator.enumerate(enumeratorOptions(container_, urls_, token->offset),
-                                                     [&entries](KsURL entry) -> Result<void> {
-                                                         entries.push_back(std::move(entry));
-                                                         return {};
-                                                     });
-    if (!listed.ok()) return observer.finishEnumeratingWithError(listed.error());
-    // A container that is one folder is nothing without it; of several, each is listed as far as it can be.
-    if (urls_.size() == 1 && enumerator.openError()) {
-        return observer.finishEnumeratingWithError(*enumerator.openError());
-    }
-
-    const std::uint64_t reached = enumerator.counter();
-    const bool isFull = reached >= token->offset && reached - token->offset == kGatherPageEntriesMax;
-    const Result<void> witnessed = witness(*token, entries, isFull);
+    const Result<void> witnessed = witness(*token, *gathered);
     if (!witnessed.ok()) return observer.finishEnumeratingWithError(witnessed.error());
-    Result<TesselItems> items = itemsOf(std::move(entries));
+    Result<TesselItems> items = itemsOf(*std::move(gathered));
     if (!items.ok()) return observer.finishEnumeratingWithError(items.error());
     observer.didEnumerateItems(std::move(*items));
 
@@ -168,13 +141,36 @@ void LocalFileEnumerator::gather(TesselEnumerationObserver& observer, FSChangeTo
     observer.finishEnumeratingUpToPage(std::nullopt);
 }
 
-/// Keeps what the page has seen, for the question whether the next may follow. A listing that ends with its first page
-/// needs no witness.
-Result<void> LocalFileEnumerator::witness(FSChangeToken& token, const std::vector<KsURL>& entries, bool isFull) const {
+Result<LocalFileEnumerator::Gathered> LocalFileEnumerator::gatherEntries(const FSChangeToken& token) const {
+    Gathered gathered;
+    gathered.entries.reserve(kGatherPageEntriesMax);
+    FSDirectoryEnumerator enumerator;
+    TRY(enumerator.enumerate(pageOptions(container_, urls_, token.offset), [&](KsURL entry) -> Result<void> {
+        gathered.entries.push_back(std::move(entry));
+        return {};
+    }));
+    // A container that is one folder is nothing without it; of several, each is listed as far as it can be.
+    if (urls_.size() == 1 && enumerator.openError()) return *enumerator.openError();
+    gathered.reached = enumerator.counter();
+    gathered.isFull = gathered.reached >= token.offset && gathered.reached - token.offset == kGatherPageEntriesMax;
+    return gathered;
+}
+
+/// Has what happened before the first page recorded, so that the pages that follow it don't take it for news. True when
+/// there was something: the listing then begins after it, with a page that is read anew.
+bool LocalFileEnumerator::settle(FSChangeToken& token) const {
+    const auto history = historyAfter(token.streamEventID);
+    if (!history || !drain(*history)) return false;
+    return std::exchange(token.streamEventID, history->currentEventID()) != token.streamEventID;
+}
+
+/// Keeps what the page has seen, for the question whether the next may follow, where no history will tell. A listing
+/// that ends with its first page needs no witness.
+Result<void> LocalFileEnumerator::witness(FSChangeToken& token, const Gathered& gathered) const {
     const bool isFirst = token.offset == 0;
-    if (isFirst && !isFull) return {};
+    if ((isFirst && !gathered.isFull) || historyAfter(token.streamEventID)) return {};
     std::vector<const DirectoryReference*> folders;
-    for (const KsURL& entry : entries) {
+    for (const KsURL& entry : gathered.entries) {
         if (folders.empty() || folders.back() != entry.directory().get()) folders.push_back(entry.directory().get());
     }
     if (isFirst) {
@@ -224,35 +220,30 @@ bool LocalFileEnumerator::mayResume(TesselEnumerationObserver& observer, const F
     return false;
 }
 
-Result<TesselItems> LocalFileEnumerator::itemsOf(std::vector<KsURL> entries) const {
-    const bool foldersOnly = container_ == kTesselAllDirectoriesContainerItemIdentifier;
+Result<TesselItems> LocalFileEnumerator::itemsOf(Gathered gathered) const {
+    std::vector<KsURL> listed;
+    std::vector<KsURL> passedOver;
     std::optional<KsError> unreadable;
-    std::erase_if(entries, [&](const KsURL& entry) {
-        if (entry.lastPathComponent() == kTrashName) return true;
+    listed.reserve(gathered.entries.size());
+    for (KsURL& entry : gathered.entries) {
+        if (container_contents::isListed(container_, entry)) {
+            listed.push_back(std::move(entry));
+            continue;
+        }
         const Result<FileStatus> status = entry.status();
         if (!status.ok() && !status.error().isPosix(ENOENT)) {
             logError("can't read \"{}\"; {}", entry.path(), status.error().description());
             unreadable = status.error().with("path", entry.path());
         }
-        return !status.ok() || isOfAnotherDevice(entry, *status) || (foldersOnly && !entry.ts_isFolder());
-    });
+        passedOver.push_back(std::move(entry));
+    }
     // A folder that may be listed but not searched has entries of which nothing can be told: that is no empty folder.
     // Among others, it is one that can't be read.
-    if (entries.empty() && unreadable && !listsEverythingBelow(container_)) return *unreadable;
-    // Without document IDs there are no items: better no page than one that misses files.
-    TRY(RvStorageManager::defaultManager().identify(entries));
-
-    TesselItems items;
-    items.reserve(entries.size());
-    FolderContexts contexts;
-    for (KsURL& entry : entries) {
-        const FolderContext& context = contexts.of(entry);
-        LocalItem::Customs customs;
-        customs.parentItemID = context.identifier;
-        customs.bundleIdentifier = context.bundleIdentifier;
-        if (auto item = LocalItem::initWithURL(std::move(entry), std::move(customs))) items.push_back(std::move(item));
-    }
-    return items;
+    if (listed.empty() && unreadable && !container_contents::isDeep(container_)) return *unreadable;
+    // The next page counts from the beginning what this one has passed over: it must be told when some of that goes,
+    // and only of what was identified is that told.
+    if (gathered.isFull && !passedOver.empty()) TRY(RvStorageManager::defaultManager().identify(passedOver));
+    return container_contents::itemsOf(std::move(listed));
 }
 
 void LocalFileEnumerator::enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,
@@ -268,9 +259,21 @@ void LocalFileEnumerator::enumerateChangesForObserver(std::shared_ptr<TesselChan
         logError("can't get volume UUID for {}", urls_.front().description());
         return observer->finishEnumeratingWithError(errorFor(LocalTesselKitError::unableToGetDeviceUUID));
     }
-    if (token->deviceUUID != *volume)
+    if (token->deviceUUID != *volume) {
         logInfo("device UUID changed ({} -> {})", token->deviceUUID.string(), volume->string());
-    observer->finishEnumeratingWithError(tesselErrorForExpiredPage());
+        return observer->finishEnumeratingWithError(tesselErrorForExpiredPage());
+    }
+    hostEnumerates();
+    const auto context = std::make_shared<LocalChangesObserverContext>(std::move(observer), shared_from_this(),
+                                                                       shouldUpdateFileIDInPalimp_);
+    const auto enumerator =
+        FSChangesEnumerator::create(container_, urls_, context, *token, EventStream::currentEventID());
+    context->setFSChangesEnumerator(enumerator);
+    {
+        const MutexLock lock(mutex_);
+        enumerators_.insert(enumerator);
+    }
+    enumerator->start();
 }
 
 void LocalFileEnumerator::currentSyncAnchorWithCompletionHandler(
@@ -280,10 +283,43 @@ void LocalFileEnumerator::currentSyncAnchorWithCompletionHandler(
         logError("can't get volume UUID for \"{}\"", urls_.front().description());
         return completion(std::nullopt);
     }
+    // Behind everything that the client can have seen; behind a first reading, too, before which nothing can be
+    // replayed.
+    if (const auto history = EventHistory::shared()) drain(*history);
     FSChangeToken token;
     token.deviceUUID = *volume;
     token.streamEventID = EventStream::currentEventID();
     completion(token.encode());
+}
+
+void LocalFileEnumerator::removeEnumerator(const std::shared_ptr<FSChangesEnumerator>& enumerator) {
+    const MutexLock lock(mutex_);
+    enumerators_.erase(enumerator);
+}
+
+void LocalFileEnumerator::hostEnumerates() const {
+    if (notifier_) notifier_->hostDidEnumerate();
+}
+
+void LocalFileEnumerator::start() {
+    if (!notifier_) return;
+    notifier_->setClient(weak_from_this());
+    notifier_->start();
+}
+
+void LocalFileEnumerator::stop() {
+    if (notifier_) notifier_->stop();
+    std::set<std::shared_ptr<FSChangesEnumerator>> running;
+    {
+        const MutexLock lock(mutex_);
+        running = enumerators_;
+    }
+    // Each takes itself out when its observer has been finished.
+    for (const auto& enumerator : running) enumerator->stop();
+}
+
+void LocalFileEnumerator::invalidate() {
+    stop();
 }
 
 }  // namespace cindral

@@ -3,65 +3,85 @@
 #include <cstdint>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
 #include "platform/foundation/KsURL.h"
+#include "platform/foundation/Mutex.h"
 #include "platform/tessel/TesselEnumerator.h"
 #include "provider/fs/FSChangeToken.h"
 
 namespace cindral {
 
+class FSChangesEnumerator;
+class FSChangesNotifier;
+
 /// Entries that one page of a listing consumes.
 inline constexpr std::uint64_t kGatherPageEntriesMax = 200;
 
-/// Lists what is in one or several folders, a page at a time, and says where a client stands.
+/// Lists what is in one or several folders, a page at a time, says where a client stands, and tells what has changed
+/// since.
 ///
 /// A page is consumed in directory order, also where the host asks for another: both initial pages list alike. A page
-/// that follows is served only while it is proven that nothing changed since the first; otherwise the listing expires,
-/// and the host begins again.
+/// that follows is served only while it is proven that nothing was deleted since the first; otherwise the listing
+/// expires, and the host begins again. A listing waits for nothing that is not yet recorded, except that the first page
+/// of several waits until what happened before it is; an anchor and changes wait for all that was complete before they
+/// were asked for.
 ///
-/// What each container lists: the working set everything below its folders, not descending into packages; all
-/// directories the plain folders among that; every other container the direct children of its folders. Never an entry
-/// named ".Trash".
+/// What each container lists: ContainerContents.h.
 ///
-/// Thread safety: all operations, from any thread. Pages are served on the caller's thread.
-class LocalFileEnumerator : public TesselEnumerator {
+/// Thread safety: all operations, from any thread. Pages are served on the caller's thread, changes on a queue.
+class LocalFileEnumerator : public TesselEnumerator, public std::enable_shared_from_this<LocalFileEnumerator> {
 public:
-    /// An empty list of URLs is a programming error and stops the process.
+    /// An empty list of URLs is a programming error and stops the process. Where there can be no live updates, an error
+    /// line says so, and everything else works.
     static std::shared_ptr<LocalFileEnumerator> initWithContainer(TesselItemIdentifier container,
                                                                   std::vector<KsURL> urls);
+    ~LocalFileEnumerator() override;
 
     const TesselItemIdentifier& container() const { return container_; }
     const std::vector<KsURL>& urls() const { return urls_; }
+    /// Null where there are no live updates.
+    const std::shared_ptr<FSChangesNotifier>& notifier() const { return notifier_; }
 
     void enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer,
                                    const TesselPage& page) override;
-    /// No event history is kept: after the checks of the anchor, every anchor is answered as expired, never as "no
-    /// changes".
     void enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,
                                      const TesselSyncAnchor& anchor) override;
     void currentSyncAnchorWithCompletionHandler(
         std::function<void(std::optional<TesselSyncAnchor>)> completion) override;
-    void invalidate() override {}
+    /// Lets go of a change enumeration that has ended.
+    void removeEnumerator(const std::shared_ptr<FSChangesEnumerator>& enumerator);
+
+    void start() override;
+    void stop() override;
+    void invalidate() override;
 
 private:
-    /// What the items of one folder have in common.
-    struct FolderContext;
-    class FolderContexts;
-
     LocalFileEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls);
     std::string enumeratedItemName() const;
+    void hostEnumerates() const;
     void gather(TesselEnumerationObserver& observer, FSChangeToken token);
     /// None when the observer has been finished.
     std::optional<FSChangeToken> gatherToken(TesselEnumerationObserver& observer, FSChangeToken token);
     bool mayResume(TesselEnumerationObserver& observer, const FSChangeToken& token) const;
-    Result<void> witness(FSChangeToken& token, const std::vector<KsURL>& entries, bool isFull) const;
-    Result<TesselItems> itemsOf(std::vector<KsURL> entries) const;
+    /// One page's scan of the folders.
+    struct Gathered;
+    Result<Gathered> gatherEntries(const FSChangeToken& token) const;
+    bool settle(FSChangeToken& token) const;
+    Result<void> witness(FSChangeToken& token, const Gathered& gathered) const;
+    Result<TesselItems> itemsOf(Gathered gathered) const;
 
+    // Constant after construction.
     const TesselItemIdentifier container_;
     const std::optional<KsURL> enumeratedItemURL_;  ///< where a single folder is listed
     const std::vector<KsURL> urls_;
+    const std::shared_ptr<FSChangesNotifier> notifier_;
+    const bool shouldUpdateFileIDInPalimp_;
+
+    Mutex mutex_;
+    std::set<std::shared_ptr<FSChangesEnumerator>> enumerators_ GUARDED_BY(mutex_);
 };
 
 }  // namespace cindral

@@ -51,8 +51,21 @@ void LocalRootEnumerator::currentSyncAnchorWithCompletionHandler(
     localFileEnumerator_->currentSyncAnchorWithCompletionHandler(std::move(completion));
 }
 
+void LocalRootEnumerator::start() {
+    if (!setRunning(true)) localFileEnumerator_->start();
+}
+
+void LocalRootEnumerator::stop() {
+    if (setRunning(false)) localFileEnumerator_->stop();
+}
+
+bool LocalRootEnumerator::setRunning(bool isRunning) {
+    const MutexLock lock(mutex_);
+    return std::exchange(isRunning_, isRunning);
+}
+
 void LocalRootEnumerator::invalidate() {
-    localFileEnumerator_->invalidate();
+    stop();
 }
 
 }  // namespace cindral

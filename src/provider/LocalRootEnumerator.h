@@ -2,6 +2,7 @@
 
 #include <memory>
 
+#include "platform/foundation/Mutex.h"
 #include "platform/foundation/SerialQueue.h"
 #include "platform/tessel/TesselEnumerator.h"
 #include "provider/LocalFileEnumerator.h"
@@ -23,15 +24,21 @@ public:
                                      const TesselSyncAnchor& anchor) override;
     void currentSyncAnchorWithCompletionHandler(
         std::function<void(std::optional<TesselSyncAnchor>)> completion) override;
+    void start() override;
+    void stop() override;
     void invalidate() override;
 
     const TesselItemIdentifier& container() const { return container_; }
 
 private:
     explicit LocalRootEnumerator(TesselItemIdentifier container);
+    /// Answers what it was before.
+    bool setRunning(bool isRunning);
 
     const TesselItemIdentifier container_;
     const std::shared_ptr<LocalFileEnumerator> localFileEnumerator_;
+    Mutex mutex_;
+    bool isRunning_ GUARDED_BY(mutex_) = false;
     SerialQueue enumQueue_{"cindral.root-enumerator.queue"};  // Last: its tasks use what stands above.
 };
 

@@ -165,7 +165,9 @@ Result<std::shared_ptr<TesselEnumerator>> LocalTesselKit::enumeratorForContainer
         return std::shared_ptr<TesselEnumerator>(LocalRootEnumerator::initWithContainer(container));
     }
     KsURL url = TRY(urlForItem(container));
-    return std::shared_ptr<TesselEnumerator>(LocalFileEnumerator::initWithContainer(container, {std::move(url)}));
+    auto enumerator = LocalFileEnumerator::initWithContainer(container, {std::move(url)});
+    enumerator->start();
+    return std::shared_ptr<TesselEnumerator>(std::move(enumerator));
 }
 
 void LocalTesselKit::providePlaceholderAtURL(const KsURL& /*url*/, Completion completion) {

@@ -106,6 +106,8 @@ public:
 
     std::atomic<int> enumeratorsMade = 0;
     std::atomic<int> enumeratorsInvalidated = 0;
+    std::atomic<int> enumeratorsStarted = 0;
+    std::atomic<int> enumeratorsStopped = 0;
     std::vector<std::string> askedURLs;
 
     std::optional<KsURL> URLForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier) override {
@@ -174,6 +176,8 @@ public:
         const ByteView bytes = bytesOf(container_);
         completion(container_ == "fid=noanchor" ? std::nullopt : std::optional(Bytes(bytes.begin(), bytes.end())));
     }
+    void start() override { ++provider_->enumeratorsStarted; }
+    void stop() override { ++provider_->enumeratorsStopped; }
     void invalidate() override { ++provider_->enumeratorsInvalidated; }
 
 private:

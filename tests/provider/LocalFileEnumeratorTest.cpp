@@ -1,5 +1,6 @@
 #include "provider/LocalFileEnumerator.h"
 
+#include <fmt/format.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -8,9 +9,10 @@
 
 #include "platform/eventstream/EventStream.h"
 #include "platform/foundation/Dispatch.h"
+#include "provider/HistoryFixture.h"
 #include "provider/KsURL+CdlFileObjectIdentifier.h"
 #include "provider/LocalTesselKitError.h"
-#include "provider/ProviderFixture.h"
+#include "provider/fs/FSListingPositions.h"
 
 namespace cindral::test {
 namespace {
@@ -398,32 +400,142 @@ TEST_F(LocalFileEnumeratorTest, manyListingsAreWatchedAtOnce) {
     EXPECT_FALSE(page(*listed, *first.next).error);
 }
 
-class ChangeObserver : public TesselChangeObserver {
-public:
-    void didUpdateItems(TesselItems items) override { updates += items.size(); }
-    void didDeleteItemsWithIdentifiers(std::vector<TesselItemIdentifier> identifiers) override {
-        deletions += identifiers.size();
-    }
-    void finishEnumeratingChangesUpToSyncAnchor(TesselSyncAnchor /*anchor*/, bool /*moreComing*/) override {
-        finished = true;
-    }
-    void finishEnumeratingWithError(const KsError& given) override { error = given; }
-    std::size_t updates = 0;
-    std::size_t deletions = 0;
-    bool finished = false;
-    std::optional<KsError> error;
-};
-
 // Nobody records events: that nothing changed can't be promised, so it is not.
 TEST_F(LocalFileEnumeratorTest, everyAnchorIsExpiredWhileNoHistoryIsKept) {
     const auto listed = enumerator();
-    for (const TesselSyncAnchor& anchor : {anchorOf(*listed).encode(), Bytes()}) {
-        const auto observer = std::make_shared<ChangeObserver>();
+    FSChangeToken elsewhere = anchorOf(*listed);
+    elsewhere.deviceUUID = KsUUID::random();
+    for (const TesselSyncAnchor& anchor : {anchorOf(*listed).encode(), elsewhere.encode(), Bytes()}) {
+        const auto observer = std::make_shared<RecordingChangeObserver>();
         listed->enumerateChangesForObserver(observer, anchor);
-        EXPECT_FALSE(observer->finished);
-        ASSERT_TRUE(observer->error);
-        EXPECT_TRUE(observer->error->is("TesselErrorDomain", -1002));
+        const GivenChanges& given = observer->wait();
+        ASSERT_TRUE(given.error);
+        EXPECT_TRUE(given.error->is("TesselErrorDomain", -1002));
+        EXPECT_TRUE(given.log.empty());
     }
+    EXPECT_EQ(log_.count("[ERROR] can't create change token from anchor data, resetting"), 1U);
+    EXPECT_EQ(log_.count("[INFO] device UUID changed ("), 1U);
+}
+
+TEST_F(LocalFileEnumeratorTest, withoutAStoreThereAreNoChanges) {
+    const auto listed = enumerator();
+    const TesselSyncAnchor anchor = anchorOf(*listed).encode();
+    RvStorageManager::defaultManager().setStore(nullptr);
+    const auto observer = std::make_shared<RecordingChangeObserver>();
+    listed->enumerateChangesForObserver(observer, anchor);
+    EXPECT_EQ(observer->wait().error, errorFor(LocalTesselKitError::unableToGetDeviceUUID));
+    EXPECT_TRUE(enumerator()->notifier() == nullptr);
+    EXPECT_TRUE(log_.containsPart(LogLevel::error, "; enumeration will have no live update"));
+}
+
+// With a history.
+
+class GatherWithHistoryTest : public HistoryTest {
+protected:
+    std::shared_ptr<LocalFileEnumerator> enumerator() {
+        return LocalFileEnumerator::initWithContainer(kTesselRootContainerItemIdentifier, {storageURL()});
+    }
+    void files(int count) {
+        for (int i = 0; i < count; ++i) storage_.file("file" + std::to_string(i));
+    }
+    static FSChangeToken tokenOf(const ListedPage& page) { return *FSChangeToken::decode(*page.next); }
+};
+
+TEST_F(GatherWithHistoryTest, aPageGoesOnAfterWhatCameAndChanged) {
+    files(250);
+    const auto listed = enumerator();
+    const ListedPage first = firstPage(*listed);
+    EXPECT_EQ(tokenOf(first).streamEventID, history_->currentEventID());
+    storage_.file("new");
+    made("new");
+    const ListedPage second = page(*listed, *first.next);
+    EXPECT_FALSE(second.error);
+    EXPECT_TRUE(log_.contains(LogLevel::debug, fmt::format("[DEBUG] safe to resume gather phase from FSEventID {}",
+                                                           tokenOf(first).streamEventID)));
+}
+
+TEST_F(GatherWithHistoryTest, aPageExpiresAfterADeletion) {
+    files(250);
+    const auto listed = enumerator();
+    const ListedPage first = firstPage(*listed);
+    remove("file17");
+    const ListedPage second = page(*listed, *first.next);
+    ASSERT_TRUE(second.error);
+    EXPECT_TRUE(second.error->is("TesselErrorDomain", -1002));
+    EXPECT_TRUE(log_.contains(LogLevel::info,
+                              "[INFO] deletion of " + (storage_ / "file17") + " requires to re-gather from scratch"));
+}
+
+TEST_F(GatherWithHistoryTest, aPageOutlivesItsProcess) {
+    files(450);
+    const ListedPage first = firstPage(*enumerator());
+    FSListingPositions::shared().removeAll();
+    reopenStore();
+    const ListedPage second = page(*enumerator(), *first.next);
+    EXPECT_FALSE(second.error);
+    EXPECT_EQ(second.items.size(), 200U);
+}
+
+// What was deleted before a listing began, and not yet recorded then, doesn't expire it.
+TEST_F(GatherWithHistoryTest, aListingBeginsAfterWhatHappenedBefore) {
+    files(250);
+    const std::uint64_t gone = fileID("file17");
+    ASSERT_EQ(::unlink((storage_ / "file17").c_str()), 0);
+    history_->onDrain([&]() -> Result<void> {
+        history_->onDrain(nullptr);
+        left("file17", gone);
+        return {};
+    });
+    const auto listed = enumerator();
+    EXPECT_EQ(all(*listed).size(), 249U);
+}
+
+TEST_F(GatherWithHistoryTest, onePageWaitsForNothing) {
+    files(20);
+    EXPECT_EQ(all(*enumerator()).size(), 20U);
+    EXPECT_EQ(history_->drains(), 0);
+}
+
+// The first reading of the store is still under way: nothing can be replayed, and listings wait for nothing.
+TEST_F(GatherWithHistoryTest, listingsGoOnBeforeThereIsAHistory) {
+    files(450);
+    history_->trim(UINT64_MAX);
+    const auto listed = enumerator();
+    EXPECT_EQ(all(*listed).size(), 450U);
+    const ListedPage first = firstPage(*listed);
+    history_->setCurrent(tokenOf(first).streamEventID + 10);
+    history_->trim(tokenOf(first).streamEventID + 10);
+    EXPECT_FALSE(page(*listed, *first.next).error) << "also when there is one meanwhile";
+    EXPECT_EQ(history_->drains(), 0);
+    storage_.file("new");
+    EXPECT_TRUE(page(*listed, *first.next).error) << "what can't be replayed is held to what was seen";
+}
+
+// Nothing that a page has passed over goes without being told: the next one counts it.
+TEST_F(GatherWithHistoryTest, whatIsPassedOverIsIdentifiedToo) {
+    files(150);
+    for (int i = 0; i < 150; ++i) storage_.folder("folder" + std::to_string(i));
+    storage_.file(".Trash/x");
+    const auto directories =
+        LocalFileEnumerator::initWithContainer(kTesselAllDirectoriesContainerItemIdentifier, {storageURL()});
+    const TesselSyncAnchor anchor = *firstPage(*directories).next;
+    std::size_t known = 0;
+    for (int i = 0; i < 150; ++i) known += store_->object(FileID{fileID("file" + std::to_string(i))}) ? 1 : 0;
+    for (int i = 0; i < 150; ++i) known += store_->object(FileID{fileID("folder" + std::to_string(i))}) ? 1 : 0;
+    known += store_->object(FileID{fileID(".Trash")}) ? 1 : 0;
+    EXPECT_GE(known, 199U) << "all but what is below .Trash";
+}
+
+TEST_F(GatherWithHistoryTest, anAnchorIsBehindWhatHappenedBefore) {
+    storage_.file("a.txt");
+    history_->onDrain([&]() -> Result<void> {
+        changed("a.txt");
+        return {};
+    });
+    const FSChangeToken anchor = *FSChangeToken::decode(anchorOf(*enumerator()));
+    history_->onDrain(nullptr);
+    EXPECT_EQ(anchor.streamEventID, history_->currentEventID());
+    EXPECT_EQ(anchor.offset, 0U);
 }
 
 }  // namespace

@@ -47,6 +47,11 @@ public:
                                              const TesselSyncAnchor& anchor) = 0;
     virtual void currentSyncAnchorWithCompletionHandler(
         std::function<void(std::optional<TesselSyncAnchor>)> completion) = 0;
+    /// From start() to stop(), the container is signalled through the manager when something in it changes. stop() also
+    /// ends the change enumerations that are under way, with an error.
+    virtual void start() = 0;
+    virtual void stop() = 0;
+    /// stop(), for the last time.
     virtual void invalidate() = 0;
 };
 

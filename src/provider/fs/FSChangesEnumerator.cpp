@@ -1,0 +1,471 @@
+#include "provider/fs/FSChangesEnumerator.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <charconv>
+#include <utility>
+
+#include "platform/foundation/Fatal.h"
+#include "platform/foundation/Log.h"
+#include "platform/foundation/ThreadPool.h"
+#include "platform/revisions/RvStorageManager.h"
+#include "platform/roster/Roster.h"
+#include "platform/tessel/TesselErrors.h"
+#include "provider/ContainerContents.h"
+#include "provider/KsURL+CdlFileObjectIdentifier.h"
+#include "provider/Utilities.h"
+
+namespace cindral {
+
+namespace {
+
+// Times that an object which is not where the store says is looked for again, each time with the store up to date.
+constexpr int kLooksMax = 5;
+// Entries of a scan that are made items of together.
+constexpr std::size_t kScanEntriesMax = 200;
+
+constexpr std::string_view kFilePrefix = "fid=";
+
+std::uint64_t checkedSum(std::uint64_t a, std::uint64_t b) {
+    std::uint64_t sum = 0;
+    if (__builtin_add_overflow(a, b, &sum)) fatal("the number of changes overflows");
+    return sum;
+}
+
+std::uint64_t numberOf(const TesselItemIdentifier& identifier) {
+    std::uint64_t number = 0;
+    const std::size_t begin = kFilePrefix.size();
+    std::from_chars(identifier.data() + begin, identifier.data() + identifier.size(), number);
+    return number;
+}
+
+bool isFileIdentifier(const TesselItemIdentifier& identifier) {
+    return identifier.starts_with(kFilePrefix);
+}
+
+/// The object that an identifier stands for, by the store's records.
+struct RecordedObject {
+    FileID fileID{};
+    std::optional<std::int64_t> birthTime;  ///< where only the object of that birth is meant
+};
+
+std::optional<RecordedObject> recordedObjectOf(const TesselItemIdentifier& identifier) {
+    if (isFileIdentifier(identifier)) return RecordedObject{FileID{numberOf(identifier)}, std::nullopt};
+    const auto store = RvStorageManager::defaultManager().store();
+    const auto document =
+        store ? store->document(DocumentID{static_cast<std::uint32_t>(numberOf(identifier))}) : std::nullopt;
+    if (!document) return std::nullopt;
+    return RecordedObject{document->fileID, document->birthTime};
+}
+
+/// Whether it is the object and not another that has its number or its place.
+bool isObject(const RecordedObject& object, const FileStatus& status) {
+    return FileID{status.fileID} == object.fileID && (!object.birthTime || status.birthStamp() == *object.birthTime);
+}
+
+Result<void> drainHistory() {
+    const auto history = EventHistory::shared();
+    if (!history) return KsError::posix(ENODEV);
+    const ThreadPool::BlockingRegion region;
+    return history->drain();
+}
+
+}  // namespace
+
+struct FSChangesEnumerator::Answer {
+    enum class Kind {
+        listed,         ///< under the identifier that was asked for
+        notListed,      ///< not at all, or under another
+        passedThrough,  ///< itself not, but what is below it
+        moving,         ///< it is not where the store says
+    };
+    Kind kind = Kind::notListed;
+    std::shared_ptr<const TesselItem> item;  ///< of what is there, also where it is listed under another identifier
+    std::string path;
+};
+
+std::shared_ptr<FSChangesEnumerator> FSChangesEnumerator::create(TesselItemIdentifier container,
+                                                                 std::vector<KsURL> urls,
+                                                                 std::shared_ptr<TesselChangeObserver> observer,
+                                                                 FSChangeToken token, std::uint64_t currentEventID) {
+    if (urls.empty()) fatal("require at least one URL to init a change enumerator");
+    return std::shared_ptr<FSChangesEnumerator>(new FSChangesEnumerator(
+        std::move(container), std::move(urls), std::move(observer), std::move(token), currentEventID));
+}
+
+FSChangesEnumerator::FSChangesEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls,
+                                         std::shared_ptr<TesselChangeObserver> observer, FSChangeToken token,
+                                         std::uint64_t currentEventID)
+    : container_(std::move(container)),
+      urls_(std::move(urls)),
+      observer_(std::move(observer)),
+      receivedToken_(token),
+      sinceFSEventID_(token.streamEventID),
+      startupFSEventID_(currentEventID),
+      places_(placesOf(urls_)),
+      currentToken_(std::move(token)) {}
+
+std::vector<FSChangesEnumerator::Place> FSChangesEnumerator::placesOf(const std::vector<KsURL>& urls) {
+    std::vector<Place> places;
+    for (const KsURL& url : urls) {
+        // What the URL has cached says nothing of now.
+        const Result<FileStatus> status = KsURL::fileURL(url.path()).status();
+        places.push_back(status.ok() ? Place(std::pair(status->device, status->fileID)) : std::nullopt);
+    }
+    return places;
+}
+
+std::shared_ptr<FSEventReader> FSChangesEnumerator::makeReader(FSEventReaderMode mode, bool verbose) {
+    auto reader = FSEventReader::create(urls_, mode, verbose, sinceFSEventID_);
+    reader->setDelegate(weak_from_this());
+    return reader;
+}
+
+void FSChangesEnumerator::start() {
+    std::shared_ptr<FSEventReader> reader;
+    {
+        const MutexLock lock(mutex_);
+        if (isOver_ || reader_) return;
+        reader_ = reader = makeReader(FSEventReaderMode::pathBased, /*verbose=*/false);
+    }
+    reader->start();
+}
+
+void FSChangesEnumerator::stop() {
+    std::shared_ptr<FSEventReader> reader;
+    {
+        const MutexLock lock(mutex_);
+        if (isOver_ || !reader_) return;
+        isOver_ = true;
+        reader = reader_;
+    }
+    reader->stop();
+    // Behind what is forwarded now: nothing follows the end.
+    reader->async(
+        [self = shared_from_this()] { self->observer_->finishEnumeratingWithError(KsError::posix(ECANCELED)); });
+}
+
+// What is listed.
+
+FSChangesEnumerator::Identifiers FSChangesEnumerator::identifiersOf(const Event& event) const {
+    Identifiers identifiers;
+    if (event.fileID == FileID{}) return identifiers;
+    identifiers.push_back(CdlFileObjectIdentifier::fromFileID(static_cast<std::uint64_t>(event.fileID)));
+    const auto add = [&](DocumentID documentID) {
+        auto identifier = CdlFileObjectIdentifier::fromDocumentID(static_cast<std::uint32_t>(documentID));
+        if (documentID != DocumentID{} && std::ranges::find(identifiers, identifier) == identifiers.end())
+            identifiers.push_back(std::move(identifier));
+    };
+    add(event.documentID);
+    const auto store = RvStorageManager::defaultManager().store();
+    if (const auto object = store ? store->object(event.fileID) : std::nullopt) add(object->documentID);
+    return identifiers;
+}
+
+Result<FSChangesEnumerator::Answer> FSChangesEnumerator::ask(FSEventReader& reader,
+                                                             const TesselItemIdentifier& identifier) {
+    std::string before;
+    for (int looks = 1;; ++looks) {
+        Answer answer = TRY(askOnce(reader, identifier));
+        if (answer.kind != Answer::Kind::moving) return answer;
+        const bool isStill = std::exchange(before, answer.path) == answer.path;
+        if (looks == kLooksMax) {
+            // What the store keeps saying of an object that isn't there is wrong; what it says anew may be right soon.
+            if (isStill) answer.kind = Answer::Kind::notListed;
+            return answer;
+        }
+        TRY(drainHistory());
+        reader.entryFinder().forget();
+    }
+}
+
+/// By the store's records, which are complete while events are recorded: to look for a number that nothing has any more
+/// below all the roots would cost what the tree costs.
+Result<FSChangesEnumerator::Answer> FSChangesEnumerator::askOnce(FSEventReader& reader,
+                                                                 const TesselItemIdentifier& identifier) {
+    const std::optional<RecordedObject> object = recordedObjectOf(identifier);
+    std::optional<std::string> path = object ? recordedPathOf(object->fileID) : std::nullopt;
+    if (!path || !container_contents::covers(container_, urls_, *path)) return Answer{};
+    FSFoundEntry found = TRY(reader.entryFinder().find(*path));
+    if (found.standing == FSFoundEntry::Standing::outside) return Answer{};
+    if (found.standing == FSFoundEntry::Standing::missing || !isObject(*object, TRY(found.url->status())))
+        return Answer{Answer::Kind::moving, nullptr, *std::move(path)};
+    return answerOf(*std::move(found.url), identifier);
+}
+
+Result<FSChangesEnumerator::Answer> FSChangesEnumerator::answerOf(KsURL entry, const TesselItemIdentifier& identifier) {
+    Answer answer;
+    answer.path = entry.path();
+    const bool isEntered = container_contents::isDeep(container_) && entry.ts_isFolder();
+    if (container_contents::isListed(container_, entry)) {
+        std::vector<KsURL> entries;
+        entries.push_back(std::move(entry));
+        TesselItems items = TRY(container_contents::itemsOf(std::move(entries)));
+        if (!items.empty()) answer.item = std::move(items.front());
+    }
+    if (answer.item && answer.item->itemIdentifier() == identifier) {
+        answer.kind = Answer::Kind::listed;
+    } else if (!answer.item && isEntered) {
+        answer.kind = Answer::Kind::passedThrough;
+    }
+    return answer;
+}
+
+/// Whether the items below a folder that moved are others now: in the trash or out of it, or another application's. No
+/// event tells of them, because nothing happened to them.
+bool FSChangesEnumerator::changesWhatIsBelow(const Event& event, const Answer& moved) const {
+    if (!(event.flags & EventFlags::removed) || !container_contents::isDeep(container_)) return false;
+    const KsURL* now = moved.item->fileURL();
+    if (!now->ts_isFolder()) return false;
+    const KsURL before = KsURL::fileURL(event.path);
+    return isInTrash(before) != isInTrash(*now) ||
+           RoBundleProxy::proxyWithContaining(before) != RoBundleProxy::proxyWithContaining(*now);
+}
+
+void FSChangesEnumerator::askAbout(FSEventReader& reader, const Event& event, const Identifiers& identifiers,
+                                   Changes changes) {
+    std::vector<std::shared_ptr<const TesselItem>> seen;
+    for (const TesselItemIdentifier& identifier : identifiers) {
+        if (container_contents::isOfFoldersOnly(container_) && !isFileIdentifier(identifier)) {
+            logDebug("dropping fsevent at {}; item is not a directory", event.path);
+            continue;
+        }
+        const auto known = std::ranges::find(seen, identifier, [](const auto& item) { return item->itemIdentifier(); });
+        if (known != seen.end()) {
+            changes.changes.emplace_back(*known);
+            continue;
+        }
+        Result<Answer> answer = ask(reader, identifier);
+        if (!answer.ok()) return endWithError(reader, answer.error());
+        if (answer->item) seen.push_back(answer->item);
+        switch (answer->kind) {
+            case Answer::Kind::listed:
+                changes.changes.emplace_back(answer->item);
+                if (changesWhatIsBelow(event, *answer)) changes.foldersToScan.push_back(answer->path);
+                break;
+            case Answer::Kind::notListed: changes.changes.emplace_back(identifier); break;
+            case Answer::Kind::passedThrough:
+                // It was listed under the name that it left. What is in it is still listed, and a client takes it out
+                // together with the folder.
+                if (!(event.flags & EventFlags::removed)) break;
+                changes.changes.emplace_back(identifier);
+                changes.foldersToScan.push_back(answer->path);
+                break;
+            case Answer::Kind::moving: return askAgain(reader);
+        }
+    }
+    forwardEvent(reader, event, changes);
+}
+
+FSEventReaderDelegate::LookFurther FSChangesEnumerator::readerDidReceiveEvent(FSEventReader& reader, const Event& event,
+                                                                              std::string_view path) {
+    reader.assertOnQueue();
+    if (path.empty() || container_contents::covers(container_, urls_, path)) return LookFurther::yes;
+    logDebug("dropping fsevent at {}; URL is not directly in the container (eventID: {})", path, event.id);
+    return LookFurther::no;
+}
+
+bool FSChangesEnumerator::readerShouldMakeItem(FSEventReader& reader, const Event& /*event*/, const KsURL& entry) {
+    reader.assertOnQueue();
+    if (container_contents::isListed(container_, entry)) return true;
+    if (container_contents::isOfFoldersOnly(container_) && !entry.ts_isFolder())
+        logDebug("dropping fsevent at {}; item is not a directory", entry.path());
+    return false;
+}
+
+void FSChangesEnumerator::readerDidUpdateItem(FSEventReader& reader, const Event& event,
+                                              const TesselItemIdentifier& identifier,
+                                              const std::shared_ptr<const TesselItem>& item) {
+    reader.assertOnQueue();
+    // Of a document, what is at its file may be another one by now.
+    if (reader.mode() == FSEventReaderMode::docIDBased && item->itemIdentifier() != identifier)
+        return askAbout(reader, event, {identifier});
+    Changes changes;
+    changes.changes.emplace_back(item);
+    // A folder that was a package was a document.
+    Identifiers others;
+    if (isFileIdentifier(item->itemIdentifier())) others = identifiersOf(event);
+    std::erase(others, item->itemIdentifier());
+    askAbout(reader, event, others, std::move(changes));
+}
+
+void FSChangesEnumerator::readerDidDeleteItem(FSEventReader& reader, const Event& event,
+                                              const TesselItemIdentifier& identifier) {
+    reader.assertOnQueue();
+    readerDidDropEvent(reader, event, identifier);
+}
+
+void FSChangesEnumerator::readerDidDropEvent(FSEventReader& reader, const Event& event,
+                                             const TesselItemIdentifier& identifier) {
+    reader.assertOnQueue();
+    const bool isOfDocument = reader.mode() == FSEventReaderMode::docIDBased;
+    askAbout(reader, event, isOfDocument ? Identifiers{identifier} : identifiersOf(event));
+}
+
+void FSChangesEnumerator::readerMustScan(FSEventReader& reader, const Event& event) {
+    reader.assertOnQueue();
+    // What went from a package's folders can't be told: the client lists again.
+    if (reader.isEnclosingPackage(event.path)) return readerDidLoseEvents(reader, event);
+    Changes changes;
+    for (const KsURL& url : urls_) {
+        if (isAtOrBelow(url.path(), event.path)) changes.foldersToScan.push_back(url.path());
+    }
+    if (!container_contents::covers(container_, urls_, event.path))
+        return askAbout(reader, event, {}, std::move(changes));
+    if (container_contents::isDeep(container_)) {
+        const Result<FSFoundEntry> found = reader.entryFinder().find(event.path);
+        if (!found.ok()) return endWithError(reader, found.error());
+        if (found->url && found->url->ts_isFolder()) changes.foldersToScan.push_back(event.path);
+    }
+    askAbout(reader, event, identifiersOf(event), std::move(changes));
+}
+
+// What is forwarded.
+
+bool FSChangesEnumerator::isBatchFull() const {
+    if (numberOfChanges_ < currentToken_.offset) return false;
+    const std::uint64_t unflushed = numberOfChanges_ - currentToken_.offset;
+    if (unflushed > kChangesBatchMax)
+        logError("invalid number of changes ({} - {} shouldn't be greater than {})", numberOfChanges_,
+                 currentToken_.offset, kChangesBatchMax);
+    return unflushed > kChangesBatchMax - 1;
+}
+
+/// Whether the changes of one more event belong into the batch. The first event's always do.
+bool FSChangesEnumerator::fits(std::size_t count) const {
+    if (numberOfChanges_ <= currentToken_.offset) return true;
+    return checkedSum(numberOfChanges_ - currentToken_.offset, count) <= kChangesBatchMax;
+}
+
+void FSChangesEnumerator::forward(const Change& change) {
+    numberOfChanges_ = checkedSum(numberOfChanges_, 1);
+    // An earlier batch from the same event has delivered those before.
+    if (numberOfChanges_ <= currentToken_.offset) return;
+    if (const auto* item = std::get_if<std::shared_ptr<const TesselItem>>(&change)) {
+        observer_->didUpdateItems({*item});
+    } else {
+        forwardDeletion(std::get<TesselItemIdentifier>(change));
+    }
+}
+
+void FSChangesEnumerator::forwardDeletion(const TesselItemIdentifier& identifier) {
+    logDebug("forward deletion of {}", identifier);
+    observer_->didDeleteItemsWithIdentifiers({identifier});
+}
+
+void FSChangesEnumerator::forwardEvent(FSEventReader& reader, const Event& event, const Changes& changes) {
+    if (!fits(changes.changes.size())) return finish(reader, reader.lastProcessedFSEventID());
+    for (const Change& change : changes.changes) forward(change);
+    std::vector<KsURL> folders;
+    for (const std::string& path : changes.foldersToScan) folders.push_back(KsURL::fileURL(path));
+    const Result<void> scanned = scan(folders);
+    if (!scanned.ok()) return endWithError(reader, scanned.error());
+    if (isBatchFull()) finish(reader, event.id);
+}
+
+/// Forwards all that is listed in the folders. Never cut: there is no position within an event.
+Result<void> FSChangesEnumerator::scan(const std::vector<KsURL>& folders) {
+    if (folders.empty()) return {};
+    std::vector<KsURL> entries;
+    const auto forwardEntries = [&]() -> Result<void> {
+        for (auto& item : TRY(container_contents::itemsOf(std::exchange(entries, {})))) forward(std::move(item));
+        return {};
+    };
+    for (const KsURL& folder : folders) logDebug("scanning folder {}", folder.path());
+    FSDirectoryEnumerator enumerator;
+    TRY(enumerator.enumerate(container_contents::scanOptions(container_, folders), [&](KsURL entry) -> Result<void> {
+        if (container_contents::isListed(container_, entry)) entries.push_back(std::move(entry));
+        return entries.size() < kScanEntriesMax ? Result<void>() : forwardEntries();
+    }));
+    return forwardEntries();
+}
+
+// How it ends.
+
+/// True for the one who is to finish the observer.
+bool FSChangesEnumerator::end(FSEventReader& reader) {
+    reader.stop();
+    const MutexLock lock(mutex_);
+    return !std::exchange(isOver_, true);
+}
+
+void FSChangesEnumerator::endWithError(FSEventReader& reader, const KsError& error) {
+    if (end(reader)) observer_->finishEnumeratingWithError(error);
+}
+
+/// Nothing is known beyond the anchor that was received: the client asks from it again.
+void FSChangesEnumerator::askAgain(FSEventReader& reader) {
+    logInfo("folders moved while changes of {} were fetched", container_);
+    if (end(reader)) observer_->finishEnumeratingChangesUpToSyncAnchor(receivedToken_.encode(), /*moreComing=*/true);
+}
+
+void FSChangesEnumerator::readerDidLoseEvents(FSEventReader& reader, const Event& /*event*/) {
+    reader.assertOnQueue();
+    logInfo("fetching changes did finish after reset");
+    endWithError(reader, tesselErrorForExpiredPage());
+}
+
+void FSChangesEnumerator::readerDidFail(FSEventReader& reader, const KsError& error) {
+    reader.assertOnQueue();
+    endWithError(reader, error);
+}
+
+void FSChangesEnumerator::readerDidFinishHistory(FSEventReader& reader, std::uint64_t eventID) {
+    reader.assertOnQueue();
+    numberOfReaderCaughtUp_ = checkedSum(numberOfReaderCaughtUp_, 1);
+    finish(reader, eventID);
+}
+
+/// The reader stops, with everything up to the event handled.
+void FSChangesEnumerator::finish(FSEventReader& reader, std::uint64_t eventID) {
+    const FSReaderState position{eventID, 0, numberOfChanges_};
+    logDebug("replayed {} fsevents from {} (offset:{})", numberOfChanges_, reader.description(), position.offset);
+    reader.stop();
+    if (reader.mode() == FSEventReaderMode::pathBased) {
+        finishPathBased(position);
+    } else {
+        finishDocIDBased(reader, position);
+    }
+}
+
+void FSChangesEnumerator::finishPathBased(const FSReaderState& position) {
+    pathBasedReaderState_ = position;
+    numberOfChanges_ = 0;
+    std::shared_ptr<FSEventReader> reader = makeReader(FSEventReaderMode::docIDBased, /*verbose=*/true);
+    {
+        const MutexLock lock(mutex_);
+        if (isOver_) return;
+        reader_ = reader;
+    }
+    reader->start();
+}
+
+void FSChangesEnumerator::finishDocIDBased(FSEventReader& reader, const FSReaderState& position) {
+    if (!pathBasedReaderState_) fatal("path based reader bookmark is missing");
+    // Events bear the paths of now. Of a folder that moved meanwhile, some may have been taken for another's.
+    if (placesOf(urls_) != places_) return askAgain(reader);
+    choosePosition(position);
+    const bool hasCaughtUp = numberOfReaderCaughtUp_ == 2;
+    if (hasCaughtUp) logDebug("fetching changes did catch up (eventID:{})", currentToken_.streamEventID);
+    if (end(reader)) observer_->finishEnumeratingChangesUpToSyncAnchor(currentToken_.encode(), !hasCaughtUp);
+}
+
+/// The earlier of the two readers' positions, so that no change is lost.
+void FSChangesEnumerator::choosePosition(FSReaderState docIDBased) {
+    const FSReaderState& pathBased = *pathBasedReaderState_;
+    if (checkedSum(docIDBased.numberOfChanges, pathBased.numberOfChanges) == 0) {
+        if (container_ == kTesselWorkingSetContainerItemIdentifier) return;
+        currentToken_.streamEventID = startupFSEventID_;
+        currentToken_.offset = 0;
+        return;
+    }
+    // The second reader's present is later than the first's: what happened between, only one of them has seen.
+    docIDBased.eventID = std::min(docIDBased.eventID, pathBased.eventID);
+    const bool isDocIDBased =
+        docIDBased.numberOfChanges > 0 && (docIDBased.eventID <= pathBased.eventID || pathBased.numberOfChanges == 0);
+    const FSReaderState& chosen = isDocIDBased ? docIDBased : pathBased;
+    currentToken_.streamEventID = chosen.eventID;
+    currentToken_.offset = chosen.offset;
+}
+
+}  // namespace cindral

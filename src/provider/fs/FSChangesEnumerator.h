@@ -1,0 +1,129 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <variant>
+#include <vector>
+
+#include "platform/foundation/Mutex.h"
+#include "platform/tessel/TesselEnumerator.h"
+#include "provider/fs/FSChangeToken.h"
+#include "provider/fs/FSEventReader.h"
+
+namespace cindral {
+
+/// Changes that a client is given at once.
+inline constexpr std::uint64_t kChangesBatchMax = 100;
+
+/// Where a reader stopped, and how many changes it had reported.
+struct FSReaderState {
+    std::uint64_t eventID = 0;
+    std::uint64_t offset = 0;
+    std::uint64_t numberOfChanges = 0;
+};
+
+/// Answers one request for the changes of a container since an anchor.
+///
+/// The history is replayed twice, first by paths, then by documents, and every event is put to one question: would a
+/// listing of the container deliver this object now, under this identifier? If so, the item is forwarded as an update,
+/// otherwise the identifier as deleted. So a client that applies what it is given, and then lists, finds nothing new.
+///
+/// An event whose object is not where the event says puts the identifiers that it had to that question: those of its
+/// file ID, of the document that it had, and of the one that the store says is there now.
+///
+/// The anchor that is handed back stands behind the last event that was handled wholly. A batch ends before an event
+/// whose changes would not fit; only a scan of a folder goes beyond it.
+///
+/// Thread safety: create(), start() and stop(), from any thread. All else on the reader's queue.
+class FSChangesEnumerator : public FSEventReaderDelegate, public std::enable_shared_from_this<FSChangesEnumerator> {
+public:
+    /// `token` is the anchor's, `currentEventID` the newest event when the request came. An empty list of URLs is a
+    /// programming error and stops the process.
+    static std::shared_ptr<FSChangesEnumerator> create(TesselItemIdentifier container, std::vector<KsURL> urls,
+                                                       std::shared_ptr<TesselChangeObserver> observer,
+                                                       FSChangeToken token, std::uint64_t currentEventID);
+
+    void start();
+    /// Ends the enumeration, unless it has ended: the observer is finished with ECANCELED, soon, on the reader's queue.
+    void stop();
+
+    LookFurther readerDidReceiveEvent(FSEventReader& reader, const Event& event, std::string_view path) override;
+    bool readerShouldMakeItem(FSEventReader& reader, const Event& event, const KsURL& entry) override;
+    void readerDidUpdateItem(FSEventReader& reader, const Event& event, const TesselItemIdentifier& identifier,
+                             const std::shared_ptr<const TesselItem>& item) override;
+    void readerDidDeleteItem(FSEventReader& reader, const Event& event,
+                             const TesselItemIdentifier& identifier) override;
+    void readerDidDropEvent(FSEventReader& reader, const Event& event, const TesselItemIdentifier& identifier) override;
+    void readerMustScan(FSEventReader& reader, const Event& event) override;
+    void readerDidLoseEvents(FSEventReader& reader, const Event& event) override;
+    void readerDidFail(FSEventReader& reader, const KsError& error) override;
+    void readerDidFinishHistory(FSEventReader& reader, std::uint64_t eventID) override;
+
+private:
+    /// One change of what a client has: an item as it is now, or an identifier of nothing that is listed.
+    using Change = std::variant<std::shared_ptr<const TesselItem>, TesselItemIdentifier>;
+    using Identifiers = std::vector<TesselItemIdentifier>;
+    /// What one event comes to.
+    struct Changes {
+        std::vector<Change> changes;
+        std::vector<std::string> foldersToScan;  ///< taken out of the client's view while what is in them is listed
+    };
+    /// What came of one question.
+    struct Answer;
+    /// Which object an URL named when the enumeration began; none where none.
+    using Place = std::optional<std::pair<std::uint64_t, std::uint64_t>>;
+
+    FSChangesEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls,
+                        std::shared_ptr<TesselChangeObserver> observer, FSChangeToken token,
+                        std::uint64_t currentEventID);
+    static std::vector<Place> placesOf(const std::vector<KsURL>& urls);
+    std::shared_ptr<FSEventReader> makeReader(FSEventReaderMode mode, bool verbose);
+
+    // What is listed.
+    Identifiers identifiersOf(const Event& event) const;
+    Result<Answer> ask(FSEventReader& reader, const TesselItemIdentifier& identifier);
+    Result<Answer> askOnce(FSEventReader& reader, const TesselItemIdentifier& identifier);
+    Result<Answer> answerOf(KsURL entry, const TesselItemIdentifier& identifier);
+    bool changesWhatIsBelow(const Event& event, const Answer& moved) const;
+    void askAbout(FSEventReader& reader, const Event& event, const Identifiers& identifiers, Changes changes = {});
+
+    // What is forwarded.
+    bool isBatchFull() const;
+    bool fits(std::size_t count) const;
+    void forward(const Change& change);
+    void forwardDeletion(const TesselItemIdentifier& identifier);
+    void forwardEvent(FSEventReader& reader, const Event& event, const Changes& changes);
+    Result<void> scan(const std::vector<KsURL>& folders);
+
+    // How it ends.
+    bool end(FSEventReader& reader);
+    void endWithError(FSEventReader& reader, const KsError& error);
+    void askAgain(FSEventReader& reader);
+    void finish(FSEventReader& reader, std::uint64_t eventID);
+    void finishPathBased(const FSReaderState& position);
+    void finishDocIDBased(FSEventReader& reader, const FSReaderState& position);
+    void choosePosition(FSReaderState docIDBased);
+
+    // Constant after construction.
+    const TesselItemIdentifier container_;
+    const std::vector<KsURL> urls_;
+    const std::shared_ptr<TesselChangeObserver> observer_;
+    const FSChangeToken receivedToken_;
+    const std::uint64_t sinceFSEventID_;
+    const std::uint64_t startupFSEventID_;
+    const std::vector<Place> places_;
+
+    // The current reader's queue's.
+    FSChangeToken currentToken_;
+    std::uint64_t numberOfChanges_ = 0;
+    std::uint64_t numberOfReaderCaughtUp_ = 0;
+    std::optional<FSReaderState> pathBasedReaderState_;
+
+    Mutex mutex_;
+    std::shared_ptr<FSEventReader> reader_ GUARDED_BY(mutex_);
+    bool isOver_ GUARDED_BY(mutex_) = false;  ///< stopped or finished: the observer is nobody else's to finish
+};
+
+}  // namespace cindral
