@@ -195,6 +195,10 @@ Result<bool> isWritable(int directory, const char* name) {
     return KsError::posix(errno);
 }
 
+bool isReadableDirectory(int directory, const char* name) {
+    return ::faccessat(directory, name, R_OK | X_OK, AT_EACCESS | AT_SYMLINK_NOFOLLOW) == 0;
+}
+
 namespace {
 
 /// Labels can refuse what the mode allows. Where the kernel has them, every file is asked for.
