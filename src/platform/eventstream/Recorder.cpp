@@ -145,6 +145,7 @@ Recorder::Wake Recorder::waitForNews(std::chrono::milliseconds timeout) {
 Result<void> Recorder::startUp() {
     const MutexLock lock(mutex_);
     keeper_.setRoots(sourcesFor(*roots()));
+    noteState();
     const bool isFirst = !store_->historyBegin();
     if (isFirst) {
         TRY(keeper_.compareEverything(IndexKeeper::Journal::no));

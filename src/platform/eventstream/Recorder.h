@@ -79,7 +79,7 @@ public:
         std::string why;
     };
     struct Status {
-        std::string recorder;  ///< "inotify", "fanotify", or "none" where nothing tells of changes
+        std::string recorder = "none";  ///< "inotify", "fanotify", or "none" where nothing tells of changes
         std::vector<Uncovered> uncovered;
         std::uint64_t auditedDifferences = 0;  ///< changes that only an audit found
     };
