@@ -13,12 +13,12 @@ namespace cindral::own_attributes {
 namespace {
 
 template <typename Integer>
-void append(Bytes& out, Integer value) {
+void appendInteger(Bytes& out, Integer value) {
     out.resize(out.size() + sizeof value);
     storeInteger(out.data() + out.size() - sizeof value, value);
 }
 
-void append(Bytes& out, ByteView bytes) {
+void appendBytes(Bytes& out, ByteView bytes) {
     out.insert(out.end(), bytes.begin(), bytes.end());
 }
 
@@ -50,10 +50,10 @@ Result<Bytes> read(int folder, const char* name) {
         // One that changed meanwhile changes the file's status, too: it is read again.
         if (!got.ok()) continue;
         value.resize(*got);
-        append(out, static_cast<std::uint16_t>(attribute.size()));
-        append(out, bytesOf(attribute));
-        append(out, static_cast<std::uint32_t>(value.size()));
-        append(out, value);
+        appendInteger(out, static_cast<std::uint16_t>(attribute.size()));
+        appendBytes(out, bytesOf(attribute));
+        appendInteger(out, static_cast<std::uint32_t>(value.size()));
+        appendBytes(out, value);
     }
     return out;
 }

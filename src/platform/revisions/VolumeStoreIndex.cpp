@@ -46,7 +46,7 @@ Result<std::uint64_t> VolumeStore::Implementation::apply(const IndexChanges& cha
 }
 
 Result<void> VolumeStore::Implementation::rememberAttributes(DocumentID document, ByteView attributes) {
-    if (document == DocumentID{} || attributes.size() > kAttributesBytesMax) return KsError::posix(EINVAL);
+    if (attributes.size() > kAttributesBytesMax) return KsError::posix(EINVAL);
     const MutexLock lock(writerMutex_);
     if (std::ranges::equal(this->attributes(document), attributes)) return {};
     TRY(waitForRoom());
