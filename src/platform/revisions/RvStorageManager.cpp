@@ -11,6 +11,7 @@
 #include "platform/foundation/Log.h"
 #include "platform/revisions/ObjectFinder.h"
 #include "platform/revisions/OwnAttributes.h"
+#include "platform/revisions/VolumeIndex.h"
 
 namespace cindral {
 
@@ -46,6 +47,18 @@ Result<FoundObject> searchAndRecord(VolumeStore& store, std::uint32_t device, Fi
     const Result<void> recorded = finder.record(store, found);
     if (!recorded.ok()) logError("can't record where {} is; {}", found.path(), recorded.error().description());
     return found;
+}
+
+/// Whether one of them is of an object that nobody has recorded yet.
+Result<bool> hasUnknown(const VolumeStore& store, std::span<const ObjectSighting> sightings) {
+    std::vector<FileID> fileIDs;
+    fileIDs.reserve(sightings.size());
+    for (const ObjectSighting& sighting : sightings) fileIDs.push_back(sighting.fileID);
+    bool isUnknown = false;
+    TRY(store.indexed(fileIDs, [&](std::size_t i, const IndexedObject* object) {
+        isUnknown = isUnknown || object == nullptr || object->birthTime != sightings[i].birthTime;
+    }));
+    return isUnknown;
 }
 
 /// Remembers the system's own attributes of documents that have some, so that they survive a save that drops them.
@@ -189,7 +202,9 @@ std::uint32_t RvStorageManager::documentIDForDescriptor(int fd) {
     sighting.kind = objectKindOf(*status, status->isDirectory());
     sighting.wantsDocumentID = true;
     std::string name;
-    if (const auto known = store->object(sighting.fileID); known && known->birthTime == sighting.birthTime) {
+    auto known = store->object(sighting.fileID);
+    if ((!known || known->birthTime != sighting.birthTime) && catchUp()) known = store->object(sighting.fileID);
+    if (known && known->birthTime == sighting.birthTime) {
         if (known->documentID != DocumentID{}) return static_cast<std::uint32_t>(known->documentID);
         sighting.parent = known->parent;
         name = known->name;
@@ -233,6 +248,8 @@ Result<void> RvStorageManager::identify(std::vector<KsURL>& entries) {
         sighting.wantsDocumentID = sighting.kind == ObjectKind::file || sighting.kind == ObjectKind::package;
         sighted.push_back(&entry);
     }
+    // A new file may be a document that was just saved: the recorder knows, and hands it the number it had.
+    if (TRY(hasUnknown(*store, sightings))) (void)catchUp();
     TRY(recordFolders(*store, folders, sightings));
     TRY(store->identify(sightings));
     for (std::size_t i = 0; i < sightings.size(); ++i) {
