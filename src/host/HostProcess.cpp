@@ -75,23 +75,45 @@ std::vector<std::string> rootURLs(const PresentedPaths& paths) {
     return urls;
 }
 
-/// How changes below each root are found out (without a recorder, by comparing with what was there before), and what
-/// below them is not published at all.
-std::string coverageText(const std::vector<std::string>& roots, const PresentedPaths& paths) {
+Recorder::Choice recorderChoice(RecorderChoice choice) {
+    switch (choice) {
+        case RecorderChoice::automatic: return Recorder::Choice::automatic;
+        case RecorderChoice::inotify: return Recorder::Choice::inotify;
+        case RecorderChoice::fanotify: return Recorder::Choice::fanotify;
+    }
+    return Recorder::Choice::automatic;
+}
+
+/// Whether the command asks for changes. The others look at the files and go.
+bool records(HostCommand command) {
+    switch (command) {
+        case HostCommand::anchor:
+        case HostCommand::status:
+        case HostCommand::rpc: return true;
+        case HostCommand::ls:
+        case HostCommand::tree:
+        case HostCommand::info:
+        case HostCommand::url:
+        case HostCommand::id: return false;
+    }
+    return false;
+}
+
+/// What is checked by comparison instead of by events, and what below the roots is not published at all: "full" where
+/// there is neither.
+std::string coverageText(const Recorder::Status& recorder, const PresentedPaths& paths) {
     std::string out = "[";
-    const auto append = [&out](std::string_view key, std::string_view url, std::string_view how, std::string_view why) {
+    const auto append = [&](std::string_view path, std::string_view how, std::string_view why) {
         if (out.size() > 1) out += ',';
-        out += fmt::format(R"({{"{}":)", key);
-        appendJsonString(out, url);
+        out += R"({"url":)";
+        appendJsonString(out, paths.realURL(KsURL::fileURL(std::string(path))));
         out += fmt::format(R"(,"how":"{}","why":)", how);
         appendJsonString(out, why);
         out += '}';
     };
-    for (const std::string& root : roots) append("root", root, "comparison", "no recorder is running");
-    for (const auto& [path, why] : RootDirectories::shared().leftOut()) {
-        append("url", paths.realURL(KsURL::fileURL(path)), "left out", why);
-    }
-    return out + "]";
+    for (const auto& [path, why] : recorder.uncovered) append(path, "comparison", why);
+    for (const auto& [path, why] : RootDirectories::shared().leftOut()) append(path, "left out", why);
+    return out.size() == 1 ? jsonString("full") : out + "]";
 }
 
 }  // namespace
@@ -130,42 +152,72 @@ Result<void> HostProcess::connect() {
     RoApplicationWorkspace::defaultWorkspace().setOwnRecord(ownRecord(paths_));
     TesselManager::defaultManager().setDocumentStorageURL(KsURL::fileURL(paths_.presented()));
     TesselManager::defaultManager().setHost(std::make_shared<Signals>());
+    if (records(options_.command)) startRecorder();
     return {};
 }
 
+/// Before the provider is made, which asks for positions in the history.
+void HostProcess::startRecorder() {
+    Recorder::Roots roots;
+    if (auto storage = RootDirectories::shared().rootHolding(paths_.presented())) roots.push_back(std::move(storage));
+    for (auto& root : RootDirectories::shared().all()) {
+        if (root->path != paths_.presented()) roots.push_back(std::move(root));
+    }
+    Recorder::Options recorderOptions;
+    recorderOptions.choice = recorderChoice(options_.recorder);
+    recorder_ = Recorder::start(store_, std::move(roots), std::move(recorderOptions));
+    EventHistory::setShared(recorder_);
+    RvStorageManager::defaultManager().setCatchUp([recorder = std::weak_ptr(recorder_)] {
+        const auto current = recorder.lock();
+        // Nobody waits for the first reading to find one object: the tree itself is searched meanwhile.
+        return current && current->isReady() && current->drain().ok();
+    });
+}
+
 HostProcess::~HostProcess() {
+    // Who waits for the history is let go of first.
+    if (recorder_) recorder_->stop();
     provider_.reset();
     // A provider that goes leaves its last work to the main queue.
     SerialQueue::main().sync([] {});
     TesselManager::defaultManager().setHost(nullptr);
     RoApplicationWorkspace::defaultWorkspace().setOwnRecord(nullptr);
+    RvStorageManager::defaultManager().setCatchUp({});
+    EventHistory::setShared(nullptr);
+    recorder_.reset();
     RootDirectories::shared().remove(paths_.presented());
     RvStorageManager::defaultManager().setStore(nullptr);
     store_.reset();
+}
+
+void HostProcess::waitForHistory() const {
+    // What went wrong was logged.
+    if (recorder_) (void)recorder_->drain();
 }
 
 std::string HostProcess::statusText() const {
     const std::vector<std::string> roots = rootURLs(paths_);
     const VolumeStore::Counts counts = store_->counts();
     const std::uint64_t currentEventID = store_->currentEventID();
+    const Recorder::Status recorder = recorder_ ? recorder_->status() : Recorder::Status{};
 
     std::string out;
     appendField(out, "version", jsonString(hostVersion()));
     appendField(out, "storage", jsonString(paths_.real()));
     appendField(out, "state", jsonString(state_));
-    appendField(out, "recorder", jsonString("none"));
+    appendField(out, "recorder", jsonString(recorder.recorder));
     appendField(out, "recorderOption", jsonString(recorderChoiceName(options_.recorder)));
     appendField(out, "applicationFolders", listText(options_.applications));
     appendField(out, "flatpak", options_.flatpak ? "true" : "false");
     appendField(out, "roots", listText(roots));
     appendField(out, "objects", fmt::to_string(counts.objects));
     appendField(out, "documents", fmt::to_string(counts.documents));
-    // Without a journal there is no event to replay: the history begins, and ends, now.
-    appendField(out, "events", "0");
-    appendField(out, "oldestEventID", fmt::to_string(currentEventID));
+    appendField(out, "events", fmt::to_string(counts.events));
+    appendField(out, "oldestEventID", fmt::to_string(store_->historyBegin().value_or(currentEventID)));
     appendField(out, "currentEventID", fmt::to_string(currentEventID));
     appendField(out, "volumeUUID", jsonString(store_->uuid().string()));
-    appendField(out, "coverage", coverageText(roots, paths_));
+    appendField(out, "coverage", coverageText(recorder, paths_));
+    appendField(out, "auditedDifferences", fmt::to_string(recorder.auditedDifferences));
     return out + "}";
 }
 

@@ -5,6 +5,7 @@
 
 #include "host/HostOptions.h"
 #include "host/PresentedPaths.h"
+#include "platform/eventstream/Recorder.h"
 #include "platform/foundation/Result.h"
 #include "platform/revisions/VolumeStore.h"
 #include "platform/tessel/TesselExtension.h"
@@ -29,17 +30,21 @@ public:
     const PresentedPaths& paths() const { return paths_; }
     const std::shared_ptr<TesselExtension>& provider() const { return provider_; }
 
+    /// Returns when the roots have been read or compared.
+    void waitForHistory() const;
     /// What `status` answers, as JSON text.
     std::string statusText() const;
 
 private:
     HostProcess(HostOptions options, PresentedPaths paths, std::string state, std::shared_ptr<VolumeStore> store);
     Result<void> connect();
+    void startRecorder();
 
     const HostOptions options_;
     const PresentedPaths paths_;
     const std::string state_;
     std::shared_ptr<VolumeStore> store_;
+    std::shared_ptr<Recorder> recorder_;  // Null for commands that don't ask for changes.
     std::shared_ptr<TesselExtension> provider_;
 };
 

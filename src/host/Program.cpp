@@ -43,7 +43,11 @@ int runRpc(const HostProcess& host) {
 int runCommand(const HostProcess& host, const HostEnvironment& environment) {
     TextOutput output(STDOUT_FILENO, ::isatty(STDOUT_FILENO) == 1);
     ProviderClient client(host.provider());
-    Commands commands({client, host.paths(), host.options(), environment, [&] { return host.statusText(); }}, output);
+    const auto statusText = [&] {
+        host.waitForHistory();
+        return host.statusText();
+    };
+    Commands commands({client, host.paths(), host.options(), environment, statusText}, output);
     const auto done = commands.run();
     // What was found before something went wrong is shown before the line that says what.
     if (const auto error = output.finish()) return outputFailure(*error);

@@ -1,6 +1,7 @@
 """Drives the program from outside: folders of its own, a JSON-RPC client, and what a test can say about both."""
 
 import base64
+import collections
 import itertools
 import json
 import os
@@ -34,13 +35,14 @@ class RpcError(Exception):
 class Client:
     """One process that speaks JSON-RPC on its standard input and output."""
 
-    def __init__(self, arguments, environment, **popen):
+    def __init__(self, arguments, environment, launcher=(), **popen):
         self.process = subprocess.Popen(
-            [PROGRAM, "rpc", *arguments], stdin=subprocess.PIPE, stdout=subprocess.PIPE, stderr=subprocess.PIPE,
+            [*launcher, PROGRAM, "rpc", *arguments], stdin=subprocess.PIPE, stdout=subprocess.PIPE, stderr=subprocess.PIPE,
             env=environment, **popen)
         self._ids = itertools.count(1)
         self._answers = queue.Queue()
         self._early = {}
+        self._notifications = collections.deque()
         self._errors = []
         self._readers = [threading.Thread(target=self._read_answers), threading.Thread(target=self._read_errors)]
         for reader in self._readers:
@@ -84,8 +86,26 @@ class Client:
             message = self.next_message()
             if message is None:
                 raise AssertionError("the process ended; it said: " + "".join(self._errors))
-            self._early[message["id"]] = message
+            self._keep(message)
         return self._early.pop(request_id)
+
+    def _keep(self, message):
+        if "id" in message:
+            self._early[message["id"]] = message
+        else:
+            self._notifications.append(message)
+
+    def next_notification(self, method):
+        """Parameters of the next one of the method, which is waited for; others are dropped."""
+        while True:
+            while self._notifications:
+                message = self._notifications.popleft()
+                if message["method"] == method:
+                    return message["params"]
+            message = self.next_message()
+            if message is None:
+                raise AssertionError("the process ended; it said: " + "".join(self._errors))
+            self._keep(message)
 
     def call(self, method, **params):
         answer = self.answer(self.send(method, **params))

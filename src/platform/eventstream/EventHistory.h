@@ -59,6 +59,9 @@ public:
     virtual KsUUID volumeUUID() const = 0;
     /// The last event's ID. Never goes back.
     virtual std::uint64_t currentEventID() const = 0;
+    /// Whether the first look at the roots since the start is over. Until then drain() waits, and what is found out
+    /// about the time before the start is still on its way into the history.
+    virtual bool isReady() const { return true; }
     /// Returns when everything that was complete before the call is in the history. Waits for a first reading of the
     /// roots to end; an error when it never will.
     virtual Result<void> drain() = 0;
@@ -76,8 +79,8 @@ public:
     /// The same of document-ID changes, with paths "/.docid/DEVICE/changed/DOCUMENT/src=SOURCE,dst=DESTINATION".
     virtual Result<Batch> documentEvents(std::uint64_t after, std::size_t max) const = 0;
 
-    /// Calls back, on the recorder's thread, whenever there are new events. Returns a number for removeObserver(),
-    /// which waits for a call that is under way, unless it is called from within one.
+    /// Calls back, on any thread, whenever there are new events. An observer only passes on: it calls nothing of the
+    /// history. Returns a number for removeObserver(), which waits for a call that is under way.
     virtual std::uint64_t addObserver(std::function<void()> observer) = 0;
     virtual void removeObserver(std::uint64_t observer) = 0;
 };

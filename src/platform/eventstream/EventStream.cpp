@@ -8,7 +8,6 @@
 #include "platform/foundation/Log.h"
 #include "platform/foundation/Mutex.h"
 #include "platform/foundation/SharedTimer.h"
-#include "platform/foundation/ThreadPool.h"
 #include "platform/revisions/RvStorageManager.h"
 
 namespace cindral {
@@ -113,10 +112,7 @@ void EventStream::State::deliverUpTo(std::uint64_t bound) {
 
 void EventStream::State::replay() {
     Result<void> drained = KsError::posix(ENODEV);
-    if (history) {
-        const ThreadPool::BlockingRegion region;
-        drained = history->drain();
-    }
+    if (history) drained = history->drain();
     if (isOver()) return;
     if (!drained.ok() || !history->canReplayAfter(position)) {
         if (history && !drained.ok()) {

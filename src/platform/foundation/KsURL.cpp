@@ -272,15 +272,28 @@ void KsURL::loadAttributeNames() const {
     if (sys::hasXattrs(where->directory, where->name, names).ok()) attributeNames_ = std::move(names);
 }
 
-bool KsURL::mayHaveAttribute(std::string_view name) const {
-    if (!attributeNames_) return true;
-    std::string_view names = *attributeNames_;
+namespace {
+
+/// Whether one of the NUL-terminated names is what is looked for.
+template <typename Test>
+bool anyName(std::string_view names, Test test) {
     while (!names.empty()) {
         const std::size_t end = std::min(names.find('\0'), names.size());
-        if (names.substr(0, end) == name) return true;
+        if (test(names.substr(0, end))) return true;
         names.remove_prefix(std::min(end + 1, names.size()));
     }
     return false;
+}
+
+}  // namespace
+
+bool KsURL::mayHaveAttribute(std::string_view name) const {
+    return !attributeNames_ || anyName(*attributeNames_, [name](std::string_view one) { return one == name; });
+}
+
+bool KsURL::mayHaveAttributeWithPrefix(std::string_view prefix) const {
+    return !attributeNames_ ||
+           anyName(*attributeNames_, [prefix](std::string_view one) { return one.starts_with(prefix); });
 }
 
 Result<std::size_t> KsURL::attribute(const char* name, std::span<std::byte> buffer) const {

@@ -97,6 +97,8 @@ public:
     void loadAttributeNames() const;
     /// False when it is known that the attribute is absent. `name` with its namespace ("user.…").
     bool mayHaveAttribute(std::string_view name) const;
+    /// The same of every name that begins like this.
+    bool mayHaveAttributeWithPrefix(std::string_view prefix) const;
     /// Reads into the buffer, or tells the size when it is empty.
     Result<std::size_t> attribute(const char* name, std::span<std::byte> buffer) const;
 

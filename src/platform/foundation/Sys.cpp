@@ -3,7 +3,9 @@
 #include <fmt/format.h>
 #include <linux/magic.h>
 #include <linux/openat2.h>
+#include <sys/fanotify.h>
 #include <sys/inotify.h>
+#include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <sys/statvfs.h>
 #include <sys/syscall.h>
@@ -16,6 +18,7 @@
 #include <cerrno>
 #include <climits>
 #include <cstdio>
+#include <cstring>
 #include <fstream>
 #include <iterator>
 
@@ -195,6 +198,10 @@ Result<bool> isWritable(int directory, const char* name) {
     return KsError::posix(errno);
 }
 
+bool isReadableDirectory(int directory, const char* name) {
+    return ::faccessat(directory, name, R_OK | X_OK, AT_EACCESS | AT_SYMLINK_NOFOLLOW) == 0;
+}
+
 namespace {
 
 /// Labels can refuse what the mode allows. Where the kernel has them, every file is asked for.
@@ -283,6 +290,103 @@ Result<void> DirectoryWatch::drain(const Change& change) {
             at += sizeof *event + event->len;
         }
     }
+}
+
+Result<std::size_t> read(int fd, std::span<std::byte> buffer) {
+    while (true) {
+        const ssize_t size = ::read(fd, buffer.data(), buffer.size());
+        if (size >= 0) return static_cast<std::size_t>(size);
+        if (errno != EINTR) return KsError::posix(errno);
+    }
+}
+
+Result<std::uint64_t> readableBytes(int fd) {
+    int bytes = 0;
+    if (::ioctl(fd, FIONREAD, &bytes) != 0) return KsError::posix(errno);
+    return static_cast<unsigned>(bytes);
+}
+
+Result<UniqueFd> inotify_init1(int flags) {
+    const int fd = ::inotify_init1(flags | IN_CLOEXEC);
+    if (fd < 0) return KsError::posix(errno);
+    return UniqueFd(fd);
+}
+
+Result<int> inotify_add_watch(int instance, int object, std::uint32_t mask) {
+    const int watch = ::inotify_add_watch(instance, pathThroughDescriptor(object, "").c_str(), mask);
+    if (watch < 0) return KsError::posix(errno);
+    return watch;
+}
+
+Result<void> inotify_rm_watch(int instance, int watch) {
+    if (::inotify_rm_watch(instance, watch) != 0) return KsError::posix(errno);
+    return {};
+}
+
+Result<UniqueFd> fanotify_init(unsigned flags, unsigned eventFlags) {
+    const int fd = ::fanotify_init(flags | FAN_CLOEXEC, eventFlags | O_CLOEXEC);
+    if (fd < 0) return KsError::posix(errno);
+    return UniqueFd(fd);
+}
+
+Result<void> fanotify_mark(int group, unsigned flags, std::uint64_t mask, int object) {
+    // By way of /proc, because a descriptor opened with O_PATH is no open file to the call itself.
+    const std::string path = pathThroughDescriptor(object, "");
+    if (::fanotify_mark(group, flags, mask, AT_FDCWD, path.c_str()) != 0) return KsError::posix(errno);
+    return {};
+}
+
+namespace {
+
+/// Room for the kernel's own form of a handle, whose bytes follow its two numbers.
+struct KernelHandle {
+    alignas(file_handle) std::byte bytes[sizeof(file_handle) + FileHandle::kBytesMax];
+    file_handle* get() { return reinterpret_cast<file_handle*>(bytes); }
+};
+
+}  // namespace
+
+Result<FileHandle> name_to_handle_at(int directory, const char* name, int flags) {
+    KernelHandle raw;
+    raw.get()->handle_bytes = FileHandle::kBytesMax;
+    int mount = 0;
+    while (::name_to_handle_at(directory, name, raw.get(), &mount, flags) != 0) {
+        if (errno != EINTR) return KsError::posix(errno);
+    }
+    FileHandle handle;
+    handle.type = raw.get()->handle_type;
+    handle.size = raw.get()->handle_bytes;
+    std::memcpy(handle.bytes, raw.get()->f_handle, handle.size);
+    return handle;
+}
+
+Result<UniqueFd> open_by_handle_at(int mount, const FileHandle& handle, int flags) {
+    KernelHandle raw;
+    raw.get()->handle_type = handle.type;
+    raw.get()->handle_bytes = handle.size;
+    std::memcpy(raw.get()->f_handle, handle.bytes, handle.size);
+    while (true) {
+        const int fd = ::open_by_handle_at(mount, raw.get(), flags | O_CLOEXEC);
+        if (fd >= 0) return UniqueFd(fd);
+        if (errno != EINTR) return KsError::posix(errno);
+    }
+}
+
+Result<std::uint64_t> fileSystemID(int fd) {
+    struct statfs fileSystem;
+    while (::fstatfs(fd, &fileSystem) != 0) {
+        if (errno != EINTR) return KsError::posix(errno);
+    }
+    std::uint64_t identifier = 0;
+    static_assert(sizeof fileSystem.f_fsid == sizeof identifier);
+    std::memcpy(&identifier, &fileSystem.f_fsid, sizeof identifier);
+    return identifier;
+}
+
+Result<UniqueFd> duplicate(int fd) {
+    const int copy = ::fcntl(fd, F_DUPFD_CLOEXEC, 0);
+    if (copy < 0) return KsError::posix(errno);
+    return UniqueFd(copy);
 }
 
 Result<Bytes> readBeginning(int directory, const char* name, std::size_t count) {

@@ -51,6 +51,17 @@ struct DirectoryRecord {
     bool isDots() const { return name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0')); }
 };
 
+/// What name_to_handle_at answers: an object's name that lasts through renames and ends with the object, a number that
+/// is used again included. Equal handles are one object of one file system.
+struct FileHandle {
+    static constexpr std::size_t kBytesMax = 128;  ///< MAX_HANDLE_SZ
+    std::int32_t type = 0;
+    std::uint32_t size = 0;
+    std::byte bytes[kBytesMax];
+
+    ByteView view() const { return {bytes, size}; }
+};
+
 /// System calls: one function a call, same name, same order of arguments. EINTR is retried here and nowhere else;
 /// every descriptor is close-on-exec. Errors are of the POSIX domain.
 namespace sys {
@@ -74,6 +85,10 @@ Result<std::size_t> getxattrat(int directory, const char* name, const char* attr
 
 /// Whether the process may write the entry itself (effective identity, links not followed).
 Result<bool> isWritable(int directory, const char* name);
+
+/// Whether the process may list the directory and reach what is in it (effective identity, links not followed). False
+/// for what is none or can't be asked.
+bool isReadableDirectory(int directory, const char* name);
 
 /// What can be relied on in the file system that holds a directory.
 struct FileSystemTraits {
@@ -109,6 +124,31 @@ public:
 private:
     UniqueFd fd_;
 };
+
+/// Bytes read; 0 at the end. EAGAIN where there is nothing yet and the descriptor does not wait.
+Result<std::size_t> read(int fd, std::span<std::byte> buffer);
+/// Bytes that can be read without waiting (FIONREAD). What a fanotify group answers is 24 for each event, whatever its
+/// length.
+Result<std::uint64_t> readableBytes(int fd);
+
+Result<UniqueFd> inotify_init1(int flags);
+/// Watches the open object itself: no path is walked, so that nothing else can take its place on the way.
+Result<int> inotify_add_watch(int instance, int object, std::uint32_t mask);
+Result<void> inotify_rm_watch(int instance, int watch);
+
+Result<UniqueFd> fanotify_init(unsigned flags, unsigned eventFlags);
+/// Marks the open object, its mount or its file system, as the flags say.
+Result<void> fanotify_mark(int group, unsigned flags, std::uint64_t mask, int object);
+
+/// An empty name with AT_EMPTY_PATH is the descriptor's own object.
+Result<FileHandle> name_to_handle_at(int directory, const char* name, int flags);
+/// `mount` is open for reading, anywhere on the file system. ESTALE when the object is gone; EPERM without
+/// CAP_DAC_READ_SEARCH.
+Result<UniqueFd> open_by_handle_at(int mount, const FileHandle& handle, int flags);
+/// The number that fanotify tells file systems apart by (f_fsid); 0 where there is none.
+Result<std::uint64_t> fileSystemID(int fd);
+/// Another descriptor of what is open.
+Result<UniqueFd> duplicate(int fd);
 
 /// Reads from a regular file without touching its access time. EPERM where the process may not ask for that;
 /// ENXIO for anything but a regular file, which is never opened.

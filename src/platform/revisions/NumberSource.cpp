@@ -54,12 +54,24 @@ std::uint64_t NumberSource::currentEvent() const {
     return next_.event - 1;
 }
 
-Result<std::uint64_t> NumberSource::advanceEvent() {
+Result<std::uint64_t> NumberSource::reserveEvents(std::uint64_t count) {
     const MutexLock lock(mutex_);
-    if (next_.event == reserved_.event) {
-        TRY(reserve({reserved_.document, reserved_.event + kBlock}));
+    const std::uint64_t end = next_.event + count;
+    if (end > reserved_.event) {
+        TRY(reserve({reserved_.document, end + kBlock}));
     }
-    return next_.event++;
+    return next_.event;
+}
+
+void NumberSource::takeEvents(std::uint64_t count) {
+    const MutexLock lock(mutex_);
+    next_.event += count;
+}
+
+Result<std::uint64_t> NumberSource::advanceEvent() {
+    const std::uint64_t event = TRY(reserveEvents(1));
+    takeEvents(1);
+    return event;
 }
 
 HighWaterMarks NumberSource::reserved() const {

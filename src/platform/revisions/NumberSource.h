@@ -10,7 +10,7 @@ namespace cindral {
 
 /// Gives document and event IDs, each once for ever: none leaves before its block is reserved on the disk.
 ///
-/// Thread safety: all operations, from any thread; document IDs by one thread at a time.
+/// Thread safety: all operations, from any thread; IDs are reserved and taken by one thread at a time.
 class NumberSource {
 public:
     /// The last document ID that is ever given.
@@ -27,6 +27,9 @@ public:
     std::uint32_t nextDocument() const;
     void takeDocuments(std::size_t count);
 
+    /// The first of so many event IDs in a row, which are reserved when it returns but not taken.
+    Result<std::uint64_t> reserveEvents(std::uint64_t count);
+    void takeEvents(std::uint64_t count);
     std::uint64_t currentEvent() const;
     Result<std::uint64_t> advanceEvent();
 

@@ -12,13 +12,16 @@
 
 #include "platform/foundation/Fatal.h"
 #include "platform/revisions/Checksum.h"
+#include "platform/revisions/ObjectTablesKeys.h"
 
 namespace cindral {
+
+using namespace tablekeys;
 
 namespace {
 
 constexpr std::size_t kMapBytesMin = std::size_t{16} << 20;
-constexpr unsigned kTablesMax = 8;
+constexpr unsigned kTablesMax = 16;
 // NOTLS: a snapshot belongs to its object, not to its thread. NORDAHEAD: look-ups go all over the file. NOMETASYNC:
 // pages
 // are on the disk before the head page that names them is written, but that head page waits for the next sync; what is
@@ -26,46 +29,10 @@ constexpr unsigned kTablesMax = 8;
 constexpr unsigned kEnvironmentFlags = MDB_NOSUBDIR | MDB_NOTLS | MDB_NORDAHEAD | MDB_NOMETASYNC;
 
 // Written to disk: never change one.
-constexpr std::uint32_t kFormatVersion = 1;
+constexpr std::uint32_t kFormatVersion = 2;
 constexpr std::string_view kHeadKey = "head";
-constexpr std::size_t kHeadBytes = 4 + 16 + 8 + 8 + 8 + 4 + 4;
-constexpr std::size_t kDocumentBytes = 16;
-
-MDB_val valueOf(ByteView bytes) {
-    return {bytes.size(),
-            const_cast<std::byte*>(bytes.data())};  // NOLINT: the library takes no const, and does not write.
-}
-
-ByteView viewOf(const MDB_val& value) {
-    return {static_cast<const std::byte*>(value.mv_data), value.mv_size};
-}
-
-/// A number as the library's integer keys want it: in the machine's own order.
-template <typename Number>
-class IntegerKey {
-public:
-    explicit IntegerKey(Number number) : number_(number) {}
-    MDB_val* value() { return &value_; }
-
-private:
-    Number number_;
-    MDB_val value_{sizeof number_, &number_};
-};
-
-bool isDamage(int code) {
-    return code == MDB_INVALID || code == MDB_CORRUPTED || code == MDB_PAGE_NOTFOUND || code == MDB_VERSION_MISMATCH ||
-           code == MDB_INCOMPATIBLE || code == MDB_NOTFOUND || code == MDB_CURSOR_FULL || code == MDB_PAGE_FULL;
-}
-
-KsError errorOf(int code) {
-    if (code > 0) return KsError::posix(code);
-    if (code == MDB_MAP_FULL) return KsError::posix(ENOSPC);
-    return KsError::posix(isDamage(code) ? kDamageCode : EIO).with("message", mdb_strerror(code));
-}
-
-KsError damage(std::string message) {
-    return KsError::posix(kDamageCode).with("message", std::move(message));
-}
+constexpr std::size_t kHeadBytes = 4 + 16 + 8 + 8 + 8 + 4 + 8 + 8 + 16 + 4;
+constexpr std::size_t kHeadChecksumOffset = kHeadBytes - 4;
 
 std::array<std::byte, kHeadBytes> encodeHead(const TablesHead& head) {
     std::array<std::byte, kHeadBytes> bytes{};
@@ -75,7 +42,10 @@ std::array<std::byte, kHeadBytes> encodeHead(const TablesHead& head) {
     storeInteger(bytes.data() + 28, head.marks.event);
     storeInteger(bytes.data() + 36, head.appliedBatch);
     storeInteger(bytes.data() + 44, static_cast<std::uint32_t>(head.settledDocument));
-    storeInteger(bytes.data() + 48, crc32c(ByteView(bytes).first(48)));
+    storeInteger(bytes.data() + 48, head.begunBatch);
+    storeInteger(bytes.data() + 56, head.historyBegin);
+    std::memcpy(bytes.data() + 64, head.nameHashKey.data(), 16);
+    storeInteger(bytes.data() + kHeadChecksumOffset, crc32c(ByteView(bytes).first(kHeadChecksumOffset)));
     return bytes;
 }
 
@@ -83,7 +53,8 @@ Result<TablesHead> decodeHead(ByteView bytes) {
     if (bytes.size() < 4) return damage("the head is too short");
     const auto version = loadInteger<std::uint32_t>(bytes.data());
     if (version != kFormatVersion) return damage(fmt::format("format {} is not known here", version));
-    if (bytes.size() != kHeadBytes || loadInteger<std::uint32_t>(bytes.data() + 48) != crc32c(bytes.first(48))) {
+    if (bytes.size() != kHeadBytes ||
+        loadInteger<std::uint32_t>(bytes.data() + kHeadChecksumOffset) != crc32c(bytes.first(kHeadChecksumOffset))) {
         return damage("the head's checksum is wrong");
     }
     TablesHead head;
@@ -91,13 +62,10 @@ Result<TablesHead> decodeHead(ByteView bytes) {
     head.marks = {loadInteger<std::uint64_t>(bytes.data() + 20), loadInteger<std::uint64_t>(bytes.data() + 28)};
     head.appliedBatch = loadInteger<std::uint64_t>(bytes.data() + 36);
     head.settledDocument = DocumentID{loadInteger<std::uint32_t>(bytes.data() + 44)};
+    head.begunBatch = loadInteger<std::uint64_t>(bytes.data() + 48);
+    head.historyBegin = loadInteger<std::uint64_t>(bytes.data() + 56);
+    std::memcpy(head.nameHashKey.data(), bytes.data() + 64, 16);
     return head;
-}
-
-std::optional<DocumentRecord> decodeDocument(ByteView bytes) {
-    if (bytes.size() != kDocumentBytes) return std::nullopt;
-    return DocumentRecord{FileID{loadInteger<std::uint64_t>(bytes.data())},
-                          loadInteger<std::int64_t>(bytes.data() + 8)};
 }
 
 }  // namespace
@@ -111,6 +79,7 @@ Result<void> ObjectTables::create(const std::string& path, const TablesHead& hea
     {
         ObjectTables tables;
         TRY(tables.openEnvironment(unfinished, kMapBytesMin));
+        TRY(tables.openHead(true));
         TRY(tables.openTables(true));
         TRY(tables.inTransaction([&](MDB_txn* transaction) { return putHead(transaction, tables.meta_, head); }));
         TRY(tables.sync());
@@ -127,8 +96,10 @@ Result<std::unique_ptr<ObjectTables>> ObjectTables::open(const std::string& path
     if (status.st_size == 0) return damage("the file is empty");
     auto tables = std::unique_ptr<ObjectTables>(new ObjectTables);
     TRY(tables->openEnvironment(path, mapBytes));
-    TRY(tables->openTables(false));
+    TRY(tables->openHead(false));
+    // First the head: tables of another format need not have what is asked for next.
     TRY(tables->loadHead());
+    TRY(tables->openTables(false));
     return tables;
 }
 
@@ -158,24 +129,39 @@ Result<void> ObjectTables::openEnvironment(const std::string& path, std::size_t 
     return {};
 }
 
-Result<void> ObjectTables::openTables(bool create) {
-    const unsigned flag = create ? MDB_CREATE : 0;
+Result<void> ObjectTables::openTables(bool create, std::span<const TableToOpen> tables) {
     MDB_txn* transaction = nullptr;
     if (const int code = mdb_txn_begin(environment_, nullptr, create ? 0 : MDB_RDONLY, &transaction); code != 0) {
         return errorOf(code);
     }
-    int code = mdb_dbi_open(transaction, nullptr, 0, &tableOfTables_);
-    if (code == 0) code = mdb_dbi_open(transaction, "meta", flag, &meta_);
-    if (code == 0) code = mdb_dbi_open(transaction, "objects", flag | MDB_INTEGERKEY, &objects_);
-    if (code == 0) code = mdb_dbi_open(transaction, "documents", flag | MDB_INTEGERKEY, &documents_);
-    if (code != 0) {
-        mdb_txn_abort(transaction);
-        return errorOf(code);
+    for (const auto& [name, flags, table] : tables) {
+        const int code = mdb_dbi_open(transaction, name, flags | (create && name != nullptr ? MDB_CREATE : 0), table);
+        if (code != 0) {
+            mdb_txn_abort(transaction);
+            return errorOf(code);
+        }
     }
     // Also a read transaction is committed: only then do its table handles outlive it.
-    code = mdb_txn_commit(transaction);
-    if (code != 0) return errorOf(code);
+    if (const int code = mdb_txn_commit(transaction); code != 0) return errorOf(code);
     return {};
+}
+
+Result<void> ObjectTables::openHead(bool create) {
+    return openTables(create, std::array<TableToOpen, 2>{{{nullptr, 0, &tableOfTables_}, {"meta", 0, &meta_}}});
+}
+
+Result<void> ObjectTables::openTables(bool create) {
+    constexpr unsigned kNumber = MDB_INTEGERKEY;
+    return openTables(create, std::array<TableToOpen, 8>{{
+                                  {"objects", kNumber, &objects_},
+                                  {"documents", kNumber, &documents_},
+                                  {"children", kNumber | MDB_DUPSORT | MDB_DUPFIXED, &children_},
+                                  {"names", 0, &names_},
+                                  {"attributes", kNumber, &attributes_},
+                                  {"events", kNumber, &events_},
+                                  {"documentEvents", kNumber, &documentChanges_},
+                                  {"timeMarks", kNumber, &timeMarks_},
+                              }});
 }
 
 Result<void> ObjectTables::loadHead() {
@@ -187,6 +173,13 @@ Result<void> ObjectTables::loadHead() {
     giveBackReader(transaction);
     head_ = TRY(std::move(head));
     return {};
+}
+
+int ObjectTables::putHead(MDB_txn* transaction, MDB_dbi table, const TablesHead& head) {
+    const auto bytes = encodeHead(head);
+    MDB_val key{kHeadKey.size(), const_cast<char*>(kHeadKey.data())};  // NOLINT: not written.
+    MDB_val value = valueOf(bytes);
+    return mdb_put(transaction, table, &key, &value, 0);
 }
 
 ObjectTables::~ObjectTables() {
@@ -298,6 +291,160 @@ Result<void> ObjectTables::Snapshot::objects(std::span<tablepages::Lookup> looku
     return {};
 }
 
+Result<void> ObjectTables::Snapshot::allObjects(std::uint64_t from,
+                                                const std::function<bool(FileID, const PackedRecord&)>& receive) const {
+    TRY(Result<void>(status_));
+    const Cursor cursor(transaction_, tables_.objects_);
+    IntegerKey<std::uint64_t> first(from);
+    MDB_val key = *first.value(), value{};
+    int code = cursor.get(&key, &value, MDB_SET_RANGE);
+    for (; code == 0; code = cursor.get(&key, &value, MDB_NEXT)) {
+        std::uint64_t fileID = 0;
+        std::memcpy(&fileID, key.mv_data, sizeof fileID);
+        const auto record = PackedRecord::decode(viewOf(value));
+        if (!record) return damage("an object has no record");
+        if (!receive(FileID{fileID}, *record)) return {};
+    }
+    if (code != MDB_NOTFOUND) return errorOf(code);
+    return {};
+}
+
+// MARK: Reading children, names and events
+
+std::uint64_t ObjectTables::Snapshot::childCount(FileID parent) const {
+    if (transaction_ == nullptr) return 0;
+    const Cursor cursor(transaction_, tables_.children_);
+    IntegerKey<std::uint64_t> key(static_cast<std::uint64_t>(parent));
+    MDB_val value{};
+    std::size_t count = 0;
+    if (cursor.get(key.value(), &value, MDB_SET) != 0 || mdb_cursor_count(cursor.get(), &count) != 0) return 0;
+    return count;
+}
+
+Result<std::vector<FileID>> ObjectTables::Snapshot::childrenWithHash(FileID parent, std::uint32_t hash) const {
+    TRY(Result<void>(status_));
+    const Cursor cursor(transaction_, tables_.children_);
+    IntegerKey<std::uint64_t> key(static_cast<std::uint64_t>(parent));
+    const auto first = encodeChild(hash, FileID{});
+    MDB_val value = valueOf(first);
+    std::vector<FileID> found;
+    int code = cursor.get(key.value(), &value, MDB_GET_BOTH_RANGE);
+    for (; code == 0; code = cursor.get(key.value(), &value, MDB_NEXT_DUP)) {
+        if (value.mv_size != kChildBytes || hashOfChild(viewOf(value)) != hash) break;
+        found.push_back(fileIDOfChild(viewOf(value)));
+    }
+    if (code != 0 && code != MDB_NOTFOUND) return errorOf(code);
+    return found;
+}
+
+Result<void> ObjectTables::Snapshot::children(FileID parent,
+                                              const std::function<void(std::span<const FileID>)>& receive) const {
+    TRY(Result<void>(status_));
+    const Cursor cursor(transaction_, tables_.children_);
+    IntegerKey<std::uint64_t> key(static_cast<std::uint64_t>(parent));
+    MDB_val value{};
+    std::vector<FileID> some;
+    int code = cursor.get(key.value(), &value, MDB_SET);
+    if (code == 0) code = cursor.get(key.value(), &value, MDB_GET_MULTIPLE);
+    for (; code == 0; code = cursor.get(key.value(), &value, MDB_NEXT_MULTIPLE)) {
+        some.clear();
+        for (ByteView rest = viewOf(value); rest.size() >= kChildBytes; rest = rest.subspan(kChildBytes)) {
+            some.push_back(fileIDOfChild(rest));
+        }
+        receive(some);
+    }
+    if (code != MDB_NOTFOUND) return errorOf(code);
+    return {};
+}
+
+bool ObjectTables::Snapshot::hasNames() const {
+    MDB_stat stat{};
+    return transaction_ != nullptr && mdb_stat(transaction_, tables_.names_, &stat) == 0 && stat.ms_entries > 0;
+}
+
+Result<std::vector<std::pair<NameKey, std::string>>> ObjectTables::Snapshot::names(FileID fileID) const {
+    TRY(Result<void>(status_));
+    const Cursor cursor(transaction_, tables_.names_);
+    const auto first = encodeNameKey({.fileID = fileID});
+    MDB_val key = valueOf(first), value{};
+    std::vector<std::pair<NameKey, std::string>> found;
+    int code = cursor.get(&key, &value, MDB_SET_RANGE);
+    for (; code == 0; code = cursor.get(&key, &value, MDB_NEXT)) {
+        const auto name = decodeNameKey(viewOf(key));
+        if (!name || name->fileID != fileID) break;
+        found.emplace_back(*name, textOf(viewOf(value)));
+    }
+    if (code != 0 && code != MDB_NOTFOUND) return errorOf(code);
+    return found;
+}
+
+Result<std::vector<NameKey>> ObjectTables::Snapshot::namesWithHash(FileID parent, std::uint32_t hash) const {
+    TRY(Result<void>(status_));
+    const Cursor cursor(transaction_, tables_.names_);
+    const auto first = encodeNamePlace({.parent = parent, .hash = hash});
+    MDB_val key = valueOf(first), value{};
+    std::vector<NameKey> found;
+    int code = cursor.get(&key, &value, MDB_SET_RANGE);
+    for (; code == 0; code = cursor.get(&key, &value, MDB_NEXT)) {
+        const auto place = decodeNamePlace(viewOf(key));
+        if (!place || place->parent != parent || place->hash != hash) break;
+        found.push_back(*place);
+    }
+    if (code != 0 && code != MDB_NOTFOUND) return errorOf(code);
+    return found;
+}
+
+std::optional<std::string_view> ObjectTables::Snapshot::name(const NameKey& nameKey) const {
+    const auto bytes = encodeNameKey(nameKey);
+    MDB_val key = valueOf(bytes), value{};
+    if (transaction_ == nullptr || mdb_get(transaction_, tables_.names_, &key, &value) != 0) return std::nullopt;
+    return textOf(viewOf(value));
+}
+
+std::optional<ByteView> ObjectTables::Snapshot::attributes(DocumentID documentID) const {
+    IntegerKey<std::uint32_t> key(static_cast<std::uint32_t>(documentID));
+    MDB_val value{};
+    if (transaction_ == nullptr || mdb_get(transaction_, tables_.attributes_, key.value(), &value) != 0)
+        return std::nullopt;
+    return viewOf(value);
+}
+
+Result<void> ObjectTables::Snapshot::readEvents(MDB_dbi table, std::uint64_t after,
+                                                const EventReceiver& receive) const {
+    TRY(Result<void>(status_));
+    if (after == ~std::uint64_t{0}) return {};
+    const Cursor cursor(transaction_, table);
+    IntegerKey<std::uint64_t> from(after + 1);
+    MDB_val key = *from.value(), value{};
+    int code = cursor.get(&key, &value, MDB_SET_RANGE);
+    for (; code == 0; code = cursor.get(&key, &value, MDB_NEXT)) {
+        std::uint64_t id = 0;
+        std::memcpy(&id, key.mv_data, sizeof id);
+        if (!receive(id, viewOf(value))) return {};
+    }
+    if (code != MDB_NOTFOUND) return errorOf(code);
+    return {};
+}
+
+Result<void> ObjectTables::Snapshot::events(std::uint64_t after, const EventReceiver& receive) const {
+    return readEvents(tables_.events_, after, receive);
+}
+
+Result<void> ObjectTables::Snapshot::documentChanges(std::uint64_t after, const EventReceiver& receive) const {
+    return readEvents(tables_.documentChanges_, after, receive);
+}
+
+Result<std::vector<std::pair<std::uint64_t, std::int64_t>>> ObjectTables::Snapshot::timeMarks() const {
+    std::vector<std::pair<std::uint64_t, std::int64_t>> marks;
+    TRY(readEvents(tables_.timeMarks_, 0, [&](std::uint64_t id, ByteView value) {
+        if (value.size() == sizeof(std::int64_t)) marks.emplace_back(id, loadInteger<std::int64_t>(value.data()));
+        return true;
+    }));
+    return marks;
+}
+
+// MARK: Counting
+
 std::uint64_t ObjectTables::lastTransaction() const {
     MDB_envinfo info{};
     mdb_env_info(environment_, &info);
@@ -321,164 +468,8 @@ std::uint64_t ObjectTables::documentCount() const {
     return entriesOf(documents_);
 }
 
-// MARK: Writing
-
-int ObjectTables::inTransactionOnce(const Body& body) {
-    MDB_txn* transaction = nullptr;
-    if (const int code = mdb_txn_begin(environment_, nullptr, 0, &transaction); code != 0) return code;
-    if (const int code = body(transaction); code != 0) {
-        mdb_txn_abort(transaction);
-        return code;
-    }
-    return mdb_txn_commit(transaction);
-}
-
-/// The body is run again, in a larger map, when the map is full.
-Result<void> ObjectTables::inTransaction(const Body& body) {
-    while (true) {
-        const int code = inTransactionOnce(body);
-        if (code == 0) return {};
-        if (code != MDB_MAP_FULL) return errorOf(code);
-        TRY(growMap());
-    }
-}
-
-/// Puts the last commit's head page on the disk; everything else is there already.
-Result<void> ObjectTables::sync() {
-    if (const int code = mdb_env_sync(environment_, 1); code != 0) return errorOf(code);
-    return {};
-}
-
-Result<void> ObjectTables::growMap() {
-    const MutexLock lock(readersMutex_);
-    mapMoves_ = true;
-    while (busyReaders_ > 0) readersChanged_.wait(readersMutex_);
-    for (MDB_txn* reader : idleReaders_) mdb_txn_abort(reader);
-    idleReaders_.clear();
-    MDB_envinfo info{};
-    mdb_env_info(environment_, &info);
-    const std::size_t wanted = info.me_mapsize * 2;
-    // The library lets go of the old map before it asks for the new one, so ask first whether there is room.
-    void* room = ::mmap(nullptr, wanted, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
-    int code = room == MAP_FAILED ? ENOMEM : 0;
-    if (code == 0) {
-        ::munmap(room, wanted);
-        code = mdb_env_set_mapsize(environment_, wanted);
-        if (code != 0) fatal("the volume store's map is lost");
-    }
-    mapMoves_ = false;
-    readersChanged_.notifyAll();
-    if (code != 0) return errorOf(code);
-    return {};
-}
-
-int ObjectTables::putHead(MDB_txn* transaction, MDB_dbi table, const TablesHead& head) {
-    const auto bytes = encodeHead(head);
-    MDB_val key{kHeadKey.size(), const_cast<char*>(kHeadKey.data())};  // NOLINT: not written.
-    MDB_val value = valueOf(bytes);
-    return mdb_put(transaction, table, &key, &value, 0);
-}
-
-/// Puts records, and counts the pages that come to be changed by them.
-class ObjectTables::Putter {
-public:
-    Putter(MDB_txn* transaction, std::size_t pageBytes, std::size_t pagesMax)
-        : transaction_(transaction), pageBytes_(pageBytes), pagesMax_(pagesMax) {}
-
-    /// Whether the transaction has about as many pages in memory as it shall.
-    bool isFull() const { return pages_ >= pagesMax_; }
-
-    int put(MDB_dbi table, const Overlay::Document& document) {
-        IntegerKey<std::uint32_t> key(static_cast<std::uint32_t>(document.first));
-        MDB_val place{kDocumentBytes, nullptr};
-        const int code = mdb_put(transaction_, table, key.value(), &place, MDB_RESERVE);
-        if (code != 0) return code;
-        auto* to = count(place);
-        storeInteger(to, static_cast<std::uint64_t>(document.second.fileID));
-        storeInteger(to + 8, document.second.birthTime);
-        return 0;
-    }
-
-    int put(MDB_dbi table, const Overlay::Object& object) {
-        IntegerKey<std::uint64_t> key(static_cast<std::uint64_t>(object.first));
-        MDB_val place{object.second.size(), nullptr};
-        const int code = mdb_put(transaction_, table, key.value(), &place, MDB_RESERVE);
-        if (code != 0) return code;
-        std::memcpy(count(place), object.second.data(), object.second.size());
-        return 0;
-    }
-
-private:
-    // Records come in key order, so a page is changed by several in a row. Where one goes tells whether it is the
-    // page of the one
-    // before; that may be wrong by a few.
-    std::byte* count(const MDB_val& place) {
-        const auto address = reinterpret_cast<std::uintptr_t>(place.mv_data);
-        const std::uintptr_t distance = address > last_ ? address - last_ : last_ - address;
-        if (distance >= pageBytes_) ++pages_;
-        last_ = address;
-        return static_cast<std::byte*>(place.mv_data);
-    }
-
-    MDB_txn* transaction_;
-    std::size_t pageBytes_;
-    std::size_t pagesMax_;
-    std::size_t pages_ = 0;
-    std::uintptr_t last_ = 0;
-};
-
-Result<void> ObjectTables::write(const Overlay& overlay, const TablesHead& head, std::size_t pagesMax,
-                                 const StepObserver& observer) {
-    const auto objects = overlay.objectsInKeyOrder();
-    const auto& documents = overlay.documents();
-    std::size_t document = 0, object = 0;
-    for (bool isLast = false; !isLast;) {
-        std::size_t documentEnd = 0, objectEnd = 0;
-        TRY(inTransaction([&](MDB_txn* transaction) {
-            Putter putter(transaction, pageBytes_, pagesMax);
-            int code = 0;
-            for (documentEnd = document; code == 0 && documentEnd < documents.size() && !putter.isFull();
-                 ++documentEnd) {
-                code = putter.put(documents_, documents[documentEnd]);
-            }
-            for (objectEnd = object; code == 0 && objectEnd < objects.size() && !putter.isFull(); ++objectEnd) {
-                code = putter.put(objects_, objects[objectEnd]);
-            }
-            isLast = documentEnd == documents.size() && objectEnd == objects.size();
-            if (code == 0 && isLast) code = putHead(transaction, meta_, head);
-            return code;
-        }));
-        if (observer) observer();
-        document = documentEnd;
-        object = objectEnd;
-    }
-    TRY(sync());
-    head_ = head;
-    return {};
-}
-
-Result<void> ObjectTables::removeUnsettledDocuments() {
-    return inTransaction([&](MDB_txn* transaction) {
-        MDB_cursor* cursor = nullptr;
-        if (const int code = mdb_cursor_open(transaction, documents_, &cursor); code != 0) return code;
-        IntegerKey<std::uint32_t> from(static_cast<std::uint32_t>(head_.settledDocument) + 1);
-        MDB_val key = *from.value(), value{};
-        int code = mdb_cursor_get(cursor, &key, &value, MDB_SET_RANGE);
-        for (; code == 0; code = mdb_cursor_get(cursor, &key, &value, MDB_NEXT)) {
-            std::uint32_t documentID = 0;
-            std::memcpy(&documentID, key.mv_data, sizeof documentID);
-            const auto document = decodeDocument(viewOf(value));
-            IntegerKey<std::uint64_t> objectKey(document ? static_cast<std::uint64_t>(document->fileID) : 0);
-            MDB_val object{};
-            const bool known = mdb_get(transaction, objects_, objectKey.value(), &object) == 0;
-            const auto record = known ? PackedRecord::decode(viewOf(object)) : std::nullopt;
-            if (record && record->documentID == DocumentID{documentID}) continue;
-            code = mdb_cursor_del(cursor, 0);
-            if (code != 0) break;
-        }
-        mdb_cursor_close(cursor);
-        return code == MDB_NOTFOUND ? 0 : code;
-    });
+std::uint64_t ObjectTables::eventCount() const {
+    return entriesOf(events_) + entriesOf(documentChanges_);
 }
 
 }  // namespace cindral

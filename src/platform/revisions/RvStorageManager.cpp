@@ -10,6 +10,8 @@
 
 #include "platform/foundation/Log.h"
 #include "platform/revisions/ObjectFinder.h"
+#include "platform/revisions/OwnAttributes.h"
+#include "platform/revisions/VolumeIndex.h"
 
 namespace cindral {
 
@@ -33,14 +35,41 @@ Result<void> recordFolders(VolumeStore& store, std::vector<const DirectoryRefere
     return {};
 }
 
-/// Finds an object, and records where it is now. A record is a hint: one that can't be written is no reason not to answer.
-Result<FoundObject> findAndRecord(VolumeStore& store, std::uint32_t device, FileID fileID) {
+// An object may move again while it is looked for; one that keeps moving is not found.
+constexpr int kSearchesMax = 3;
+
+/// Searches the file system for an object, and records where it is now. A record is a hint: one that can't be written
+/// is no reason not to answer.
+Result<FoundObject> searchAndRecord(VolumeStore& store, std::uint32_t device, FileID fileID) {
     const ObjectFinder finder(store, device);
     FoundObject found = TRY(finder.find(fileID));
     if (found.isRecorded) return found;
     const Result<void> recorded = finder.record(store, found);
     if (!recorded.ok()) logError("can't record where {} is; {}", found.path(), recorded.error().description());
     return found;
+}
+
+/// Whether one of them is of an object that nobody has recorded yet.
+Result<bool> hasUnknown(const VolumeStore& store, std::span<const ObjectSighting> sightings) {
+    std::vector<FileID> fileIDs;
+    fileIDs.reserve(sightings.size());
+    for (const ObjectSighting& sighting : sightings) fileIDs.push_back(sighting.fileID);
+    bool isUnknown = false;
+    TRY(store.indexed(fileIDs, [&](std::size_t i, const IndexedObject* object) {
+        isUnknown = isUnknown || object == nullptr || object->birthTime != sightings[i].birthTime;
+    }));
+    return isUnknown;
+}
+
+/// Remembers the system's own attributes of documents that have some, so that they survive a save that drops them.
+void rememberAttributes(VolumeStore& store, const KsURL& entry, DocumentID document) {
+    entry.loadAttributeNames();
+    if (!entry.mayHaveAttributeWithPrefix(own_attributes::kPrefix)) return;
+    const std::string name(entry.lastPathComponent());
+    const Result<Bytes> attributes = own_attributes::read(entry.directory()->fd.get(), name.c_str());
+    if (!attributes.ok() || *attributes == store.attributes(document)) return;
+    const Result<void> remembered = store.rememberAttributes(document, *attributes);
+    if (!remembered.ok()) logError("can't remember the attributes of {}; {}", name, remembered.error().description());
 }
 
 /// Tells the names of objects with several from the one that each is listed under.
@@ -100,6 +129,42 @@ std::shared_ptr<VolumeStore> RvStorageManager::store() const {
     return store_;
 }
 
+void RvStorageManager::setCatchUp(CatchUp catchUp) {
+    auto shared = catchUp ? std::make_shared<const CatchUp>(std::move(catchUp)) : nullptr;
+    const MutexLock lock(mutex_);
+    catchUp_ = std::move(shared);
+}
+
+bool RvStorageManager::catchUp() const {
+    std::shared_ptr<const CatchUp> current;
+    {
+        const MutexLock lock(mutex_);
+        current = catchUp_;
+    }
+    return current && (*current)();
+}
+
+/// Looks for an object where the records say, as of now.
+struct RvStorageManager::Search {
+    const RvStorageManager& manager;
+    VolumeStore& store;
+    std::uint32_t device;
+
+    /// `fileIDNow` is asked before each look, because a document may have gone to another object meanwhile. Returns its
+    /// error, or ENOENT.
+    template <typename FileIDNow>
+    Result<FoundObject> find(FileIDNow fileIDNow) const {
+        const ObjectFinder finder(store, device);
+        for (int search = 0;; ++search) {
+            const FileID fileID = TRY(fileIDNow());
+            Result<FoundObject> found = finder.findByRecords(fileID);
+            if (found.ok()) return found;
+            if (search == kSearchesMax) return KsError::posix(ENOENT);
+            if (!manager.catchUp()) return searchAndRecord(store, device, TRY(fileIDNow()));
+        }
+    }
+};
+
 std::uint64_t RvStorageManager::resolveDocumentID(std::int64_t documentID, std::uint32_t device) {
     const auto fail = [](int errorNumber) {
         errno = errorNumber;
@@ -108,9 +173,12 @@ std::uint64_t RvStorageManager::resolveDocumentID(std::int64_t documentID, std::
     const auto store = this->store();
     if (!store) return fail(EAGAIN);
     if (documentID <= 0 || documentID > UINT32_MAX) return fail(EINVAL);
-    const auto document = store->document(DocumentID{static_cast<std::uint32_t>(documentID)});
-    if (!document) return fail(ENOENT);
-    const Result<FoundObject> found = findAndRecord(*store, device, document->fileID);
+    std::optional<DocumentRecord> document;
+    const Result<FoundObject> found = Search{*this, *store, device}.find([&]() -> Result<FileID> {
+        document = store->document(DocumentID{static_cast<std::uint32_t>(documentID)});
+        if (!document) return KsError::posix(ENOENT);
+        return document->fileID;
+    });
     if (!found.ok()) return fail(errnoOf(found.error()));
     // The number went to another object: the document's own is gone.
     if (found->status.birthStamp() != document->birthTime) return fail(ENOENT);
@@ -134,7 +202,9 @@ std::uint32_t RvStorageManager::documentIDForDescriptor(int fd) {
     sighting.kind = objectKindOf(*status, status->isDirectory());
     sighting.wantsDocumentID = true;
     std::string name;
-    if (const auto known = store->object(sighting.fileID); known && known->birthTime == sighting.birthTime) {
+    auto known = store->object(sighting.fileID);
+    if ((!known || known->birthTime != sighting.birthTime) && catchUp()) known = store->object(sighting.fileID);
+    if (known && known->birthTime == sighting.birthTime) {
         if (known->documentID != DocumentID{}) return static_cast<std::uint32_t>(known->documentID);
         sighting.parent = known->parent;
         name = known->name;
@@ -193,12 +263,15 @@ Result<void> RvStorageManager::identify(std::vector<KsURL>& entries) {
         sighting.wantsDocumentID = sighting.kind == ObjectKind::file || sighting.kind == ObjectKind::package;
         sighted.push_back(&entry);
     }
+    // A new file may be a document that was just saved: the recorder knows, and hands it the number it had.
+    if (TRY(hasUnknown(*store, sightings))) (void)catchUp();
     TRY(recordFolders(*store, folders, sightings));
     TRY(store->identify(sightings));
     for (std::size_t i = 0; i < sightings.size(); ++i) {
         if (!sightings[i].wantsDocumentID) continue;
         sighted[i]->setCachedResourceValue(ResourceKey::documentIdentifier,
                                            std::uint64_t{static_cast<std::uint32_t>(sightings[i].documentID)});
+        rememberAttributes(*store, *sighted[i], sightings[i].documentID);
     }
     return {};
 }
@@ -206,7 +279,8 @@ Result<void> RvStorageManager::identify(std::vector<KsURL>& entries) {
 Result<std::string> RvStorageManager::pathOfFileID(std::uint64_t fileID, std::uint32_t device, std::size_t sizeMax) {
     const auto store = this->store();
     if (!store) return KsError::posix(EAGAIN);
-    const FoundObject found = TRY(findAndRecord(*store, device, FileID{fileID}));
+    const FoundObject found =
+        TRY((Search{*this, *store, device}.find([fileID]() -> Result<FileID> { return FileID{fileID}; })));
     std::string path = found.path();
     if (path.size() >= sizeMax) return KsError::posix(ENAMETOOLONG, path);
     return path;

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -27,6 +28,12 @@ public:
     /// Connects the manager, and the URLs' document identifiers, to a store; null disconnects.
     void setStore(std::shared_ptr<VolumeStore> store);
     std::shared_ptr<VolumeStore> store() const;
+
+    /// Brings the store's records up to date with what others did to the tree; answers whether they then hold every
+    /// object. Asked when the records don't lead to an object.
+    using CatchUp = std::function<bool()>;
+    /// Empty: the records are only what listings saw, and the file system itself is searched.
+    void setCatchUp(CatchUp catchUp);
 
     /// The file ID of the document on the device, checked against the file system; 0 with errno otherwise:
     /// ENOENT no such document, or its file is gone; ESTALE it moved while it was looked for, ask again; EAGAIN no
@@ -58,8 +65,13 @@ public:
     Result<std::string> pathOfFileID(std::uint64_t fileID, std::uint32_t device, std::size_t sizeMax);
 
 private:
+    struct Search;
+    /// False when there is nothing that could.
+    bool catchUp() const;
+
     mutable Mutex mutex_;
     std::shared_ptr<VolumeStore> store_ GUARDED_BY(mutex_);
+    std::shared_ptr<const CatchUp> catchUp_ GUARDED_BY(mutex_);
 };
 
 }  // namespace cindral

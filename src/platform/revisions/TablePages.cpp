@@ -19,8 +19,16 @@ constexpr std::uint64_t kNoPage = ~std::uint64_t{0};
 constexpr std::uint64_t kMetaPages = 2;
 constexpr unsigned kDepthMax = 32;  // The library's cursors go no deeper.
 
-enum PageFlags : std::uint16_t { kBranch = 0x01, kLeaf = 0x02, kOverflow = 0x04, kMeta = 0x08 };
-enum NodeFlags : std::uint16_t { kBigValue = 0x01, kTable = 0x02 };
+enum PageFlags : std::uint16_t {
+    kBranch = 0x01,
+    kLeaf = 0x02,
+    kOverflow = 0x04,
+    kMeta = 0x08,
+    kChanged = 0x10,  // Of a page within a page what is on the disk may still say so.
+    kFixed = 0x20,    // A leaf of keys of one size, one behind the other, without values.
+    kWithin = 0x40,   // A page within an entry of another.
+};
+enum NodeFlags : std::uint16_t { kBigValue = 0x01, kTable = 0x02, kSeveral = 0x04 };
 
 struct PageHead {
     std::uint64_t number;
@@ -80,7 +88,17 @@ struct Node {
     const std::byte* value;
 };
 
-enum class KeyOrder { integer, bytes };
+/// A table whose keys are integers.
+struct Table {
+    std::string_view name;
+    std::size_t keyBytes = 0;
+    std::size_t valueBytes = 0;  // Where a key may have several values, which then have one size.
+};
+
+constexpr Table kTables[] = {
+    {"objects", 8}, {"documents", 4},      {"children", 8, 12}, {"attributes", 4},
+    {"events", 8},  {"documentEvents", 8}, {"timeMarks", 8},
+};
 
 /// Walks every page that is in use, reading the file (a map of a file that is too short would end the process).
 class Checker {
@@ -96,11 +114,17 @@ private:
     // Each step returns whether to go on: false after damage.
     Result<bool> checkAll();
     Result<bool> readMeta();
-    Result<bool> checkTree(const Tree& tree, std::string_view name, std::size_t keyBytes);
+    /// Its keys are of any length when `keyBytes` is 0; a key has several values, of one size, when `valueBytes` is not.
+    Result<bool> checkTree(const Tree& tree, std::string_view name, std::size_t keyBytes, std::size_t valueBytes = 0);
+    Result<bool> walkTree(const Tree& tree);
     Result<bool> checkPage(std::uint64_t number, unsigned depth);
     Result<bool> checkBranch(const Bytes& page, unsigned depth);
     Result<bool> checkLeaf(const Bytes& page);
+    bool checkFixedLeaf(ByteView page);
     Result<bool> checkValue(const Node& node);
+    Result<bool> checkSeveral(const Node& node);
+    Result<bool> checkValueTree(const Node& node);
+    bool checkPageWithin(const Node& node);
     Result<bool> readBigValue(std::uint64_t number, std::size_t size, Bytes& value);
     Result<bool> readPages(std::uint64_t number, std::size_t count, Bytes& into);
     std::optional<Node> node(const Bytes& page, std::size_t index, bool branch) const;
@@ -119,12 +143,17 @@ private:
     std::vector<bool> inUse_;
     std::optional<std::string> damage_;
 
-    // Of the tree that is being walked.
-    std::string_view tree_;
-    std::size_t keyBytes_ = 0;  // 0: of any length, in the order of their bytes.
-    std::uint64_t entries_ = 0;
-    std::optional<Bytes> previousKey_;
-    bool separatorBefore_ = false;  // previousKey_ came from a branch: the next key may be equal to it.
+    /// Of the tree that is being walked.
+    struct Walk {
+        std::string name;
+        std::size_t keyBytes = 0;    // 0: of any length, in the order of their bytes.
+        std::size_t valueBytes = 0;  // Of each of a key's values, where it may have several; otherwise 0.
+        bool isFixed = false;        // The values of one key, which are its keys.
+        std::uint64_t entries = 0;
+        std::optional<Bytes> previousKey = std::nullopt;
+        bool separatorBefore = false;  // previousKey came from a branch: the next key may be equal to it.
+    };
+    Walk walk_;
     std::vector<std::pair<std::string, Tree>> tables_;
     std::vector<std::uint64_t> freePages_;
 };
@@ -166,9 +195,9 @@ Result<bool> Checker::readMeta() {
 
 bool Checker::claim(std::uint64_t number) {
     if (number < kMetaPages || number > meta_.lastPage || number >= inUse_.size()) {
-        return damaged(fmt::format("page {} of \"{}\" is none of the file's", number, tree_));
+        return damaged(fmt::format("page {} of \"{}\" is none of the file's", number, walk_.name));
     }
-    if (inUse_[number]) return damaged(fmt::format("page {} of \"{}\" is in use twice", number, tree_));
+    if (inUse_[number]) return damaged(fmt::format("page {} of \"{}\" is in use twice", number, walk_.name));
     inUse_[number] = true;
     return true;
 }
@@ -185,27 +214,28 @@ std::optional<Node> Checker::node(const Bytes& page, std::size_t index, bool bra
     if (head.keyBytes > room || valueBytes > room - head.keyBytes) return std::nullopt;
     // The first key of a branch is never compared and may be left out.
     const bool keyCounts = !branch || index > 0;
-    if (keyCounts && keyBytes_ != 0 && head.keyBytes != keyBytes_) return std::nullopt;
+    if (keyCounts && walk_.keyBytes != 0 && head.keyBytes != walk_.keyBytes) return std::nullopt;
     const std::byte* key = page.data() + offset + sizeof(NodeHead);
     return Node{head, ByteView(key, head.keyBytes), key + head.keyBytes};
 }
 
 bool Checker::keyFollows(ByteView key) {
     bool follows = true;
-    if (previousKey_) {
+    if (walk_.previousKey) {
         int order = 0;
-        if (keyBytes_ == 8) {
-            const auto a = load<std::uint64_t>(previousKey_->data()), b = load<std::uint64_t>(key.data());
+        if (walk_.keyBytes == 8) {
+            const auto a = load<std::uint64_t>(walk_.previousKey->data()), b = load<std::uint64_t>(key.data());
             order = a < b ? -1 : a > b ? 1 : 0;
-        } else if (keyBytes_ == 4) {
-            const auto a = load<std::uint32_t>(previousKey_->data()), b = load<std::uint32_t>(key.data());
+        } else if (walk_.keyBytes == 4) {
+            const auto a = load<std::uint32_t>(walk_.previousKey->data()), b = load<std::uint32_t>(key.data());
             order = a < b ? -1 : a > b ? 1 : 0;
         } else {
-            order = textOf(*previousKey_).compare(textOf(key));
+            order = textOf(*walk_.previousKey).compare(textOf(key));
         }
-        follows = order < 0 || (order == 0 && separatorBefore_);
+        follows = order < 0 || (order == 0 && walk_.separatorBefore);
     }
-    previousKey_.emplace(key.begin(), key.end());
+    if (!walk_.previousKey) walk_.previousKey.emplace();
+    walk_.previousKey->assign(key.begin(), key.end());
     return follows;
 }
 
@@ -214,22 +244,24 @@ Result<bool> Checker::checkPage(std::uint64_t number, unsigned depth) {
     Bytes page;
     if (!TRY(readPages(number, 1, page))) return false;
     const auto head = load<PageHead>(page.data());
-    const std::uint16_t expected = depth == 1 ? kLeaf : kBranch;
+    const std::uint16_t leaf = walk_.isFixed ? kLeaf | kFixed : kLeaf;
+    const std::uint16_t expected = depth == 1 ? leaf : std::uint16_t{kBranch};
     const bool sound = head.number == number && head.flags == expected && head.lower > sizeof(PageHead) &&
                        head.lower % 2 == 0 && head.lower <= head.upper && head.upper <= page.size();
-    if (!sound) return damaged(fmt::format("page {} of \"{}\" is not what it should be", number, tree_));
-    return depth == 1 ? checkLeaf(page) : checkBranch(page, depth);
+    if (!sound) return damaged(fmt::format("page {} of \"{}\" is not what it should be", number, walk_.name));
+    if (depth > 1) return checkBranch(page, depth);
+    return walk_.isFixed ? checkFixedLeaf(page) : checkLeaf(page);
 }
 
 Result<bool> Checker::checkBranch(const Bytes& page, unsigned depth) {
     const auto head = load<PageHead>(page.data());
     for (std::size_t i = 0; i < head.entryCount(); ++i) {
         const auto entry = node(page, i, true);
-        if (!entry) return damaged(fmt::format("an entry of page {} of \"{}\" is broken", head.number, tree_));
+        if (!entry) return damaged(fmt::format("an entry of page {} of \"{}\" is broken", head.number, walk_.name));
         if (i > 0) {
             const bool follows = keyFollows(entry->key);
-            separatorBefore_ = true;
-            if (!follows) return damaged(fmt::format("page {} of \"{}\" is out of order", head.number, tree_));
+            walk_.separatorBefore = true;
+            if (!follows) return damaged(fmt::format("page {} of \"{}\" is out of order", head.number, walk_.name));
         }
         if (!TRY(checkPage(entry->head.childPage(), depth - 1))) return false;
     }
@@ -240,22 +272,77 @@ Result<bool> Checker::checkLeaf(const Bytes& page) {
     const auto head = load<PageHead>(page.data());
     for (std::size_t i = 0; i < head.entryCount(); ++i) {
         const auto entry = node(page, i, false);
-        if (!entry) return damaged(fmt::format("an entry of page {} of \"{}\" is broken", head.number, tree_));
+        if (!entry) return damaged(fmt::format("an entry of page {} of \"{}\" is broken", head.number, walk_.name));
         if (!keyFollows(entry->key))
-            return damaged(fmt::format("page {} of \"{}\" is out of order", head.number, tree_));
-        separatorBefore_ = false;
-        ++entries_;
+            return damaged(fmt::format("page {} of \"{}\" is out of order", head.number, walk_.name));
+        walk_.separatorBefore = false;
+        if (walk_.valueBytes != 0) {
+            if (!TRY(checkSeveral(*entry))) return false;
+            continue;
+        }
+        ++walk_.entries;
         if (!TRY(checkValue(*entry))) return false;
     }
     return true;
 }
 
+bool Checker::checkFixedLeaf(ByteView page) {
+    const auto head = load<PageHead>(page.data());
+    if (head.padding != walk_.keyBytes || sizeof(PageHead) + head.entryCount() * walk_.keyBytes > page.size()) {
+        return damaged(fmt::format("page {} of \"{}\" is not what it should be", head.number, walk_.name));
+    }
+    for (std::size_t i = 0; i < head.entryCount(); ++i) {
+        if (!keyFollows(page.subspan(sizeof(PageHead) + i * walk_.keyBytes, walk_.keyBytes))) {
+            return damaged(fmt::format("page {} of \"{}\" is out of order", head.number, walk_.name));
+        }
+        walk_.separatorBefore = false;
+        ++walk_.entries;
+    }
+    return true;
+}
+
+/// The values of one key: one as any, several in a page within the entry, many in a tree of their own.
+Result<bool> Checker::checkSeveral(const Node& node) {
+    if (node.head.flags == 0) {
+        ++walk_.entries;
+        return node.head.valueBytes() == walk_.valueBytes ||
+               damaged(fmt::format("\"{}\" has a value of another size", walk_.name));
+    }
+    if ((node.head.flags & ~kTable) != kSeveral)
+        return damaged(fmt::format("\"{}\" has values of no kind", walk_.name));
+    Walk outer = std::exchange(
+        walk_, Walk{.name = fmt::format("values of {}", walk_.name), .keyBytes = walk_.valueBytes, .isFixed = true});
+    const bool isGood = (node.head.flags & kTable) != 0 ? TRY(checkValueTree(node)) : checkPageWithin(node);
+    outer.entries += walk_.entries;
+    walk_ = std::move(outer);
+    return isGood;
+}
+
+Result<bool> Checker::checkValueTree(const Node& node) {
+    if (node.head.valueBytes() != sizeof(Tree)) return damaged("a table where none can be");
+    const auto tree = load<Tree>(node.value);
+    if (tree.padding != walk_.keyBytes || tree.root == kNoPage)
+        return damaged(fmt::format("\"{}\" is no tree", walk_.name));
+    return walkTree(tree);
+}
+
+bool Checker::checkPageWithin(const Node& node) {
+    const ByteView page(node.value, node.head.valueBytes());
+    if (page.size() < sizeof(PageHead)) return damaged(fmt::format("a page of \"{}\" is too short", walk_.name));
+    const auto head = load<PageHead>(page.data());
+    const bool sound = (head.flags & ~kChanged) == (kLeaf | kFixed | kWithin) && head.lower > sizeof(PageHead) &&
+                       head.lower % 2 == 0 && head.lower <= head.upper && head.upper <= page.size();
+    if (!sound) return damaged(fmt::format("a page of \"{}\" is not what it should be", walk_.name));
+    return checkFixedLeaf(page);
+}
+
 Result<bool> Checker::checkValue(const Node& node) {
     const bool isTable = node.head.flags == kTable;
     if ((node.head.flags & ~kBigValue) != 0 && !isTable)
-        return damaged(fmt::format("\"{}\" has values of no kind", tree_));
+        return damaged(fmt::format("\"{}\" has values of no kind", walk_.name));
     if (isTable) {
-        if (tree_ != "tables" || node.head.valueBytes() != sizeof(Tree)) return damaged("a table where none can be");
+        if (walk_.name != "tables" || node.head.valueBytes() != sizeof(Tree))
+            return damaged("a table where none can be");
         tables_.emplace_back(textOf(node.key), load<Tree>(node.value));
         return true;
     }
@@ -265,7 +352,7 @@ Result<bool> Checker::checkValue(const Node& node) {
         if (!TRY(readBigValue(load<std::uint64_t>(node.value), node.head.valueBytes(), big))) return false;
         value = ByteView(big).subspan(sizeof(PageHead), node.head.valueBytes());
     }
-    return tree_ != "free" || checkFreeList(value);
+    return walk_.name != "free" || checkFreeList(value);
 }
 
 Result<bool> Checker::readBigValue(std::uint64_t number, std::size_t size, Bytes& value) {
@@ -276,7 +363,7 @@ Result<bool> Checker::readBigValue(std::uint64_t number, std::size_t size, Bytes
     if (!TRY(readPages(number, count, value))) return false;
     const auto head = load<PageHead>(value.data());
     if (head.number != number || head.flags != kOverflow || head.overflowPages() != count) {
-        return damaged(fmt::format("page {} of \"{}\" is not what it should be", number, tree_));
+        return damaged(fmt::format("page {} of \"{}\" is not what it should be", number, walk_.name));
     }
     return true;
 }
@@ -294,27 +381,29 @@ bool Checker::checkFreeList(ByteView value) {
     return true;
 }
 
-Result<bool> Checker::checkTree(const Tree& tree, std::string_view name, std::size_t keyBytes) {
-    tree_ = name;
-    keyBytes_ = keyBytes;
-    entries_ = 0;
-    previousKey_.reset();
-    separatorBefore_ = false;
+Result<bool> Checker::checkTree(const Tree& tree, std::string_view name, std::size_t keyBytes, std::size_t valueBytes) {
+    walk_ = {.name = std::string(name), .keyBytes = keyBytes, .valueBytes = valueBytes};
+    return walkTree(tree);
+}
+
+Result<bool> Checker::walkTree(const Tree& tree) {
     if (tree.root != kNoPage) {
         if (tree.depth == 0 || tree.depth > kDepthMax)
-            return damaged(fmt::format("\"{}\" is {} deep", name, tree.depth));
+            return damaged(fmt::format("\"{}\" is {} deep", walk_.name, tree.depth));
         if (!TRY(checkPage(tree.root, tree.depth))) return false;
     }
-    if (entries_ != tree.entries)
-        return damaged(fmt::format("\"{}\" holds {} entries of {}", name, entries_, tree.entries));
+    if (walk_.entries != tree.entries) {
+        return damaged(fmt::format("\"{}\" holds {} entries of {}", walk_.name, walk_.entries, tree.entries));
+    }
     return true;
 }
 
 Result<bool> Checker::checkTables() {
     const auto tables = std::exchange(tables_, {});
     for (const auto& [name, tree] : tables) {
-        const std::size_t keyBytes = name == "objects" ? 8 : name == "documents" ? 4 : 0;
-        if (!TRY(checkTree(tree, name, keyBytes))) return false;
+        const Table* known = std::ranges::find(kTables, name, &Table::name);
+        const Table& table = known != std::end(kTables) ? *known : Table{.name = name};
+        if (!TRY(checkTree(tree, name, table.keyBytes, table.valueBytes))) return false;
     }
     return true;
 }

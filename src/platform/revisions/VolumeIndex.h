@@ -19,7 +19,7 @@ struct IndexedObject {
     FileID fileID{};
     std::int64_t birthTime = 0;  ///< ns since 1970, 0 where the file system has none
     FileID parent{};
-    std::string_view name;
+    std::string_view name = {};
     ObjectKind kind = ObjectKind::other;
     std::int64_t changeTime = 0;  ///< ns since 1970; 0: listed before the recorder ever looked at it
     std::uint64_t size = 0;       ///< bytes; of a folder 0
@@ -44,11 +44,11 @@ struct JournalEvent {
     FileID fileID{};
     DocumentID documentID{};  ///< that the object has, or had when it departed
     FileID parent{};
-    std::string name;
+    std::string name = {};
     ObjectKind objectKind = ObjectKind::other;
-    std::string path;  ///< departed only: where it was below its root when it left, should `parent` be gone, too
-    FileID root{};     ///< departed only: the root that `path` is below
-    FileID target{};   ///< document only; 0: the document no longer exists
+    std::string path = {};  ///< departed only: where it was below its root when it left, should `parent` be gone, too
+    FileID root{};          ///< departed only: the root that `path` is below
+    FileID target{};        ///< document only; 0: the document no longer exists
 };
 
 /// Changes of the index, collected in order, that VolumeStore::apply() carries out in one transaction together with

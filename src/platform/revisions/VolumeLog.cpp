@@ -8,15 +8,13 @@ namespace cindral {
 
 namespace {
 
-// Written to disk: never change one.
-constexpr std::uint32_t kBatchMagic = 0x31425643;  // "CVB1"
-enum class RecordType : std::uint8_t { sighting = 1, sightingThatGivesDocument = 2 };
+constexpr std::uint32_t kBatchMagic = 0x32425643;  // "CVB2". Written to disk: never change it.
 
 // Batch head: magic u32, payload bytes u32, sequence u64, checksum u32.
 constexpr std::size_t kChecksumOffset = 16;
 constexpr std::size_t kBatchHeadBytes = 20;
-// Record head: file ID u64, type u8, bytes of the packed record u16.
-constexpr std::size_t kRecordHeadBytes = 11;
+// Record head: key u64, type u8, bytes of the value u32.
+constexpr std::size_t kRecordHeadBytes = 13;
 constexpr std::size_t kBatchCapacityKept = 1 << 20;
 
 std::uint32_t checksum(const KsUUID& store, ByteView batch) {
@@ -24,19 +22,44 @@ std::uint32_t checksum(const KsUUID& store, ByteView batch) {
     return crc32c(batch.subspan(kBatchHeadBytes), crc32c(batch.first(kChecksumOffset), bound));
 }
 
+bool isDocumentKey(std::uint64_t key) {
+    return key != 0 && key <= std::numeric_limits<std::uint32_t>::max();
+}
+
+/// Whether the record is one that a store may have written.
+bool isGood(const LogRecord& record) {
+    switch (record.type) {
+        case LogRecordType::object: return PackedRecord::decode(record.value).has_value();
+        case LogRecordType::objectWithDocument: {
+            const auto packed = PackedRecord::decode(record.value);
+            return packed && packed->documentID != DocumentID{};
+        }
+        case LogRecordType::objectGone: return record.value.empty();
+        case LogRecordType::documentGiven:
+        case LogRecordType::documentHandedOver:
+            return isDocumentKey(record.key) && record.value.size() == kDocumentBytes;
+        case LogRecordType::otherName:
+            return record.value.size() >= LogRecord::kNameHeadBytes &&
+                   record.value.size() <= LogRecord::kNameHeadBytes + PackedRecord::kNameBytesMax;
+        case LogRecordType::otherNameGone: return record.value.size() == LogRecord::kNameHeadBytes;
+        case LogRecordType::departure: return Departure::decode(record.value).has_value();
+        case LogRecordType::documentChange: return DocumentChange::decode(record.value).has_value();
+        case LogRecordType::attributes: return isDocumentKey(record.key) && record.value.size() <= kAttributesBytesMax;
+        case LogRecordType::timeMark: return record.value.size() == sizeof(std::int64_t);
+    }
+    return false;
+}
+
 /// The first record of the payload, which is moved behind it. None when there is no good one.
 std::optional<LogRecord> takeRecord(ByteView& payload) {
     if (payload.size() < kRecordHeadBytes) return std::nullopt;
-    const auto type = loadInteger<std::uint8_t>(payload.data() + 8);
-    const std::size_t size = loadInteger<std::uint16_t>(payload.data() + 9);
-    if (type < 1 || type > 2 || size > payload.size() - kRecordHeadBytes) return std::nullopt;
-    LogRecord record{.fileID = FileID{loadInteger<std::uint64_t>(payload.data())},
-                     .givesDocument = RecordType{type} == RecordType::sightingThatGivesDocument,
-                     .packed = payload.subspan(kRecordHeadBytes, size)};
+    const std::size_t size = loadInteger<std::uint32_t>(payload.data() + 9);
+    if (size > payload.size() - kRecordHeadBytes) return std::nullopt;
+    const LogRecord record{.type = LogRecordType{loadInteger<std::uint8_t>(payload.data() + 8)},
+                           .key = loadInteger<std::uint64_t>(payload.data()),
+                           .value = payload.subspan(kRecordHeadBytes, size)};
     payload = payload.subspan(kRecordHeadBytes + size);
-    const auto packed = PackedRecord::decode(record.packed);
-    if (!packed || (record.givesDocument && packed->documentID == DocumentID{})) return std::nullopt;
-    return record;
+    return isGood(record) ? std::optional(record) : std::nullopt;
 }
 
 bool isWellFormed(ByteView payload) {
@@ -62,6 +85,13 @@ std::optional<volumelog::Batch> takeBatch(ByteView& bytes, const KsUUID& store) 
 }
 
 }  // namespace
+
+NameKey LogRecord::nameKey() const {
+    return {.fileID = fileID(),
+            .parent = FileID{loadInteger<std::uint64_t>(value.data())},
+            .hash = loadInteger<std::uint32_t>(value.data() + 8),
+            .index = loadInteger<std::uint16_t>(value.data() + 12)};
+}
 
 namespace volumelog {
 
@@ -90,16 +120,49 @@ void BatchWriter::begin() {
     count_ = 0;
 }
 
-void BatchWriter::add(FileID fileID, bool givesDocument, const PackedRecord& record) {
-    const auto type = givesDocument ? RecordType::sightingThatGivesDocument : RecordType::sighting;
+std::byte* BatchWriter::add(LogRecordType type, std::uint64_t key, std::size_t valueBytes) {
     const std::size_t at = bytes_.size();
-    bytes_.resize(at + kRecordHeadBytes + record.size());
+    bytes_.resize(at + kRecordHeadBytes + valueBytes);
     std::byte* to = bytes_.data() + at;
-    storeInteger(to, static_cast<std::uint64_t>(fileID));
+    storeInteger(to, key);
     storeInteger(to + 8, static_cast<std::uint8_t>(type));
-    storeInteger(to + 9, static_cast<std::uint16_t>(record.size()));
-    record.encode(to + kRecordHeadBytes);
+    storeInteger(to + 9, static_cast<std::uint32_t>(valueBytes));
     ++count_;
+    return to + kRecordHeadBytes;
+}
+
+void BatchWriter::add(LogRecordType type, std::uint64_t key, ByteView value) {
+    std::byte* to = add(type, key, value.size());
+    if (!value.empty()) std::memcpy(to, value.data(), value.size());
+}
+
+void BatchWriter::addObject(FileID fileID, bool givesDocument, const PackedRecord& record) {
+    const auto type = givesDocument ? LogRecordType::objectWithDocument : LogRecordType::object;
+    record.encode(add(type, static_cast<std::uint64_t>(fileID), record.encodedBytes()));
+}
+
+void BatchWriter::addDocument(LogRecordType type, DocumentID documentID, const DocumentRecord& document) {
+    encodeDocument(document, add(type, static_cast<std::uint32_t>(documentID), kDocumentBytes));
+}
+
+std::byte* BatchWriter::addName(LogRecordType type, const NameKey& key, std::size_t nameBytes) {
+    std::byte* to = add(type, static_cast<std::uint64_t>(key.fileID), LogRecord::kNameHeadBytes + nameBytes);
+    storeInteger(to, static_cast<std::uint64_t>(key.parent));
+    storeInteger(to + 8, key.hash);
+    storeInteger(to + 12, key.index);
+    return to + LogRecord::kNameHeadBytes;
+}
+
+void BatchWriter::addOtherName(const NameKey& key, std::string_view name) {
+    std::memcpy(addName(LogRecordType::otherName, key, name.size()), name.data(), name.size());
+}
+
+void BatchWriter::addOtherNameGone(const NameKey& key) {
+    addName(LogRecordType::otherNameGone, key, 0);
+}
+
+void BatchWriter::addTimeMark(std::uint64_t eventID, std::int64_t time) {
+    storeInteger(add(LogRecordType::timeMark, eventID, sizeof time), time);
 }
 
 ByteView BatchWriter::finish(const KsUUID& store, std::uint64_t sequence) {

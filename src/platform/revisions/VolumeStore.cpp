@@ -5,6 +5,8 @@
 
 #include "platform/foundation/Log.h"
 #include "platform/revisions/VolumeStoreImplementation.h"
+#include "platform/revisions/VolumeStoreReading.h"
+#include "platform/revisions/VolumeStoreUpdate.h"
 
 namespace cindral {
 
@@ -45,11 +47,72 @@ std::optional<VolumeStore::RecordedPath> VolumeStore::recordedPath(FileID fileID
 }
 
 std::uint64_t VolumeStore::currentEventID() const {
-    return implementation_->numbers().currentEvent();
+    return implementation_->currentEventID();
 }
 
 Result<std::uint64_t> VolumeStore::advanceEventID() {
-    return implementation_->numbers().advanceEvent();
+    return implementation_->advanceEventID();
+}
+
+Result<std::uint64_t> VolumeStore::apply(const IndexChanges& changes, std::span<const FileID> roots) {
+    return implementation_->apply(changes, roots);
+}
+
+bool VolumeStore::indexed(FileID fileID, const ObjectReceiver& receive) const {
+    return implementation_->indexed(fileID, receive);
+}
+
+Result<void> VolumeStore::indexed(std::span<const FileID> fileIDs,
+                                  const std::function<void(std::size_t, const IndexedObject*)>& receive) const {
+    return implementation_->indexed(fileIDs, receive);
+}
+
+bool VolumeStore::child(FileID parent, std::string_view name, const ObjectReceiver& receive) const {
+    return implementation_->child(parent, name, receive);
+}
+
+Result<void> VolumeStore::children(FileID parent, const ObjectReceiver& receive) const {
+    return implementation_->children(parent, receive);
+}
+
+std::uint64_t VolumeStore::childCount(FileID parent) const {
+    return implementation_->childCount(parent);
+}
+
+std::vector<VolumeStore::Name> VolumeStore::otherNames(FileID fileID) const {
+    return implementation_->otherNames(fileID);
+}
+
+Bytes VolumeStore::attributes(DocumentID document) const {
+    return implementation_->attributes(document);
+}
+
+Result<void> VolumeStore::rememberAttributes(DocumentID document, ByteView attributes) {
+    return implementation_->rememberAttributes(document, attributes);
+}
+
+Result<std::vector<JournalEvent>> VolumeStore::events(std::uint64_t after, std::size_t max) const {
+    return implementation_->events(after, max);
+}
+
+Result<std::vector<JournalEvent>> VolumeStore::documentEvents(std::uint64_t after, std::size_t max) const {
+    return implementation_->documentEvents(after, max);
+}
+
+std::optional<std::uint64_t> VolumeStore::historyBegin() const {
+    return implementation_->historyBegin();
+}
+
+Result<std::uint64_t> VolumeStore::beginHistory() {
+    return implementation_->beginHistory();
+}
+
+Result<void> VolumeStore::renewUUID() {
+    return implementation_->renewUUID();
+}
+
+Result<void> VolumeStore::trimJournal(std::uint64_t eventsMax, std::chrono::seconds ageMax) {
+    return implementation_->trimJournal(eventsMax, ageMax);
 }
 
 VolumeStore::Counts VolumeStore::counts() const {
@@ -66,91 +129,15 @@ Result<void> VolumeStore::checkpoint() {
 
 // MARK: Looking up
 
-namespace {
-
-// A chain this long is no path that the file system could have made; one in a circle gets here, too.
-constexpr std::size_t kPathDepthMax = 4096;
-// Sightings that are looked up at once: enough that memory is never waited for, few enough to stay in the nearest
-// cache.
-constexpr std::size_t kLookupsAtOnceMax = 128;
-
-bool isSame(const PackedRecord& record, const ObjectSighting& sighting) {
-    return record.birthTime == sighting.birthTime && record.parent == sighting.parent && record.kind == sighting.kind &&
-           record.name == sighting.name && (record.documentID != DocumentID{} || !sighting.wantsDocumentID);
+KsUUID VolumeStore::Implementation::uuid() const {
+    const MutexLock lock(mutex_);
+    return uuid_;
 }
 
-/// A path put together from its end.
-class BackwardsPath {
-public:
-    void prepend(std::string_view name) {
-        const std::size_t needed = name.size() + (isEmpty() ? 0 : 1);
-        if (needed > begin_) grow(needed);
-        if (!isEmpty()) text_[--begin_] = '/';
-        begin_ -= name.size();
-        name.copy(text_.data() + begin_, name.size());
-        hasNames_ = true;
-    }
-    std::string take() { return std::move(text_.erase(0, begin_)); }
-
-private:
-    bool isEmpty() const { return !hasNames_; }
-    void grow(std::size_t needed) {
-        const std::size_t more = text_.size() + needed;
-        text_.insert(0, more, '\0');
-        begin_ += more;
-    }
-
-    std::string text_ = std::string(256, '\0');
-    std::size_t begin_ = 256;
-    bool hasNames_ = false;
-};
-
-/// What a record of any age may hold is checked before it becomes part of a path.
-bool isFileName(std::string_view name) {
-    return !name.empty() && name != "." && name != ".." && name.find('/') == std::string_view::npos;
+Overlay::State VolumeStore::Implementation::findUnsaved(FileID fileID) const {
+    if (const Overlay::State state = active_->find(fileID); state.isKnown) return state;
+    return frozen_ ? frozen_->find(fileID) : Overlay::State();
 }
-
-}  // namespace
-
-std::optional<PackedRecord> VolumeStore::Implementation::findUnsaved(FileID fileID) const {
-    if (auto record = active_->find(fileID)) return record;
-    return frozen_ ? frozen_->find(fileID) : std::nullopt;
-}
-
-/// Reads records one by one: first of what is not in the tables yet, then of the tables.
-class VolumeStore::Implementation::Reader {
-public:
-    explicit Reader(const Implementation& store) : store_(store) {}
-
-    /// Calls `use` with the record and answers true, or answers false when there is none.
-    template <typename Use>
-    bool read(FileID fileID, Use use) {
-        if (readUnsaved(fileID, use)) return true;
-        const auto record = snapshot_->object(fileID);
-        if (record) use(*record);
-        return record.has_value();
-    }
-
-private:
-    template <typename Use>
-    bool readUnsaved(FileID fileID, Use use) {
-        {
-            const MutexLock lock(store_.mutex_);
-            if (const auto record = store_.findUnsaved(fileID)) {
-                use(*record);
-                return true;
-            }
-            if (saved_ != store_.frozenCountSaved_) snapshot_.reset();
-            saved_ = store_.frozenCountSaved_;
-        }
-        if (!snapshot_) snapshot_.emplace(*store_.tables_);
-        return false;
-    }
-
-    const Implementation& store_;
-    std::optional<ObjectTables::Snapshot> snapshot_;
-    std::uint64_t saved_ = 0;
-};
 
 std::optional<ObjectRecord> VolumeStore::Implementation::object(FileID fileID) const {
     std::optional<ObjectRecord> found;
@@ -200,39 +187,19 @@ std::optional<VolumeStore::RecordedPath> VolumeStore::Implementation::recordedPa
     return std::nullopt;
 }
 
-/// Calls `use` with the place of each file ID and its record, or null.
-template <typename FileIDAt, typename Use>
-Result<void> VolumeStore::Implementation::lookUp(std::size_t count, FileIDAt fileIDAt, Use use) const {
-    std::array<tablepages::Lookup, kLookupsAtOnceMax> lookups;
-    std::array<std::size_t, kLookupsAtOnceMax> places;
-    for (std::size_t begin = 0; begin < count; begin += kLookupsAtOnceMax) {
-        const std::size_t end = std::min(count, begin + kLookupsAtOnceMax);
-        std::size_t missing = 0;
-        {
-            const MutexLock lock(mutex_);
-            for (std::size_t i = begin; i < end; ++i) {
-                const FileID fileID = fileIDAt(i);
-                if (const auto record = findUnsaved(fileID)) {
-                    use(i, &*record);
-                } else {
-                    lookups[missing].key = static_cast<std::uint64_t>(fileID);
-                    places[missing++] = i;
-                }
-            }
-        }
-        if (missing == 0) continue;
-        // After the overlays: what leaves them is in the tables before.
-        const ObjectTables::Snapshot snapshot(*tables_);
-        TRY(snapshot.objects(std::span(lookups).first(missing)));
-        for (std::size_t i = 0; i < missing; ++i) {
-            const auto record = lookups[i].found ? PackedRecord::decode(lookups[i].value) : std::nullopt;
-            use(places[i], record ? &*record : nullptr);
-        }
-    }
-    return {};
+// MARK: Recording
+
+namespace {
+
+/// Whether the sighting tells nothing new.
+bool isSame(const PackedRecord& record, const ObjectSighting& sighting) {
+    if (record.birthTime != sighting.birthTime || !record.isListed) return false;
+    if (record.documentID == DocumentID{} && sighting.wantsDocumentID) return false;
+    // Where the recorder has looked, a listing has nothing to say of the place.
+    return record.changeTime != 0 || (record.isAt(sighting.parent, sighting.name) && record.kind == sighting.kind);
 }
 
-// MARK: Recording
+}  // namespace
 
 Result<void> VolumeStore::Implementation::identify(std::span<ObjectSighting> sightings) {
     std::vector<std::uint32_t> news;
@@ -249,133 +216,66 @@ Result<void> VolumeStore::Implementation::identify(std::span<ObjectSighting> sig
     return done;
 }
 
-/// What becomes of a sighting that looked new.
-struct VolumeStore::Implementation::Outcome {
-    DocumentID documentID{};
-    bool isRecorded = false;  ///< there is something to write
-    bool isNewObject = false;
-    bool givesDocument = false;
-};
-
-namespace {
-
-constexpr std::uint32_t kNone = ~std::uint32_t{0};
-
-/// For each sighting the one of the same object before it in the page, as a file with two names gives.
-std::vector<std::uint32_t> earlierOnes(std::span<const ObjectSighting* const> news) {
-    std::vector<std::pair<FileID, std::uint32_t>> order;
-    order.reserve(news.size());
-    for (std::uint32_t i = 0; i < news.size(); ++i) order.emplace_back(news[i]->fileID, i);
-    std::ranges::sort(order);
-    std::vector<std::uint32_t> earlier(news.size(), kNone);
-    for (std::size_t i = 1; i < order.size(); ++i) {
-        if (order[i].first == order[i - 1].first) earlier[order[i].second] = order[i - 1].second;
-    }
-    return earlier;
-}
-
-PackedRecord recordOf(const ObjectSighting& sighting, DocumentID documentID) {
-    return {.parent = sighting.parent,
-            .birthTime = sighting.birthTime,
-            .documentID = documentID,
-            .kind = sighting.kind,
-            .name = sighting.name};
-}
-
-bool canBeRecorded(const ObjectSighting& sighting) {
-    return sighting.name.size() <= PackedRecord::kNameBytesMax &&
-           sighting.name.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
-}
-
-}  // namespace
-
 Result<void> VolumeStore::Implementation::record(std::span<ObjectSighting> sightings,
                                                  const std::vector<std::uint32_t>& newsPlaces) {
-    std::vector<const ObjectSighting*> news;
     // In the order of the page, not in that of the look-up: so are the document IDs.
     std::vector<std::uint32_t> places = newsPlaces;
     std::ranges::sort(places);
     for (const std::uint32_t place : places) {
-        if (!canBeRecorded(sightings[place]))
+        if (!canBeName(sightings[place].name))
             return KsError::posix(EINVAL).with("name", std::string(sightings[place].name));
-        news.push_back(&sightings[place]);
     }
-
-    std::vector<Outcome> outcomes(news.size());
+    std::vector<DocumentID> answers(places.size());
     {
         const MutexLock lock(writerMutex_);
         TRY(waitForRoom());
-        TRY(decide(news, outcomes));
-        if (batch_.count() > 0) {
-            TRY(logs_[activeLog_].append(batch_.finish(uuid_, nextBatch_)));
-            ++nextBatch_;
-            transactionCount_.fetch_add(1, std::memory_order_relaxed);
-            remember(news, outcomes);
-        }
+        Update update = beginUpdate(roots_, true);
+        // Looks again, because another thread may have recorded the same since.
+        TRY(update.load(places.size(), [&](std::size_t i) { return sightings[places[i]].fileID; }));
+        for (std::size_t i = 0; i < places.size(); ++i) answers[i] = update.sight(sightings[places[i]]);
+        TRY(commit(update));
     }
-    for (std::size_t i = 0; i < places.size(); ++i) sightings[places[i]].documentID = outcomes[i].documentID;
+    for (std::size_t i = 0; i < places.size(); ++i) sightings[places[i]].documentID = answers[i];
     return {};
 }
 
-/// Composes the batch. Looks again, because another thread may have recorded the same since.
-Result<void> VolumeStore::Implementation::decide(std::span<const ObjectSighting* const> news,
-                                                 std::vector<Outcome>& outcomes) {
-    const auto fileIDAt = [&](std::size_t i) { return news[i]->fileID; };
-    TRY(lookUp(news.size(), fileIDAt, [&](std::size_t i, const PackedRecord* record) {
-        outcomes[i].isNewObject = record == nullptr;
-        outcomes[i].isRecorded = record == nullptr || !isSame(*record, *news[i]);
-        const bool isSameObject = record != nullptr && record->birthTime == news[i]->birthTime;
-        outcomes[i].documentID = isSameObject ? record->documentID : DocumentID{};
-    }));
+VolumeStore::Implementation::Update VolumeStore::Implementation::beginUpdate(std::span<const FileID> roots,
+                                                                             bool journals) {
+    return {*this, roots, journals, {.event = numbers_->currentEvent() + 1, .document = numbers_->nextDocument()}};
+}
 
-    const auto earlier = earlierOnes(news);
-    const std::uint32_t first = numbers_->nextDocument();
-    std::uint32_t given = 0;
+/// Puts the update into the log, and then where readers find it. Nothing at all when nothing is new.
+Result<void> VolumeStore::Implementation::commit(Update& update) {
+    const std::uint64_t events = update.eventCount();
+    const std::int64_t time = events > 0 ? now() : 0;
+    const bool marksTime = events > 0 && isTimeMarkDue(time);
+    if (marksTime) update.markTime(time);
     batch_.begin();
-    for (std::size_t i = 0; i < news.size(); ++i) {
-        const ObjectSighting& sighting = *news[i];
-        Outcome& outcome = outcomes[i];
-        if (earlier[i] != kNone) {
-            const PackedRecord before = recordOf(*news[earlier[i]], outcomes[earlier[i]].documentID);
-            outcome.isNewObject = false;
-            outcome.isRecorded = !isSame(before, sighting);
-            outcome.documentID = before.birthTime == sighting.birthTime ? before.documentID : DocumentID{};
-        }
-        if (sighting.wantsDocumentID && outcome.documentID == DocumentID{}) {
-            outcome.documentID = DocumentID{first + given++};
-            outcome.givesDocument = true;
-        }
-        if (outcome.isRecorded)
-            batch_.add(sighting.fileID, outcome.givesDocument, recordOf(sighting, outcome.documentID));
-    }
-    // Reserved before they leave; taken only once the batch is in the log.
-    if (given > 0) TRY(numbers_->reserveDocuments(given));
-    return {};
-}
-
-/// Puts what is in the log now where readers find it.
-void VolumeStore::Implementation::remember(std::span<const ObjectSighting* const> news,
-                                           const std::vector<Outcome>& outcomes) {
-    std::size_t given = 0;
+    update.writeTo(batch_);
+    if (batch_.count() == 0) return {};
+    // Reserved before they leave; taken only once the batch is in the log, and what it says can be read.
+    if (update.documentCount() > 0) TRY(numbers_->reserveDocuments(update.documentCount()));
+    if (events > 0) TRY(numbers_->reserveEvents(events));
+    TRY(logs_[activeLog_].append(batch_.finish(uuid(), nextBatch_)));
+    ++nextBatch_;
+    transactionCount_.fetch_add(1, std::memory_order_relaxed);
+    if (marksTime) lastTimeMark_ = TimeMark{update.firstEvent(), time};
     {
         const MutexLock lock(mutex_);
-        for (std::size_t i = 0; i < news.size(); ++i) {
-            const ObjectSighting& sighting = *news[i];
-            const Outcome& outcome = outcomes[i];
-            if (!outcome.isRecorded) continue;
-            active_->put(sighting.fileID, recordOf(sighting, outcome.documentID));
-            counts_.objects += outcome.isNewObject ? 1 : 0;
-            if (!outcome.givesDocument) continue;
-            active_->addDocument(outcome.documentID, {sighting.fileID, sighting.birthTime});
-            ++given;
-        }
-        counts_.documents += given;
+        update.writeTo(*active_, counts_, historyBegin_.value_or(0));
         if (!due_) {
             due_ = std::chrono::steady_clock::now() + kCheckpointDelay;
             dueChanged_.notifyAll();
         }
     }
-    numbers_->takeDocuments(given);
+    numbers_->takeDocuments(update.documentCount());
+    numbers_->takeEvents(events);
+    return {};
+}
+
+Result<std::uint64_t> VolumeStore::Implementation::advanceEventID() {
+    const MutexLock lock(writerMutex_);
+    return numbers_->advanceEvent();
 }
 
 bool VolumeStore::Implementation::isFull() const {
@@ -441,8 +341,8 @@ Result<void> VolumeStore::Implementation::writeCheckpoint() {
         lastBatch = frozenLastBatch_;
     }
     if (!overlay) return {};
-    Result<void> written = tables_->write(*overlay, headFor(*overlay, lastBatch, numbers_->reserved()),
-                                          options_.checkpointPagesMax, options_.onCheckpointStep);
+    const Result<void> written = writeTables(overlay, lastBatch);
+    const MutexLock writerLock(writerMutex_);
     if (written.ok()) {
         checkpointSucceeded(lastBatch);
     } else {
@@ -451,13 +351,35 @@ Result<void> VolumeStore::Implementation::writeCheckpoint() {
     return written;
 }
 
+Result<void> VolumeStore::Implementation::writeTables(const std::shared_ptr<const Overlay>& overlay,
+                                                      std::uint64_t lastBatch) {
+    publishChildCounts(*overlay);
+    return tables_->write(*overlay, headFor(*overlay, lastBatch, numbers_->reserved()), options_.checkpointPagesMax,
+                          options_.onCheckpointStep);
+}
+
+/// While the tables are half written, they and the overlay's differences don't add up.
+void VolumeStore::Implementation::publishChildCounts(const Overlay& overlay) {
+    {
+        const MutexLock lock(mutex_);
+        if (frozenChildCounts_) return;  // Tried before.
+    }
+    auto counts = std::make_shared<ChildCounts>();
+    const ObjectTables::Snapshot snapshot(*tables_);
+    for (const auto& [parent, difference] : overlay.childCountDifferences()) {
+        (*counts)[parent] = snapshot.childCount(parent) + static_cast<std::uint64_t>(difference);
+    }
+    const MutexLock lock(mutex_);
+    frozenChildCounts_ = std::move(counts);
+}
+
 void VolumeStore::Implementation::checkpointSucceeded(std::uint64_t lastBatch) {
-    const MutexLock writerLock(writerMutex_);
     // Should it fail, the batches' numbers tell that they are in the tables.
     (void)logs_[activeLog_ ^ 1].clear();
     {
         const MutexLock lock(mutex_);
         frozen_.reset();
+        frozenChildCounts_.reset();
         savedBatch_ = lastBatch;
         ++frozenCountSaved_;
         lastFailure_.reset();
@@ -467,7 +389,6 @@ void VolumeStore::Implementation::checkpointSucceeded(std::uint64_t lastBatch) {
 
 void VolumeStore::Implementation::checkpointFailed(const KsError& error) {
     if (error.isPosix(kDamageCode)) isSuspect_ = true;
-    const MutexLock writerLock(writerMutex_);
     {
         const MutexLock lock(mutex_);
         // One line for a disk that stays full, not one a second.
@@ -477,6 +398,27 @@ void VolumeStore::Implementation::checkpointFailed(const KsError& error) {
         retryAt_ = std::chrono::steady_clock::now() + 5 * kCheckpointDelay;
     }
     roomChanged_.notifyAll();
+}
+
+/// Returns with nothing left in logs and overlays.
+Result<void> VolumeStore::Implementation::saveEverything() {
+    while (true) {
+        std::shared_ptr<const Overlay> overlay;
+        std::uint64_t lastBatch = 0;
+        {
+            const MutexLock lock(mutex_);
+            if (!frozen_ && active_->empty()) return {};
+            if (!frozen_) freeze();
+            overlay = frozen_;
+            lastBatch = frozenLastBatch_;
+        }
+        const Result<void> written = writeTables(overlay, lastBatch);
+        if (!written.ok()) {
+            checkpointFailed(written.error());
+            return written;
+        }
+        checkpointSucceeded(lastBatch);
+    }
 }
 
 Result<void> VolumeStore::Implementation::checkpoint() {

@@ -65,6 +65,8 @@ struct VolumeStoreOptions {
     std::size_t checkpointPagesMax = 512;
     /// Off: a checkpoint is written by checkpoint() and at the end, never by itself.
     bool checkpointsItself = true;
+    /// The time that the journal goes by. None: the system's.
+    std::function<std::chrono::system_clock::time_point()> now;
     /// Called within a checkpoint after each of its transactions, on the thread that writes it.
     std::function<void()> onCheckpointStep;
 };
@@ -141,7 +143,7 @@ public:
     /// After an error nothing of the call is recorded.
     Result<std::uint64_t> apply(const IndexChanges& changes, std::span<const FileID> roots);
 
-    /// Called with an object's name borrowed for the call.
+    /// Called with an object's name borrowed for the call. May read the store, but not change it.
     using ObjectReceiver = std::function<void(const IndexedObject&)>;
     /// Calls back and answers true, or answers false when the object is unknown.
     bool indexed(FileID fileID, const ObjectReceiver& receive) const;
@@ -161,7 +163,7 @@ public:
     std::vector<Name> otherNames(FileID fileID) const;
 
     /// The attributes that a document had when they were last looked at, as given to rememberAttributes(): bytes that
-    /// the store doesn't read. Empty for none.
+    /// the store doesn't read. Empty for none. What is remembered for document 0 is of the volume itself.
     Bytes attributes(DocumentID document) const;
     Result<void> rememberAttributes(DocumentID document, ByteView attributes);
 
@@ -177,7 +179,8 @@ public:
     Result<std::uint64_t> beginHistory();
     /// Takes a new UUID, and forgets the events: every token of before expires.
     Result<void> renewUUID();
-    /// Forgets the oldest events beyond the count, and those that were journalled longer ago than the age.
+    /// Forgets the oldest events beyond the count, and those that were journalled longer ago than the age, which is
+    /// known to ten minutes: none is forgotten too early. Does nothing before beginHistory().
     Result<void> trimJournal(std::uint64_t eventsMax, std::chrono::seconds ageMax);
 
     struct Counts {

@@ -3,19 +3,23 @@
 #include <array>
 #include <atomic>
 #include <chrono>
+#include <map>
 #include <memory>
 #include <optional>
 #include <span>
 #include <string>
 #include <thread>
+#include <unordered_map>
 #include <vector>
 
 #include "platform/foundation/Mutex.h"
 #include "platform/foundation/UniqueFd.h"
+#include "platform/revisions/NameHash.h"
 #include "platform/revisions/NumberSource.h"
 #include "platform/revisions/ObjectTables.h"
 #include "platform/revisions/Overlay.h"
 #include "platform/revisions/StoreLock.h"
+#include "platform/revisions/VolumeIndex.h"
 #include "platform/revisions/VolumeLog.h"
 #include "platform/revisions/VolumeStore.h"
 
@@ -35,7 +39,7 @@ public:
 
     Result<void> open();
 
-    const KsUUID& uuid() const { return uuid_; }
+    KsUUID uuid() const;
     Result<void> identify(std::span<ObjectSighting> sightings);
     std::optional<ObjectRecord> object(FileID fileID) const;
     std::optional<DocumentRecord> document(DocumentID documentID) const;
@@ -43,7 +47,26 @@ public:
     Counts counts() const;
     Result<void> checkpoint();
 
-    NumberSource& numbers() const { return *numbers_; }
+    std::uint64_t currentEventID() const { return numbers_->currentEvent(); }
+    Result<std::uint64_t> advanceEventID();
+
+    Result<std::uint64_t> apply(const IndexChanges& changes, std::span<const FileID> roots);
+    bool indexed(FileID fileID, const ObjectReceiver& receive) const;
+    Result<void> indexed(std::span<const FileID> fileIDs,
+                         const std::function<void(std::size_t, const IndexedObject*)>& receive) const;
+    bool child(FileID parent, std::string_view name, const ObjectReceiver& receive) const;
+    Result<void> children(FileID parent, const ObjectReceiver& receive) const;
+    std::uint64_t childCount(FileID parent) const;
+    std::vector<Name> otherNames(FileID fileID) const;
+    Bytes attributes(DocumentID document) const;
+    Result<void> rememberAttributes(DocumentID document, ByteView attributes);
+    Result<std::vector<JournalEvent>> events(std::uint64_t after, std::size_t max) const;
+    Result<std::vector<JournalEvent>> documentEvents(std::uint64_t after, std::size_t max) const;
+    std::optional<std::uint64_t> historyBegin() const;
+    Result<std::uint64_t> beginHistory();
+    Result<void> renewUUID();
+    Result<void> trimJournal(std::uint64_t eventsMax, std::chrono::seconds ageMax);
+
     std::uint64_t transactionCount() const { return transactionCount_.load(std::memory_order_relaxed); }
 
 private:
@@ -56,25 +79,37 @@ private:
     Result<void> setAside(const KsError& damage);
     Result<HighWaterMarks> openState(const std::optional<HighWaterMarks>& marks);
     Result<void> readLogs(Overlay& unsaved);
-    static void replay(const volumelog::Batch& batch, Overlay& unsaved);
+    void replay(const volumelog::Batch& batch, Overlay& unsaved) const;
     Result<void> saveReplayed(const Overlay& unsaved, const HighWaterMarks& next);
     Result<std::string> closedNote() const;
     void close();
-    Result<void> saveMarks();
+    Result<void> saveHead();
 
     // Looking up.
     class Reader;
-    std::optional<PackedRecord> findUnsaved(FileID fileID) const REQUIRES(mutex_);
+    Overlay::State findUnsaved(FileID fileID) const REQUIRES(mutex_);
     template <typename FileIDAt, typename Use>
     Result<void> lookUp(std::size_t count, FileIDAt fileIDAt, Use use) const;
+    struct FoundChild;
+    bool findUnsavedChild(FileID parent, std::string_view name, std::uint32_t hash, FoundChild& found) const;
+    bool findSavedChild(FileID parent, std::string_view name, std::uint32_t hash, FoundChild& found) const;
+    bool findByOtherName(FileID parent, std::string_view name, std::uint32_t hash, FoundChild& found) const;
+    std::vector<NameKey> namesWithHash(FileID parent, std::uint32_t hash) const;
+    std::optional<std::string> nameOf(const NameKey& key) const;
+    using Names = std::map<NameKey, std::string>;
+    Names names(FileID fileID) const;
+
+    // The journal.
+    Result<void> resolve(std::vector<JournalEvent>& candidates, std::vector<JournalEvent>& found) const;
+    std::int64_t now() const;
+    Result<std::uint64_t> lastEventOlderThan(std::chrono::seconds age, std::uint64_t current) const;
 
     // Recording.
-    struct Outcome;
+    class Update;
     Result<void> record(std::span<ObjectSighting> sightings, const std::vector<std::uint32_t>& news);
-    Result<void> decide(std::span<const ObjectSighting* const> news, std::vector<Outcome>& outcomes)
-        REQUIRES(writerMutex_);
-    void remember(std::span<const ObjectSighting* const> news, const std::vector<Outcome>& outcomes)
-        REQUIRES(writerMutex_);
+    Update beginUpdate(std::span<const FileID> roots, bool journals) REQUIRES(writerMutex_);
+    Result<void> commit(Update& update) REQUIRES(writerMutex_);
+    bool isTimeMarkDue(std::int64_t time) const REQUIRES(writerMutex_);
     Result<void> waitForRoom() REQUIRES(writerMutex_);
     bool isFull() const REQUIRES(mutex_);
     void freeze() REQUIRES(writerMutex_, mutex_);
@@ -83,8 +118,12 @@ private:
     Result<void> writeCheckpoint() EXCLUDES(checkpointMutex_);
     TablesHead headFor(const Overlay& overlay, std::uint64_t lastBatch, const HighWaterMarks& marks) const
         REQUIRES(checkpointMutex_);
-    void checkpointSucceeded(std::uint64_t lastBatch);
-    void checkpointFailed(const KsError& error);
+    Result<void> writeTables(const std::shared_ptr<const Overlay>& overlay, std::uint64_t lastBatch)
+        REQUIRES(checkpointMutex_);
+    void publishChildCounts(const Overlay& overlay);
+    void checkpointSucceeded(std::uint64_t lastBatch) REQUIRES(writerMutex_);
+    void checkpointFailed(const KsError& error) REQUIRES(writerMutex_);
+    Result<void> saveEverything() REQUIRES(checkpointMutex_, writerMutex_);
     void writeCheckpointsWhenDue();
     bool waitUntilDue();
     std::optional<std::chrono::steady_clock::time_point> nextCheckpoint() const REQUIRES(mutex_);
@@ -96,7 +135,7 @@ private:
     StoreLock lock_;
     std::unique_ptr<NumberSource> numbers_;
     std::unique_ptr<ObjectTables> tables_;
-    KsUUID uuid_;
+    NameHashKey nameHashKey_{};
     bool opened_ = false;
     std::thread checkpointThread_;
 
@@ -114,6 +153,12 @@ private:
     std::array<LogFile, 2> logs_ GUARDED_BY(writerMutex_);
     std::size_t activeLog_ GUARDED_BY(writerMutex_) = 0;
     std::uint64_t nextBatch_ GUARDED_BY(writerMutex_) = 1;
+    std::vector<FileID> roots_ GUARDED_BY(writerMutex_);  // Of the last apply().
+    struct TimeMark {
+        std::uint64_t eventID = 0;
+        std::int64_t time = 0;
+    };
+    std::optional<TimeMark> lastTimeMark_ GUARDED_BY(writerMutex_);
 
     /// Held for moments only, never over a system call that may wait for the disk.
     mutable Mutex mutex_;
@@ -124,6 +169,12 @@ private:
     std::uint64_t savedBatch_ GUARDED_BY(mutex_) = 0;
     std::uint64_t frozenCountSaved_ GUARDED_BY(mutex_) =
         0;  // A snapshot taken before it grew may lack what left the overlay.
+    // How many children the folders that frozen_ changes have with it. None before it begins to be written: until then
+    // the tables and its differences tell.
+    using ChildCounts = std::unordered_map<FileID, std::uint64_t>;
+    std::shared_ptr<const ChildCounts> frozenChildCounts_ GUARDED_BY(mutex_);
+    KsUUID uuid_ GUARDED_BY(mutex_);
+    std::optional<std::uint64_t> historyBegin_ GUARDED_BY(mutex_);
     Counts counts_ GUARDED_BY(mutex_);
     std::optional<std::chrono::steady_clock::time_point> due_ GUARDED_BY(mutex_);  // Of active_.
     std::chrono::steady_clock::time_point retryAt_ GUARDED_BY(mutex_);             // Of frozen_.

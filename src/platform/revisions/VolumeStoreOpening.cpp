@@ -45,7 +45,14 @@ Result<void> VolumeStore::Implementation::open() {
     TRY(numbers_->repairFile());
     {
         const MutexLock lock(mutex_);
-        counts_ = {.objects = tables_->objectCount(), .documents = tables_->documentCount()};
+        counts_ = {
+            .objects = tables_->objectCount(), .documents = tables_->documentCount(), .events = tables_->eventCount()};
+        if (tables_->head().historyBegin != 0) historyBegin_ = tables_->head().historyBegin;
+    }
+    {
+        const MutexLock lock(writerMutex_);
+        const auto marks = TRY(ObjectTables::Snapshot(*tables_).timeMarks());
+        if (!marks.empty()) lastTimeMark_ = TimeMark{marks.back().first, marks.back().second};
     }
     // A store without objects is about to be told of some. Where that can't be written now, the first to be given says
     // so.
@@ -64,6 +71,7 @@ Result<HighWaterMarks> VolumeStore::Implementation::openState(const std::optiona
     TRY(readLogs(unsaved));
     HighWaterMarks next = HighWaterMarks::highest(marks.value_or(HighWaterMarks{}), tables_->head().marks);
     // Only when the file of marks was lost can the logs know more.
+    next.event = std::max(next.event, unsaved.lastEvent() + 1);
     if (!unsaved.documents().empty()) {
         next.document =
             std::max(next.document, std::uint64_t{static_cast<std::uint32_t>(unsaved.documents().back().first)} + 1);
@@ -81,6 +89,8 @@ bool VolumeStore::Implementation::hasTables() const {
 Result<void> VolumeStore::Implementation::openTables(const std::optional<HighWaterMarks>& marks) {
     TRY(hasTables() ? checkTables() : createTables(marks));
     tables_ = TRY(ObjectTables::open(pathOf(kTablesName), options_.mapBytes));
+    nameHashKey_ = tables_->head().nameHashKey;
+    const MutexLock lock(mutex_);
     uuid_ = tables_->head().uuid;
     return {};
 }
@@ -90,6 +100,7 @@ Result<void> VolumeStore::Implementation::openTables(const std::optional<HighWat
 Result<void> VolumeStore::Implementation::createTables(const std::optional<HighWaterMarks>& marks) {
     TablesHead head;
     head.uuid = KsUUID::random();
+    head.nameHashKey = randomNameHashKey();
     head.marks = marks.value_or(HighWaterMarks{});
     return ObjectTables::create(pathOf(kTablesName), head);
 }
@@ -143,7 +154,7 @@ Result<void> VolumeStore::Implementation::readLogs(Overlay& unsaved) {
     for (std::size_t i = 0; i < logs_.size(); ++i) {
         logs_[i] = LogFile(TRY(StoreFile::open(folderFd_.get(), kLogNames[i])));
         bytes[i] = TRY(logs_[i].readAll());
-        batches[i] = volumelog::decode(bytes[i], uuid_);
+        batches[i] = volumelog::decode(bytes[i], uuid());
     }
     const auto firstNumber = [](const auto& log) { return log.empty() ? 0 : log.front().sequence; };
     std::ranges::sort(batches, {}, firstNumber);
@@ -158,11 +169,34 @@ Result<void> VolumeStore::Implementation::readLogs(Overlay& unsaved) {
     return {};
 }
 
-void VolumeStore::Implementation::replay(const volumelog::Batch& batch, Overlay& unsaved) {
+void VolumeStore::Implementation::replay(const volumelog::Batch& batch, Overlay& unsaved) const {
+    const std::uint64_t forgotten = tables_->head().historyBegin;
     for (const LogRecord& logged : volumelog::records(batch)) {
-        const PackedRecord record = *PackedRecord::decode(logged.packed);
-        unsaved.put(logged.fileID, record);
-        if (logged.givesDocument) unsaved.addDocument(record.documentID, {logged.fileID, record.birthTime});
+        switch (logged.type) {
+            case LogRecordType::object:
+            case LogRecordType::objectWithDocument: {
+                const PackedRecord record = *PackedRecord::decode(logged.value);
+                unsaved.put(logged.fileID(), record, nameHash(nameHashKey_, record.name), record.eventID > forgotten);
+                if (logged.type == LogRecordType::objectWithDocument)
+                    unsaved.addDocument(record.documentID, {logged.fileID(), record.birthTime});
+                break;
+            }
+            case LogRecordType::objectGone: unsaved.putGone(logged.fileID()); break;
+            case LogRecordType::documentGiven:
+                unsaved.addDocument(logged.documentID(), *decodeDocument(logged.value));
+                break;
+            case LogRecordType::documentHandedOver:
+                unsaved.handOver(logged.documentID(), *decodeDocument(logged.value));
+                break;
+            case LogRecordType::otherName: unsaved.putName(logged.nameKey(), std::string(logged.otherName())); break;
+            case LogRecordType::otherNameGone: unsaved.putName(logged.nameKey(), std::nullopt); break;
+            case LogRecordType::departure: unsaved.addDeparture(logged.key, logged.value); break;
+            case LogRecordType::documentChange:
+                unsaved.addDocumentChange(logged.key, *DocumentChange::decode(logged.value));
+                break;
+            case LogRecordType::attributes: unsaved.putAttributes(logged.documentID(), logged.value); break;
+            case LogRecordType::timeMark: unsaved.addTimeMark(logged.key, logged.time()); break;
+        }
     }
 }
 
@@ -171,6 +205,8 @@ Result<void> VolumeStore::Implementation::saveReplayed(const Overlay& unsaved, c
     const MutexLock writerLock(writerMutex_);
     TRY(tables_->removeUnsettledDocuments());
     const std::uint64_t lastBatch = nextBatch_ - 1;
+    // A checkpoint that was not finished had batches that the logs have lost.
+    if (tables_->head().begunBatch > lastBatch) TRY(tables_->rebuildChildren());
     if (!unsaved.empty()) {
         TRY(tables_->write(unsaved, headFor(unsaved, lastBatch, next), options_.checkpointPagesMax,
                            options_.onCheckpointStep));
@@ -200,7 +236,7 @@ VolumeStore::Implementation::~Implementation() {
 void VolumeStore::Implementation::close() {
     bool isClean = checkpoint().ok() && !isSuspect_;
     // What can't be given back is skipped by the next holder.
-    if (numbers_->giveBackTheRest().ok() && isClean) isClean = saveMarks().ok();
+    if (numbers_->giveBackTheRest().ok() && isClean) isClean = saveHead().ok();
     tables_.reset();
     if (!isClean) return;
     const Result<std::string> note = closedNote();
@@ -208,7 +244,7 @@ void VolumeStore::Implementation::close() {
 }
 
 /// Lowers the tables' copy of the marks, which would otherwise make the next holder skip what was given back.
-Result<void> VolumeStore::Implementation::saveMarks() {
+Result<void> VolumeStore::Implementation::saveHead() {
     const MutexLock checkpointLock(checkpointMutex_);
     TablesHead head = tables_->head();
     if (head.marks == numbers_->reserved()) return {};

@@ -36,13 +36,20 @@ protected:
             Overlay overlay;
             for (std::size_t i = begin; i < std::min(count, begin + count / 3 + 1); ++i) {
                 const DocumentID id{static_cast<std::uint32_t>(i + 1)};
+                const std::string name = nameOf(keys[i]);
+                const FileID parent = parentOf(keys[i]);
                 overlay.put(FileID{keys[i]},
-                            {.parent = FileID{2}, .birthTime = 5, .documentID = id, .name = nameOf(keys[i])});
+                            {.parent = parent, .birthTime = 5, .documentID = id, .eventID = keys[i], .name = name},
+                            nameHash({}, name), true);
                 overlay.addDocument(id, {FileID{keys[i]}, 5});
             }
             EXPECT_TRUE(tables->write(overlay, tables->head(), 100, {}).ok());
         }
         return {keys.begin(), keys.end()};
+    }
+    /// Folders of every size: of one child, of several, of many.
+    static FileID parentOf(std::uint64_t key) {
+        return FileID{key % 16 == 0 ? 1'000'000 + key : key % 16 == 1 ? 2'000'000 + key / 1000 : 2};
     }
     static std::string nameOf(std::uint64_t key) { return "name " + std::string(key % 40, 'n') + std::to_string(key); }
 

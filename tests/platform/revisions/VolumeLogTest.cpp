@@ -25,12 +25,12 @@ Bytes batchOf(std::uint64_t sequence, const std::vector<std::string>& names) {
     std::uint32_t id = 1;
     for (const std::string& name : names) {
         const bool gives = id % 2 == 1;
-        writer.add(FileID{100 + id}, gives,
-                   {.parent = FileID{2},
-                    .birthTime = 3,
-                    .documentID = DocumentID{id},
-                    .kind = ObjectKind::file,
-                    .name = name});
+        writer.addObject(FileID{100 + id}, gives,
+                         {.parent = FileID{2},
+                          .birthTime = 3,
+                          .documentID = DocumentID{id},
+                          .kind = ObjectKind::file,
+                          .name = name});
         ++id;
     }
     const ByteView bytes = writer.finish(kStore, sequence);
@@ -59,10 +59,10 @@ TEST(VolumeLog, decodesWhatWasWritten) {
     EXPECT_EQ(batches[1].sequence, 8U);
     const auto records = volumelog::records(batches[0]);
     ASSERT_EQ(records.size(), 3U);
-    EXPECT_EQ(records[1].fileID, FileID{102});
-    EXPECT_TRUE(records[0].givesDocument);
-    EXPECT_FALSE(records[1].givesDocument);
-    const auto packed = PackedRecord::decode(records[2].packed);
+    EXPECT_EQ(records[1].fileID(), FileID{102});
+    EXPECT_EQ(records[0].type, LogRecordType::objectWithDocument);
+    EXPECT_EQ(records[1].type, LogRecordType::object);
+    const auto packed = PackedRecord::decode(records[2].value);
     ASSERT_TRUE(packed.has_value());
     EXPECT_EQ(packed->name, std::string(1023, 'n'));
     EXPECT_EQ(packed->parent, FileID{2});
@@ -75,24 +75,31 @@ TEST(VolumeLog, decodesWhatWasWritten) {
 TEST(VolumeLog, writesTheBytesThatTheDocumentShows) {
     BatchWriter writer;
     writer.begin();
-    writer.add(FileID{0x1234}, true,
-               {.parent = FileID{2},
-                .birthTime = 1'700'000'000'000'000'000,
-                .documentID = DocumentID{5},
-                .kind = ObjectKind::file,
-                .name = "a.txt"});
+    writer.addObject(FileID{0x1234}, true,
+                     {.parent = FileID{2},
+                      .birthTime = 1'700'000'000'000'000'000,
+                      .documentID = DocumentID{5},
+                      .kind = ObjectKind::file,
+                      .isListed = true,
+                      .changeTime = 1'700'000'001'000'000'000,
+                      .size = 1000,
+                      .eventID = 9,
+                      .name = "a.txt"});
     EXPECT_EQ(hex(writer.finish(kStore, 1)),
-              "43564231"          // "CVB1"
-              "25000000"          // 37 bytes of records
+              "43564232"          // "CVB2"
+              "3f000000"          // 63 bytes of records
               "0100000000000000"  // the first batch
-              "b745c89b"          // of the UUID and the rest
+              "b7d581f7"          // of the UUID and the rest
               "3412000000000000"  // file ID
-              "02"                // a sighting that gives a document ID
-              "1a00"              // 26 bytes of record
+              "02"                // an object with a document ID that it was given
+              "32000000"          // 50 bytes of record
               "0200000000000000"  // parent
               "00002a36fe9c9717"  // birth time
               "05000000"          // document ID
-              "01"                // a file
+              "11"                // a file, listed
+              "00cac471fe9c9717"  // change time
+              "e803000000000000"  // size
+              "0900000000000000"  // event
               "612e747874");      // "a.txt"
 }
 

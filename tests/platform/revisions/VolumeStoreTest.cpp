@@ -773,7 +773,7 @@ TEST_F(VolumeStoreTest, keepsWhatACheckpointHadNoRoomForAndSavesItLater) {
     Page first = Page::of(1000, 1000), second = Page::of(5000, 1000), third = Page::of(9000, 1);
     LogCapture log;
     {
-        const FullDisk full(64 * 1024);  // Room for the log of a thousand, but not for the tables.
+        const FullDisk full(112 * 1024);  // Room for the log of a thousand, but not for the tables.
         identify(first);
         identify(second);
         const auto refused = store_->identify(third.all());

@@ -1,0 +1,570 @@
+#include "platform/eventstream/IndexKeeper.h"
+
+#include <fcntl.h>
+
+#include <algorithm>
+#include <cctype>
+#include <cerrno>
+#include <charconv>
+#include <utility>
+
+#include "platform/eventstream/IndexKeeperTypes.h"
+#include "platform/foundation/Log.h"
+#include "platform/foundation/TypeDatabase.h"
+#include "platform/revisions/ObjectFinder.h"
+#include "platform/revisions/OwnAttributes.h"
+
+// Rounds, looking, and saves. What compares whole folders is in IndexKeeperScan.cpp.
+
+namespace cindral {
+
+using index_keeper::kindOf;
+using index_keeper::sizeOf;
+using index_keeper::stampOf;
+
+namespace {
+
+// A transaction of so many changes costs little more than its changes.
+constexpr std::size_t kChangesAtOnceMax = 1'000;
+// What comes while a call works is left to the next one after so many rounds. Everything that was complete before the
+// call is done after two: one that looks, one that gives up what did not turn up.
+constexpr int kRoundsMax = 8;
+// A number given to an object younger than this was given while it was being saved.
+constexpr std::int64_t kYoungNanoseconds = 60'000'000'000;
+
+/// The number in a name such as "#123": what the kernel calls a file that was made without a name.
+std::optional<FileID> numberOfNameless(std::string_view name) {
+    if (!name.starts_with('#') || name.size() < 2) return std::nullopt;
+    std::uint64_t number = 0;
+    const auto read = std::from_chars(name.data() + 1, name.data() + name.size(), number);
+    if (read.ec != std::errc() || read.ptr != name.data() + name.size()) return std::nullopt;
+    return FileID{number};
+}
+
+}  // namespace
+
+ObjectKind index_keeper::kindOf(const FileStatus& status, std::string_view name) {
+    return objectKindOf(status, status.isDirectory() && TypeDatabase::shared().isPackageName(name));
+}
+
+IndexKeeper::IndexKeeper(VolumeStore& store, Options options) : store_(store), options_(std::move(options)) {}
+IndexKeeper::~IndexKeeper() = default;
+
+void IndexKeeper::setRoots(std::vector<Root> roots) {
+    openFolders_.clear();
+    contexts_.clear();
+    roots_ = std::move(roots);
+    rootIDs_.clear();
+    sources_.clear();
+    for (const Root& root : roots_) {
+        rootIDs_.push_back(root.fileID());
+        if (root.source && std::ranges::find(sources_, root.source) == sources_.end()) sources_.push_back(root.source);
+    }
+}
+
+// MARK: Hints
+
+Result<void> IndexKeeper::takeHints() {
+    for (const auto& source : sources_) TRY(source->drain([this](const EventHint& hint) { note(hint); }));
+    return {};
+}
+
+void IndexKeeper::note(const EventHint& hint) {
+    switch (hint.kind) {
+        case EventHint::Kind::entry: dirtyFolders_[hint.folder].names.emplace(hint.name); break;
+        case EventHint::Kind::object:
+        case EventHint::Kind::lost: dirtyObjects_.insert(hint.fileID); break;
+        case EventHint::Kind::overflow:
+            if (!everythingIsDirty_) logInfo("events were lost; comparing everything");
+            everythingIsDirty_ = true;
+            break;
+    }
+}
+
+// MARK: Rounds
+
+Result<void> IndexKeeper::settle() {
+    return workOff();
+}
+
+/// Whatever fails, nothing is forgotten: the next call compares everything.
+Result<void> IndexKeeper::workOff() {
+    const Result<void> done = rounds();
+    openFolders_.clear();
+    contexts_.clear();
+    if (!done.ok()) {
+        changes_.reset();
+        placed_.clear();
+        departures_.clear();
+        replacements_.clear();
+        everythingIsDirty_ = true;
+    }
+    return done;
+}
+
+Result<void> IndexKeeper::rounds() {
+    TRY(takeHints());
+    bool isFirst = true;
+    for (int round = 0; round < kRoundsMax; ++round) {
+        if (!isFirst && !isDirty() && departures_.empty()) break;
+        ++roundNumber_;
+        TRY(lookAtDirt());
+        if (isFirst) TRY(compareUnwatched());
+        isFirst = false;
+        TRY(scanPending());
+        TRY(flush());
+        waitForRenames();
+        TRY(takeHints());
+        TRY(endRound(!isDirty()));
+        TRY(flush());
+    }
+    return {};
+}
+
+/// A rename takes an object from its old name before the event is out, but both folders are locked until it is. Who
+/// has read a folder knows that no such rename is under way in it.
+void IndexKeeper::waitForRenames() {
+    std::vector<FileID> parents;
+    for (const Departure& departure : departures_) {
+        if (departure.round == roundNumber_) parents.push_back(departure.parent);
+    }
+    std::ranges::sort(parents);
+    parents.erase(std::ranges::unique(parents).begin(), parents.end());
+    alignas(8) std::byte buffer[4'096];
+    for (const FileID parent : parents) {
+        const auto folder = openFolder(parent);
+        if (!folder) continue;
+        (void)::lseek(folder->fd.get(), 0, SEEK_SET);
+        (void)sys::getdents(folder->fd.get(), buffer);
+    }
+}
+
+Result<void> IndexKeeper::lookAtDirt() {
+    if (std::exchange(everythingIsDirty_, false)) {
+        dirtyFolders_.clear();
+        dirtyObjects_.clear();
+        toScan_ = rootIDs_;
+        return {};
+    }
+    const auto folders = std::exchange(dirtyFolders_, {});
+    const auto objects = std::exchange(dirtyObjects_, {});
+    for (const auto& [fileID, dirt] : folders) TRY(lookAtDirtyFolder(fileID, dirt));
+    for (const FileID fileID : objects) TRY(lookAtObject(fileID));
+    return {};
+}
+
+Result<void> IndexKeeper::lookAtDirtyFolder(FileID fileID, const FolderDirt& dirt) {
+    const auto folder = openFolder(fileID);
+    // Where a folder can't be reached, its own parent tells what became of it.
+    if (!folder) return rootWithID(fileID) == nullptr ? lookAtObject(fileID) : Result<void>();
+    for (const std::string& name : dirt.names) {
+        TRY(look(*folder, name));
+        TRY(flushWhenFull());
+    }
+    lookAtFolderItself(*folder);
+    return {};
+}
+
+Result<void> IndexKeeper::lookAtObject(FileID fileID) {
+    if (rootWithID(fileID) != nullptr) return {};
+    const std::optional<Known> known = find(fileID);
+    if (!known) return {};
+    const auto folder = openFolder(known->object.parent);
+    return folder ? look(*folder, known->name) : Result<void>();
+}
+
+/// Gives up what did not turn up. In a quiet round nothing is dirty any more, so nothing can; otherwise what was lost in
+/// this round waits for the next.
+Result<void> IndexKeeper::endRound(bool isQuiet) {
+    std::vector<Departure> waiting;
+    for (const Departure& departure : std::exchange(departures_, {})) {
+        if (isQuiet || departure.round < roundNumber_) {
+            TRY(giveUp(departure));
+            TRY(flushWhenFull());
+        } else {
+            waiting.push_back(departure);
+        }
+    }
+    departures_.insert(departures_.end(), std::make_move_iterator(waiting.begin()),
+                       std::make_move_iterator(waiting.end()));
+    if (departures_.empty()) TRY(resolveReplacements());
+    for (const FileID package : touchedPackages_) {
+        if (find(package)) changes().touch(package);
+    }
+    touchedPackages_.clear();
+    return {};
+}
+
+Result<void> IndexKeeper::giveUp(const Departure& departure) {
+    const std::optional<Known> known = find(departure.fileID);
+    // It turned up elsewhere, or its number went to another object: either way it is where the index says.
+    if (!known || !known->isSame(departure.fileID, departure.birthTime) ||
+        !known->isAt(departure.parent, departure.name))
+        return {};
+    if (holds(departure.parent, departure.name, departure.fileID, departure.birthTime)) return {};
+    if (known->object.hasOtherNames) {
+        for (const VolumeStore::Name& other : store_.otherNames(departure.fileID)) {
+            const std::optional<FileStatus> status = statusAt(other.parent, other.name);
+            if (!status || FileID{status->fileID} != departure.fileID || status->birthStamp() != departure.birthTime)
+                continue;
+            changes().removeName(departure.fileID, other.parent, other.name);
+            put(other.parent, other.name, *status, false);
+            return {};
+        }
+    }
+    if (known->object.documentID != DocumentID{}) {
+        recent_.add(departure.parent, departure.name, known->object.documentID, options_.now());
+    }
+    if (known->isFolder()) {
+        TRY(removeBelow(departure.fileID));
+        forgetWatch(departure.fileID);
+        contexts_.clear();
+    } else if (known->object.hasOtherNames) {
+        forgetWatch(departure.fileID);
+    }
+    // Whoever takes its document over does so before it is gone.
+    for (auto at = replacements_.begin(); at != replacements_.end(); ++at) {
+        if (at->document != known->object.documentID || at->document == DocumentID{}) continue;
+        const Replacement replacement = std::move(*at);
+        replacements_.erase(at);
+        TRY(takeOver(replacement.document, replacement.parent, replacement.name, replacement.newcomer));
+        break;
+    }
+    placed_.erase(departure.fileID);
+    changes().remove(departure.fileID);
+    packagesChanged(departure.parent);
+    return {};
+}
+
+IndexChanges& IndexKeeper::changes() {
+    if (!changes_) changes_ = std::make_unique<IndexChanges>(journal_);
+    return *changes_;
+}
+
+Result<void> IndexKeeper::flush() {
+    placed_.clear();
+    if (!changes_ || changes_->empty()) return {};
+    const auto changes = std::exchange(changes_, nullptr);
+    changeCount_ += changes->size();
+    TRY(store_.apply(*changes, rootIDs_));
+    return {};
+}
+
+Result<void> IndexKeeper::flushWhenFull() {
+    return changes_ && changes_->size() >= kChangesAtOnceMax ? flush() : Result<void>();
+}
+
+// MARK: Looking
+
+Result<void> IndexKeeper::look(OpenFolder& folder, const std::string& name) {
+    const Result<FileStatus> status = sys::statx(folder.fd.get(), name.c_str());
+    if (!status.ok() && !status.error().isPosix(ENOENT)) {
+        // EACCES: the folder was closed; what is in it is told when it is opened again.
+        logDebug("can't look at {}/{}; {}", folder.path, name, status.error().description());
+        return {};
+    }
+    const std::optional<Known> former = findAt(folder.fileID, name);
+    const bool isHere = status.ok() && status->device == folder.root->directory->status.device;
+    if (isHere) TRY(see(folder, name, *status, true));
+    if (!former) {
+        if (!isHere) {
+            if (const auto nameless = numberOfNameless(name)) dirtyObjects_.insert(*nameless);
+        }
+        return {};
+    }
+    const bool isSameNumber = isHere && FileID{status->fileID} == former->object.fileID;
+    if (isSameNumber) return {};
+    lost(folder.fileID, name, *former, isHere ? std::optional(FileID{status->fileID}) : std::nullopt);
+    return {};
+}
+
+/// A name of an object that is no longer there, or has another.
+void IndexKeeper::lost(FileID parent, std::string_view name, const Known& known, std::optional<FileID> newcomer) {
+    if (!known.isAt(parent, name)) {
+        // One of its other names. The number of names is part of its status.
+        changes().removeName(known.object.fileID, parent, name);
+        dirtyObjects_.insert(known.object.fileID);
+        return;
+    }
+    departures_.push_back({parent, std::string(name), known.object.fileID, known.object.birthTime, roundNumber_});
+    if (newcomer && known.object.documentID != DocumentID{}) {
+        replacements_.push_back({parent, std::string(name), known.object.documentID, *newcomer});
+    }
+}
+
+Result<void> IndexKeeper::see(OpenFolder& folder, std::string_view name, const FileStatus& status, bool isHinted) {
+    const std::optional<Known> known = find(FileID{status.fileID});
+    if (known && known->object.birthTime == status.birthStamp()) {
+        return seeKnown(folder, name, status, *known, isHinted);
+    }
+    return seeNew(folder, name, status, known);
+}
+
+Result<void> IndexKeeper::seeKnown(OpenFolder& folder, std::string_view name, const FileStatus& status,
+                                   const Known& known, bool isHinted) {
+    const IndexedObject& object = known.object;
+    const bool isFolder = status.isDirectory();
+    const bool isChanged = object.changeTime != stampOf(status.changeTime) || object.size != sizeOf(status) ||
+                           object.kind != kindOf(status, name);
+    const bool isClosed = isFolder && (isChanged || object.isClosed)
+                              ? !sys::isReadableDirectory(folder.fd.get(), std::string(name).c_str())
+                              : object.isClosed;
+    if (!known.isAt(folder.fileID, name)) {
+        if (isFolder || !holds(object.parent, known.name, object.fileID, object.birthTime)) {
+            return seeMoved(folder, name, status, known, isClosed);
+        }
+        return seeOtherName(folder, name, status, known);
+    }
+    // Where two changes may bear the same stamp, a hint alone says that there was one.
+    if (!isChanged && object.isClosed == isClosed && (!isHinted || folder.stampsAreDistinct || isFolder)) return {};
+    put(folder.fileID, name, status, isClosed);
+    rememberAttributes(folder, name, known);
+    if (!isFolder) {
+        if (object.hasOtherNames && status.names < 2) forgetWatch(object.fileID);
+        watchNames(folder, name, status);
+        return {};
+    }
+    if (object.isClosed == isClosed && object.kind == kindOf(status, name)) return {};
+    // What is below shows, or no longer shows, where it did not, or did.
+    contexts_.clear();
+    if (!isClosed) toScan_.push_back(object.fileID);
+    return touchBelow(object.fileID);
+}
+
+Result<void> IndexKeeper::seeMoved(OpenFolder& folder, std::string_view name, const FileStatus& status,
+                                   const Known& known, bool isClosed) {
+    const IndexedObject& object = known.object;
+    movedAway(known, folder.fileID, name);
+    if (object.hasOtherNames) {
+        for (const VolumeStore::Name& other : store_.otherNames(object.fileID)) {
+            if (other.parent == folder.fileID && other.name == name) {
+                changes().removeName(object.fileID, other.parent, other.name);
+            }
+        }
+    }
+    packagesChanged(object.parent);
+    if (!status.isDirectory()) {
+        put(folder.fileID, name, status, false);
+        arrived(folder.fileID, name, object.fileID);
+        watchNames(folder, name, status);
+        return {};
+    }
+    const Context before = contextInside(object.parent, known.name, object.kind);
+    put(folder.fileID, name, status, isClosed);
+    arrived(folder.fileID, name, object.fileID);
+    contexts_.clear();
+    const Context after = contextInside(folder.fileID, name, kindOf(status, name));
+    if (before.root != after.root) toScan_.push_back(object.fileID);
+    if (before.differsFrom(after)) TRY(touchBelow(object.fileID));
+    return {};
+}
+
+Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name, const FileStatus& status,
+                                       const Known& known) {
+    const IndexedObject& object = known.object;
+    const std::optional<Known> here = findAt(folder.fileID, name);
+    const bool isKnownName = here && here->object.fileID == object.fileID;
+    if (!isKnownName) changes().addName(object.fileID, folder.fileID, name);
+    if (object.changeTime != stampOf(status.changeTime) || object.size != sizeOf(status)) {
+        put(object.parent, known.name, status, false);
+    }
+    watchNames(folder, name, status);
+    return {};
+}
+
+Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, const FileStatus& status,
+                                 const std::optional<Known>& formerHolder) {
+    const FileID fileID{status.fileID};
+    if (formerHolder) {
+        // The number was another object's. That one is gone, wherever it was.
+        const DocumentID document = formerHolder->object.documentID;
+        if (document != DocumentID{}) {
+            recent_.add(formerHolder->object.parent, formerHolder->name, document, options_.now());
+        }
+        packagesChanged(formerHolder->object.parent);
+        if (formerHolder->isFolder()) {
+            TRY(removeBelow(fileID));
+            contexts_.clear();
+        }
+        forgetWatch(fileID);
+        placed_.erase(fileID);
+    }
+    const bool isFolder = status.isDirectory();
+    const bool isClosed = isFolder && !sys::isReadableDirectory(folder.fd.get(), std::string(name).c_str());
+    put(folder.fileID, name, status, isClosed);
+    arrived(folder.fileID, name, fileID);
+    if (isFolder) {
+        if (!isClosed) toScan_.push_back(fileID);
+    } else {
+        watchNames(folder, name, status);
+    }
+    return {};
+}
+
+/// A folder whose entries changed is itself changed.
+void IndexKeeper::lookAtFolderItself(OpenFolder& folder) {
+    if (rootWithID(folder.fileID) != nullptr) return;
+    const std::optional<Known> known = find(folder.fileID);
+    const Result<FileStatus> status = sys::statx(folder.fd.get(), "");
+    // One without a name is told of by its parent.
+    if (!known || !status.ok() || status->names == 0 || status->birthStamp() != known->object.birthTime) return;
+    if (known->object.changeTime == stampOf(status->changeTime)) return;
+    put(known->object.parent, known->name, *status, known->object.isClosed);
+}
+
+void IndexKeeper::put(FileID parent, std::string_view name, const FileStatus& status, bool isClosed) {
+    IndexedObject object;
+    object.fileID = FileID{status.fileID};
+    object.birthTime = status.birthStamp();
+    object.parent = parent;
+    object.name = name;
+    object.kind = kindOf(status, name);
+    object.changeTime = stampOf(status.changeTime);
+    object.size = sizeOf(status);
+    object.isClosed = isClosed;
+    object.hasOtherNames = !status.isDirectory() && status.names > 1;
+    changes().put(object);
+    packagesChanged(parent);
+    // A file with one name is not met again before it is written, except under another name: it is looked up there.
+    const bool mayBeMetAgain =
+        status.isDirectory() || object.hasOtherNames || placed_.contains(object.fileID) || journal_ == Journal::yes;
+    if (!mayBeMetAgain) return;
+    Known known{object, std::string(name)};
+    known.object.name = {};
+    if (const auto before = find(object.fileID); before && before->object.birthTime == object.birthTime) {
+        known.object.documentID = before->object.documentID;
+        known.object.isListed = before->object.isListed;
+    }
+    placed_.insert_or_assign(object.fileID, std::move(known));
+}
+
+void IndexKeeper::rememberAttributes(const OpenFolder& folder, std::string_view name, const Known& known) {
+    const DocumentID document = known.object.documentID;
+    if (document == DocumentID{}) return;
+    const Result<Bytes> attributes = own_attributes::read(folder.fd.get(), std::string(name).c_str());
+    if (!attributes.ok() || *attributes == store_.attributes(document)) return;
+    const Result<void> remembered = store_.rememberAttributes(document, *attributes);
+    if (!remembered.ok()) logError("can't remember the attributes of {}; {}", name, remembered.error().description());
+}
+
+// MARK: Saves
+
+/// A document that moves aside under a backup's name makes place for the one that replaces it.
+void IndexKeeper::movedAway(const Known& known, FileID newParent, std::string_view newName) {
+    if (known.object.documentID == DocumentID{} || newParent != known.object.parent) return;
+    if (!isBackupName(newName, known.name)) return;
+    recent_.add(known.object.parent, known.name, known.object.documentID, options_.now());
+}
+
+/// Something is under a name that it did not have before.
+void IndexKeeper::arrived(FileID parent, std::string_view name, FileID newcomer) {
+    if (const auto document = recent_.take(parent, name, options_.now())) {
+        replacements_.push_back({parent, std::string(name), *document, newcomer});
+    }
+}
+
+Result<void> IndexKeeper::resolveReplacements() {
+    for (const Replacement& replacement : std::exchange(replacements_, {})) {
+        const auto document = store_.document(replacement.document);
+        if (!document) continue;
+        const std::optional<Known> holder = find(document->fileID);
+        const bool isHeld = holder && holder->object.documentID == replacement.document &&
+                            holder->object.birthTime == document->birthTime;
+        // The document is still somebody's: only a backup gives it away.
+        const bool isBackup =
+            isHeld && holder->object.parent == replacement.parent && isBackupName(holder->name, replacement.name);
+        if (isHeld && !isBackup) continue;
+        TRY(takeOver(replacement.document, replacement.parent, replacement.name, replacement.newcomer));
+    }
+    return {};
+}
+
+Result<void> IndexKeeper::takeOver(DocumentID document, FileID parent, const std::string& name, FileID newcomer) {
+    TRY(flush());
+    const std::optional<Known> known = find(newcomer);
+    if (!known || !known->isAt(parent, name) || !mayTakeOver(*known)) return {};
+    if (known->object.documentID == document) return {};
+    changes().handOver(document, newcomer);
+    (void)recent_.take(parent, name, options_.now());
+    restoreAttributes(document, parent, name, newcomer);
+    return {};
+}
+
+/// An older document with a number of its own was moved over another, and stays itself.
+bool IndexKeeper::mayTakeOver(const Known& newcomer) const {
+    if (newcomer.object.kind != ObjectKind::file && newcomer.object.kind != ObjectKind::package) return false;
+    if (newcomer.object.documentID == DocumentID{}) return true;
+    const std::int64_t age = stampOf(options_.wallClock()) - newcomer.object.birthTime;
+    return newcomer.object.birthTime != 0 && age < kYoungNanoseconds;
+}
+
+void IndexKeeper::restoreAttributes(DocumentID document, FileID parent, const std::string& name, FileID newcomer) {
+    const Bytes attributes = store_.attributes(document);
+    if (attributes.empty()) return;
+    const auto folder = openFolder(parent);
+    if (!folder) return;
+    // Its kind was looked at: what waits for a reader when it is opened is not among them, and is not waited for.
+    const Result<UniqueFd> file =
+        sys::openat(folder->fd.get(), name.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY);
+    const Result<FileStatus> status = file.ok() ? sys::statx(file->get(), "") : Result<FileStatus>(file.error());
+    if (!status.ok() || FileID{status->fileID} != newcomer) return;
+    const Result<std::size_t> put = own_attributes::restoreMissing(file->get(), attributes);
+    if (!put.ok()) logError("can't put back the attributes of {}; {}", name, put.error().description());
+    if (put.ok() && *put > 0) dirtyObjects_.insert(newcomer);
+}
+
+// MARK: The index, with what is not written yet
+
+std::optional<IndexKeeper::Known> IndexKeeper::find(FileID fileID) const {
+    if (const auto placed = placed_.find(fileID); placed != placed_.end()) return placed->second;
+    std::optional<Known> found;
+    store_.indexed(fileID, [&](const IndexedObject& object) {
+        found.emplace(object, std::string(object.name));
+        found->object.name = {};
+    });
+    return found;
+}
+
+std::optional<IndexKeeper::Known> IndexKeeper::findAt(FileID parent, std::string_view name) const {
+    std::optional<Known> found;
+    store_.child(parent, name, [&](const IndexedObject& object) {
+        found.emplace(object, std::string(object.name));
+        found->object.name = {};
+    });
+    if (!found) return found;
+    const auto placed = placed_.find(found->object.fileID);
+    if (placed == placed_.end()) return found;
+    // It was here, and has moved since; or its number is another object's.
+    if (found->isAt(parent, name) && !placed->second.isAt(parent, name)) return std::nullopt;
+    return placed->second.object.birthTime == found->object.birthTime ? std::optional(placed->second) : std::nullopt;
+}
+
+IndexKeeper::Context IndexKeeper::contextInside(FileID parent, std::string_view name, ObjectKind kind) {
+    Context context = contextOf(parent);
+    if (name == ".Trash") context.isInTrash = true;
+    return kind == ObjectKind::package ? (context.packages.emplace_back(), context) : context;
+}
+
+const IndexKeeper::Context& IndexKeeper::contextOf(FileID folder) {
+    const auto found = contexts_.find(folder);
+    if (found != contexts_.end()) return found->second;
+    Context context;
+    const std::optional<Known> known = rootWithID(folder) == nullptr ? find(folder) : std::nullopt;
+    if (known && known->object.parent != folder) {
+        context = contextOf(known->object.parent);
+        if (known->name == ".Trash") context.isInTrash = true;
+        if (known->object.kind == ObjectKind::package) context.packages.push_back(folder);
+    } else {
+        context.root = folder;
+    }
+    return contexts_.insert_or_assign(folder, std::move(context)).first->second;
+}
+
+/// What changes inside a package changes the package.
+void IndexKeeper::packagesChanged(FileID folder) {
+    if (journal_ == Journal::no) return;
+    const Context& context = contextOf(folder);
+    touchedPackages_.insert(context.packages.begin(), context.packages.end());
+}
+
+}  // namespace cindral

@@ -1,0 +1,382 @@
+#include <fcntl.h>
+#include <linux/openat2.h>
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <utility>
+
+#include "platform/eventstream/IndexKeeper.h"
+#include "platform/eventstream/IndexKeeperTypes.h"
+#include "platform/foundation/Log.h"
+
+// How folders are compared with the index, and how the tree is reached.
+
+namespace cindral {
+
+using index_keeper::kindOf;
+using index_keeper::sizeOf;
+using index_keeper::stampOf;
+
+namespace {
+
+// Folders that are kept open for what comes next in them; well below what a process may have open.
+constexpr std::size_t kOpenFoldersMax = 128;
+constexpr std::size_t kDirectoryBytes = 65'536;
+// Every folder's watch may bring news while others are read; the kernel's queue must not fill up meanwhile.
+constexpr std::size_t kFoldersBetweenHints = 8;
+
+std::string joined(std::string_view folder, std::string_view name) {
+    std::string path(folder);
+    if (!path.empty()) path += '/';
+    path += name;
+    return path;
+}
+
+}  // namespace
+
+// MARK: Comparing
+
+Result<void> IndexKeeper::compareEverything(Journal journal) {
+    journal_ = journal;
+    everythingIsDirty_ = true;
+    const Result<void> done = workOff();
+    journal_ = Journal::yes;
+    return done;
+}
+
+Result<void> IndexKeeper::compareTree(FileID folder) {
+    toScan_.push_back(folder);
+    return workOff();
+}
+
+Result<std::vector<FileID>> IndexKeeper::compareFolder(FileID fileID) {
+    TRY(takeHints());
+    std::vector<FileID> subfolders;
+    if (const auto folder = openFolder(fileID)) {
+        std::vector<Subfolder> found;
+        const Result<void> compared = compareEntries(*folder, &found);
+        if (!compared.ok()) everythingIsDirty_ = true;
+        TRY(Result<void>(compared));
+        for (const Subfolder& subfolder : found) subfolders.push_back(subfolder.fileID);
+    }
+    TRY(workOff());
+    return subfolders;
+}
+
+Result<void> IndexKeeper::compareUnwatched() {
+    // A copy: what is found to be watched now leaves the set.
+    const std::vector<FileID> unwatched(unwatched_.begin(), unwatched_.end());
+    for (const FileID fileID : unwatched) {
+        const auto folder = openFolder(fileID);
+        if (!folder) {
+            if (!find(fileID) && rootWithID(fileID) == nullptr) unwatched_.erase(fileID);
+            continue;
+        }
+        watch(*folder);
+        TRY(compareEntries(*folder, nullptr));
+        lookAtFolderItself(*folder);
+    }
+    return {};
+}
+
+Result<void> IndexKeeper::scanPending() {
+    while (!toScan_.empty()) {
+        const FileID folder = toScan_.back();
+        toScan_.pop_back();
+        TRY(scan(folder));
+    }
+    return {};
+}
+
+/// Watches first, then reads: what comes in between is told of twice, never not at all.
+Result<void> IndexKeeper::scan(FileID top) {
+    TRY(flush());
+    const auto first = openFolder(top);
+    if (!first) return {};
+    const Root& root = *first->root;
+    std::vector<Subfolder> stack;
+    stack.push_back({top, first->path});
+    for (std::size_t count = 1; !stack.empty(); ++count) {
+        if (options_.isStopping()) return KsError::posix(ECANCELED);
+        const Subfolder next = std::move(stack.back());
+        stack.pop_back();
+        const auto folder = open(next.fileID, next.path, root);
+        if (!folder.ok()) {
+            // Moved or gone since its parent was read: its parent's watch tells. Closed: it says so itself.
+            logDebug("can't read the folder {}; {}", next.path, folder.error().description());
+            if (!folder.error().isPosix(EACCES)) dirtyObjects_.insert(next.fileID);
+            continue;
+        }
+        watch(**folder);
+        TRY(compareEntries(**folder, &stack));
+        TRY(flushWhenFull());
+        if (count % kFoldersBetweenHints == 0) TRY(takeHints());
+    }
+    return {};
+}
+
+/// Entries of a folder as they were just read.
+struct IndexKeeper::Entries {
+    struct Entry {
+        const char* name = nullptr;
+        FileStatus status;
+        bool isMatched = false;
+    };
+    std::vector<Entry> entries;
+    std::vector<FileID> fileIDs;
+    std::vector<std::uint64_t> seen;  // File IDs of all the entries so far.
+    std::uint64_t recordedHere = 0;   // Of them, those that the index has here.
+};
+
+Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders) {
+    const std::uint64_t recorded = store_.childCount(folder.fileID);
+    Entries entries;
+    alignas(8) std::array<std::byte, kDirectoryBytes> buffer;
+    (void)::lseek(folder.fd.get(), 0, SEEK_SET);
+    while (true) {
+        const Result<std::size_t> read = sys::getdents(folder.fd.get(), buffer);
+        if (!read.ok()) {
+            // What can't be read is not gone, and is no reason not to read the others.
+            logDebug("can't read the folder {}; {}", folder.path, read.error().description());
+            return {};
+        }
+        const std::size_t size = *read;
+        if (size == 0) break;
+        entries.entries.clear();
+        for (std::size_t at = 0; at < size;) {
+            const auto* record = reinterpret_cast<const DirectoryRecord*>(buffer.data() + at);
+            at += record->length;
+            if (record->isDots()) continue;
+            const Result<FileStatus> status = sys::statx(folder.fd.get(), record->name);
+            if (!status.ok()) {
+                if (status.error().isPosix(ENOENT)) continue;
+                logDebug("can't look at {}/{}; {}", folder.path, record->name, status.error().description());
+                // What can't be looked at is not gone.
+                return {};
+            }
+            if (status->device != folder.root->directory->status.device) continue;
+            entries.entries.push_back({record->name, *status});
+        }
+        TRY(compareBatch(folder, entries, subfolders != nullptr));
+        if (subfolders == nullptr) continue;
+        for (const Entries::Entry& entry : entries.entries) {
+            if (!entry.status.isDirectory()) continue;
+            subfolders->push_back({FileID{entry.status.fileID}, joined(folder.path, entry.name)});
+        }
+    }
+    return entries.recordedHere == recorded ? Result<void>() : findLost(folder, entries.seen);
+}
+
+Result<void> IndexKeeper::compareBatch(OpenFolder& folder, Entries& entries, bool goesOnBelow) {
+    entries.fileIDs.clear();
+    for (const Entries::Entry& entry : entries.entries) {
+        entries.fileIDs.push_back(FileID{entry.status.fileID});
+        entries.seen.push_back(entry.status.fileID);
+    }
+    TRY(store_.indexed(entries.fileIDs, [&](std::size_t i, const IndexedObject* object) {
+        Entries::Entry& entry = entries.entries[i];
+        if (object == nullptr || object->parent != folder.fileID || object->name != entry.name ||
+            object->birthTime != entry.status.birthStamp())
+            return;
+        ++entries.recordedHere;
+        entry.isMatched = object->changeTime == stampOf(entry.status.changeTime) &&
+                          object->size == sizeOf(entry.status) && object->kind == kindOf(entry.status, entry.name) &&
+                          !object->isClosed && !object->hasOtherNames && entry.status.names == 1;
+        // A folder's number of links says nothing.
+        if (entry.status.isDirectory() && !object->isClosed) {
+            entry.isMatched = object->changeTime == stampOf(entry.status.changeTime) &&
+                              object->kind == kindOf(entry.status, entry.name);
+        }
+    }));
+    for (const Entries::Entry& entry : entries.entries) {
+        if (!entry.isMatched) TRY(seeCompared(folder, entry.name, entry.status, goesOnBelow));
+    }
+    return {};
+}
+
+Result<void> IndexKeeper::seeCompared(OpenFolder& folder, const char* name, const FileStatus& status,
+                                      bool goesOnBelow) {
+    const std::size_t before = toScan_.size();
+    TRY(see(folder, name, status, false));
+    watchNames(folder, name, status);
+    if (goesOnBelow && status.isDirectory()) {
+        // The comparison comes to it by itself.
+        const auto added = toScan_.begin() + static_cast<std::ptrdiff_t>(before);
+        toScan_.erase(std::remove(added, toScan_.end(), FileID{status.fileID}), toScan_.end());
+    }
+    return flushWhenFull();
+}
+
+/// What the index has in the folder and the folder doesn't.
+Result<void> IndexKeeper::findLost(OpenFolder& folder, std::vector<std::uint64_t>& seen) {
+    TRY(flush());
+    std::ranges::sort(seen);
+    std::vector<Known> missing;
+    TRY(store_.children(folder.fileID, [&](const IndexedObject& object) {
+        if (std::ranges::binary_search(seen, static_cast<std::uint64_t>(object.fileID))) return;
+        missing.push_back({object, std::string(object.name)});
+        missing.back().object.name = {};
+    }));
+    for (const Known& known : missing) {
+        const Result<FileStatus> status = sys::statx(folder.fd.get(), known.name.c_str());
+        if (!status.ok() && !status.error().isPosix(ENOENT)) continue;
+        const bool isThere = status.ok() && status->device == folder.root->directory->status.device;
+        if (isThere && known.isSame(FileID{status->fileID}, status->birthStamp())) continue;
+        lost(folder.fileID, known.name, known, isThere ? std::optional(FileID{status->fileID}) : std::nullopt);
+    }
+    return {};
+}
+
+// MARK: Watching
+
+void IndexKeeper::watch(const OpenFolder& folder) {
+    const auto& source = folder.root->source;
+    if (!source) {
+        unwatched_.insert(folder.fileID);
+        return;
+    }
+    const Result<void> watched = source->watchFolder(folder.fd.get(), folder.fileID);
+    if (watched.ok()) {
+        unwatched_.erase(folder.fileID);
+        return;
+    }
+    if (watched.error().isPosix(ENOSPC)) {
+        reachedWatchLimit_ = true;
+    } else {
+        logDebug("can't watch {}; {}", folder.path, watched.error().description());
+    }
+    unwatched_.insert(folder.fileID);
+}
+
+/// A file with several names may be changed through one that is outside of the roots.
+void IndexKeeper::watchNames(const OpenFolder& folder, std::string_view name, const FileStatus& status) {
+    if (!status.isRegular() || status.names < 2 || !folder.root->source) return;
+    const Result<UniqueFd> file = sys::openat(folder.fd.get(), std::string(name).c_str(), O_PATH | O_NOFOLLOW);
+    if (!file.ok()) return;
+    const Result<void> watched = folder.root->source->watchFile(file->get(), FileID{status.fileID});
+    if (!watched.ok()) logDebug("can't watch the file {}; {}", name, watched.error().description());
+}
+
+void IndexKeeper::forgetWatch(FileID fileID) {
+    for (const auto& source : sources_) source->forget(fileID);
+    unwatched_.erase(fileID);
+}
+
+// MARK: Subtrees
+
+Result<void> IndexKeeper::forEachBelow(FileID top, const std::function<Result<void>(FileID, bool)>& use) {
+    struct Level {
+        FileID folder{};
+        bool isExpanded = false;
+    };
+    std::vector<Level> stack{{top, false}};
+    std::vector<FileID> files;
+    while (!stack.empty()) {
+        const FileID folder = stack.back().folder;
+        if (stack.back().isExpanded) {
+            stack.pop_back();
+            if (folder != top) TRY(use(folder, true));
+            continue;
+        }
+        stack.back().isExpanded = true;
+        files.clear();
+        TRY(store_.children(folder, [&](const IndexedObject& object) {
+            if (object.kind == ObjectKind::folder || object.kind == ObjectKind::package) {
+                stack.push_back({object.fileID, false});
+            } else {
+                files.push_back(object.fileID);
+            }
+        }));
+        for (const FileID file : files) TRY(use(file, false));
+    }
+    return {};
+}
+
+Result<void> IndexKeeper::removeBelow(FileID folder) {
+    TRY(flush());
+    return forEachBelow(folder, [this](FileID fileID, bool isFolder) -> Result<void> {
+        if (isFolder) forgetWatch(fileID);
+        changes().remove(fileID);
+        return flushWhenFull();
+    });
+}
+
+Result<void> IndexKeeper::touchBelow(FileID folder) {
+    if (journal_ == Journal::no) return {};
+    TRY(flush());
+    return forEachBelow(folder, [this](FileID fileID, bool) -> Result<void> {
+        changes().touch(fileID);
+        return flushWhenFull();
+    });
+}
+
+Result<void> IndexKeeper::removeTree(FileID folder) {
+    TRY(removeBelow(folder));
+    forgetWatch(folder);
+    if (find(folder)) changes().remove(folder);
+    return flush();
+}
+
+// MARK: The tree
+
+const IndexKeeper::Root* IndexKeeper::rootWithID(FileID fileID) const {
+    const auto found = std::ranges::find(roots_, fileID, &Root::fileID);
+    return found == roots_.end() ? nullptr : &*found;
+}
+
+/// Opens the folder at the path, if it is the one. No link is part of a path that leads to a folder by its parents.
+Result<std::shared_ptr<IndexKeeper::OpenFolder>> IndexKeeper::open(FileID fileID, std::string_view path,
+                                                                   const Root& root) const {
+    auto folder = std::make_shared<OpenFolder>();
+    const int rootFd = root.directory->fd.get();
+    folder->fd = path.empty() ? TRY(sys::openDirectoryForReading(rootFd, "."))
+                              : TRY(sys::openDirectoryBeneath(rootFd, path, RESOLVE_NO_SYMLINKS));
+    const FileStatus status = TRY(sys::statx(folder->fd.get(), ""));
+    if (FileID{status.fileID} != fileID || status.device != root.directory->status.device) {
+        return KsError::posix(ESTALE);
+    }
+    folder->fileID = fileID;
+    folder->path = path;
+    folder->root = &root;
+    folder->stampsAreDistinct = root.stampsAreDistinct;
+    return folder;
+}
+
+/// Null when it can't be opened where the index has it.
+std::shared_ptr<IndexKeeper::OpenFolder> IndexKeeper::openFolder(FileID fileID) {
+    if (const auto found = openFolders_.find(fileID); found != openFolders_.end()) return found->second;
+    const Root* root = rootWithID(fileID);
+    std::string path;
+    if (root == nullptr) {
+        // Folders on the way may have moved with changes that are not written yet.
+        std::vector<std::string> names;
+        FileID at = fileID;
+        while ((root = rootWithID(at)) == nullptr) {
+            const std::optional<Known> known = find(at);
+            if (!known || names.size() > 4'096) return nullptr;
+            names.push_back(known->name);
+            at = known->object.parent;
+        }
+        for (auto name = names.rbegin(); name != names.rend(); ++name) path = joined(path, *name);
+    }
+    Result<std::shared_ptr<OpenFolder>> folder = open(fileID, path, *root);
+    if (!folder.ok()) return nullptr;
+    if (openFolders_.size() >= kOpenFoldersMax) openFolders_.clear();
+    return openFolders_.emplace(fileID, *std::move(folder)).first->second;
+}
+
+std::optional<FileStatus> IndexKeeper::statusAt(FileID parent, const std::string& name) {
+    const auto folder = openFolder(parent);
+    if (!folder) return std::nullopt;
+    const Result<FileStatus> status = sys::statx(folder->fd.get(), name.c_str());
+    if (!status.ok() || status->device != folder->root->directory->status.device) return std::nullopt;
+    return *status;
+}
+
+bool IndexKeeper::holds(FileID parent, const std::string& name, FileID fileID, std::int64_t birthTime) {
+    const std::optional<FileStatus> status = statusAt(parent, name);
+    return status && FileID{status->fileID} == fileID && status->birthStamp() == birthTime;
+}
+
+}  // namespace cindral

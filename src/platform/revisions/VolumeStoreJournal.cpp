@@ -1,0 +1,264 @@
+#include <algorithm>
+#include <limits>
+
+#include "platform/revisions/VolumeIndex.h"
+#include "platform/revisions/VolumeStoreReading.h"
+
+// The event journal: how it is read, begun and trimmed.
+
+namespace cindral {
+
+namespace {
+
+// How far apart the moments are that the journal remembers.
+constexpr std::chrono::minutes kTimeMarkInterval{10};
+
+std::int64_t nanoseconds(std::chrono::system_clock::time_point time) {
+    return std::chrono::duration_cast<std::chrono::nanoseconds>(time.time_since_epoch()).count();
+}
+
+JournalEvent eventOf(std::uint64_t id, const Departure& departure) {
+    return {.id = id,
+            .kind = JournalEvent::Kind::departed,
+            .fileID = departure.fileID,
+            .documentID = departure.documentID,
+            .parent = departure.parent,
+            .name = std::string(departure.name),
+            .objectKind = departure.objectKind,
+            .path = std::string(departure.path),
+            .root = departure.root};
+}
+
+JournalEvent eventOf(std::uint64_t id, FileID fileID) {
+    return {.id = id, .kind = JournalEvent::Kind::present, .fileID = fileID};
+}
+
+JournalEvent eventOf(std::uint64_t id, const DocumentChange& change) {
+    return {.id = id,
+            .kind = JournalEvent::Kind::document,
+            .fileID = change.source,
+            .documentID = change.documentID,
+            .target = change.target};
+}
+
+/// None for what no store has written.
+std::optional<JournalEvent> decodeEvent(std::uint64_t id, ByteView bytes) {
+    if (const auto presence = Presence::decode(bytes)) return eventOf(id, presence->fileID);
+    if (const auto departure = Departure::decode(bytes)) return eventOf(id, *departure);
+    return std::nullopt;
+}
+
+/// The first events of an overlay after an ID, in their order, without those that another one there has replaced.
+void collect(const Overlay& overlay, std::uint64_t after, std::size_t max, std::vector<JournalEvent>& found) {
+    const auto idOf = [](const auto& entry) { return entry.first; };
+    auto presence = std::ranges::upper_bound(overlay.presences(), after, {}, idOf);
+    auto departure = std::ranges::upper_bound(overlay.departures(), after, {}, idOf);
+    const auto presencesEnd = overlay.presences().end();
+    const auto departuresEnd = overlay.departures().end();
+    while (found.size() < max && (presence != presencesEnd || departure != departuresEnd)) {
+        if (departure == departuresEnd || (presence != presencesEnd && presence->first < departure->first)) {
+            if (overlay.isCurrent(*presence)) found.push_back(eventOf(presence->first, presence->second));
+            ++presence;
+        } else {
+            found.push_back(eventOf(departure->first, *Departure::decode(departure->second)));
+            ++departure;
+        }
+    }
+}
+
+void collectDocumentChanges(const Overlay& overlay, std::uint64_t after, std::size_t max,
+                            std::vector<JournalEvent>& found) {
+    const auto& changes = overlay.documentChanges();
+    auto change = std::ranges::upper_bound(changes, after, {}, [](const auto& entry) { return entry.first; });
+    for (; change != changes.end() && found.size() < max; ++change) {
+        found.push_back(eventOf(change->first, change->second));
+    }
+}
+
+}  // namespace
+
+// MARK: Reading
+
+/// Fills in what the records say today, and takes those over that are good: an object has but one event, and one that
+/// is gone has none.
+Result<void> VolumeStore::Implementation::resolve(std::vector<JournalEvent>& candidates,
+                                                  std::vector<JournalEvent>& found) const {
+    std::vector<std::size_t> presences;
+    for (std::size_t i = 0; i < candidates.size(); ++i) {
+        if (candidates[i].kind == JournalEvent::Kind::present) presences.push_back(i);
+    }
+    TRY(lookUp(
+        presences.size(), [&](std::size_t i) { return candidates[presences[i]].fileID; },
+        [&](std::size_t i, const PackedRecord* record) {
+            JournalEvent& event = candidates[presences[i]];
+            if (record == nullptr || record->eventID != event.id) {
+                event.id = 0;
+                return;
+            }
+            event.parent = record->parent;
+            event.name = record->name;
+            event.objectKind = record->kind;
+            event.documentID = record->documentID;
+        }));
+    for (JournalEvent& event : candidates) {
+        if (event.id != 0) found.push_back(std::move(event));
+    }
+    candidates.clear();
+    return {};
+}
+
+Result<std::vector<JournalEvent>> VolumeStore::Implementation::events(std::uint64_t after, std::size_t max) const {
+    std::vector<JournalEvent> found, candidates, unsaved;
+    std::uint64_t unsavedBegin = std::numeric_limits<std::uint64_t>::max();
+    {
+        const MutexLock lock(mutex_);
+        if (frozen_) {
+            unsavedBegin = frozen_->firstEvent();
+            collect(*frozen_, after, max, unsaved);
+        }
+        unsavedBegin = std::min(unsavedBegin, active_->firstEvent());
+        collect(*active_, after, max, unsaved);
+    }
+    Result<void> resolved;
+    {
+        const ObjectTables::Snapshot snapshot(*tables_);
+        TRY(snapshot.events(after, [&](std::uint64_t id, ByteView bytes) {
+            if (id >= unsavedBegin || found.size() + candidates.size() >= max) return false;
+            if (auto event = decodeEvent(id, bytes)) candidates.push_back(std::move(*event));
+            if (candidates.size() == std::min(kLookupsAtOnceMax, max - found.size()))
+                resolved = resolve(candidates, found);
+            return resolved.ok();
+        }));
+    }
+    TRY(Result<void>(resolved));
+    TRY(resolve(candidates, found));
+    for (auto event = unsaved.begin(); event != unsaved.end() && found.size() < max;) {
+        const auto some = std::min<std::size_t>(static_cast<std::size_t>(unsaved.end() - event), max - found.size());
+        candidates.assign(std::make_move_iterator(event),
+                          std::make_move_iterator(event + static_cast<std::ptrdiff_t>(some)));
+        event += static_cast<std::ptrdiff_t>(some);
+        TRY(resolve(candidates, found));
+    }
+    return found;
+}
+
+Result<std::vector<JournalEvent>> VolumeStore::Implementation::documentEvents(std::uint64_t after,
+                                                                              std::size_t max) const {
+    std::vector<JournalEvent> found, unsaved;
+    std::uint64_t unsavedBegin = std::numeric_limits<std::uint64_t>::max();
+    {
+        const MutexLock lock(mutex_);
+        if (frozen_) {
+            unsavedBegin = frozen_->firstEvent();
+            collectDocumentChanges(*frozen_, after, max, unsaved);
+        }
+        unsavedBegin = std::min(unsavedBegin, active_->firstEvent());
+        collectDocumentChanges(*active_, after, max, unsaved);
+    }
+    TRY(ObjectTables::Snapshot(*tables_).documentChanges(after, [&](std::uint64_t id, ByteView bytes) {
+        if (id >= unsavedBegin || found.size() >= max) return false;
+        if (const auto change = DocumentChange::decode(bytes)) found.push_back(eventOf(id, *change));
+        return true;
+    }));
+    for (auto event = unsaved.begin(); event != unsaved.end() && found.size() < max; ++event) {
+        found.push_back(std::move(*event));
+    }
+    return found;
+}
+
+// MARK: Beginning and forgetting
+
+std::optional<std::uint64_t> VolumeStore::Implementation::historyBegin() const {
+    const MutexLock lock(mutex_);
+    return historyBegin_;
+}
+
+Result<std::uint64_t> VolumeStore::Implementation::beginHistory() {
+    TRY(checkpoint());
+    const MutexLock checkpointLock(checkpointMutex_);
+    const MutexLock writerLock(writerMutex_);
+    TRY(saveEverything());
+    const std::uint64_t begin = TRY(numbers_->reserveEvents(1));
+    TablesHead head = tables_->head();
+    head.historyBegin = begin;
+    head.marks = numbers_->reserved();
+    TRY(tables_->forgetEvents(head));
+    lastTimeMark_.reset();
+    {
+        const MutexLock lock(mutex_);
+        historyBegin_ = begin;
+        counts_.events = 0;
+    }
+    numbers_->takeEvents(1);
+    return begin;
+}
+
+Result<void> VolumeStore::Implementation::renewUUID() {
+    TRY(checkpoint());
+    const MutexLock checkpointLock(checkpointMutex_);
+    const MutexLock writerLock(writerMutex_);
+    TRY(saveEverything());
+    // Under the new UUID what is in the logs would be nothing; it is in the tables.
+    for (LogFile& log : logs_) TRY(log.clearDurably());
+    TablesHead head = tables_->head();
+    head.uuid = KsUUID::random();
+    if (head.historyBegin != 0) head.historyBegin = numbers_->currentEvent();
+    TRY(tables_->forgetEvents(head));
+    lastTimeMark_.reset();
+    const MutexLock lock(mutex_);
+    uuid_ = head.uuid;
+    if (historyBegin_) historyBegin_ = head.historyBegin;
+    counts_.events = 0;
+    return {};
+}
+
+std::int64_t VolumeStore::Implementation::now() const {
+    return nanoseconds(options_.now ? options_.now() : std::chrono::system_clock::now());
+}
+
+/// Whether the time is to be remembered with the next event.
+bool VolumeStore::Implementation::isTimeMarkDue(std::int64_t time) const {
+    // A clock that was set back begins anew: the newer marks count.
+    return !lastTimeMark_ || time < lastTimeMark_->time ||
+           time - lastTimeMark_->time >= std::chrono::nanoseconds(kTimeMarkInterval).count();
+}
+
+/// The last event that was journalled longer ago, for certain; 0 for none.
+Result<std::uint64_t> VolumeStore::Implementation::lastEventOlderThan(std::chrono::seconds age,
+                                                                      std::uint64_t current) const {
+    const auto marks = TRY(ObjectTables::Snapshot(*tables_).timeMarks());
+    // Events from a mark on, up to the next, are of the interval that begins with it.
+    const std::int64_t interval = std::chrono::nanoseconds(kTimeMarkInterval).count();
+    const std::int64_t time = now();
+    std::uint64_t last = 0;
+    for (std::size_t i = 0; i < marks.size(); ++i) {
+        if (time - marks[i].second < interval) continue;
+        const auto seconds = (time - marks[i].second - interval) / 1'000'000'000;
+        if (seconds < age.count()) continue;
+        last = i + 1 < marks.size() ? marks[i + 1].first - 1 : current;
+    }
+    return last;
+}
+
+Result<void> VolumeStore::Implementation::trimJournal(std::uint64_t eventsMax, std::chrono::seconds ageMax) {
+    const std::uint64_t current = currentEventID();
+    // What is trimmed is in the tables.
+    TRY(checkpoint());
+    const MutexLock checkpointLock(checkpointMutex_);
+    TablesHead head = tables_->head();
+    const std::uint64_t upTo =
+        std::min(current, std::max(TRY(tables_->lastEventBeyond(eventsMax)), TRY(lastEventOlderThan(ageMax, current))));
+    if (head.historyBegin == 0 || upTo <= head.historyBegin) return {};
+    head.historyBegin = upTo;
+    {
+        // Before the first goes: who finds its own still covered has them all.
+        const MutexLock lock(mutex_);
+        historyBegin_ = upTo;
+    }
+    const std::uint64_t forgotten = TRY(tables_->forgetEventsUpTo(upTo, head));
+    const MutexLock lock(mutex_);
+    counts_.events -= std::min(counts_.events, forgotten);
+    return {};
+}
+
+}  // namespace cindral

@@ -1,0 +1,1 @@
+cindral_fuzz_target(FanotifyEventsFuzz DEPENDS cindral_eventstream)

@@ -1,0 +1,698 @@
+#include "platform/eventstream/Recorder.h"
+
+#include <fcntl.h>
+#include <gmock/gmock.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "RecorderFixture.h"
+
+namespace cindral::test {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+using ::testing::UnorderedElementsAre;
+using Changes = std::set<std::string>;
+using std::chrono::milliseconds;
+using std::chrono::seconds;
+
+constexpr DocumentID kNoDocument{};
+constexpr FileID kNothing{};
+
+// MARK: Objects that come, change and go
+
+TEST_P(RecorderTest, hasNoEventsOfWhatWasThereAtTheFirstReading) {
+    write("a");
+    makeFolder("f");
+    write("f/b");
+    start();
+    EXPECT_THAT(changes(), IsEmpty());
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, tellsOfANewFile) {
+    start();
+    write("a");
+    EXPECT_EQ(changes(), (Changes{"a"}));
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, tellsOfAWrite) {
+    write("a");
+    start();
+    append("a", "more");
+    EXPECT_EQ(changes(), (Changes{"a"}));
+    EXPECT_THAT(changes(), IsEmpty());
+}
+
+TEST_P(RecorderTest, tellsOfAWriteOfTheSameSize) {
+    write("a", "one");
+    start();
+    write("a", "two");
+    EXPECT_EQ(changes(), (Changes{"a"}));
+}
+
+TEST_P(RecorderTest, tellsOfManyWritesOnce) {
+    write("a");
+    start();
+    for (int i = 0; i < 100; ++i) {
+        append("a", "more");
+        if (i % 10 == 0) {
+            ASSERT_TRUE(recorder().drain().ok());
+        }
+    }
+    ASSERT_TRUE(recorder().drain().ok());
+    const auto batch = recorder().pathEvents(seenEvents_, 1'000);
+    ASSERT_TRUE(batch.ok());
+    EXPECT_EQ(batch->events.size(), 1u);
+}
+
+TEST_P(RecorderTest, tellsOfNewModeAndAttributes) {
+    write("a");
+    write("b");
+    start();
+    ASSERT_EQ(::chmod(path("a").c_str(), 0600), 0);
+    setTag("b", "red");
+    EXPECT_EQ(changes(), (Changes{"a", "b"}));
+}
+
+TEST_P(RecorderTest, tellsThatAListedFileIsGone) {
+    write("a");
+    start();
+    list("a");
+    remove("a");
+    EXPECT_EQ(changes(), (Changes{"- a"}));
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, saysNothingOfAFileThatCameAndWent) {
+    start();
+    write("a");
+    EXPECT_EQ(changes(), (Changes{"a"}));
+    remove("a");
+    EXPECT_THAT(changes(), IsEmpty());
+    write("b");
+    remove("b");
+    EXPECT_THAT(changes(), IsEmpty());
+    EXPECT_EQ(store().counts().events, 0u);
+}
+
+TEST_P(RecorderTest, tellsOfARename) {
+    write("a");
+    start();
+    const DocumentID document = list("a");
+    rename("a", "b");
+    EXPECT_EQ(changes(), (Changes{"- a", "b"}));
+    EXPECT_EQ(this->document("b"), document);
+    EXPECT_THAT(documentChanges(), IsEmpty());
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, tellsOfAMoveBetweenFolders) {
+    makeFolder("f");
+    makeFolder("g");
+    write("f/a");
+    start();
+    const DocumentID document = list("f/a");
+    rename("f/a", "g/b");
+    EXPECT_EQ(changes(), (Changes{"- f/a", "g/b", "f", "g"}));
+    EXPECT_EQ(this->document("g/b"), document);
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, followsAFileThatMovesOnAndBack) {
+    write("a");
+    start();
+    list("a");
+    rename("a", "b");
+    rename("b", "c");
+    rename("c", "a");
+    // A rename changes the file's own change time.
+    const Changes told = changes();
+    EXPECT_TRUE(told == (Changes{"a"}) || told.empty());
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, followsTwoFilesThatSwapNames) {
+    write("a", "one");
+    write("b", "two");
+    start();
+    const DocumentID a = list("a"), b = list("b");
+    exchange("a", "b");
+    EXPECT_EQ(changes(), (Changes{"a", "b", "- a", "- b"}));
+    EXPECT_EQ(document("a"), b);
+    EXPECT_EQ(document("b"), a);
+    expectIndexIsTree();
+}
+
+// MARK: Folders
+
+TEST_P(RecorderTest, tellsOfTheFolderWhoseEntriesChanged) {
+    makeFolder("f");
+    start();
+    write("f/a");
+    EXPECT_EQ(changes(), (Changes{"f", "f/a"}));
+}
+
+TEST_P(RecorderTest, tellsOfATreeThatIsMadeAtOnce) {
+    start();
+    std::string folder = "t";
+    Changes expected;
+    for (int i = 0; i < 30; ++i) {
+        makeFolder(folder);
+        expected.insert(folder);
+        for (int j = 0; j < 5; ++j) {
+            write(folder + "/" + std::to_string(j));
+            expected.insert(folder + "/" + std::to_string(j));
+        }
+        folder += "/n";
+    }
+    EXPECT_EQ(changes(), expected);
+    write("t/n/n/late");
+    EXPECT_EQ(changes(), (Changes{"t/n/n", "t/n/n/late"}));
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, repathsWhatIsBelowARenamedFolderWithoutEvents) {
+    makeFolder("f");
+    makeFolder("f/g");
+    write("f/g/a");
+    start();
+    list("f");
+    rename("f", "h");
+    EXPECT_EQ(changes(), (Changes{"- f", "h"}));
+    append("h/g/a", "more");
+    EXPECT_EQ(changes(), (Changes{"h/g/a"}));
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, tellsOfEverythingInAFolderThatIsMovedIn) {
+    ASSERT_EQ(::mkdir(outside("f").c_str(), 0755), 0);
+    ASSERT_EQ(::mkdir(outside("f/g").c_str(), 0755), 0);
+    start();
+    renamePaths(outside("f"), path("f"));
+    EXPECT_EQ(changes(), (Changes{"f", "f/g"}));
+    write("f/g/a");
+    EXPECT_EQ(changes(), (Changes{"f/g", "f/g/a"}));
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, tellsOfEverythingInAFolderThatIsMovedOut) {
+    makeFolder("f");
+    makeFolder("f/g");
+    write("f/g/a");
+    write("f/g/unlisted");
+    start();
+    const DocumentID document = list("f/g/a");
+    list("f/g");
+    list("f");
+    const FileID file = fileID("f/g/a");
+    renamePaths(path("f"), outside("f"));
+    EXPECT_EQ(changes(), (Changes{"- f", "- f/g", "- f/g/a"}));
+    EXPECT_THAT(documentChanges(), ElementsAre(DocumentChange{document, file, kNothing}));
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, tellsOfEverythingInATreeThatIsRemoved) {
+    makeFolder("f");
+    makeFolder("f/g");
+    write("f/g/a");
+    start();
+    list("f");
+    list("f/g");
+    list("f/g/a");
+    removeTree("f");
+    EXPECT_EQ(changes(), (Changes{"- f", "- f/g", "- f/g/a"}));
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, keepsWhatWasMovedOutOfATreeBeforeThatWasRemoved) {
+    makeFolder("f");
+    write("f/a");
+    start();
+    const DocumentID document = list("f/a");
+    rename("f/a", "a");
+    removeTree("f");
+    const Changes told = changes();
+    EXPECT_TRUE(told.contains("a"));
+    EXPECT_EQ(this->document("a"), document);
+    EXPECT_THAT(documentChanges(), IsEmpty());
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, takesAFolderUnderARecycledNumberForANewOne) {
+    start();
+    for (int i = 0; i < 20; ++i) {
+        makeFolder("f");
+        write("f/" + std::to_string(i));
+        ASSERT_TRUE(recorder().drain().ok());
+        removeTree("f");
+    }
+    makeFolder("f");
+    write("f/last");
+    EXPECT_EQ(changes(), (Changes{"f", "f/last"}));
+    expectIndexIsTree();
+}
+
+// MARK: Names
+
+TEST_P(RecorderTest, tellsOfNamesThatAreNotText) {
+    start();
+    write("new\nline");
+    write("\xff\xfe");
+    write("#12345");
+    EXPECT_EQ(changes(), (Changes{"new\nline", "\xff\xfe", "#12345"}));
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, tellsOfLinksAndPipes) {
+    start();
+    ASSERT_EQ(::symlink("nowhere", path("dangling").c_str()), 0);
+    ASSERT_EQ(::symlink("loop", path("loop").c_str()), 0);
+    ASSERT_EQ(::mkfifo(path("pipe").c_str(), 0600), 0);
+    EXPECT_EQ(changes(), (Changes{"dangling", "loop", "pipe"}));
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, keepsAFileWithTwoNamesUnderTheFirst) {
+    write("a");
+    start();
+    const DocumentID document = list("a");
+    link("a", "b");
+    EXPECT_EQ(changes(), (Changes{"a"}));
+    append("b", "more");
+    EXPECT_EQ(changes(), (Changes{"a"}));
+    EXPECT_EQ(this->document("b"), document);
+    remove("b");
+    EXPECT_EQ(changes(), (Changes{"a"}));
+}
+
+TEST_P(RecorderTest, keepsAFileThatLosesItsFirstNameUnderTheOther) {
+    makeFolder("f");
+    write("a");
+    start();
+    const DocumentID document = list("a");
+    link("a", "f/b");
+    changes();
+    remove("a");
+    EXPECT_EQ(changes(), (Changes{"- a", "f/b"}));
+    EXPECT_EQ(this->document("f/b"), document);
+    EXPECT_THAT(documentChanges(), IsEmpty());
+}
+
+TEST_P(RecorderTest, tellsOfChangesThroughANameOutside) {
+    write("a");
+    ASSERT_EQ(::link(path("a").c_str(), outside("a").c_str()), 0);
+    start();
+    {
+        const int fd = ::open(outside("a").c_str(), O_WRONLY | O_APPEND);
+        ASSERT_EQ(::write(fd, "more", 4), 4);
+        ::close(fd);
+    }
+    EXPECT_EQ(changes(), (Changes{"a"}));
+    ASSERT_EQ(::unlink(outside("a").c_str()), 0);
+    EXPECT_EQ(changes(), (Changes{"a"}));
+}
+
+TEST_P(RecorderTest, tellsOfAFileThatWasMadeWithoutAName) {
+    start();
+    const int fd = ::open(storage_.c_str(), O_TMPFILE | O_WRONLY, 0600);
+    ASSERT_GE(fd, 0);
+    ASSERT_EQ(::write(fd, "x", 1), 1);
+    const std::string own = "/proc/self/fd/" + std::to_string(fd);
+    ASSERT_EQ(::linkat(AT_FDCWD, own.c_str(), AT_FDCWD, path("a").c_str(), AT_SYMLINK_FOLLOW), 0);
+    EXPECT_EQ(changes(), (Changes{"a"}));
+    // The kernel still calls it by its number here.
+    ASSERT_EQ(::write(fd, "more", 4), 4);
+    ::close(fd);
+    EXPECT_EQ(changes(), (Changes{"a"}));
+}
+
+// MARK: Saves
+
+TEST_P(RecorderTest, handsADocumentToTheFileThatIsRenamedOverIt) {
+    write("doc", "old");
+    start();
+    const DocumentID document = list("doc");
+    const FileID old = fileID("doc");
+    write("tmp", "new");
+    rename("tmp", "doc");
+    EXPECT_TRUE(changes().contains("doc"));
+    EXPECT_EQ(this->document("doc"), document);
+    EXPECT_THAT(documentChanges(), ::testing::Contains(DocumentChange{document, old, fileID("doc")}));
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, handsADocumentToAFileThatWasListedWhileItWasBeingSaved) {
+    write("doc", "old");
+    start();
+    const DocumentID document = list("doc");
+    write("tmp", "new");
+    ASSERT_TRUE(recorder().drain().ok());
+    const DocumentID young = list("tmp");
+    const FileID newcomer = fileID("tmp");
+    rename("tmp", "doc");
+    changes();
+    EXPECT_EQ(this->document("doc"), document);
+    EXPECT_THAT(documentChanges(), ::testing::Contains(DocumentChange{young, newcomer, kNothing}));
+}
+
+TEST_P(RecorderTest, handsADocumentOnWhenTheOldFileBecomesABackup) {
+    write("doc", "old");
+    start();
+    const DocumentID document = list("doc");
+    rename("doc", "doc~");
+    write("doc", "new");
+    changes();
+    EXPECT_EQ(this->document("doc"), document);
+    EXPECT_NE(this->document("doc~"), document);
+    remove("doc~");
+    changes();
+    EXPECT_EQ(this->document("doc"), document);
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, handsADocumentOnWhenTheBackupIsSeenBeforeTheNewFile) {
+    write("doc", "old");
+    start();
+    const DocumentID document = list("doc");
+    rename("doc", "doc.bak");
+    changes();
+    letTimePass(milliseconds(1'900));
+    write("doc", "new");
+    changes();
+    EXPECT_EQ(this->document("doc"), document);
+    EXPECT_EQ(this->document("doc.bak"), kNoDocument);
+}
+
+TEST_P(RecorderTest, takesABackupThatStaysAloneForAMove) {
+    write("doc", "old");
+    start();
+    const DocumentID document = list("doc");
+    rename("doc", "doc.bak");
+    changes();
+    letTimePass(milliseconds(2'100));
+    write("doc", "new");
+    changes();
+    EXPECT_EQ(this->document("doc"), kNoDocument);
+    EXPECT_EQ(this->document("doc.bak"), document);
+}
+
+TEST_P(RecorderTest, takesAMoveToAnotherNameForAMove) {
+    write("doc", "old");
+    start();
+    const DocumentID document = list("doc");
+    rename("doc", "archive");
+    write("doc", "new");
+    changes();
+    EXPECT_EQ(this->document("doc"), kNoDocument);
+    EXPECT_EQ(this->document("archive"), document);
+}
+
+TEST_P(RecorderTest, handsADocumentToTheFileThatIsCreatedAgain) {
+    write("doc", "old");
+    start();
+    const DocumentID document = list("doc");
+    remove("doc");
+    EXPECT_EQ(changes(), (Changes{"- doc"}));
+    letTimePass(milliseconds(1'900));
+    write("doc", "new");
+    EXPECT_EQ(changes(), (Changes{"doc"}));
+    EXPECT_EQ(this->document("doc"), document);
+}
+
+TEST_P(RecorderTest, handsADocumentToTheFileThatIsCreatedAgainAtOnce) {
+    write("doc", "old");
+    start();
+    const DocumentID document = list("doc");
+    remove("doc");
+    write("doc", "new");
+    changes();
+    EXPECT_EQ(this->document("doc"), document);
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, givesAFileThatIsCreatedLaterANumberOfItsOwn) {
+    write("doc", "old");
+    start();
+    const DocumentID document = list("doc");
+    remove("doc");
+    changes();
+    letTimePass(milliseconds(2'100));
+    write("doc", "new");
+    changes();
+    EXPECT_EQ(this->document("doc"), kNoDocument);
+    EXPECT_NE(list("doc"), document);
+}
+
+TEST_P(RecorderTest, leavesAnOlderDocumentThatIsMovedOverAnotherItsNumber) {
+    write("doc", "one");
+    write("other", "two");
+    Recorder::Options options;
+    start();
+    const DocumentID document = list("doc"), other = list("other");
+    const FileID old = fileID("doc");
+    stop();
+    options.choice = GetParam();
+    options.recordsByItself = false;
+    options.wallClock = [] {
+        KsDate now = KsDate::now();
+        now.seconds += 61;
+        return now;
+    };
+    recorder_ = Recorder::start(store_, {root_}, options);
+    ASSERT_TRUE(recorder_->drain().ok());
+    rename("other", "doc");
+    changes();
+    EXPECT_EQ(this->document("doc"), other);
+    EXPECT_THAT(documentChanges(), ElementsAre(DocumentChange{document, old, kNothing}));
+}
+
+TEST_P(RecorderTest, handsADocumentOnThroughASaveWhileNobodyRecorded) {
+    write("doc", "old");
+    start();
+    const DocumentID document = list("doc");
+    stop();
+    write("tmp", "new");
+    rename("tmp", "doc");
+    start();
+    EXPECT_TRUE(changes().contains("doc"));
+    EXPECT_EQ(this->document("doc"), document);
+}
+
+TEST_P(RecorderTest, carriesTheAttributesThroughASave) {
+    write("doc", "old");
+    start();
+    list("doc");
+    setTag("doc", "red");
+    changes();
+    write("tmp", "new");
+    rename("tmp", "doc");
+    changes();
+    EXPECT_EQ(tag("doc"), "red");
+}
+
+TEST_P(RecorderTest, leavesAttributesThatTheSavedFileBrings) {
+    write("doc", "old");
+    start();
+    list("doc");
+    setTag("doc", "red");
+    changes();
+    write("tmp", "new");
+    setTag("tmp", "blue");
+    rename("tmp", "doc");
+    changes();
+    EXPECT_EQ(tag("doc"), "blue");
+}
+
+// MARK: Packages and trash
+
+TEST_P(RecorderTest, tellsOfAPackageWhenSomethingInItChanges) {
+    makeFolder("p.folio");
+    makeFolder("p.folio/d");
+    write("p.folio/d/a");
+    start();
+    append("p.folio/d/a", "more");
+    EXPECT_EQ(changes(), (Changes{"p.folio", "p.folio/d/a"}));
+}
+
+TEST_P(RecorderTest, tellsOfEverythingInAFolderThatBecomesAPackage) {
+    makeFolder("p");
+    write("p/a");
+    start();
+    list("p");
+    list("p/a");
+    rename("p", "p.folio");
+    const Changes told = changes();
+    EXPECT_TRUE(told.contains("p.folio"));
+    EXPECT_TRUE(told.contains("p.folio/a"));
+    EXPECT_TRUE(told.contains("- p"));
+    rename("p.folio", "p");
+    EXPECT_TRUE(changes().contains("p/a"));
+}
+
+TEST_P(RecorderTest, tellsOfEverythingInAFolderThatIsTrashed) {
+    makeFolder(".Trash");
+    makeFolder("f");
+    write("f/a");
+    start();
+    list("f");
+    list("f/a");
+    rename("f", ".Trash/f");
+    const Changes told = changes();
+    EXPECT_TRUE(told.contains(".Trash/f/a"));
+    EXPECT_TRUE(told.contains("- f"));
+}
+
+// MARK: What happens while nobody records
+
+TEST_P(RecorderTest, findsWhatHappenedWhileNobodyRecorded) {
+    makeFolder("f");
+    write("f/same");
+    write("changed");
+    write("gone");
+    write("moved");
+    start();
+    list("gone");
+    list("changed");
+    const DocumentID moved = list("moved");
+    restartAll();
+    EXPECT_THAT(changes(), IsEmpty());
+    stop();
+    append("changed", "more");
+    remove("gone");
+    rename("moved", "f/moved");
+    write("new");
+    restartAll();
+    EXPECT_EQ(changes(), (Changes{"changed", "- gone", "- moved", "f", "f/moved", "new"}));
+    EXPECT_EQ(document("f/moved"), moved);
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, followsAFolderThatWasMovedWhileNobodyRecorded) {
+    makeFolder("a");
+    makeFolder("b");
+    makeFolder("a/f");
+    write("a/f/x");
+    start();
+    list("a/f");
+    const DocumentID document = list("a/f/x");
+    stop();
+    rename("a/f", "b/g");
+    start();
+    EXPECT_EQ(changes(), (Changes{"a", "b", "- a/f", "b/g"}));
+    EXPECT_EQ(this->document("b/g/x"), document);
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, givesFewEventsForFewEditsInALargeTree) {
+    for (int i = 0; i < 20; ++i) {
+        makeFolder("f" + std::to_string(i));
+        for (int j = 0; j < 50; ++j) write("f" + std::to_string(i) + "/" + std::to_string(j));
+    }
+    start();
+    stop();
+    for (int i = 0; i < 7; ++i) append("f" + std::to_string(i) + "/" + std::to_string(i), "more");
+    restartAll();
+    EXPECT_EQ(changes().size(), 7u);
+}
+
+TEST_P(RecorderTest, cantReplayWhatWasBeforeItsHistory) {
+    write("a");
+    const std::uint64_t before = store().currentEventID();
+    start();
+    EXPECT_FALSE(recorder().canReplayAfter(before));
+    EXPECT_TRUE(recorder().canReplayAfter(recorder().currentEventID()));
+    EXPECT_FALSE(recorder().canReplayAfter(recorder().currentEventID() + 1));
+}
+
+TEST_P(RecorderTest, keepsItsHistoryOverARestart) {
+    start();
+    const std::uint64_t before = recorder().currentEventID();
+    write("a");
+    ASSERT_TRUE(recorder().drain().ok());
+    restartAll();
+    EXPECT_TRUE(recorder().canReplayAfter(before));
+    EXPECT_EQ(changes(), (Changes{"a"}));
+}
+
+TEST_P(RecorderTest, beginsAnewForAnotherStorage) {
+    write("a");
+    start();
+    list("a");
+    const KsUUID uuid = recorder().volumeUUID();
+    stop();
+    renamePaths(storage_, outside("former"));
+    ASSERT_EQ(::mkdir(storage_.c_str(), 0755), 0);
+    root_ = *RootDirectories::shared().add(storage_, RootPolicy::storage);
+    start();
+    EXPECT_NE(recorder().volumeUUID(), uuid);
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, findsWhatAMemoryMapWroteWhenItAudits) {
+    write("a", std::string(4'096, 'x'));
+    start();
+    const int fd = ::open(path("a").c_str(), O_RDWR);
+    ASSERT_GE(fd, 0);
+    auto* map = static_cast<char*>(::mmap(nullptr, 4'096, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0));
+    ASSERT_NE(map, MAP_FAILED);
+    map[0] = 'y';
+    ASSERT_EQ(::msync(map, 4'096, MS_SYNC), 0);
+    const auto differences = recorder().audit();
+    ASSERT_TRUE(differences.ok());
+    EXPECT_EQ(*differences, 1u);
+    EXPECT_EQ(recorder().status().auditedDifferences, 1u);
+    EXPECT_EQ(changes(), (Changes{"a"}));
+    ::munmap(map, 4'096);
+    ::close(fd);
+}
+
+TEST_P(RecorderTest, comparesEverythingWhenEventsWereLost) {
+    makeFolder("f");
+    start();
+    // More than the kernel keeps for a reader that doesn't read.
+    std::size_t made = 0;
+    for (int i = 0; i < 9'000; ++i, ++made) write("f/" + std::to_string(i));
+    const Changes told = changes();
+    EXPECT_EQ(told.size(), made + 1);
+    expectIndexIsTree();
+}
+
+// MARK: What is refused
+
+TEST_P(RecorderTest, tellsWhoWaitsThatItHasStopped) {
+    start();
+    recorder().stop();
+    const Result<void> drained = recorder().drain();
+    ASSERT_FALSE(drained.ok());
+    EXPECT_TRUE(drained.error().isPosix(ECANCELED));
+}
+
+TEST_P(RecorderTest, callsItsObserversWhenThereIsNews) {
+    start();
+    int calls = 0;
+    const std::uint64_t observer = recorder().addObserver([&] { ++calls; });
+    write("a");
+    ASSERT_TRUE(recorder().drain().ok());
+    EXPECT_EQ(calls, 1);
+    ASSERT_TRUE(recorder().drain().ok());
+    EXPECT_EQ(calls, 1);
+    recorder().removeObserver(observer);
+    write("b");
+    ASSERT_TRUE(recorder().drain().ok());
+    EXPECT_EQ(calls, 1);
+}
+
+std::string nameOf(const ::testing::TestParamInfo<Recorder::Choice>& info) {
+    return info.param == Recorder::Choice::inotify ? "inotify" : "automatic";
+}
+
+// Automatic is fanotify where the process may.
+INSTANTIATE_TEST_SUITE_P(Sources, RecorderTest,
+                         ::testing::Values(Recorder::Choice::inotify, Recorder::Choice::automatic), nameOf);
+
+}  // namespace
+}  // namespace cindral::test
