@@ -48,8 +48,10 @@ std::optional<JournalEvent> decodeEvent(std::uint64_t id, ByteView bytes) {
     return std::nullopt;
 }
 
-/// The first events of an overlay after an ID, in their order, without those that another one there has replaced.
-void collect(const Overlay& overlay, std::uint64_t after, std::size_t max, std::vector<JournalEvent>& found) {
+/// The first events of an overlay after an ID, in their order, without those that are not good any more.
+template <typename IsCurrent>
+void collect(const Overlay& overlay, std::uint64_t after, std::size_t max, IsCurrent isCurrent,
+             std::vector<JournalEvent>& found) {
     const auto idOf = [](const auto& entry) { return entry.first; };
     auto presence = std::ranges::upper_bound(overlay.presences(), after, {}, idOf);
     auto departure = std::ranges::upper_bound(overlay.departures(), after, {}, idOf);
@@ -57,7 +59,7 @@ void collect(const Overlay& overlay, std::uint64_t after, std::size_t max, std::
     const auto departuresEnd = overlay.departures().end();
     while (found.size() < max && (presence != presencesEnd || departure != departuresEnd)) {
         if (departure == departuresEnd || (presence != presencesEnd && presence->first < departure->first)) {
-            if (overlay.isCurrent(*presence)) found.push_back(eventOf(presence->first, presence->second));
+            if (isCurrent(*presence)) found.push_back(eventOf(presence->first, presence->second));
             ++presence;
         } else {
             found.push_back(eventOf(departure->first, *Departure::decode(departure->second)));
@@ -108,23 +110,41 @@ Result<void> VolumeStore::Implementation::resolve(std::vector<JournalEvent>& can
 }
 
 Result<std::vector<JournalEvent>> VolumeStore::Implementation::events(std::uint64_t after, std::size_t max) const {
-    std::vector<JournalEvent> found, candidates, unsaved;
+    std::vector<JournalEvent> found;
+    bool isEnd = false;
+    // A second time only where events were replaced between one look and the next.
+    while (!isEnd && found.size() < max) isEnd = TRY(readEvents(after, max, found));
+    return found;
+}
+
+/// Goes on with the events after an ID, which is moved on, until there are `max`. Answers whether there is none beyond.
+Result<bool> VolumeStore::Implementation::readEvents(std::uint64_t& after, std::size_t max,
+                                                     std::vector<JournalEvent>& found) const {
+    const std::size_t wanted = max - found.size();
+    std::vector<JournalEvent> candidates, unsaved;
     std::uint64_t unsavedBegin = std::numeric_limits<std::uint64_t>::max();
     {
         const MutexLock lock(mutex_);
+        const Overlay& active = *active_;
         if (frozen_) {
-            unsavedBegin = frozen_->firstEvent();
-            collect(*frozen_, after, max, unsaved);
+            const Overlay& frozen = *frozen_;
+            unsavedBegin = frozen.firstEvent();
+            const auto isCurrent = [&](const auto& presence) {
+                return !active.find(presence.second).isKnown ? frozen.isCurrent(presence) : active.isCurrent(presence);
+            };
+            collect(frozen, after, wanted, isCurrent, unsaved);
         }
-        unsavedBegin = std::min(unsavedBegin, active_->firstEvent());
-        collect(*active_, after, max, unsaved);
+        unsavedBegin = std::min(unsavedBegin, active.firstEvent());
+        collect(
+            active, after, wanted, [&](const auto& presence) { return active.isCurrent(presence); }, unsaved);
     }
     Result<void> resolved;
     {
         const ObjectTables::Snapshot snapshot(*tables_);
         TRY(snapshot.events(after, [&](std::uint64_t id, ByteView bytes) {
-            if (id >= unsavedBegin || found.size() + candidates.size() >= max) return false;
+            if (id >= unsavedBegin || found.size() == max) return false;
             if (auto event = decodeEvent(id, bytes)) candidates.push_back(std::move(*event));
+            after = id;
             if (candidates.size() == std::min(kLookupsAtOnceMax, max - found.size()))
                 resolved = resolve(candidates, found);
             return resolved.ok();
@@ -132,14 +152,12 @@ Result<std::vector<JournalEvent>> VolumeStore::Implementation::events(std::uint6
     }
     TRY(Result<void>(resolved));
     TRY(resolve(candidates, found));
-    for (auto event = unsaved.begin(); event != unsaved.end() && found.size() < max;) {
-        const auto some = std::min<std::size_t>(static_cast<std::size_t>(unsaved.end() - event), max - found.size());
-        candidates.assign(std::make_move_iterator(event),
-                          std::make_move_iterator(event + static_cast<std::ptrdiff_t>(some)));
-        event += static_cast<std::ptrdiff_t>(some);
-        TRY(resolve(candidates, found));
-    }
-    return found;
+    if (found.size() == max) return false;
+    const bool isEnd = unsaved.size() < wanted;
+    unsaved.resize(std::min(unsaved.size(), max - found.size()));
+    if (!unsaved.empty()) after = unsaved.back().id;
+    TRY(resolve(unsaved, found));
+    return isEnd;
 }
 
 Result<std::vector<JournalEvent>> VolumeStore::Implementation::documentEvents(std::uint64_t after,
@@ -170,7 +188,7 @@ Result<std::vector<JournalEvent>> VolumeStore::Implementation::documentEvents(st
 
 std::optional<std::uint64_t> VolumeStore::Implementation::historyBegin() const {
     const MutexLock lock(mutex_);
-    return historyBegin_;
+    return hasHistory_ ? std::optional(forgottenEvent_) : std::nullopt;
 }
 
 Result<std::uint64_t> VolumeStore::Implementation::beginHistory() {
@@ -180,13 +198,15 @@ Result<std::uint64_t> VolumeStore::Implementation::beginHistory() {
     TRY(saveEverything());
     const std::uint64_t begin = TRY(numbers_->reserveEvents(1));
     TablesHead head = tables_->head();
-    head.historyBegin = begin;
+    head.hasHistory = true;
+    head.forgottenEvent = begin;
     head.marks = numbers_->reserved();
     TRY(tables_->forgetEvents(head));
     lastTimeMark_.reset();
     {
         const MutexLock lock(mutex_);
-        historyBegin_ = begin;
+        hasHistory_ = true;
+        forgottenEvent_ = begin;
         counts_.events = 0;
     }
     numbers_->takeEvents(1);
@@ -202,12 +222,12 @@ Result<void> VolumeStore::Implementation::renewUUID() {
     for (LogFile& log : logs_) TRY(log.clearDurably());
     TablesHead head = tables_->head();
     head.uuid = KsUUID::random();
-    if (head.historyBegin != 0) head.historyBegin = numbers_->currentEvent();
+    head.forgottenEvent = numbers_->currentEvent();
     TRY(tables_->forgetEvents(head));
     lastTimeMark_.reset();
     const MutexLock lock(mutex_);
     uuid_ = head.uuid;
-    if (historyBegin_) historyBegin_ = head.historyBegin;
+    forgottenEvent_ = head.forgottenEvent;
     counts_.events = 0;
     return {};
 }
@@ -248,14 +268,14 @@ Result<void> VolumeStore::Implementation::trimJournal(std::uint64_t eventsMax, s
     TablesHead head = tables_->head();
     const std::uint64_t upTo =
         std::min(current, std::max(TRY(tables_->lastEventBeyond(eventsMax)), TRY(lastEventOlderThan(ageMax, current))));
-    if (head.historyBegin == 0 || upTo <= head.historyBegin) return {};
-    head.historyBegin = upTo;
+    if (upTo <= head.forgottenEvent) return {};
+    head.forgottenEvent = upTo;
     {
         // Before the first goes: who finds its own still covered has them all.
         const MutexLock lock(mutex_);
-        historyBegin_ = upTo;
+        forgottenEvent_ = upTo;
     }
-    const std::uint64_t forgotten = TRY(tables_->forgetEventsUpTo(upTo, head));
+    const std::uint64_t forgotten = TRY(tables_->forgetEventsAsSaid(head));
     const MutexLock lock(mutex_);
     counts_.events -= std::min(counts_.events, forgotten);
     return {};
