@@ -101,7 +101,7 @@ private:
     Names names(FileID fileID) const;
 
     // The journal.
-    Result<void> resolve(std::vector<JournalEvent>& candidates, std::vector<JournalEvent>& found) const;
+    Result<std::uint64_t> resolve(std::vector<JournalEvent>& candidates, std::vector<JournalEvent>& found) const;
     Result<bool> readEvents(std::uint64_t& after, std::size_t max, std::vector<JournalEvent>& found) const;
     std::int64_t now() const;
     Result<std::uint64_t> lastEventOlderThan(std::chrono::seconds age, std::uint64_t current) const;

@@ -82,9 +82,10 @@ void collectDocumentChanges(const Overlay& overlay, std::uint64_t after, std::si
 // MARK: Reading
 
 /// Fills in what the records say today, and takes those over that are good: an object has but one event, and one that
-/// is gone has none.
-Result<void> VolumeStore::Implementation::resolve(std::vector<JournalEvent>& candidates,
-                                                  std::vector<JournalEvent>& found) const {
+/// is gone has none. Answers the newest event that has replaced another; 0 for none.
+Result<std::uint64_t> VolumeStore::Implementation::resolve(std::vector<JournalEvent>& candidates,
+                                                           std::vector<JournalEvent>& found) const {
+    std::uint64_t newest = 0;
     std::vector<std::size_t> presences;
     for (std::size_t i = 0; i < candidates.size(); ++i) {
         if (candidates[i].kind == JournalEvent::Kind::present) presences.push_back(i);
@@ -95,6 +96,7 @@ Result<void> VolumeStore::Implementation::resolve(std::vector<JournalEvent>& can
             JournalEvent& event = candidates[presences[i]];
             if (record == nullptr || record->eventID != event.id) {
                 event.id = 0;
+                if (record != nullptr) newest = std::max(newest, record->eventID);
                 return;
             }
             event.parent = record->parent;
@@ -106,7 +108,7 @@ Result<void> VolumeStore::Implementation::resolve(std::vector<JournalEvent>& can
         if (event.id != 0) found.push_back(std::move(event));
     }
     candidates.clear();
-    return {};
+    return newest;
 }
 
 Result<std::vector<JournalEvent>> VolumeStore::Implementation::events(std::uint64_t after, std::size_t max) const {
@@ -138,26 +140,29 @@ Result<bool> VolumeStore::Implementation::readEvents(std::uint64_t& after, std::
         collect(
             active, after, wanted, [&](const auto& presence) { return active.isCurrent(presence); }, unsaved);
     }
-    Result<void> resolved;
+    Result<std::uint64_t> resolved = std::uint64_t{0};
+    std::uint64_t newest = 0;
     {
         const ObjectTables::Snapshot snapshot(*tables_);
         TRY(snapshot.events(after, [&](std::uint64_t id, ByteView bytes) {
             if (id >= unsavedBegin || found.size() == max) return false;
             if (auto event = decodeEvent(id, bytes)) candidates.push_back(std::move(*event));
             after = id;
-            if (candidates.size() == std::min(kLookupsAtOnceMax, max - found.size()))
-                resolved = resolve(candidates, found);
+            if (candidates.size() < std::min(kLookupsAtOnceMax, max - found.size())) return true;
+            resolved = resolve(candidates, found);
+            if (resolved.ok()) newest = std::max(newest, *resolved);
             return resolved.ok();
         }));
     }
-    TRY(Result<void>(resolved));
-    TRY(resolve(candidates, found));
+    TRY(Result<std::uint64_t>(resolved));
+    newest = std::max(newest, TRY(resolve(candidates, found)));
     if (found.size() == max) return false;
-    const bool isEnd = unsaved.size() < wanted;
+    const bool isAll = unsaved.size() <= max - found.size() && unsaved.size() < wanted;
     unsaved.resize(std::min(unsaved.size(), max - found.size()));
     if (!unsaved.empty()) after = unsaved.back().id;
-    TRY(resolve(unsaved, found));
-    return isEnd;
+    newest = std::max(newest, TRY(resolve(unsaved, found)));
+    // What has replaced an event since is beyond what was looked at.
+    return isAll && newest <= after;
 }
 
 Result<std::vector<JournalEvent>> VolumeStore::Implementation::documentEvents(std::uint64_t after,
