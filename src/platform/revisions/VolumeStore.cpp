@@ -228,9 +228,7 @@ Result<void> VolumeStore::Implementation::identify(std::span<ObjectSighting> sig
             news.push_back(static_cast<std::uint32_t>(i));
         }
     });
-    Result<void> done = looked.ok() && !news.empty() ? record(sightings, news) : looked;
-    if (!done.ok() && done.error().isPosix(kDamageCode)) isSuspect_ = true;
-    return done;
+    return noticed(looked.ok() && !news.empty() ? record(sightings, news) : looked);
 }
 
 Result<void> VolumeStore::Implementation::record(std::span<ObjectSighting> sightings,

@@ -87,6 +87,12 @@ private:
     Result<void> saveHead();
 
     // Looking up.
+    /// The result, remembered where it tells of damage.
+    template <typename T>
+    Result<T> noticed(Result<T> result) const {
+        if (!result.ok() && result.error().isPosix(kDamageCode)) isSuspect_ = true;
+        return result;
+    }
     class Reader;
     Overlay::State findUnsaved(FileID fileID) const REQUIRES(mutex_);
     template <typename FileIDAt, typename Use>
@@ -142,7 +148,7 @@ private:
     std::thread checkpointThread_;
 
     std::atomic<std::uint64_t> transactionCount_{0};
-    std::atomic<bool> isSuspect_{
+    mutable std::atomic<bool> isSuspect_{
         false};  // Damage was met while the store was in use: the next opening looks at everything.
 
     /// Held while a checkpoint is written.

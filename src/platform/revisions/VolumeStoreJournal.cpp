@@ -115,7 +115,7 @@ Result<std::vector<JournalEvent>> VolumeStore::Implementation::events(std::uint6
     std::vector<JournalEvent> found;
     bool isEnd = false;
     // A second time only where events were replaced between one look and the next.
-    while (!isEnd && found.size() < max) isEnd = TRY(readEvents(after, max, found));
+    while (!isEnd && found.size() < max) isEnd = TRY(noticed(readEvents(after, max, found)));
     return found;
 }
 
