@@ -140,6 +140,7 @@ class Convergence:
         for _ in range(options.size):
             self.operations.run()
         self.host = self._host(folder)
+        self.operations.names_outside_are_told = self.options.model or self.host.call("status")["recorder"] == "fanotify"
         self.whole = [ContainerView(self.host, container) for container in (ROOT, WORKING_SET, ALL_DIRECTORIES)]
         self.folders = []
 

@@ -220,6 +220,9 @@ class Operations:
         self.tree = tree
         self.random = tree.random
         self.size = size
+        # inotify tells nothing of a name that a file is given in a folder that isn't watched; from the next look at the
+        # file on it does.
+        self.names_outside_are_told = True
         self.growing = [(self.make_file, 10), (self.make_folder, 4), (self.make_tree, 1), (self.move_in, 3), (self.hard_link, 2),
                         (self.symbolic_link, 2), (self.hard_link_outside, 1)]
         self.steady = [(self.write, 6), (self.append, 6), (self.truncate, 3), (self.write_mapped, 3), (self.rename, 8),
@@ -570,6 +573,8 @@ class Operations:
         outside = os.path.join(self.tree.beside_path, b"%d" % self.tree.number)
         os.link(self.tree.path(node), outside)
         self.tree.outside.append((outside, Node(b"", None, "file", node.names)))
+        if not self.names_outside_are_told:
+            os.chmod(self.tree.path(node), 0o644)
         return f"link {self.tree.path(node)} {outside}"
 
     def change_outside_name(self):

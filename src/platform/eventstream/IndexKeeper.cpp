@@ -219,16 +219,7 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
         !known->isAt(departure.parent, departure.name))
         return {};
     if (holds(departure.parent, departure.name, departure.fileID, departure.birthTime)) return {};
-    if (known->object.hasOtherNames) {
-        for (const VolumeStore::Name& other : store_.otherNames(departure.fileID)) {
-            const std::optional<FileStatus> status = statusAt(other.parent, other.name);
-            if (!status || FileID{status->fileID} != departure.fileID || status->birthStamp() != departure.birthTime)
-                continue;
-            changes().removeName(departure.fileID, other.parent, other.name);
-            put(other.parent, other.name, *status, false);
-            return {};
-        }
-    }
+    if (known->object.hasOtherNames && keepUnderOtherName(departure.fileID)) return {};
     if (known->object.documentID != DocumentID{}) {
         recent_.add(departure.parent, departure.name, known->object.documentID, options_.now());
     }
@@ -251,6 +242,20 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
     changes().remove(departure.fileID);
     packagesChanged(departure.parent);
     return {};
+}
+
+/// False when the object has no other name that leads to it.
+bool IndexKeeper::keepUnderOtherName(FileID fileID) {
+    const std::optional<Known> known = find(fileID);
+    if (!known) return false;
+    for (const VolumeStore::Name& other : store_.otherNames(fileID)) {
+        const std::optional<FileStatus> status = statusAt(other.parent, other.name);
+        if (!status || !known->isSame(FileID{status->fileID}, status->birthStamp())) continue;
+        changes().removeName(fileID, other.parent, other.name);
+        put(other.parent, other.name, *status, false);
+        return true;
+    }
+    return false;
 }
 
 IndexChanges& IndexKeeper::changes() {

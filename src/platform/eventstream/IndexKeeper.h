@@ -107,6 +107,7 @@ private:
     Result<void> lookAtObject(FileID fileID);
     Result<void> endRound(bool isQuiet);
     Result<void> giveUp(const Departure& departure);
+    bool keepUnderOtherName(FileID fileID);
     Result<void> resolveReplacements();
     Result<void> flush();
     Result<void> flushWhenFull();
@@ -140,13 +141,14 @@ private:
         std::string path;  // below the root
     };
     struct Entries;
+    enum class GoesOn { no, below };  ///< whether the comparison comes to subfolders by itself
     Result<void> compareUnwatched();
     Result<void> scanPending();
     Result<void> scan(FileID folder);
     void scanLater(FileID folder);
-    Result<void> compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders);
-    Result<void> compareBatch(OpenFolder& folder, Entries& entries, bool goesOnBelow);
-    Result<void> seeCompared(OpenFolder& folder, const char* name, const FileStatus& status, bool goesOnBelow);
+    Result<void> compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders, GoesOn goesOn);
+    Result<void> compareBatch(OpenFolder& folder, Entries& entries, GoesOn goesOn);
+    Result<void> seeCompared(OpenFolder& folder, const char* name, const FileStatus& status, GoesOn goesOn);
     Result<void> findLost(OpenFolder& folder, std::vector<std::uint64_t>& seen);
     void watch(const OpenFolder& folder);
     void watchNames(const OpenFolder& folder, std::string_view name, const FileStatus& status);
@@ -156,7 +158,12 @@ private:
     Result<void> removeBelow(FileID folder);
     Result<void> touchBelow(FileID folder);
     /// From the leaves up.
-    Result<void> forEachBelow(FileID folder, const std::function<Result<void>(FileID, bool isFolder)>& use);
+    struct Below {
+        FileID fileID{};
+        bool isFolder = false;
+        bool hasOtherNames = false;
+    };
+    Result<void> forEachBelow(FileID folder, const std::function<Result<void>(const Below&)>& use);
 
     // The index, with what is not written yet.
     std::optional<Known> find(FileID fileID) const;

@@ -57,7 +57,7 @@ Result<std::vector<FileID>> IndexKeeper::compareFolder(FileID fileID) {
     std::vector<FileID> subfolders;
     if (const auto folder = openFolder(fileID)) {
         std::vector<Subfolder> found;
-        const Result<void> compared = compareEntries(*folder, &found);
+        const Result<void> compared = compareEntries(*folder, &found, GoesOn::no);
         if (!compared.ok()) everythingIsDirty_ = true;
         TRY(Result<void>(compared));
         for (const Subfolder& subfolder : found) subfolders.push_back(subfolder.fileID);
@@ -76,7 +76,7 @@ Result<void> IndexKeeper::compareUnwatched() {
             continue;
         }
         watch(*folder);
-        TRY(compareEntries(*folder, nullptr));
+        TRY(compareEntries(*folder, nullptr, GoesOn::no));
         lookAtFolderItself(*folder);
     }
     return {};
@@ -115,7 +115,7 @@ Result<void> IndexKeeper::scan(FileID top) {
         }
         unreached_.erase(next.fileID);
         watch(**folder);
-        TRY(compareEntries(**folder, &stack));
+        TRY(compareEntries(**folder, &stack, GoesOn::below));
         TRY(flushWhenFull());
         if (count % kFoldersBetweenHints == 0) TRY(takeHints());
     }
@@ -146,7 +146,7 @@ struct IndexKeeper::Entries {
     std::uint64_t recordedHere = 0;   // Of them, those that the index has here.
 };
 
-Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders) {
+Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders, GoesOn goesOn) {
     const std::uint64_t recorded = store_.childCount(folder.fileID);
     Entries entries;
     alignas(8) std::array<std::byte, kDirectoryBytes> buffer;
@@ -175,7 +175,7 @@ Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfold
             if (status->device != folder.root->directory->status.device) continue;
             entries.entries.push_back({record->name, *status});
         }
-        TRY(compareBatch(folder, entries, subfolders != nullptr));
+        TRY(compareBatch(folder, entries, goesOn));
         if (subfolders == nullptr) continue;
         for (const Entries::Entry& entry : entries.entries) {
             if (!entry.status.isDirectory()) continue;
@@ -185,7 +185,7 @@ Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfold
     return entries.recordedHere == recorded ? Result<void>() : findLost(folder, entries.seen);
 }
 
-Result<void> IndexKeeper::compareBatch(OpenFolder& folder, Entries& entries, bool goesOnBelow) {
+Result<void> IndexKeeper::compareBatch(OpenFolder& folder, Entries& entries, GoesOn goesOn) {
     entries.fileIDs.clear();
     for (const Entries::Entry& entry : entries.entries) {
         entries.fileIDs.push_back(FileID{entry.status.fileID});
@@ -207,17 +207,16 @@ Result<void> IndexKeeper::compareBatch(OpenFolder& folder, Entries& entries, boo
         }
     }));
     for (const Entries::Entry& entry : entries.entries) {
-        if (!entry.isMatched) TRY(seeCompared(folder, entry.name, entry.status, goesOnBelow));
+        if (!entry.isMatched) TRY(seeCompared(folder, entry.name, entry.status, goesOn));
     }
     return {};
 }
 
-Result<void> IndexKeeper::seeCompared(OpenFolder& folder, const char* name, const FileStatus& status,
-                                      bool goesOnBelow) {
+Result<void> IndexKeeper::seeCompared(OpenFolder& folder, const char* name, const FileStatus& status, GoesOn goesOn) {
     const std::size_t before = toScan_.size();
     TRY(see(folder, name, status, false));
     watchNames(folder, name, status);
-    if (goesOnBelow && status.isDirectory()) {
+    if (goesOn == GoesOn::below && status.isDirectory()) {
         // The comparison comes to it by itself.
         const auto added = toScan_.begin() + static_cast<std::ptrdiff_t>(before);
         toScan_.erase(std::remove(added, toScan_.end(), FileID{status.fileID}), toScan_.end());
@@ -282,7 +281,7 @@ void IndexKeeper::forgetWatch(FileID fileID) {
 
 // MARK: Subtrees
 
-Result<void> IndexKeeper::forEachBelow(FileID top, const std::function<Result<void>(FileID, bool)>& use) {
+Result<void> IndexKeeper::forEachBelow(FileID top, const std::function<Result<void>(const Below&)>& use) {
     struct Level {
         FileID folder{};
         bool isExpanded = false;
@@ -290,12 +289,12 @@ Result<void> IndexKeeper::forEachBelow(FileID top, const std::function<Result<vo
     std::vector<Level> stack{{top, false}};
     // While folders are on their way to their places, the index may have one below another and that one below it.
     std::unordered_set<FileID> visited;
-    std::vector<FileID> files;
+    std::vector<Below> files;
     while (!stack.empty()) {
         const FileID folder = stack.back().folder;
         if (stack.back().isExpanded) {
             stack.pop_back();
-            if (folder != top) TRY(use(folder, true));
+            if (folder != top) TRY(use({.fileID = folder, .isFolder = true}));
             continue;
         }
         stack.back().isExpanded = true;
@@ -308,19 +307,20 @@ Result<void> IndexKeeper::forEachBelow(FileID top, const std::function<Result<vo
             if (object.kind == ObjectKind::folder || object.kind == ObjectKind::package) {
                 stack.push_back({object.fileID, false});
             } else {
-                files.push_back(object.fileID);
+                files.push_back({.fileID = object.fileID, .hasOtherNames = object.hasOtherNames});
             }
         }));
-        for (const FileID file : files) TRY(use(file, false));
+        for (const Below& file : files) TRY(use(file));
     }
     return {};
 }
 
 Result<void> IndexKeeper::removeBelow(FileID folder) {
     TRY(flush());
-    return forEachBelow(folder, [this](FileID fileID, bool isFolder) -> Result<void> {
-        if (isFolder) forgetWatch(fileID);
-        changes().remove(fileID);
+    return forEachBelow(folder, [this](const Below& below) -> Result<void> {
+        if (below.hasOtherNames && keepUnderOtherName(below.fileID)) return flushWhenFull();
+        if (below.isFolder || below.hasOtherNames) forgetWatch(below.fileID);
+        changes().remove(below.fileID);
         return flushWhenFull();
     });
 }
@@ -328,8 +328,8 @@ Result<void> IndexKeeper::removeBelow(FileID folder) {
 Result<void> IndexKeeper::touchBelow(FileID folder) {
     if (journal_ == Journal::no) return {};
     TRY(flush());
-    return forEachBelow(folder, [this](FileID fileID, bool) -> Result<void> {
-        changes().touch(fileID);
+    return forEachBelow(folder, [this](const Below& below) -> Result<void> {
+        changes().touch(below.fileID);
         return flushWhenFull();
     });
 }

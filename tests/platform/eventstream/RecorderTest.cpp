@@ -302,6 +302,35 @@ TEST_P(RecorderTest, keepsAFileThatLosesItsFirstNameUnderTheOther) {
     EXPECT_THAT(documentChanges(), IsEmpty());
 }
 
+TEST_P(RecorderTest, keepsAFileWhoseFirstNameGoesWithItsFolder) {
+    makeFolder("f");
+    write("f/a");
+    start();
+    const DocumentID document = list("f/a");
+    link("f/a", "b");
+    changes();
+    removeTree("f");
+    EXPECT_TRUE(changes().contains("b"));
+    EXPECT_EQ(this->document("b"), document);
+    EXPECT_THAT(documentChanges(), IsEmpty());
+}
+
+TEST_P(RecorderTest, followsWhatHappensInAFolderThatIsMovedMeanwhile) {
+    makeFolder("f");
+    makeFolder("g");
+    write("f/a");
+    start();
+    list("f/a");
+    rename("f/a", "f/b");
+    exchange("f", "g");
+    rename("g", "h");
+    write("h/c");
+    const Changes told = changes();
+    EXPECT_TRUE(told.contains("h/b"));
+    EXPECT_TRUE(told.contains("h/c"));
+    expectIndexIsTree();
+}
+
 TEST_P(RecorderTest, tellsOfChangesThroughANameOutside) {
     write("a");
     ASSERT_EQ(::link(path("a").c_str(), outside("a").c_str()), 0);
