@@ -3,7 +3,6 @@
 #include <fcntl.h>
 
 #include <algorithm>
-#include <cctype>
 #include <cerrno>
 #include <charconv>
 #include <utility>
@@ -29,6 +28,8 @@ constexpr std::size_t kChangesAtOnceMax = 1'000;
 // What comes while a call works is left to the next one after so many rounds. Everything that was complete before the
 // call is done after two: one that looks, one that gives up what did not turn up.
 constexpr int kRoundsMax = 8;
+// A folder that can't be reached so often keeps moving, or can't be opened for a reason of its own.
+constexpr int kAttemptsMax = 6;
 // A number given to an object younger than this was given while it was being saved.
 constexpr std::int64_t kYoungNanoseconds = 60'000'000'000;
 
@@ -143,26 +144,42 @@ Result<void> IndexKeeper::lookAtDirt() {
     if (std::exchange(everythingIsDirty_, false)) {
         dirtyFolders_.clear();
         dirtyObjects_.clear();
+        unreached_.clear();
         toScan_ = rootIDs_;
         return {};
     }
-    const auto folders = std::exchange(dirtyFolders_, {});
+    auto folders = std::exchange(dirtyFolders_, {});
     const auto objects = std::exchange(dirtyObjects_, {});
-    for (const auto& [fileID, dirt] : folders) TRY(lookAtDirtyFolder(fileID, dirt));
+    for (auto& [fileID, dirt] : folders) TRY(lookAtDirtyFolder(fileID, std::move(dirt)));
     for (const FileID fileID : objects) TRY(lookAtObject(fileID));
     return {};
 }
 
-Result<void> IndexKeeper::lookAtDirtyFolder(FileID fileID, const FolderDirt& dirt) {
+Result<void> IndexKeeper::lookAtDirtyFolder(FileID fileID, FolderDirt dirt) {
     const auto folder = openFolder(fileID);
-    // Where a folder can't be reached, its own parent tells what became of it.
-    if (!folder) return rootWithID(fileID) == nullptr ? lookAtObject(fileID) : Result<void>();
+    if (!folder) {
+        if (rootWithID(fileID) != nullptr) return {};
+        // Where it can't be reached, its own parent tells what became of it.
+        TRY(lookAtObject(fileID));
+        lookAgainLater(fileID, std::move(dirt));
+        return {};
+    }
     for (const std::string& name : dirt.names) {
         TRY(look(*folder, name));
         TRY(flushWhenFull());
     }
     lookAtFolderItself(*folder);
     return {};
+}
+
+/// The folder may have moved, or one above it, and be found in the next round. One that is gone is not in the index
+/// then; one that was closed is compared when it is opened again.
+void IndexKeeper::lookAgainLater(FileID fileID, FolderDirt dirt) {
+    const std::optional<Known> known = find(fileID);
+    if (!known || known->object.isClosed || ++dirt.attempts > kAttemptsMax) return;
+    FolderDirt& later = dirtyFolders_[fileID];
+    later.attempts = std::max(later.attempts, dirt.attempts);
+    later.names.merge(dirt.names);
 }
 
 Result<void> IndexKeeper::lookAtObject(FileID fileID) {
@@ -548,9 +565,11 @@ IndexKeeper::Context IndexKeeper::contextInside(FileID parent, std::string_view 
 const IndexKeeper::Context& IndexKeeper::contextOf(FileID folder) {
     const auto found = contexts_.find(folder);
     if (found != contexts_.end()) return found->second;
+    // Should the folders lie in a circle, while they are on their way to their places, it ends here.
+    contexts_[folder].root = folder;
     Context context;
     const std::optional<Known> known = rootWithID(folder) == nullptr ? find(folder) : std::nullopt;
-    if (known && known->object.parent != folder) {
+    if (known) {
         context = contextOf(known->object.parent);
         if (known->name == ".Trash") context.isInTrash = true;
         if (known->object.kind == ObjectKind::package) context.packages.push_back(folder);

@@ -81,8 +81,8 @@ public:
 private:
     struct OpenFolder;
     struct FolderDirt {
-        bool everything = false;
         std::unordered_set<std::string> names;
+        int attempts = 0;  ///< to open the folder, which may be on its way to another place
     };
     struct Known;        // an object of the index, with its name
     struct Departure;    // a name that lost its object
@@ -93,14 +93,16 @@ private:
     Result<void> takeHints();
     void note(const EventHint& hint);
     bool isDirty() const {
-        return !dirtyFolders_.empty() || !dirtyObjects_.empty() || !toScan_.empty() || everythingIsDirty_;
+        return !dirtyFolders_.empty() || !dirtyObjects_.empty() || !toScan_.empty() || !unreached_.empty() ||
+               everythingIsDirty_;
     }
 
     // Rounds.
     Result<void> workOff();
     Result<void> rounds();
     Result<void> lookAtDirt();
-    Result<void> lookAtDirtyFolder(FileID fileID, const FolderDirt& dirt);
+    Result<void> lookAtDirtyFolder(FileID fileID, FolderDirt dirt);
+    void lookAgainLater(FileID fileID, FolderDirt dirt);
     void waitForRenames();
     Result<void> lookAtObject(FileID fileID);
     Result<void> endRound(bool isQuiet);
@@ -141,6 +143,7 @@ private:
     Result<void> compareUnwatched();
     Result<void> scanPending();
     Result<void> scan(FileID folder);
+    void scanLater(FileID folder);
     Result<void> compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders);
     Result<void> compareBatch(OpenFolder& folder, Entries& entries, bool goesOnBelow);
     Result<void> seeCompared(OpenFolder& folder, const char* name, const FileStatus& status, bool goesOnBelow);
@@ -181,8 +184,9 @@ private:
     std::unordered_map<FileID, FolderDirt> dirtyFolders_;
     std::unordered_set<FileID> dirtyObjects_;
     bool everythingIsDirty_ = false;
-    std::vector<FileID> toScan_;  // Folders whose contents are to be compared, and what is below them.
-    std::set<FileID> unwatched_;  // Folders that no source tells about.
+    std::unordered_map<FileID, int> unreached_;  // Folders to be compared that were not where they were looked for.
+    std::vector<FileID> toScan_;                 // Folders whose contents are to be compared, and what is below them.
+    std::set<FileID> unwatched_;                 // Folders that no source tells about.
     bool reachedWatchLimit_ = false;
 
     // The round's.

@@ -25,6 +25,8 @@ constexpr std::size_t kOpenFoldersMax = 128;
 constexpr std::size_t kDirectoryBytes = 65'536;
 // Every folder's watch may bring news while others are read; the kernel's queue must not fill up meanwhile.
 constexpr std::size_t kFoldersBetweenHints = 8;
+// A folder that can't be reached so often keeps moving, or can't be opened for a reason of its own.
+constexpr int kScanAttemptsMax = 6;
 
 std::string joined(std::string_view folder, std::string_view name) {
     std::string path(folder);
@@ -81,6 +83,7 @@ Result<void> IndexKeeper::compareUnwatched() {
 }
 
 Result<void> IndexKeeper::scanPending() {
+    for (const auto& [folder, attempts] : unreached_) toScan_.push_back(folder);
     while (!toScan_.empty()) {
         const FileID folder = toScan_.back();
         toScan_.pop_back();
@@ -93,7 +96,10 @@ Result<void> IndexKeeper::scanPending() {
 Result<void> IndexKeeper::scan(FileID top) {
     TRY(flush());
     const auto first = openFolder(top);
-    if (!first) return {};
+    if (!first) {
+        scanLater(top);
+        return {};
+    }
     const Root& root = *first->root;
     std::vector<Subfolder> stack;
     stack.push_back({top, first->path});
@@ -103,17 +109,28 @@ Result<void> IndexKeeper::scan(FileID top) {
         stack.pop_back();
         const auto folder = open(next.fileID, next.path, root);
         if (!folder.ok()) {
-            // Moved or gone since its parent was read: its parent's watch tells. Closed: it says so itself.
             logDebug("can't read the folder {}; {}", next.path, folder.error().description());
-            if (!folder.error().isPosix(EACCES)) dirtyObjects_.insert(next.fileID);
+            scanLater(next.fileID);
             continue;
         }
+        unreached_.erase(next.fileID);
         watch(**folder);
         TRY(compareEntries(**folder, &stack));
         TRY(flushWhenFull());
         if (count % kFoldersBetweenHints == 0) TRY(takeHints());
     }
     return {};
+}
+
+/// The folder has moved, or one above it, since its parent was read: it may be found in the next round. One that is gone
+/// is not in the index then; one that is closed says so when it is opened.
+void IndexKeeper::scanLater(FileID folder) {
+    const std::optional<Known> known = find(folder);
+    if (known && !known->object.isClosed && ++unreached_[folder] <= kScanAttemptsMax) {
+        dirtyObjects_.insert(folder);
+    } else {
+        unreached_.erase(folder);
+    }
 }
 
 /// Entries of a folder as they were just read.
@@ -271,6 +288,8 @@ Result<void> IndexKeeper::forEachBelow(FileID top, const std::function<Result<vo
         bool isExpanded = false;
     };
     std::vector<Level> stack{{top, false}};
+    // While folders are on their way to their places, the index may have one below another and that one below it.
+    std::unordered_set<FileID> visited;
     std::vector<FileID> files;
     while (!stack.empty()) {
         const FileID folder = stack.back().folder;
@@ -280,6 +299,10 @@ Result<void> IndexKeeper::forEachBelow(FileID top, const std::function<Result<vo
             continue;
         }
         stack.back().isExpanded = true;
+        if (!visited.insert(folder).second) {
+            stack.pop_back();
+            continue;
+        }
         files.clear();
         TRY(store_.children(folder, [&](const IndexedObject& object) {
             if (object.kind == ObjectKind::folder || object.kind == ObjectKind::package) {

@@ -31,7 +31,7 @@ constexpr unsigned kEnvironmentFlags = MDB_NOSUBDIR | MDB_NOTLS | MDB_NORDAHEAD 
 // Written to disk: never change one.
 constexpr std::uint32_t kFormatVersion = 2;
 constexpr std::string_view kHeadKey = "head";
-constexpr std::size_t kHeadBytes = 4 + 16 + 8 + 8 + 8 + 4 + 8 + 8 + 16 + 4;
+constexpr std::size_t kHeadBytes = 4 + 16 + 8 + 8 + 8 + 4 + 8 + 8 + 1 + 16 + 4;
 constexpr std::size_t kHeadChecksumOffset = kHeadBytes - 4;
 
 std::array<std::byte, kHeadBytes> encodeHead(const TablesHead& head) {
@@ -43,8 +43,9 @@ std::array<std::byte, kHeadBytes> encodeHead(const TablesHead& head) {
     storeInteger(bytes.data() + 36, head.appliedBatch);
     storeInteger(bytes.data() + 44, static_cast<std::uint32_t>(head.settledDocument));
     storeInteger(bytes.data() + 48, head.begunBatch);
-    storeInteger(bytes.data() + 56, head.historyBegin);
-    std::memcpy(bytes.data() + 64, head.nameHashKey.data(), 16);
+    storeInteger(bytes.data() + 56, head.forgottenEvent);
+    storeInteger(bytes.data() + 64, static_cast<std::uint8_t>(head.hasHistory ? 1 : 0));
+    std::memcpy(bytes.data() + 65, head.nameHashKey.data(), 16);
     storeInteger(bytes.data() + kHeadChecksumOffset, crc32c(ByteView(bytes).first(kHeadChecksumOffset)));
     return bytes;
 }
@@ -63,8 +64,9 @@ Result<TablesHead> decodeHead(ByteView bytes) {
     head.appliedBatch = loadInteger<std::uint64_t>(bytes.data() + 36);
     head.settledDocument = DocumentID{loadInteger<std::uint32_t>(bytes.data() + 44)};
     head.begunBatch = loadInteger<std::uint64_t>(bytes.data() + 48);
-    head.historyBegin = loadInteger<std::uint64_t>(bytes.data() + 56);
-    std::memcpy(head.nameHashKey.data(), bytes.data() + 64, 16);
+    head.forgottenEvent = loadInteger<std::uint64_t>(bytes.data() + 56);
+    head.hasHistory = bytes[64] != std::byte{};
+    std::memcpy(head.nameHashKey.data(), bytes.data() + 65, 16);
     return head;
 }
 

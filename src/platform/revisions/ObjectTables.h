@@ -23,11 +23,12 @@ namespace cindral {
 /// What the tables say of themselves, written anew with every checkpoint.
 struct TablesHead {
     KsUUID uuid;
-    HighWaterMarks marks;            ///< a second copy of the high-water file's
-    std::uint64_t appliedBatch = 0;  ///< the last batch of the log that the tables hold
-    DocumentID settledDocument{};    ///< documents above it are of a checkpoint that was not finished
-    std::uint64_t begunBatch = 0;    ///< the last batch of the newest checkpoint, finished or not
-    std::uint64_t historyBegin = 0;  ///< events after it are all there; 0: there is no history yet
+    HighWaterMarks marks;              ///< a second copy of the high-water file's
+    std::uint64_t appliedBatch = 0;    ///< the last batch of the log that the tables hold
+    DocumentID settledDocument{};      ///< documents above it are of a checkpoint that was not finished
+    std::uint64_t begunBatch = 0;      ///< the last batch of the newest checkpoint, finished or not
+    std::uint64_t forgottenEvent = 0;  ///< no event up to it is there any more
+    bool hasHistory = false;           ///< what happened after it is in the journal
     NameHashKey nameHashKey{};
 };
 
@@ -129,9 +130,8 @@ public:
     Result<void> forgetEvents(const TablesHead& head);
     /// The ID of the last event to be forgotten so that so many remain; 0 where there are no more.
     Result<std::uint64_t> lastEventBeyond(std::uint64_t eventsMax) const;
-    /// Writes the head, which says so, and then forgets the events up to its `historyBegin`, or `upTo` where it has
-    /// none. Answers how many.
-    Result<std::uint64_t> forgetEventsUpTo(std::uint64_t upTo, const TablesHead& head);
+    /// Writes the head, and then forgets the events up to its `forgottenEvent`. Answers how many.
+    Result<std::uint64_t> forgetEventsAsSaid(const TablesHead& head);
     Result<void> writeHead(const TablesHead& head);
 
 private:

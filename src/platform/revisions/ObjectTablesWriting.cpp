@@ -510,8 +510,9 @@ Result<std::uint64_t> ObjectTables::forgetSome(MDB_dbi table, std::uint64_t upTo
     return removed;
 }
 
-Result<std::uint64_t> ObjectTables::forgetEventsUpTo(std::uint64_t upTo, const TablesHead& head) {
+Result<std::uint64_t> ObjectTables::forgetEventsAsSaid(const TablesHead& head) {
     TRY(writeHead(head));
+    const std::uint64_t upTo = head.forgottenEvent;
     std::uint64_t forgotten = 0;
     for (const MDB_dbi table : {events_, documentChanges_}) {
         while (const std::uint64_t some = TRY(forgetSome(table, upTo))) forgotten += some;

@@ -162,7 +162,8 @@ void Overlay::dropOldPresences() {
 
 std::uint64_t Overlay::lastEvent() const {
     std::uint64_t last = 0;
-    if (!presences_.empty()) last = std::max(last, presences_.back().first);
+    // What a log brings back need not be in order.
+    for (const auto& [eventID, fileID] : presences_) last = std::max(last, eventID);
     if (!departures_.empty()) last = std::max(last, departures_.back().first);
     if (!documentChanges_.empty()) last = std::max(last, documentChanges_.back().first);
     return last;

@@ -80,15 +80,16 @@ public:
     bool isOne(const KsURL& entry) {
         const Result<FileStatus> status = entry.status();
         if (!status.ok() || status->isDirectory() || status->names < 2) return false;
-        // Two names of one page: the first seen is the one.
-        const auto [seen, isNew] = seen_.emplace(status->fileID, entry.path());
-        if (!isNew) return seen->second != entry.path();
         const auto record = store_.object(FileID{status->fileID});
-        if (!record || record->birthTime != status->birthStamp()) return false;
-        const bool isRecordedName =
-            record->name == entry.lastPathComponent() && record->parent == FileID{entry.directory()->status.fileID};
+        const bool isRecorded = record && record->birthTime == status->birthStamp();
+        const bool isRecordedName = isRecorded && record->name == entry.lastPathComponent() &&
+                                    record->parent == FileID{entry.directory()->status.fileID};
         if (isRecordedName) return false;
-        return ObjectFinder(store_, status->deviceID()).findByRecords(FileID{status->fileID}).ok();
+        if (isRecorded && ObjectFinder(store_, status->deviceID()).findByRecords(FileID{status->fileID}).ok())
+            return true;
+        // Nobody knows it under a name: the first of the page is the one.
+        const auto [seen, isNew] = seen_.emplace(status->fileID, entry.path());
+        return !isNew && seen->second != entry.path();
     }
 
 private:

@@ -201,6 +201,23 @@ bool isSame(const PackedRecord& record, const ObjectSighting& sighting) {
 
 }  // namespace
 
+namespace {
+
+/// The places and those of every other sighting of the same objects, in the order of the page: so are the document IDs.
+std::vector<std::uint32_t> withTheirLike(std::span<const ObjectSighting> sightings,
+                                         const std::vector<std::uint32_t>& places) {
+    std::vector<FileID> fileIDs;
+    for (const std::uint32_t place : places) fileIDs.push_back(sightings[place].fileID);
+    std::ranges::sort(fileIDs);
+    std::vector<std::uint32_t> all;
+    for (std::uint32_t i = 0; i < sightings.size(); ++i) {
+        if (std::ranges::binary_search(fileIDs, sightings[i].fileID)) all.push_back(i);
+    }
+    return all;
+}
+
+}  // namespace
+
 Result<void> VolumeStore::Implementation::identify(std::span<ObjectSighting> sightings) {
     std::vector<std::uint32_t> news;
     const auto fileIDAt = [&](std::size_t i) { return sightings[i].fileID; };
@@ -211,16 +228,12 @@ Result<void> VolumeStore::Implementation::identify(std::span<ObjectSighting> sig
             news.push_back(static_cast<std::uint32_t>(i));
         }
     });
-    Result<void> done = looked.ok() && !news.empty() ? record(sightings, news) : looked;
-    if (!done.ok() && done.error().isPosix(kDamageCode)) isSuspect_ = true;
-    return done;
+    return noticed(looked.ok() && !news.empty() ? record(sightings, news) : looked);
 }
 
 Result<void> VolumeStore::Implementation::record(std::span<ObjectSighting> sightings,
                                                  const std::vector<std::uint32_t>& newsPlaces) {
-    // In the order of the page, not in that of the look-up: so are the document IDs.
-    std::vector<std::uint32_t> places = newsPlaces;
-    std::ranges::sort(places);
+    const std::vector<std::uint32_t> places = withTheirLike(sightings, newsPlaces);
     for (const std::uint32_t place : places) {
         if (!canBeName(sightings[place].name))
             return KsError::posix(EINVAL).with("name", std::string(sightings[place].name));
@@ -262,7 +275,7 @@ Result<void> VolumeStore::Implementation::commit(Update& update) {
     if (marksTime) lastTimeMark_ = TimeMark{update.firstEvent(), time};
     {
         const MutexLock lock(mutex_);
-        update.writeTo(*active_, counts_, historyBegin_.value_or(0));
+        update.writeTo(*active_, counts_, forgottenEvent_);
         if (!due_) {
             due_ = std::chrono::steady_clock::now() + kCheckpointDelay;
             dueChanged_.notifyAll();

@@ -180,7 +180,7 @@ public:
     /// Takes a new UUID, and forgets the events: every token of before expires.
     Result<void> renewUUID();
     /// Forgets the oldest events beyond the count, and those that were journalled longer ago than the age, which is
-    /// known to ten minutes: none is forgotten too early. Does nothing before beginHistory().
+    /// known to ten minutes: none is forgotten too early.
     Result<void> trimJournal(std::uint64_t eventsMax, std::chrono::seconds ageMax);
 
     struct Counts {

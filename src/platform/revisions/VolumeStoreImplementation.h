@@ -78,14 +78,21 @@ private:
     Result<void> checkTables();
     Result<void> setAside(const KsError& damage);
     Result<HighWaterMarks> openState(const std::optional<HighWaterMarks>& marks);
-    Result<void> readLogs(Overlay& unsaved);
+    struct Replayed;
+    Result<void> readLogs(Replayed& replayed);
     void replay(const volumelog::Batch& batch, Overlay& unsaved) const;
-    Result<void> saveReplayed(const Overlay& unsaved, const HighWaterMarks& next);
+    Result<void> saveReplayed(const Replayed& replayed, const HighWaterMarks& next);
     Result<std::string> closedNote() const;
     void close();
     Result<void> saveHead();
 
     // Looking up.
+    /// The result, remembered where it tells of damage.
+    template <typename T>
+    Result<T> noticed(Result<T> result) const {
+        if (!result.ok() && result.error().isPosix(kDamageCode)) isSuspect_ = true;
+        return result;
+    }
     class Reader;
     Overlay::State findUnsaved(FileID fileID) const REQUIRES(mutex_);
     template <typename FileIDAt, typename Use>
@@ -100,7 +107,8 @@ private:
     Names names(FileID fileID) const;
 
     // The journal.
-    Result<void> resolve(std::vector<JournalEvent>& candidates, std::vector<JournalEvent>& found) const;
+    Result<std::uint64_t> resolve(std::vector<JournalEvent>& candidates, std::vector<JournalEvent>& found) const;
+    Result<bool> readEvents(std::uint64_t& after, std::size_t max, std::vector<JournalEvent>& found) const;
     std::int64_t now() const;
     Result<std::uint64_t> lastEventOlderThan(std::chrono::seconds age, std::uint64_t current) const;
 
@@ -140,7 +148,7 @@ private:
     std::thread checkpointThread_;
 
     std::atomic<std::uint64_t> transactionCount_{0};
-    std::atomic<bool> isSuspect_{
+    mutable std::atomic<bool> isSuspect_{
         false};  // Damage was met while the store was in use: the next opening looks at everything.
 
     /// Held while a checkpoint is written.
@@ -174,7 +182,8 @@ private:
     using ChildCounts = std::unordered_map<FileID, std::uint64_t>;
     std::shared_ptr<const ChildCounts> frozenChildCounts_ GUARDED_BY(mutex_);
     KsUUID uuid_ GUARDED_BY(mutex_);
-    std::optional<std::uint64_t> historyBegin_ GUARDED_BY(mutex_);
+    bool hasHistory_ GUARDED_BY(mutex_) = false;
+    std::uint64_t forgottenEvent_ GUARDED_BY(mutex_) = 0;  // No event up to it is there any more.
     Counts counts_ GUARDED_BY(mutex_);
     std::optional<std::chrono::steady_clock::time_point> due_ GUARDED_BY(mutex_);  // Of active_.
     std::chrono::steady_clock::time_point retryAt_ GUARDED_BY(mutex_);             // Of frozen_.

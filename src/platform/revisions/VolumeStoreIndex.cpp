@@ -28,7 +28,7 @@ Result<std::uint64_t> VolumeStore::Implementation::apply(const IndexChanges& cha
     if (operations.empty()) return numbers_->currentEvent();
     TRY(waitForRoom());
     Update update = beginUpdate(roots_, changes.journal() == IndexChanges::Journal::yes);
-    TRY(update.load(operations.size(), [&](std::size_t i) { return operations[i].object.fileID; }));
+    TRY(noticed(update.load(operations.size(), [&](std::size_t i) { return operations[i].object.fileID; })));
     for (const auto& operation : operations) {
         const IndexedObject& object = operation.object;
         const std::string_view name = changes.nameOf(operation);
@@ -103,12 +103,12 @@ Result<void> VolumeStore::Implementation::indexed(
     for (std::size_t begin = 0; begin < fileIDs.size(); begin += kLookupsAtOnceMax) {
         const auto some = fileIDs.subspan(begin, std::min(kLookupsAtOnceMax, fileIDs.size() - begin));
         found.clear();
-        TRY(lookUp(
+        TRY(noticed(lookUp(
             some.size(), [&](std::size_t i) { return some[i]; },
             [&](std::size_t i, const PackedRecord* record) {
                 auto& place = found.emplace_back(begin + i, std::nullopt);
                 if (record != nullptr) place.second.emplace(some[i], *record);
-            }));
+            })));
         for (auto& [place, object] : found) receive(place, object ? &object->named() : nullptr);
     }
     return {};
@@ -144,7 +144,7 @@ bool VolumeStore::Implementation::findUnsavedChild(FileID parent, std::string_vi
 
 bool VolumeStore::Implementation::findSavedChild(FileID parent, std::string_view name, std::uint32_t hash,
                                                  FoundChild& found) const {
-    const auto candidates = ObjectTables::Snapshot(*tables_).childrenWithHash(parent, hash);
+    const auto candidates = noticed(ObjectTables::Snapshot(*tables_).childrenWithHash(parent, hash));
     if (!candidates.ok()) return false;
     Reader reader(*this);
     for (const FileID fileID : *candidates) {
@@ -188,12 +188,12 @@ Result<void> VolumeStore::Implementation::children(FileID parent, const ObjectRe
     const ObjectTables::Snapshot snapshot(*tables_);
     std::vector<FileID> others;
     Result<void> told;
-    TRY(snapshot.children(parent, [&](std::span<const FileID> some) {
+    TRY(noticed(snapshot.children(parent, [&](std::span<const FileID> some) {
         others.clear();
         std::ranges::copy_if(some, std::back_inserter(others),
                              [&](FileID fileID) { return !std::ranges::binary_search(arrived, fileID); });
         if (told.ok()) told = indexed(others, tell);
-    }));
+    })));
     return told;
 }
 

@@ -48,8 +48,10 @@ std::optional<JournalEvent> decodeEvent(std::uint64_t id, ByteView bytes) {
     return std::nullopt;
 }
 
-/// The first events of an overlay after an ID, in their order, without those that another one there has replaced.
-void collect(const Overlay& overlay, std::uint64_t after, std::size_t max, std::vector<JournalEvent>& found) {
+/// The first events of an overlay after an ID, in their order, without those that are not good any more.
+template <typename IsCurrent>
+void collect(const Overlay& overlay, std::uint64_t after, std::size_t max, IsCurrent isCurrent,
+             std::vector<JournalEvent>& found) {
     const auto idOf = [](const auto& entry) { return entry.first; };
     auto presence = std::ranges::upper_bound(overlay.presences(), after, {}, idOf);
     auto departure = std::ranges::upper_bound(overlay.departures(), after, {}, idOf);
@@ -57,7 +59,7 @@ void collect(const Overlay& overlay, std::uint64_t after, std::size_t max, std::
     const auto departuresEnd = overlay.departures().end();
     while (found.size() < max && (presence != presencesEnd || departure != departuresEnd)) {
         if (departure == departuresEnd || (presence != presencesEnd && presence->first < departure->first)) {
-            if (overlay.isCurrent(*presence)) found.push_back(eventOf(presence->first, presence->second));
+            if (isCurrent(*presence)) found.push_back(eventOf(presence->first, presence->second));
             ++presence;
         } else {
             found.push_back(eventOf(departure->first, *Departure::decode(departure->second)));
@@ -80,9 +82,10 @@ void collectDocumentChanges(const Overlay& overlay, std::uint64_t after, std::si
 // MARK: Reading
 
 /// Fills in what the records say today, and takes those over that are good: an object has but one event, and one that
-/// is gone has none.
-Result<void> VolumeStore::Implementation::resolve(std::vector<JournalEvent>& candidates,
-                                                  std::vector<JournalEvent>& found) const {
+/// is gone has none. Answers the newest event that has replaced another; 0 for none.
+Result<std::uint64_t> VolumeStore::Implementation::resolve(std::vector<JournalEvent>& candidates,
+                                                           std::vector<JournalEvent>& found) const {
+    std::uint64_t newest = 0;
     std::vector<std::size_t> presences;
     for (std::size_t i = 0; i < candidates.size(); ++i) {
         if (candidates[i].kind == JournalEvent::Kind::present) presences.push_back(i);
@@ -93,6 +96,7 @@ Result<void> VolumeStore::Implementation::resolve(std::vector<JournalEvent>& can
             JournalEvent& event = candidates[presences[i]];
             if (record == nullptr || record->eventID != event.id) {
                 event.id = 0;
+                if (record != nullptr) newest = std::max(newest, record->eventID);
                 return;
             }
             event.parent = record->parent;
@@ -104,42 +108,61 @@ Result<void> VolumeStore::Implementation::resolve(std::vector<JournalEvent>& can
         if (event.id != 0) found.push_back(std::move(event));
     }
     candidates.clear();
-    return {};
+    return newest;
 }
 
 Result<std::vector<JournalEvent>> VolumeStore::Implementation::events(std::uint64_t after, std::size_t max) const {
-    std::vector<JournalEvent> found, candidates, unsaved;
+    std::vector<JournalEvent> found;
+    bool isEnd = false;
+    // A second time only where events were replaced between one look and the next.
+    while (!isEnd && found.size() < max) isEnd = TRY(noticed(readEvents(after, max, found)));
+    return found;
+}
+
+/// Goes on with the events after an ID, which is moved on, until there are `max`. Answers whether there is none beyond.
+Result<bool> VolumeStore::Implementation::readEvents(std::uint64_t& after, std::size_t max,
+                                                     std::vector<JournalEvent>& found) const {
+    const std::size_t wanted = max - found.size();
+    std::vector<JournalEvent> candidates, unsaved;
     std::uint64_t unsavedBegin = std::numeric_limits<std::uint64_t>::max();
     {
         const MutexLock lock(mutex_);
+        const Overlay& active = *active_;
         if (frozen_) {
-            unsavedBegin = frozen_->firstEvent();
-            collect(*frozen_, after, max, unsaved);
+            const Overlay& frozen = *frozen_;
+            unsavedBegin = frozen.firstEvent();
+            const auto isCurrent = [&](const auto& presence) {
+                return !active.find(presence.second).isKnown ? frozen.isCurrent(presence) : active.isCurrent(presence);
+            };
+            collect(frozen, after, wanted, isCurrent, unsaved);
         }
-        unsavedBegin = std::min(unsavedBegin, active_->firstEvent());
-        collect(*active_, after, max, unsaved);
+        unsavedBegin = std::min(unsavedBegin, active.firstEvent());
+        collect(
+            active, after, wanted, [&](const auto& presence) { return active.isCurrent(presence); }, unsaved);
     }
-    Result<void> resolved;
+    Result<std::uint64_t> resolved = std::uint64_t{0};
+    std::uint64_t newest = 0;
     {
         const ObjectTables::Snapshot snapshot(*tables_);
         TRY(snapshot.events(after, [&](std::uint64_t id, ByteView bytes) {
-            if (id >= unsavedBegin || found.size() + candidates.size() >= max) return false;
+            if (id >= unsavedBegin || found.size() == max) return false;
             if (auto event = decodeEvent(id, bytes)) candidates.push_back(std::move(*event));
-            if (candidates.size() == std::min(kLookupsAtOnceMax, max - found.size()))
-                resolved = resolve(candidates, found);
+            after = id;
+            if (candidates.size() < std::min(kLookupsAtOnceMax, max - found.size())) return true;
+            resolved = resolve(candidates, found);
+            if (resolved.ok()) newest = std::max(newest, *resolved);
             return resolved.ok();
         }));
     }
-    TRY(Result<void>(resolved));
-    TRY(resolve(candidates, found));
-    for (auto event = unsaved.begin(); event != unsaved.end() && found.size() < max;) {
-        const auto some = std::min<std::size_t>(static_cast<std::size_t>(unsaved.end() - event), max - found.size());
-        candidates.assign(std::make_move_iterator(event),
-                          std::make_move_iterator(event + static_cast<std::ptrdiff_t>(some)));
-        event += static_cast<std::ptrdiff_t>(some);
-        TRY(resolve(candidates, found));
-    }
-    return found;
+    TRY(Result<std::uint64_t>(resolved));
+    newest = std::max(newest, TRY(resolve(candidates, found)));
+    if (found.size() == max) return false;
+    const bool isAll = unsaved.size() <= max - found.size() && unsaved.size() < wanted;
+    unsaved.resize(std::min(unsaved.size(), max - found.size()));
+    if (!unsaved.empty()) after = unsaved.back().id;
+    newest = std::max(newest, TRY(resolve(unsaved, found)));
+    // What has replaced an event since is beyond what was looked at.
+    return isAll && newest <= after;
 }
 
 Result<std::vector<JournalEvent>> VolumeStore::Implementation::documentEvents(std::uint64_t after,
@@ -170,7 +193,7 @@ Result<std::vector<JournalEvent>> VolumeStore::Implementation::documentEvents(st
 
 std::optional<std::uint64_t> VolumeStore::Implementation::historyBegin() const {
     const MutexLock lock(mutex_);
-    return historyBegin_;
+    return hasHistory_ ? std::optional(forgottenEvent_) : std::nullopt;
 }
 
 Result<std::uint64_t> VolumeStore::Implementation::beginHistory() {
@@ -180,13 +203,15 @@ Result<std::uint64_t> VolumeStore::Implementation::beginHistory() {
     TRY(saveEverything());
     const std::uint64_t begin = TRY(numbers_->reserveEvents(1));
     TablesHead head = tables_->head();
-    head.historyBegin = begin;
+    head.hasHistory = true;
+    head.forgottenEvent = begin;
     head.marks = numbers_->reserved();
     TRY(tables_->forgetEvents(head));
     lastTimeMark_.reset();
     {
         const MutexLock lock(mutex_);
-        historyBegin_ = begin;
+        hasHistory_ = true;
+        forgottenEvent_ = begin;
         counts_.events = 0;
     }
     numbers_->takeEvents(1);
@@ -202,12 +227,12 @@ Result<void> VolumeStore::Implementation::renewUUID() {
     for (LogFile& log : logs_) TRY(log.clearDurably());
     TablesHead head = tables_->head();
     head.uuid = KsUUID::random();
-    if (head.historyBegin != 0) head.historyBegin = numbers_->currentEvent();
+    head.forgottenEvent = numbers_->currentEvent();
     TRY(tables_->forgetEvents(head));
     lastTimeMark_.reset();
     const MutexLock lock(mutex_);
     uuid_ = head.uuid;
-    if (historyBegin_) historyBegin_ = head.historyBegin;
+    forgottenEvent_ = head.forgottenEvent;
     counts_.events = 0;
     return {};
 }
@@ -248,14 +273,14 @@ Result<void> VolumeStore::Implementation::trimJournal(std::uint64_t eventsMax, s
     TablesHead head = tables_->head();
     const std::uint64_t upTo =
         std::min(current, std::max(TRY(tables_->lastEventBeyond(eventsMax)), TRY(lastEventOlderThan(ageMax, current))));
-    if (head.historyBegin == 0 || upTo <= head.historyBegin) return {};
-    head.historyBegin = upTo;
+    if (upTo <= head.forgottenEvent) return {};
+    head.forgottenEvent = upTo;
     {
         // Before the first goes: who finds its own still covered has them all.
         const MutexLock lock(mutex_);
-        historyBegin_ = upTo;
+        forgottenEvent_ = upTo;
     }
-    const std::uint64_t forgotten = TRY(tables_->forgetEventsUpTo(upTo, head));
+    const std::uint64_t forgotten = TRY(tables_->forgetEventsAsSaid(head));
     const MutexLock lock(mutex_);
     counts_.events -= std::min(counts_.events, forgotten);
     return {};

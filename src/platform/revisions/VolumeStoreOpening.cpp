@@ -47,7 +47,8 @@ Result<void> VolumeStore::Implementation::open() {
         const MutexLock lock(mutex_);
         counts_ = {
             .objects = tables_->objectCount(), .documents = tables_->documentCount(), .events = tables_->eventCount()};
-        if (tables_->head().historyBegin != 0) historyBegin_ = tables_->head().historyBegin;
+        hasHistory_ = tables_->head().hasHistory;
+        forgottenEvent_ = tables_->head().forgottenEvent;
     }
     {
         const MutexLock lock(writerMutex_);
@@ -63,20 +64,29 @@ Result<void> VolumeStore::Implementation::open() {
     return {};
 }
 
+/// What the logs hold beyond the tables. A checkpoint that was begun is done again by itself: half of it may be in the
+/// tables, and only the very same makes it whole.
+struct VolumeStore::Implementation::Replayed {
+    Overlay unfinished;
+    std::uint64_t unfinishedLastBatch = 0;
+    Overlay rest;
+};
+
 /// Tables and logs as the last holder left them, put together. Answers the first numbers that nobody can have been
 /// given.
 Result<HighWaterMarks> VolumeStore::Implementation::openState(const std::optional<HighWaterMarks>& marks) {
     TRY(openTables(marks));
-    Overlay unsaved;
-    TRY(readLogs(unsaved));
+    Replayed replayed;
+    TRY(readLogs(replayed));
     HighWaterMarks next = HighWaterMarks::highest(marks.value_or(HighWaterMarks{}), tables_->head().marks);
     // Only when the file of marks was lost can the logs know more.
-    next.event = std::max(next.event, unsaved.lastEvent() + 1);
-    if (!unsaved.documents().empty()) {
-        next.document =
-            std::max(next.document, std::uint64_t{static_cast<std::uint32_t>(unsaved.documents().back().first)} + 1);
+    for (const Overlay* unsaved : {&replayed.unfinished, &replayed.rest}) {
+        next.event = std::max(next.event, unsaved->lastEvent() + 1);
+        if (unsaved->documents().empty()) continue;
+        const auto last = static_cast<std::uint32_t>(unsaved->documents().back().first);
+        next.document = std::max(next.document, std::uint64_t{last} + 1);
     }
-    TRY(saveReplayed(unsaved, next));
+    TRY(saveReplayed(replayed, next));
     return next;
 }
 
@@ -147,7 +157,7 @@ Result<void> VolumeStore::Implementation::setAside(const KsError& damage) {
 
 /// Reads what the logs hold beyond the tables: their batches in the order of their numbers, up to the first that is
 /// missing or torn.
-Result<void> VolumeStore::Implementation::readLogs(Overlay& unsaved) {
+Result<void> VolumeStore::Implementation::readLogs(Replayed& replayed) {
     const MutexLock writerLock(writerMutex_);
     std::array<Bytes, 2> bytes;
     std::array<std::vector<volumelog::Batch>, 2> batches;
@@ -162,7 +172,9 @@ Result<void> VolumeStore::Implementation::readLogs(Overlay& unsaved) {
     for (const auto& log : batches) {
         for (const auto& batch : log) {
             if (batch.sequence != nextBatch_) continue;  // In the tables already, or behind one that is lost.
-            replay(batch, unsaved);
+            const bool isUnfinished = batch.sequence <= tables_->head().begunBatch;
+            replay(batch, isUnfinished ? replayed.unfinished : replayed.rest);
+            if (isUnfinished) replayed.unfinishedLastBatch = batch.sequence;
             ++nextBatch_;
         }
     }
@@ -170,7 +182,7 @@ Result<void> VolumeStore::Implementation::readLogs(Overlay& unsaved) {
 }
 
 void VolumeStore::Implementation::replay(const volumelog::Batch& batch, Overlay& unsaved) const {
-    const std::uint64_t forgotten = tables_->head().historyBegin;
+    const std::uint64_t forgotten = tables_->head().forgottenEvent;
     for (const LogRecord& logged : volumelog::records(batch)) {
         switch (logged.type) {
             case LogRecordType::object:
@@ -200,15 +212,17 @@ void VolumeStore::Implementation::replay(const volumelog::Batch& batch, Overlay&
     }
 }
 
-Result<void> VolumeStore::Implementation::saveReplayed(const Overlay& unsaved, const HighWaterMarks& next) {
+Result<void> VolumeStore::Implementation::saveReplayed(const Replayed& replayed, const HighWaterMarks& next) {
     const MutexLock checkpointLock(checkpointMutex_);
     const MutexLock writerLock(writerMutex_);
     TRY(tables_->removeUnsettledDocuments());
     const std::uint64_t lastBatch = nextBatch_ - 1;
     // A checkpoint that was not finished had batches that the logs have lost.
     if (tables_->head().begunBatch > lastBatch) TRY(tables_->rebuildChildren());
-    if (!unsaved.empty()) {
-        TRY(tables_->write(unsaved, headFor(unsaved, lastBatch, next), options_.checkpointPagesMax,
+    for (const auto& [unsaved, last] :
+         {std::pair(&replayed.unfinished, replayed.unfinishedLastBatch), std::pair(&replayed.rest, lastBatch)}) {
+        if (unsaved->empty()) continue;
+        TRY(tables_->write(*unsaved, headFor(*unsaved, last, next), options_.checkpointPagesMax,
                            options_.onCheckpointStep));
     }
     // On the disk, because numbers go on here: a batch of the tail that was cut off shall never follow one that is new.

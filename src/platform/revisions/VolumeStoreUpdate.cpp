@@ -327,7 +327,8 @@ void VolumeStore::Implementation::Update::writeTo(Overlay& overlay, Counts& coun
     std::vector<std::pair<std::uint64_t, const Object*>> announced;
     for (const Object& object : objects_) {
         if (!object.isChanged()) continue;
-        const bool stays = object.wasThere && object.isThere && object.before.parent == object.now.parent;
+        const bool stays = object.wasThere && object.isThere && object.before.isAt(object.now.parent, object.now.name);
+        // Also a rename within a folder, which changes nothing but while the tables are half written.
         if (object.wasThere && !stays) overlay.addToChildCount(object.before.parent, -1);
         if (object.isThere && !stays) overlay.addToChildCount(object.now.parent, 1);
         counts.objects += object.isThere ? 1 : 0;

@@ -316,8 +316,6 @@ void FSChangesEnumerator::readerDidDropEvent(FSEventReader& reader, const Event&
 
 void FSChangesEnumerator::readerMustScan(FSEventReader& reader, const Event& event) {
     reader.assertOnQueue();
-    // What went from a package's folders can't be told: the client lists again.
-    if (reader.isEnclosingPackage(event.path)) return readerDidLoseEvents(reader, event);
     Changes changes;
     for (const KsURL& url : urls_) {
         if (isAtOrBelow(url.path(), event.path)) changes.foldersToScan.push_back(url.path());

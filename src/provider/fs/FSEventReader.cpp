@@ -36,28 +36,6 @@ std::uint32_t deviceOfDocumentTree() {
     return device != 0 ? device : deviceID(TesselManager::defaultManager().documentStorageURL());
 }
 
-/// The outermost package that the directory is or lies in, below its root; empty where there is none.
-std::string enclosingPackage(const KsURL& url) {
-    const auto root = RootDirectories::shared().rootHolding(url.path());
-    const std::string& path = url.path();
-    std::size_t begin = root ? root->path.size() : 0;
-    while (begin < path.size()) {
-        ++begin;  // Past the slash.
-        const std::size_t end = std::min(path.find('/', begin), path.size());
-        if (TypeDatabase::shared().isPackageName(std::string_view(path).substr(begin, end - begin)))
-            return path.substr(0, end);
-        begin = end;
-    }
-    return {};
-}
-
-std::vector<std::string> enclosingPackages(const std::vector<KsURL>& urls) {
-    std::vector<std::string> packages;
-    packages.reserve(urls.size());
-    for (const KsURL& url : urls) packages.push_back(enclosingPackage(url));
-    return packages;
-}
-
 /// Decides whether a listing may go on: the reader's delegate for one replay.
 class FSEventChecker : public FSEventReaderDelegate {
 public:
@@ -165,7 +143,6 @@ std::shared_ptr<FSEventReader> FSEventReader::create(std::vector<KsURL> urls, FS
 
 FSEventReader::FSEventReader(std::vector<KsURL> urls, FSEventReaderMode mode, bool verbose, std::uint64_t sinceEventID)
     : urls_(std::move(urls)),
-      enclosingPackages_(enclosingPackages(urls_)),
       mode_(mode),
       verbose_(verbose),
       streamQueue_(std::make_shared<SerialQueue>("cindral.fsevents-stream")),
@@ -197,9 +174,7 @@ std::shared_ptr<EventStream> FSEventReader::makeStream() {
                                                      kCreationFlags, std::move(callback));
     } else {
         std::vector<std::string> paths;
-        for (std::size_t i = 0; i < urls_.size(); ++i) {
-            paths.push_back(enclosingPackages_[i].empty() ? urls_[i].path() : enclosingPackages_[i]);
-        }
+        for (const KsURL& url : urls_) paths.push_back(url.path());
         stream = EventStream::create(std::move(paths), since, kLatency, kCreationFlags, std::move(callback));
     }
     stream->setDispatchQueue(streamQueue_);
@@ -331,10 +306,6 @@ void FSEventReader::reportFlags(FSEventReaderDelegate& delegate, FSEventReader& 
     }
 }
 
-bool FSEventReader::isEnclosingPackage(std::string_view path) const {
-    return !path.empty() && std::ranges::find(enclosingPackages_, path) != enclosingPackages_.end();
-}
-
 /// Whether what left the path is, or held, one of the directories.
 bool FSEventReader::mayMoveDirectory(const Event& event) const {
     return (event.flags & EventFlags::removed) &&
@@ -351,7 +322,6 @@ Result<FSEventReader::Look> FSEventReader::lookAt(FSEventReaderDelegate& delegat
     if (mode_ == FSEventReaderMode::docIDBased) return lookAtDocument(delegate, event);
     const bool isMonitored = directoryHolding(urls_, event.path) != nullptr;
     if (!isMonitored && mayMoveDirectory(event)) return Look{.kind = Look::Kind::directoryMoved};
-    if (isEnclosingPackage(event.path)) return Look{.kind = Look::Kind::scan};
     if (event.flags & EventFlags::mustScanSubdirectories) {
         const auto isBelow = [&](const KsURL& url) { return isAtOrBelow(url.path(), event.path); };
         if (isMonitored || std::ranges::any_of(urls_, isBelow)) return Look{.kind = Look::Kind::scan};

@@ -106,8 +106,6 @@ public:
 
     /// Stops the process unless the caller is on the reader's queue.
     void assertOnQueue() const { streamQueue_->assertCurrent(); }
-    /// Whether the path is a package that one of the URLs is or lies in.
-    bool isEnclosingPackage(std::string_view path) const;
     /// Runs the task on the reader's queue, after what is reported now.
     void async(SerialQueue::Task task) { streamQueue_->async(std::move(task)); }
 
@@ -142,8 +140,6 @@ private:
 
     // Constant after construction.
     const std::vector<KsURL> urls_;
-    /// Of each of urls_, the outermost package that it is or lies in; empty where there is none.
-    const std::vector<std::string> enclosingPackages_;
     const FSEventReaderMode mode_;
     const bool verbose_;
     /// Shared, because the stream's work may be on it when the reader goes.

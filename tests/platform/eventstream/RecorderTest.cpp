@@ -546,6 +546,26 @@ TEST_P(RecorderTest, tellsOfEverythingInAFolderThatIsTrashed) {
     EXPECT_TRUE(told.contains("- f"));
 }
 
+TEST_P(RecorderTest, tellsOfEverythingInAFolderThatIsExchangedOutOfAPackage) {
+    makeFolder("p.folio");
+    makeFolder("p.folio/h");
+    write("p.folio/h/a");
+    makeFolder("g");
+    makeFolder("g/.Trash");
+    write("g/.Trash/b");
+    start();
+    exchange("p.folio/h", "g/.Trash");
+    Changes told = changes();
+    EXPECT_TRUE(told.contains("g/.Trash/a"));
+    EXPECT_TRUE(told.contains("p.folio/h/b"));
+    exchange("p.folio/h", "g/.Trash");
+    rename("g", "h");
+    told = changes();
+    EXPECT_TRUE(told.contains("h/.Trash/b"));
+    EXPECT_TRUE(told.contains("p.folio/h/a"));
+    expectIndexIsTree();
+}
+
 // MARK: What happens while nobody records
 
 TEST_P(RecorderTest, findsWhatHappenedWhileNobodyRecorded) {

@@ -53,6 +53,21 @@ protected:
     }
     static std::string nameOf(std::uint64_t key) { return "name " + std::string(key % 40, 'n') + std::to_string(key); }
 
+    /// How many children there are in all, having read every folder and every event.
+    static std::size_t readFolders(const ObjectTables::Snapshot& snapshot, const std::set<std::uint64_t>& keys) {
+        std::set<FileID> folders;
+        for (const std::uint64_t key : keys) folders.insert(parentOf(key));
+        std::size_t children = 0, counted = 0;
+        for (const FileID folder : folders) {
+            (void)snapshot.children(folder, [&](std::span<const FileID> some) { children += some.size(); });
+            counted += snapshot.childCount(folder);
+            (void)snapshot.childrenWithHash(folder, 0x80000000);
+        }
+        std::size_t events = 0;
+        (void)snapshot.events(0, [&](std::uint64_t, ByteView) { return ++events < 1'000'000; });
+        return children == counted && events == children ? children : 0;
+    }
+
     std::optional<std::string> damage() const {
         const UniqueFd file = std::move(sys::open(path().c_str(), O_RDONLY)).value();
         return tablepages::findDamage(file.get()).value();
@@ -106,6 +121,7 @@ TEST_F(TablePagesTest, findsManyKeysAtOnceAsTheLibraryFindsThem) {
             EXPECT_EQ(many->documentID, one->documentID);
         }
         EXPECT_EQ(found, count);
+        EXPECT_EQ(readFolders(snapshot, keys), count);
         EXPECT_TRUE(snapshot.objects({}).ok());
     }
 }
@@ -117,9 +133,9 @@ TEST_F(TablePagesTest, findsFlippedBitsBeforeTheLibraryDoes) {
     std::size_t found = 0, harmless = 0;
     std::optional<std::size_t> changed;
     for (std::size_t page = 0; page < good.size(); page += 4096) {
-        // The page's head, its first offsets, the end with the first entries that were written; in head pages all of
-        // it.
-        for (std::size_t at = 0; at < 4096; at += at == 40 && page >= 8192 ? 4000 : 1) {
+        // The page's head, its first offsets, the end with the first entries that were written, and some of what is
+        // between; in head pages all of it.
+        for (std::size_t at = 0; at < 4096; at += at >= 40 && at < 4040 && page >= 8192 ? 41 : 1) {
             if (page < 8192 && at == 160) break;
             if (changed) setByte(*changed, good[*changed]);
             changed = page + at;
@@ -139,6 +155,7 @@ TEST_F(TablePagesTest, findsFlippedBitsBeforeTheLibraryDoes) {
             }
             (void)snapshot.objects(lookups);
             for (std::uint32_t id = 1; id <= keys.size(); ++id) (void)snapshot.document(DocumentID{id});
+            readFolders(snapshot, keys);
         }
     }
     EXPECT_GT(found, 0U);

@@ -7,6 +7,8 @@
 
 #include "platform/revisions/Checksum.h"
 #include "platform/revisions/HighWaterFile.h"
+#include "platform/revisions/JournalRecord.h"
+#include "platform/revisions/NameHash.h"
 
 namespace cindral {
 namespace {
@@ -103,6 +105,99 @@ TEST(VolumeLog, writesTheBytesThatTheDocumentShows) {
               "612e747874");      // "a.txt"
 }
 
+// Every type of record as it was first written, which newer versions have to read.
+TEST(VolumeLog, writesAndReadsEveryTypeAsEver) {
+    BatchWriter writer;
+    writer.begin();
+    PackedRecord record{.parent = FileID{2},
+                        .birthTime = 1'700'000'000'000'000'000,
+                        .kind = ObjectKind::file,
+                        .isListed = true,
+                        .isClosed = true,
+                        .hasOtherNames = true,
+                        .changeTime = 1'700'000'001'000'000'000,
+                        .size = 1000,
+                        .eventID = 4,
+                        .name = "n"};
+    writer.addObject(FileID{10}, false, record);
+    record.documentID = DocumentID{5};
+    record.eventID = 9;
+    record.isClosed = record.hasOtherNames = false;
+    writer.addObject(FileID{11}, true, record);
+    writer.addObjectGone(FileID{12});
+    writer.addDocument(LogRecordType::documentGiven, DocumentID{6}, {FileID{13}, -7});
+    writer.addDocument(LogRecordType::documentHandedOver, DocumentID{5}, {FileID{14}, 8});
+    const NameKey key{.fileID = FileID{10}, .parent = FileID{3}, .hash = 0x11223344, .index = 1};
+    writer.addOtherName(key, "link");
+    writer.addOtherNameGone(key);
+    const Departure departure{.fileID = FileID{10},
+                              .documentID = DocumentID{5},
+                              .parent = FileID{3},
+                              .objectKind = ObjectKind::file,
+                              .root = FileID{2},
+                              .name = "a.txt",
+                              .path = "letters/a.txt"};
+    writer.add(LogRecordType::departure, 21, departure.encode());
+    const DocumentChange change{.documentID = DocumentID{5}, .source = FileID{11}, .target = FileID{14}};
+    writer.add(LogRecordType::documentChange, 22, change.encode());
+    writer.add(LogRecordType::attributes, 5, bytesOf("attributes"));
+    writer.addTimeMark(21, 1'700'000'002'000'000'000);
+    const ByteView batch = writer.finish(kStore, 1);
+    ASSERT_EQ(hex(batch),
+              "4356423283010000010000000000000016f078c90a00000000000000012e000000020000000000000000002a36fe9c971700"
+              "0000007100cac471fe9c9717e80300000000000004000000000000006e0b00000000000000022e0000000200000000000000"
+              "00002a36fe9c9717050000001100cac471fe9c9717e80300000000000009000000000000006e0c0000000000000003000000"
+              "00060000000000000004100000000d00000000000000f9ffffffffffffff050000000000000005100000000e000000000000"
+              "0008000000000000000a00000000000000061200000003000000000000004433221101006c696e6b0a00000000000000070e"
+              "000000030000000000000044332211010015000000000000000832000000020a000000000000000500000003000000000000"
+              "000102000000000000000500612e7478746c6574746572732f612e74787416000000000000000914000000050000000b0000"
+              "00000000000e0000000000000005000000000000000a0a0000006174747269627574657315000000000000000b0800000000"
+              "945fadfe9c9717");
+
+    const auto batches = volumelog::decode(batch, kStore);
+    ASSERT_EQ(batches.size(), 1U);
+    const auto records = volumelog::records(batches[0]);
+    ASSERT_EQ(records.size(), 11U);
+    EXPECT_EQ(PackedRecord::decode(records[1].value), record);
+    EXPECT_EQ(records[2].fileID(), FileID{12});
+    EXPECT_EQ(decodeDocument(records[3].value)->birthTime, -7);
+    EXPECT_EQ(records[4].documentID(), DocumentID{5});
+    EXPECT_EQ(records[5].nameKey(), key);
+    EXPECT_EQ(records[5].otherName(), "link");
+    EXPECT_EQ(records[6].nameKey(), key);
+    EXPECT_EQ(Departure::decode(records[7].value), departure);
+    EXPECT_EQ(DocumentChange::decode(records[8].value), change);
+    EXPECT_EQ(textOf(records[9].value), "attributes");
+    EXPECT_EQ(records[10].time(), 1'700'000'002'000'000'000);
+}
+
+TEST(VolumeLog, holdsNothingThatNoStoreWrites) {
+    const auto isRead = [](LogRecordType type, std::uint64_t key, std::size_t bytes) {
+        BatchWriter writer;
+        writer.begin();
+        writer.add(type, key, Bytes(bytes));
+        return !volumelog::decode(writer.finish(kStore, 1), kStore).empty();
+    };
+    EXPECT_TRUE(isRead(LogRecordType::objectGone, 5, 0));
+    EXPECT_FALSE(isRead(LogRecordType::objectGone, 5, 1));
+    EXPECT_FALSE(isRead(LogRecordType::object, 5, PackedRecord::kHeadBytes - 1));
+    EXPECT_FALSE(isRead(LogRecordType::objectWithDocument, 5, PackedRecord::kHeadBytes));  // Document 0.
+    EXPECT_TRUE(isRead(LogRecordType::documentGiven, 5, 16));
+    EXPECT_FALSE(isRead(LogRecordType::documentGiven, 0, 16));
+    EXPECT_FALSE(isRead(LogRecordType::documentHandedOver, 1ULL << 32, 16));
+    EXPECT_FALSE(isRead(LogRecordType::documentHandedOver, 5, 17));
+    EXPECT_FALSE(isRead(LogRecordType::otherName, 5, 13));
+    EXPECT_FALSE(isRead(LogRecordType::otherName, 5, 14 + 1024));
+    EXPECT_FALSE(isRead(LogRecordType::otherNameGone, 5, 15));
+    EXPECT_FALSE(isRead(LogRecordType::departure, 5, Departure::kHeadBytes));  // Of another kind.
+    EXPECT_FALSE(isRead(LogRecordType::documentChange, 5, 19));
+    EXPECT_TRUE(isRead(LogRecordType::attributes, 5, 65'536));
+    EXPECT_FALSE(isRead(LogRecordType::attributes, 5, 65'537));
+    EXPECT_FALSE(isRead(LogRecordType::timeMark, 5, 7));
+    EXPECT_FALSE(isRead(LogRecordType{0}, 5, 8));
+    EXPECT_FALSE(isRead(LogRecordType{12}, 5, 8));
+}
+
 TEST(VolumeLog, takesTheWholeBatchesOfEveryTruncation) {
     const Bytes first = batchOf(7, {"a"}), log = joined({first, batchOf(8, {"b", "c"})});
     for (std::size_t size = 0; size < log.size(); ++size) {
@@ -133,6 +228,30 @@ TEST(VolumeLog, stopsWhereANumberIsMissing) {
 TEST(VolumeLog, isNoneOfAnotherStore) {
     EXPECT_TRUE(volumelog::decode(batchOf(7, {"a"}), KsUUID{}).empty());
     EXPECT_TRUE(volumelog::decode(Bytes(1000), kStore).empty());
+}
+
+// A departure cut short is none, or one whose names end earlier; never one that reads beyond its bytes.
+TEST(JournalRecord, takesTruncatedDeparturesForWhatTheyAre) {
+    const Bytes bytes = Departure{.fileID = FileID{1}, .name = "name", .path = "folder/name"}.encode();
+    for (std::size_t size = 0; size <= bytes.size(); ++size) {
+        const auto departure = Departure::decode(ByteView(bytes).first(size));
+        ASSERT_EQ(departure.has_value(), size >= Departure::kHeadBytes + 4) << size;
+        if (!departure) continue;
+        EXPECT_EQ(departure->name, "name");
+        EXPECT_EQ(departure->path, std::string("folder/name").substr(0, size - Departure::kHeadBytes - 4));
+    }
+    EXPECT_EQ(Presence::decode(bytes), std::nullopt);
+}
+
+// From the paper that the function was published in.
+TEST(NameHash, isSipHash) {
+    NameHashKey key{};
+    std::string bytes;
+    for (std::uint8_t i = 0; i < 16; ++i) key[i] = i;
+    for (char i = 0; i < 15; ++i) bytes += i;
+    EXPECT_EQ(sipHash(key, bytesOf(bytes)), 0xA129CA6149BE45E5U);
+    EXPECT_EQ(nameHash(key, bytes), 0x49BE45E5U);
+    EXPECT_NE(nameHash(randomNameHashKey(), "a"), nameHash(randomNameHashKey(), "a"));
 }
 
 TEST(HighWaterFile, readsTheHigherOfItsGoodSlots) {
