@@ -5,6 +5,8 @@
 #include <nlohmann/json.hpp>
 
 #include "host/ContainerListing.h"
+#include "host/ContainerMonitor.h"
+#include "host/Descriptor.h"
 #include "host/HostError.h"
 #include "host/ItemWriter.h"
 #include "host/JsonText.h"
@@ -19,6 +21,10 @@ namespace {
 bool isManyFolders(const TesselItemIdentifier& container) {
     return container == kTesselRootContainerItemIdentifier || container == kTesselWorkingSetContainerItemIdentifier ||
            container == kTesselAllDirectoriesContainerItemIdentifier;
+}
+
+bool isExpired(const KsError& error) {
+    return error.is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::pageExpired));
 }
 
 /// Errors that all say: there is nothing of that name.
@@ -48,6 +54,8 @@ Result<void> Commands::run() {
         case HostCommand::url: return url();
         case HostCommand::id: return id();
         case HostCommand::anchor: return anchor();
+        case HostCommand::changes: return changes();
+        case HostCommand::watch: return watch();
         case HostCommand::status: return status();
         case HostCommand::rpc: break;
     }
@@ -164,11 +172,77 @@ Result<void> Commands::id() {
     return {};
 }
 
-Result<void> Commands::anchor() {
-    const auto anchor = context_.client.anchor(TRY(identifier()));
+Result<TesselSyncAnchor> Commands::anchorOf(const TesselItemIdentifier& container) const {
+    auto anchor = context_.client.anchor(container);
     if (!anchor.ok()) return failure(anchor.error());
     if (!*anchor) return hostFailure(fmt::format("there is no anchor for {}", subject()));
-    printValue("anchor", base64Encode(**anchor));
+    return **std::move(anchor);
+}
+
+Result<void> Commands::anchor() {
+    printValue("anchor", base64Encode(TRY(anchorOf(TRY(identifier())))));
+    return {};
+}
+
+Result<TesselItemIdentifier> Commands::container() const {
+    TesselItemIdentifier container = TRY(identifier());
+    if (!isManyFolders(container) && !isContainer(kindOf(*TRY(item()))))
+        return hostFailure(fmt::format("{} is not a folder", subject()));
+    return container;
+}
+
+ChangePrinter Commands::changePrinter() {
+    return {context_.paths, context_.options.json ? ChangePrinter::Form::json : ChangePrinter::Form::text, output_};
+}
+
+Result<void> Commands::follow(ChangePrinter& printer, const TesselItemIdentifier& container, TesselSyncAnchor& anchor,
+                              int stop) {
+    bool moreComing = true;
+    while (moreComing && !output_.isBroken() && !(stop >= 0 && descriptor::isReadable(stop))) {
+        ChangesBatch batch = TRY(context_.client.changesSince(container, anchor));
+        printer.print(batch);
+        anchor = std::move(batch.anchor);
+        moreComing = batch.moreComing;
+    }
+    return {};
+}
+
+Result<void> Commands::changes() {
+    const auto anchorBytes = base64Decode(context_.options.since);
+    if (!anchorBytes) return usageFailure("the anchor is not base64");
+    const TesselItemIdentifier container = TRY(this->container());
+    TesselSyncAnchor anchor = *anchorBytes;
+    ChangePrinter printer = changePrinter();
+    const auto followed = follow(printer, container, anchor, /*stop=*/-1);
+    if (!followed.ok() && isExpired(followed.error()))
+        return hostFailure(fmt::format("{}: the anchor has expired; list again, and take a new one", subject()));
+    if (!followed.ok()) return failure(followed.error());
+    printer.printAnchor(anchor);
+    return {};
+}
+
+Result<void> Commands::watch() {
+    const TesselItemIdentifier container = TRY(this->container());
+    const UniqueFd news = TRY(descriptor::makeInterrupt());
+    ContainerMonitor monitor(context_.client, context_.signals,
+                             [&](const TesselItemIdentifier&) { descriptor::interrupt(news); });
+    TesselSyncAnchor anchor = TRY(anchorOf(container));
+    if (const auto started = monitor.start(container); !started.ok()) return failure(started.error());
+    const int stop = TRY(context_.stopDescriptor());
+    ChangePrinter printer = changePrinter();
+    auto readiness = descriptor::Readiness::input;
+    while (readiness == descriptor::Readiness::input && !output_.isBroken()) {
+        // Before what it tells of is asked for: what comes later sets it off again.
+        descriptor::clearInterrupt(news);
+        const auto followed = follow(printer, container, anchor, stop);
+        if (!followed.ok() && !isExpired(followed.error())) return failure(followed.error());
+        if (!followed.ok()) {
+            printer.printLost();
+            anchor = TRY(anchorOf(container));
+        }
+        output_.flush();
+        readiness = TRY(descriptor::waitForInput(news.get(), output_.descriptor(), stop));
+    }
     return {};
 }
 

@@ -4,10 +4,12 @@
 #include <string>
 #include <string_view>
 
+#include "host/ChangePrinter.h"
 #include "host/HostOptions.h"
 #include "host/ItemText.h"
 #include "host/PresentedPaths.h"
 #include "host/ProviderClient.h"
+#include "host/SignalDispatcher.h"
 #include "host/TextOutput.h"
 
 namespace cindral {
@@ -25,6 +27,9 @@ public:
         const HostOptions& options;
         const HostEnvironment& environment;
         std::function<std::string()> statusText;  ///< as JSON
+        SignalDispatcher& signals;
+        /// From the call on, what asks a command that has no end to end makes the descriptor readable.
+        std::function<Result<int>()> stopDescriptor;
     };
 
     /// All borrowed for life.
@@ -44,6 +49,8 @@ private:
     Result<void> url();
     Result<void> id();
     Result<void> anchor();
+    Result<void> changes();
+    Result<void> watch();
     Result<void> status();
 
     /// The item that was named; the root container where none was.
@@ -53,6 +60,13 @@ private:
     /// The named item's text, or the storage's path.
     std::string subject() const;
     KsError failure(const KsError& error) const;
+    /// The container that was named; an error where it is none.
+    Result<TesselItemIdentifier> container() const;
+    Result<TesselSyncAnchor> anchorOf(const TesselItemIdentifier& container) const;
+    /// Prints the changes since the anchor, which is moved on, until there are no more or `stop` is readable.
+    Result<void> follow(ChangePrinter& printer, const TesselItemIdentifier& container, TesselSyncAnchor& anchor,
+                        int stop);
+    ChangePrinter changePrinter();
 
     void printItem(const TesselItem& item);
     void printValue(std::string_view key, const std::string& value);

@@ -71,6 +71,17 @@ void interrupt(const UniqueFd& interrupt) {
     [[maybe_unused]] const ssize_t put = ::write(interrupt.get(), &one, sizeof one);
 }
 
+void clearInterrupt(const UniqueFd& interrupt) {
+    std::uint64_t count = 0;
+    // Nothing to read is as clear as it gets.
+    [[maybe_unused]] const ssize_t got = ::read(interrupt.get(), &count, sizeof count);
+}
+
+bool isReadable(int fd) {
+    pollfd entry{fd, POLLIN, 0};
+    return ::poll(&entry, 1, 0) > 0;
+}
+
 void enlargePipe(int fd, std::size_t bytes) {
     ::fcntl(fd, F_SETPIPE_SZ, static_cast<int>(bytes));
 }

@@ -23,6 +23,10 @@ Result<Readiness> waitForInput(int input, int output, int interrupt);
 /// A descriptor that becomes readable by interrupt() and stays so.
 Result<UniqueFd> makeInterrupt();
 void interrupt(const UniqueFd& interrupt);
+/// Makes it as it was before.
+void clearInterrupt(const UniqueFd& interrupt);
+/// Whether something can be read, or nothing ever will be. At once.
+bool isReadable(int fd);
 
 /// Lets a pipe hold that many bytes, where it is one and the system allows it.
 void enlargePipe(int fd, std::size_t bytes);

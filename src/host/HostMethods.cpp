@@ -183,6 +183,69 @@ void currentSyncAnchor(const HostMethodsContext& context, const Json& params, co
                                      });
 }
 
+void answerChanges(JsonRpcReply& reply, const Result<ChangesBatch>& changes, const PresentedPaths& paths) {
+    if (!changes.ok()) return answerWithError(reply, changes.error(), paths);
+    reply.result([&](std::string& out) {
+        ItemWriter writer(paths);
+        ItemWriter::reserve(out, changes->log.size());
+        // Each list with its own view of the log.
+        const auto appendList = [&](std::string_view key, const auto& append) {
+            out += key;
+            out += '[';
+            const std::size_t begin = out.size();
+            for (const auto& entry : changes->log) append(entry, out.size() == begin ? "" : ",");
+            out += ']';
+        };
+        appendList(R"({"updated":)", [&](const ChangesBatch::Entry& entry, std::string_view comma) {
+            if (!entry.item) return;
+            out += comma;
+            writer.append(out, *entry.item);
+        });
+        appendList(R"(,"deleted":)", [&](const ChangesBatch::Entry& entry, std::string_view comma) {
+            if (entry.item) return;
+            out += comma;
+            appendJsonString(out, entry.identifier);
+        });
+        out += R"(,"anchor":")";
+        appendBase64(out, changes->anchor);
+        out += changes->moreComing ? R"(","moreComing":true)" : R"(","moreComing":false)";
+        appendList(R"(,"log":)", [&](const ChangesBatch::Entry& entry, std::string_view comma) {
+            out += comma;
+            out += entry.item ? R"(["u",)" : R"(["d",)";
+            appendJsonString(out, entry.identifier);
+            out += ']';
+        });
+        out += '}';
+    });
+}
+
+void enumerateChanges(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const Params given(params, *reply);
+    const auto container = given.string("container");
+    if (!container) return;
+    const auto anchor = given.base64("anchor");
+    if (!anchor) return;
+    context.client.enumerateChanges(*container, *anchor,
+                                    [reply, &paths = context.paths](const Result<ChangesBatch>& changes) {
+                                        answerChanges(*reply, changes, paths);
+                                    });
+}
+
+void startMonitoring(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const auto container = Params(params, *reply).string("container");
+    if (!container) return;
+    const auto started = context.monitor.start(*container);
+    if (!started.ok()) return answerWithError(*reply, started.error(), context.paths);
+    reply->result([](std::string& out) { out += "{}"; });
+}
+
+void stopMonitoring(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const auto container = Params(params, *reply).string("container");
+    if (!container) return;
+    context.monitor.stop(*container);
+    reply->result([](std::string& out) { out += "{}"; });
+}
+
 void defaultContainer(const HostMethodsContext& context, const Json& params, const Reply& reply) {
     const auto bundleIdentifier = Params(params, *reply).string("bundleIdentifier");
     if (!bundleIdentifier) return;
@@ -222,6 +285,9 @@ JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context) {
         {"identifierForItemAtURL", identifierForItemAtURL},
         {"enumerateItems", enumerateItems},
         {"currentSyncAnchor", currentSyncAnchor},
+        {"enumerateChanges", enumerateChanges},
+        {"startMonitoring", startMonitoring},
+        {"stopMonitoring", stopMonitoring},
         {"defaultContainer", defaultContainer},
         {"status", status},
     };

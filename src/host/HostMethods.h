@@ -3,6 +3,7 @@
 #include <functional>
 #include <string>
 
+#include "host/ContainerMonitor.h"
 #include "host/JsonRpcServer.h"
 #include "host/PresentedPaths.h"
 #include "host/ProviderClient.h"
@@ -12,6 +13,7 @@ namespace cindral {
 /// What the methods of one client work with. Borrowed for as long as a method may run.
 struct HostMethodsContext {
     ProviderClient& client;
+    ContainerMonitor& monitor;
     const PresentedPaths& paths;
     std::function<std::string()> statusText;  ///< as JSON
 };

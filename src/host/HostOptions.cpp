@@ -34,6 +34,7 @@ struct Words {
     bool noFlatpak = false;
     bool json = false;
     bool intoPackages = false;
+    std::string since;
     std::string item;
 };
 
@@ -54,6 +55,10 @@ constexpr CommandDescription kCommands[] = {
     {"url", "Print the URL of an item.", HostCommand::url, Argument::item},
     {"id", "Print the identifier of the item at a path.", HostCommand::id, Argument::path},
     {"anchor", "Print the current sync anchor of a container, in base64.", HostCommand::anchor, Argument::optionalItem},
+    {"changes", "Print what has changed in a container since an anchor, and the anchor that follows.",
+     HostCommand::changes, Argument::optionalItem},
+    {"watch", "Print what changes in a container, a line each, until it is interrupted.", HostCommand::watch,
+     Argument::optionalItem},
     {"status", "Show where the host works and what it knows.", HostCommand::status, Argument::none},
     {"rpc", "Speak JSON-RPC 2.0 on standard input and output, one message a line.", HostCommand::rpc, Argument::none},
 };
@@ -113,6 +118,9 @@ void addCommands(CLI::App& app, Words& words) {
         if (description.command == HostCommand::tree) {
             command->add_flag("--packages", words.intoPackages, "Also show what is in packages.");
         }
+        if (description.command == HostCommand::changes) {
+            command->add_option("--since", words.since, "The anchor, in base64.")->type_name("ANCHOR")->required();
+        }
     }
 }
 
@@ -144,6 +152,7 @@ HostOptions optionsOf(const CLI::App& app, const Words& words, const HostEnviron
     options.recorder = recorderOf(words.recorder);
     options.json = words.json;
     options.intoPackages = words.intoPackages;
+    options.since = words.since;
     return options;
 }
 

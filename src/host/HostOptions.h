@@ -10,7 +10,7 @@
 
 namespace cindral {
 
-enum class HostCommand { ls, tree, info, url, id, anchor, status, rpc };
+enum class HostCommand { ls, tree, info, url, id, anchor, changes, watch, status, rpc };
 enum class RecorderChoice { automatic, inotify, fanotify };
 /// "auto", "inotify", "fanotify".
 std::string_view recorderChoiceName(RecorderChoice choice);
@@ -28,6 +28,7 @@ struct HostOptions {
     RecorderChoice recorder = RecorderChoice::automatic;
     bool json = false;
     bool intoPackages = false;  ///< tree
+    std::string since;          ///< changes: an anchor, as printed
 };
 
 /// What there is to say instead of working: help, the version, or what is wrong with the call's words.

@@ -21,19 +21,6 @@ namespace {
 
 constexpr const char* kOwnBundleIdentifier = "com.vemra.CindralStorage";
 
-/// What a provider may ask of this host. Nobody monitors a container yet and there is no search index, so a signal
-/// has nobody to reach and a deletion nothing to delete: both are done as soon as they are asked for.
-class Signals final : public TesselManager::Host {
-public:
-    void signalEnumerator(const TesselItemIdentifier& /*container*/, TesselManager::Completion completion) override {
-        if (completion) completion(std::nullopt);
-    }
-    void deleteSearchableItems(const std::vector<std::string>& /*domains*/,
-                               TesselManager::Completion completion) override {
-        if (completion) completion(std::nullopt);
-    }
-};
-
 Result<std::shared_ptr<VolumeStore>> openStore(const std::string& state) {
     auto store = VolumeStore::open(state + "/store");
     if (store.ok()) return std::shared_ptr<VolumeStore>(*std::move(store));
@@ -88,6 +75,8 @@ Recorder::Choice recorderChoice(RecorderChoice choice) {
 bool records(HostCommand command) {
     switch (command) {
         case HostCommand::anchor:
+        case HostCommand::changes:
+        case HostCommand::watch:
         case HostCommand::status:
         case HostCommand::rpc: return true;
         case HostCommand::ls:
@@ -151,7 +140,7 @@ Result<void> HostProcess::connect() {
     }
     RoApplicationWorkspace::defaultWorkspace().setOwnRecord(ownRecord(paths_));
     TesselManager::defaultManager().setDocumentStorageURL(KsURL::fileURL(paths_.presented()));
-    TesselManager::defaultManager().setHost(std::make_shared<Signals>());
+    TesselManager::defaultManager().setHost(signals_);
     if (records(options_.command)) startRecorder();
     return {};
 }

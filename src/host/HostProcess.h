@@ -5,6 +5,7 @@
 
 #include "host/HostOptions.h"
 #include "host/PresentedPaths.h"
+#include "host/SignalDispatcher.h"
 #include "platform/eventstream/Recorder.h"
 #include "platform/foundation/Result.h"
 #include "platform/revisions/VolumeStore.h"
@@ -30,6 +31,9 @@ public:
     const PresentedPaths& paths() const { return paths_; }
     const std::shared_ptr<TesselExtension>& provider() const { return provider_; }
 
+    /// Where the provider's signals arrive.
+    SignalDispatcher& signals() const { return *signals_; }
+
     /// Returns when the roots have been read or compared.
     void waitForHistory() const;
     /// What `status` answers, as JSON text.
@@ -43,6 +47,7 @@ private:
     const HostOptions options_;
     const PresentedPaths paths_;
     const std::string state_;
+    const std::shared_ptr<SignalDispatcher> signals_ = std::make_shared<SignalDispatcher>();
     std::shared_ptr<VolumeStore> store_;
     std::shared_ptr<Recorder> recorder_;  // Null for commands that don't ask for changes.
     std::shared_ptr<TesselExtension> provider_;

@@ -9,6 +9,7 @@
 #include "host/HostOptions.h"
 #include "host/HostProcess.h"
 #include "host/RpcConnection.h"
+#include "host/StopSignals.h"
 #include "host/TerminalText.h"
 #include "host/TextOutput.h"
 #include "platform/foundation/Log.h"
@@ -34,8 +35,8 @@ int outputFailure(const KsError& error) {
 }
 
 int runRpc(const HostProcess& host) {
-    const auto served =
-        serveRpc(STDIN_FILENO, STDOUT_FILENO, host.provider(), host.paths(), [&] { return host.statusText(); });
+    const auto served = serveRpc(STDIN_FILENO, STDOUT_FILENO,
+                                 {host.provider(), host.paths(), host.signals(), [&] { return host.statusText(); }});
     if (!served.ok()) return failWith(hostFailure(fmt::format("the connection broke: {}", served.error().reason())));
     return kExitDone;
 }
@@ -47,7 +48,13 @@ int runCommand(const HostProcess& host, const HostEnvironment& environment) {
         host.waitForHistory();
         return host.statusText();
     };
-    Commands commands({client, host.paths(), host.options(), environment, statusText}, output);
+    std::unique_ptr<StopSignals> stopSignals;
+    const auto stopDescriptor = [&]() -> Result<int> {
+        stopSignals = TRY(StopSignals::catchThem());
+        return stopSignals->descriptor();
+    };
+    Commands commands({client, host.paths(), host.options(), environment, statusText, host.signals(), stopDescriptor},
+                      output);
     const auto done = commands.run();
     // What was found before something went wrong is shown before the line that says what.
     if (const auto error = output.finish()) return outputFailure(*error);

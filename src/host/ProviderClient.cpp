@@ -13,6 +13,9 @@ bool isKept(const TesselItemIdentifier& container) {
            container == kTesselAllDirectoriesContainerItemIdentifier;
 }
 
+// Times that changes are asked for when the enumeration is cut short.
+constexpr int kAttemptsMax = 5;
+
 /// Collects a page, and answers once. One that is dropped without an end answers with ECANCELED.
 class PageCollector final : public TesselEnumerationObserver {
 public:
@@ -42,6 +45,47 @@ private:
     ItemsPage page_;
 };
 
+/// Collects changes, and answers once. One that is dropped without an end answers with ECANCELED.
+class ChangesCollector final : public TesselChangeObserver {
+public:
+    /// `retry` is called instead of the completion when the enumeration was cut short.
+    ChangesCollector(ProviderClient::ChangesCompletion completion,
+                     std::function<void(ProviderClient::ChangesCompletion)> retry)
+        : completion_(std::move(completion)), retry_(std::move(retry)) {}
+    ~ChangesCollector() override { finish(KsError::posix(ECANCELED)); }
+
+    void didUpdateItems(TesselItems items) override {
+        for (auto& item : items) {
+            TesselItemIdentifier identifier = item->itemIdentifier();
+            batch_.log.push_back({std::move(item), std::move(identifier)});
+        }
+    }
+    void didDeleteItemsWithIdentifiers(std::vector<TesselItemIdentifier> identifiers) override {
+        for (auto& identifier : identifiers) batch_.log.push_back({nullptr, std::move(identifier)});
+    }
+    void finishEnumeratingChangesUpToSyncAnchor(TesselSyncAnchor anchor, bool moreComing) override {
+        batch_.anchor = std::move(anchor);
+        batch_.moreComing = moreComing;
+        finish(std::move(batch_));
+    }
+    void finishEnumeratingWithError(const KsError& error) override {
+        if (error.isPosix(ECANCELED) && retry_ && completion_) {
+            retry_(std::exchange(completion_, nullptr));
+        } else {
+            finish(error);
+        }
+    }
+
+private:
+    void finish(Result<ChangesBatch> result) {
+        if (auto completion = std::exchange(completion_, nullptr)) completion(std::move(result));
+    }
+
+    ProviderClient::ChangesCompletion completion_;
+    const std::function<void(ProviderClient::ChangesCompletion)> retry_;
+    ChangesBatch batch_;
+};
+
 /// Waits for a completion's value.
 template <typename Value>
 class Awaited {
@@ -68,56 +112,156 @@ private:
 
 }  // namespace
 
-/// An enumerator for the time of one request. One that is not kept is invalidated when the call has returned and the
-/// request is answered, whichever comes later, and never from within a call of the enumerator's.
-class ProviderClient::Use {
+/// An enumerator that is invalidated when nobody needs it any more: not here, not on this thread, because that may be
+/// within a call of the enumerator's.
+class ProviderClient::Handle {
 public:
-    Use(std::shared_ptr<TesselEnumerator> enumerator, DispatchGroup* invalidations)
+    Handle(std::shared_ptr<TesselEnumerator> enumerator, DispatchGroup& invalidations)
         : enumerator_(std::move(enumerator)), invalidations_(invalidations) {}
+    ~Handle() {
+        if (!enumerator_) return;
+        invalidations_.enter();
+        dispatchAsync([enumerator = std::move(enumerator_), &group = invalidations_]() mutable {
+            enumerator->invalidate();
+            enumerator.reset();
+            group.leave();
+        });
+    }
+    Handle(const Handle&) = delete;
+    Handle& operator=(const Handle&) = delete;
 
     TesselEnumerator& enumerator() { return *enumerator_; }
+    /// For the last who has the handle, and not within a call of the enumerator's.
+    void invalidateNow() {
+        enumerator_->invalidate();
+        enumerator_.reset();
+    }
+
+private:
+    std::shared_ptr<TesselEnumerator> enumerator_;
+    DispatchGroup& invalidations_;
+};
+
+/// An enumerator for the time of one request: until the call has returned and the request is answered, whichever comes
+/// later.
+class ProviderClient::Use {
+public:
+    explicit Use(std::shared_ptr<Handle> handle) : handle_(std::move(handle)) {}
+
+    TesselEnumerator& enumerator() { return handle_->enumerator(); }
 
     void callReturned() {
-        if (isLast() && invalidations_ != nullptr) enumerator_->invalidate();
+        if (!isLast()) return;
+        // Mostly the request was answered within the call, and nobody else has the enumerator.
+        if (handle_.use_count() == 1) handle_->invalidateNow();
+        handle_.reset();
     }
     /// Lets go of the use: once answered, the client and all it holds may be on their way out.
     static void answered(std::shared_ptr<Use>& use) {
         const std::shared_ptr<Use> last = std::move(use);
-        if (!last->isLast() || last->invalidations_ == nullptr) return;
-        last->invalidations_->enter();
-        dispatchAsync([enumerator = last->enumerator_, group = last->invalidations_]() mutable {
-            enumerator->invalidate();
-            enumerator.reset();
-            group->leave();
-        });
+        if (last->isLast()) last->handle_.reset();
     }
 
 private:
     bool isLast() { return pending_.fetch_sub(1) == 1; }
 
-    const std::shared_ptr<TesselEnumerator> enumerator_;
-    DispatchGroup* const invalidations_;  // Null for one that is kept.
+    std::shared_ptr<Handle> handle_;
     std::atomic<int> pending_ = 2;
 };
 
 ProviderClient::~ProviderClient() {
+    std::map<TesselItemIdentifier, std::shared_ptr<Handle>> kept;
+    {
+        const MutexLock lock(mutex_);
+        kept.swap(kept_);
+        kept.merge(monitored_);
+    }
+    kept.clear();
     invalidations_.wait();
-    const MutexLock lock(mutex_);
-    for (const auto& [container, enumerator] : kept_) enumerator->invalidate();
+}
+
+Result<std::shared_ptr<ProviderClient::Handle>> ProviderClient::enumerator(const TesselItemIdentifier& container) {
+    return std::make_shared<Handle>(TRY(provider_->enumeratorForContainerItemIdentifier(container)), invalidations_);
 }
 
 Result<std::shared_ptr<ProviderClient::Use>> ProviderClient::use(const TesselItemIdentifier& container) {
-    if (isKept(container)) return std::make_shared<Use>(TRY(keptEnumerator(container)), nullptr);
-    return std::make_shared<Use>(TRY(provider_->enumeratorForContainerItemIdentifier(container)), &invalidations_);
+    return std::make_shared<Use>(TRY(isKept(container) ? keptEnumerator(container) : enumerator(container)));
 }
 
-Result<std::shared_ptr<TesselEnumerator>> ProviderClient::keptEnumerator(const TesselItemIdentifier& container) {
+Result<std::shared_ptr<ProviderClient::Handle>> ProviderClient::keptEnumerator(const TesselItemIdentifier& container) {
     const MutexLock lock(mutex_);
     const auto found = kept_.find(container);
     if (found != kept_.end()) return found->second;
-    auto enumerator = TRY(provider_->enumeratorForContainerItemIdentifier(container));
-    kept_.emplace(container, enumerator);
-    return enumerator;
+    auto handle = TRY(enumerator(container));
+    kept_.emplace(container, handle);
+    return handle;
+}
+
+Result<void> ProviderClient::startMonitoring(const TesselItemIdentifier& container) {
+    std::shared_ptr<Handle> handle = TRY(isKept(container) ? keptEnumerator(container) : enumerator(container));
+    handle->enumerator().start();
+    if (isKept(container)) return {};
+    const MutexLock lock(mutex_);
+    monitored_[container].swap(handle);
+    return {};
+}
+
+void ProviderClient::stopMonitoring(const TesselItemIdentifier& container) {
+    std::shared_ptr<Handle> handle;
+    {
+        const MutexLock lock(mutex_);
+        if (const auto kept = kept_.find(container); kept != kept_.end()) {
+            handle = kept->second;
+        } else if (const auto monitored = monitored_.find(container); monitored != monitored_.end()) {
+            handle = std::move(monitored->second);
+            monitored_.erase(monitored);
+        }
+    }
+    // Others may be using it for a request, which then goes on by itself.
+    if (handle) handle->enumerator().stop();
+}
+
+void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor,
+                                      ChangesCompletion completion) {
+    enumerateChanges(container, anchor, kAttemptsMax, std::move(completion));
+}
+
+void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor,
+                                      int attempts, ChangesCompletion completion) {
+    auto made = isKept(container) ? keptEnumerator(container) : enumerator(container);
+    if (!made.ok()) {
+        completion(std::move(made).error());
+        return;
+    }
+    if (!isKept(container)) {
+        std::shared_ptr<Handle> before;
+        {
+            const MutexLock lock(mutex_);
+            // What is monitored from now on is where the folder is now, and knows that the client has come.
+            if (const auto monitored = monitored_.find(container); monitored != monitored_.end())
+                before = std::exchange(monitored->second, *made);
+        }
+        if (before) (*made)->enumerator().start();
+    }
+    auto use = std::make_shared<Use>(*std::move(made));
+    std::function<void(ChangesCompletion)> retry;
+    if (attempts > 1) {
+        // Whoever stopped the enumeration meant something else: that the container is no longer monitored.
+        retry = [this, container, anchor, attempts](ChangesCompletion again) {
+            dispatchAsync([this, container, anchor, attempts, again = std::move(again)]() mutable {
+                enumerateChanges(container, anchor, attempts - 1, std::move(again));
+            });
+        };
+    }
+    use->enumerator().enumerateChangesForObserver(
+        std::make_shared<ChangesCollector>(
+            [use, completion = std::move(completion)](Result<ChangesBatch> result) mutable {
+                Use::answered(use);
+                completion(std::move(result));
+            },
+            std::move(retry)),
+        anchor);
+    use->callReturned();
 }
 
 void ProviderClient::enumerateItems(const TesselItemIdentifier& container, const TesselPage& page,
@@ -161,6 +305,13 @@ Result<ItemsPage> ProviderClient::itemsOnPage(const TesselItemIdentifier& contai
 Result<std::optional<TesselSyncAnchor>> ProviderClient::anchor(const TesselItemIdentifier& container) {
     Awaited<Result<std::optional<TesselSyncAnchor>>> awaited;
     currentSyncAnchor(container, awaited.completion());
+    return awaited.wait();
+}
+
+Result<ChangesBatch> ProviderClient::changesSince(const TesselItemIdentifier& container,
+                                                  const TesselSyncAnchor& anchor) {
+    Awaited<Result<ChangesBatch>> awaited;
+    enumerateChanges(container, anchor, awaited.completion());
     return awaited.wait();
 }
 

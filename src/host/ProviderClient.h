@@ -17,11 +17,23 @@ struct ItemsPage {
     std::optional<TesselPage> nextPage;  ///< none: the listing is over
 };
 
+/// What one enumeration of changes said.
+struct ChangesBatch {
+    struct Entry {
+        /// An update; null for a deletion.
+        std::shared_ptr<const TesselItem> item;
+        TesselItemIdentifier identifier;
+    };
+    std::vector<Entry> log;  ///< in the order in which the provider sent it
+    TesselSyncAnchor anchor;
+    bool moreComing = false;
+};
+
 /// One client's way to a provider: a connection's, or a command's.
 ///
 /// A container is looked up anew at each request, so that a folder that was renamed meanwhile goes on. The containers
 /// that stand for many folders (root, working set, all directories) keep their enumerator for as long as the client
-/// lives.
+/// lives. So does a folder that is monitored: each request for its changes looks it up anew, and monitors what it found.
 ///
 /// Thread safety: all operations, from any thread. Completions run on any thread, once.
 class ProviderClient {
@@ -40,20 +52,34 @@ public:
     using AnchorCompletion = std::function<void(Result<std::optional<TesselSyncAnchor>>)>;
     void currentSyncAnchor(const TesselItemIdentifier& container, AnchorCompletion completion);
 
+    using ChangesCompletion = std::function<void(Result<ChangesBatch>)>;
+    void enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor,
+                          ChangesCompletion completion);
+
+    /// Until stopMonitoring(), an enumerator of the container is kept that has it signalled. Twice is once.
+    Result<void> startMonitoring(const TesselItemIdentifier& container);
+    void stopMonitoring(const TesselItemIdentifier& container);
+
     /// The same for a caller that has nothing else to do.
     Result<ItemsPage> itemsOnPage(const TesselItemIdentifier& container, const TesselPage& page);
     Result<std::optional<TesselSyncAnchor>> anchor(const TesselItemIdentifier& container);
+    Result<ChangesBatch> changesSince(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor);
 
 private:
+    class Handle;
     class Use;
     Result<std::shared_ptr<Use>> use(const TesselItemIdentifier& container);
-    Result<std::shared_ptr<TesselEnumerator>> keptEnumerator(const TesselItemIdentifier& container);
+    Result<std::shared_ptr<Handle>> enumerator(const TesselItemIdentifier& container);
+    Result<std::shared_ptr<Handle>> keptEnumerator(const TesselItemIdentifier& container);
+    void enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor, int attempts,
+                          ChangesCompletion completion);
 
     const std::shared_ptr<TesselExtension> provider_;
     DispatchGroup invalidations_;
 
     Mutex mutex_;
-    std::map<TesselItemIdentifier, std::shared_ptr<TesselEnumerator>> kept_ GUARDED_BY(mutex_);
+    std::map<TesselItemIdentifier, std::shared_ptr<Handle>> kept_ GUARDED_BY(mutex_);
+    std::map<TesselItemIdentifier, std::shared_ptr<Handle>> monitored_ GUARDED_BY(mutex_);  ///< folders
 };
 
 }  // namespace cindral

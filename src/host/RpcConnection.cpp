@@ -2,8 +2,10 @@
 
 #include <vector>
 
+#include "host/ContainerMonitor.h"
 #include "host/Descriptor.h"
 #include "host/HostMethods.h"
+#include "host/JsonText.h"
 #include "host/LineOutput.h"
 #include "host/LineSplitter.h"
 
@@ -24,6 +26,13 @@ private:
     JsonRpcServer& server_;
 };
 
+/// The notification that something in a container has changed.
+std::string signalLine(const TesselItemIdentifier& container) {
+    std::string line = R"({"jsonrpc":"2.0","method":"signal","params":{"container":)";
+    appendJsonString(line, container);
+    return line + "}}\n";
+}
+
 /// Reads until the end of input, or until nobody reads the answers.
 Result<void> readAll(int input, int output, const UniqueFd& interrupt, LineSplitter& lines) {
     std::vector<char> buffer(kReadBytes);
@@ -40,15 +49,16 @@ Result<void> readAll(int input, int output, const UniqueFd& interrupt, LineSplit
 
 }  // namespace
 
-Result<void> serveRpc(int input, int output, const std::shared_ptr<TesselExtension>& provider,
-                      const PresentedPaths& paths, const std::function<std::string()>& statusText) {
+Result<void> serveRpc(int input, int output, const RpcService& service) {
     const UniqueFd interrupt = TRY(descriptor::makeInterrupt());
     descriptor::enlargePipe(output, kPipeBytes);
     LineOutput answers(output, interrupt);
-    // Taken down from the last to the first: the server waits for its requests, then the client lets go of its
-    // enumerators.
-    ProviderClient client(provider);
-    JsonRpcServer server(makeHostMethods({client, paths, statusText}),
+    // Taken down from the last to the first: the server waits for its requests, then nothing is monitored any more, and
+    // the client lets go of its enumerators.
+    ProviderClient client(service.provider);
+    ContainerMonitor monitor(client, service.signals,
+                             [&](const TesselItemIdentifier& container) { answers.write(signalLine(container)); });
+    JsonRpcServer server(makeHostMethods({client, monitor, service.paths, service.statusText}),
                          [&](std::string_view line) { answers.write(line); });
     Receiver receiver(server);
     LineSplitter lines(receiver, kJsonRpcLineBytesMax);

@@ -5,16 +5,25 @@
 #include <string>
 
 #include "host/PresentedPaths.h"
+#include "host/SignalDispatcher.h"
 #include "platform/foundation/Result.h"
 #include "platform/tessel/TesselExtension.h"
 
 namespace cindral {
 
-/// Serves one client on a pair of descriptors until its input ends, or it no longer reads.
+/// What a connection is served from. Borrowed for the call.
+struct RpcService {
+    const std::shared_ptr<TesselExtension>& provider;
+    const PresentedPaths& paths;
+    SignalDispatcher& signals;
+    std::function<std::string()> statusText;
+};
+
+/// Serves one client on a pair of descriptors until its input ends, or it no longer reads. What the client monitors is
+/// told on the same line as the answers, as notifications, until the end of its input.
 ///
 /// At the end of input what is under way is answered before this returns. A client that has stopped reading is no
 /// error; output that can't be written for another reason is.
-Result<void> serveRpc(int input, int output, const std::shared_ptr<TesselExtension>& provider,
-                      const PresentedPaths& paths, const std::function<std::string()>& statusText);
+Result<void> serveRpc(int input, int output, const RpcService& service);
 
 }  // namespace cindral

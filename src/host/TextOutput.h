@@ -26,6 +26,11 @@ public:
     /// The same for text that was appended to buffer().
     void endLine();
     std::string& buffer() { return buffer_; }
+    /// Writes what there is: nothing more may come for a while.
+    void flush();
+
+    /// What is written to.
+    int descriptor() const { return fd_; }
 
     /// Nothing that is printed from now on arrives: there is no use in working on.
     bool isBroken() const { return isBroken_; }
@@ -34,8 +39,6 @@ public:
     std::optional<KsError> finish();
 
 private:
-    void flush();
-
     const int fd_;
     const std::size_t bufferBytesMax_;
     std::string buffer_;

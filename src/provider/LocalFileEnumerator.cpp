@@ -39,10 +39,10 @@ EnumeratorOptions pageOptions(const TesselItemIdentifier& container, const std::
     return options;
 }
 
-/// The event history, where it can tell what happened since the event.
+/// The event history, where it can tell what happened since the event without a wait for the first look at the roots.
 std::shared_ptr<EventHistory> historyAfter(std::uint64_t eventID) {
     auto history = EventHistory::shared();
-    return history && history->canReplayAfter(eventID) ? history : nullptr;
+    return history && history->isReady() && history->canReplayAfter(eventID) ? history : nullptr;
 }
 
 /// False, after an error line, when what was complete before the call may not be in the history.
@@ -168,7 +168,7 @@ bool LocalFileEnumerator::settle(FSChangeToken& token) const {
 /// that ends with its first page needs no witness.
 Result<void> LocalFileEnumerator::witness(FSChangeToken& token, const Gathered& gathered) const {
     const bool isFirst = token.offset == 0;
-    if ((isFirst && !gathered.isFull) || historyAfter(token.streamEventID)) return {};
+    if (isFirst && (!gathered.isFull || historyAfter(token.streamEventID))) return {};
     std::vector<const DirectoryReference*> folders;
     for (const KsURL& entry : gathered.entries) {
         if (folders.empty() || folders.back() != entry.directory().get()) folders.push_back(entry.directory().get());

@@ -12,6 +12,7 @@
 #include <fstream>
 #include <nlohmann/json.hpp>
 
+#include "host/Descriptor.h"
 #include "host/FakeProvider.h"
 #include "host/HostError.h"
 #include "support/TemporaryFolder.h"
@@ -56,7 +57,8 @@ protected:
         options_.item = std::move(item);
         ProviderClient client(provider_);
         const auto done = Commands({client, paths_, options_, environment_,
-                                    [] { return std::string(R"({"version":"1","events":0})"); }},
+                                    [] { return std::string(R"({"version":"1","events":0})"); }, signals_,
+                                    [this]() -> Result<int> { return stop_.get(); }},
                                    output)
                               .run();
         failure_ = done.ok() ? "" : messageOf(done.error());
@@ -77,6 +79,8 @@ protected:
     const std::shared_ptr<test::FakeProvider> provider_ = std::make_shared<test::FakeProvider>();
     HostEnvironment environment_;
     HostOptions options_;
+    SignalDispatcher signals_;
+    const UniqueFd stop_ = *descriptor::makeInterrupt();
     std::string failure_;
 };
 

@@ -54,7 +54,7 @@ protected:
     }
 
     FakeItem& item(const std::string& identifier, const std::string& name) {
-        FakeItem& made = provider_->document(identifier, name);
+        FakeItem& made = fake_->document(identifier, name);
         made.url = KsURL::fileURL(presented_ + "/" + name);
         return made;
     }
@@ -84,12 +84,14 @@ protected:
             input.writeEnd.reset();
         });
         std::thread reader([&] { text = readToEnd(output.readEnd.get()); });
-        served_ = serveRpc(input.readEnd.get(), output.writeEnd.get(), provider_, paths_,
-                           [] { return std::string(R"({"version":"x"})"); });
+        served_ = serveRpc(input.readEnd.get(), output.writeEnd.get(), service());
         output.writeEnd.reset();
         writer.join();
         reader.join();
         return text;
+    }
+    RpcService service() {
+        return {provider_, paths_, signals_, [] { return std::string(R"({"version":"x"})"); }};
     }
     Json answer(const std::string& method, const Json& params) {
         const Json request{{"jsonrpc", "2.0"}, {"id", 1}, {"method", method}, {"params", params}};
@@ -106,7 +108,9 @@ protected:
     const std::string real_ = root_ + "/data";
     const std::string presented_ = "/nowhere/Documents";
     const PresentedPaths paths_{real_, real_, presented_};
-    const std::shared_ptr<test::FakeProvider> provider_ = std::make_shared<test::FakeProvider>();
+    const std::shared_ptr<test::FakeProvider> fake_ = std::make_shared<test::FakeProvider>();
+    const std::shared_ptr<TesselExtension> provider_ = fake_;
+    SignalDispatcher signals_;
     Result<void> served_;
 };
 
@@ -129,7 +133,7 @@ TEST_F(RpcConnectionTest, tellsOfAnUnknownContainer) {
 }
 
 TEST_F(RpcConnectionTest, tellsPathsOfErrorsAsClientsKnowThem) {
-    provider_->listingErrors.emplace("fid=2", KsError::posix(EACCES, presented_ + "/folder"));
+    fake_->listingErrors.emplace("fid=2", KsError::posix(EACCES, presented_ + "/folder"));
     const Json error = this->error("enumerateItems", {{"container", "fid=2"}});
     EXPECT_EQ(error["data"], (Json{{"domain", "KsPOSIXErrorDomain"}, {"code", EACCES}, {"path", real_ + "/folder"}}));
     EXPECT_EQ(error["message"], "Permission denied");
@@ -161,8 +165,8 @@ TEST_F(RpcConnectionTest, refusesPathsAndURLsThatNameNoFileHere) {
 }
 
 TEST_F(RpcConnectionTest, listsAContainerPageByPage) {
-    provider_->folder("fid=20", "many");
-    provider_->documents(7, "fid=20");
+    fake_->folder("fid=20", "many");
+    fake_->documents(7, "fid=20");
     std::vector<std::string> names;
     Json params{{"container", "fid=20"}};
     while (true) {
@@ -190,7 +194,7 @@ TEST_F(RpcConnectionTest, refusesPagesThatAreNotBase64) {
 }
 
 TEST_F(RpcConnectionTest, tellsOfAnExpiredPage) {
-    provider_->expiries = 1;
+    fake_->expiries = 1;
     EXPECT_EQ(error("enumerateItems", {{"container", "fid=2"}, {"page", "Mw=="}})["data"],
               (Json{{"domain", "TesselErrorDomain"}, {"code", -1002}}));
 }
@@ -204,7 +208,7 @@ TEST_F(RpcConnectionTest, findsTheAnchorOfAContainer) {
 }
 
 TEST_F(RpcConnectionTest, findsAnApplicationsContainer) {
-    provider_->document("#com.example.notes", "Notes");
+    fake_->document("#com.example.notes", "Notes");
     EXPECT_EQ(result("defaultContainer", {{"bundleIdentifier", "com.example.notes"}})["identifier"],
               "#com.example.notes");
     const Json error = this->error("defaultContainer", {{"bundleIdentifier", "none"}});
@@ -217,10 +221,9 @@ TEST_F(RpcConnectionTest, answersStatus) {
 }
 
 TEST_F(RpcConnectionTest, refusesMethodsThatAreNotThere) {
-    for (const char* method :
-         {"enumerateChanges", "startMonitoring", "stopMonitoring", "importDocument", "createDirectory", "renameItem",
-          "reparentItem", "deleteItem", "trashItem", "untrashItem", "removeTrashedItemsOlderThan", "setLastUsedDate",
-          "setTags", "setFavoriteRank", "fetchThumbnails", "cancel", "", "itemforidentifier"}) {
+    for (const char* method : {"importDocument", "createDirectory", "renameItem", "reparentItem", "deleteItem",
+                               "trashItem", "untrashItem", "removeTrashedItemsOlderThan", "setLastUsedDate", "setTags",
+                               "setFavoriteRank", "fetchThumbnails", "cancel", "", "itemforidentifier"}) {
         EXPECT_EQ(error(method, Json::object())["code"], -32601) << method;
     }
 }
@@ -244,7 +247,7 @@ TEST_F(RpcConnectionTest, livesOnAfterLinesThatAreNoRequests) {
 }
 
 TEST_F(RpcConnectionTest, answersWhatIsUnderWayAtTheEndOfInput) {
-    provider_->isAsynchronous = true;
+    fake_->isAsynchronous = true;
     std::string lines;
     for (int i = 0; i < 500; ++i) {
         lines += fmt::format(R"({{"jsonrpc":"2.0","id":{},"method":"enumerateItems","params":{{"container":"{}"}}}})",
@@ -253,8 +256,8 @@ TEST_F(RpcConnectionTest, answersWhatIsUnderWayAtTheEndOfInput) {
     }
     EXPECT_EQ(answersTo(lines).size(), 500U);
     EXPECT_TRUE(served_.ok());
-    EXPECT_EQ(provider_->enumeratorsInvalidated, provider_->enumeratorsMade);
-    EXPECT_EQ(provider_->enumeratorsMade, 251);
+    EXPECT_EQ(fake_->enumeratorsInvalidated, fake_->enumeratorsMade);
+    EXPECT_EQ(fake_->enumeratorsMade, 251);
 }
 
 TEST_F(RpcConnectionTest, endsQuietlyWhenNobodyReadsAnswers) {
@@ -265,8 +268,7 @@ TEST_F(RpcConnectionTest, endsQuietlyWhenNobodyReadsAnswers) {
     const std::string line = R"({"jsonrpc":"2.0","id":1,"method":"status"})"
                              "\n";
     ASSERT_TRUE(descriptor::writeAll(input.writeEnd.get(), line).ok());
-    EXPECT_TRUE(
-        serveRpc(input.readEnd.get(), output.writeEnd.get(), provider_, paths_, [] { return std::string("{}"); }).ok());
+    EXPECT_TRUE(serveRpc(input.readEnd.get(), output.writeEnd.get(), service()).ok());
 }
 
 TEST_F(RpcConnectionTest, tellsOfOutputThatCannotBeWritten) {
@@ -275,7 +277,7 @@ TEST_F(RpcConnectionTest, tellsOfOutputThatCannotBeWritten) {
     const std::string line = R"({"jsonrpc":"2.0","id":1,"method":"status"})"
                              "\n";
     ASSERT_TRUE(descriptor::writeAll(input.writeEnd.get(), line).ok());
-    const auto served = serveRpc(input.readEnd.get(), full.get(), provider_, paths_, [] { return std::string("{}"); });
+    const auto served = serveRpc(input.readEnd.get(), full.get(), service());
     ASSERT_FALSE(served.ok());
     EXPECT_TRUE(served.error().isPosix(ENOSPC));
 }

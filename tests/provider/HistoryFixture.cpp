@@ -89,15 +89,25 @@ std::uint64_t HistoryTest::changed(std::string_view name) {
     event.path = storage_ / name;
     event.fileID = FileID{fileID(name)};
     event.documentID = documentID(name);
+    event.kind = kindOf(name);
     return history_->add(std::move(event));
 }
 
-std::uint64_t HistoryTest::left(std::string_view name, std::uint64_t fileID, DocumentID documentID) {
+ObjectKind HistoryTest::kindOf(std::string_view name) const {
+    const KsURL named = url(name);
+    const auto status = named.status();
+    if (!status.ok() || !(status->isDirectory() || status->isRegular())) return ObjectKind::other;
+    if (status->isRegular()) return ObjectKind::file;
+    return named.ts_isFolder() ? ObjectKind::folder : ObjectKind::package;
+}
+
+std::uint64_t HistoryTest::left(std::string_view name, std::uint64_t fileID, ObjectKind kind, DocumentID documentID) {
     Event event;
     event.path = storage_ / name;
     event.flags = EventFlags::removed;
     event.fileID = FileID{fileID};
     event.documentID = documentID;
+    event.kind = kind;
     return history_->add(std::move(event));
 }
 
@@ -112,9 +122,10 @@ std::uint64_t HistoryTest::documentWent(DocumentID document, std::uint64_t sourc
 void HistoryTest::move(std::string_view from, std::string_view to) {
     const std::uint64_t moved = fileID(from);
     const DocumentID document = documentID(from);
+    const ObjectKind kind = kindOf(from);
     ASSERT_EQ(std::rename((storage_ / from).c_str(), (storage_ / to).c_str()), 0);
     record(to);
-    left(from, moved, document);
+    left(from, moved, kind, document);
     changed(to);
     folderChanged(from);
     folderChanged(to);
@@ -133,8 +144,9 @@ void HistoryTest::made(std::string_view name) {
 void HistoryTest::remove(std::string_view name) {
     const std::uint64_t gone = fileID(name);
     const DocumentID document = documentID(name);
+    const ObjectKind kind = kindOf(name);
     ASSERT_EQ(std::remove((storage_ / name).c_str()), 0);
-    left(name, gone, document);
+    left(name, gone, kind, document);
     folderChanged(name);
 }
 

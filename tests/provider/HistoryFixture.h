@@ -59,8 +59,10 @@ protected:
     void record(std::string_view name);
     /// The object is to be looked at, where it is now.
     std::uint64_t changed(std::string_view name);
+    ObjectKind kindOf(std::string_view name) const;
     /// What had the numbers left the place.
-    std::uint64_t left(std::string_view name, std::uint64_t fileID, DocumentID documentID = {});
+    std::uint64_t left(std::string_view name, std::uint64_t fileID, ObjectKind kind = ObjectKind::other,
+                       DocumentID documentID = {});
     std::uint64_t documentWent(DocumentID document, std::uint64_t source, std::uint64_t target);
     /// The folder that holds the object has changed, too.
     void folderChanged(std::string_view name);

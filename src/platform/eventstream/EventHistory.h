@@ -39,6 +39,8 @@ struct Event {
     std::uint64_t id = 0;
     FileID fileID{};
     DocumentID documentID{};  ///< that the object had when it was recorded, or has now; 0 for none
+    /// What the object was when it left, or is; `other` with document-ID changes.
+    ObjectKind kind = ObjectKind::other;
 };
 
 /// The events of the volume, in order, and where they come to an end: now.

@@ -470,6 +470,7 @@ Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_
         event.id = journalled.id;
         event.fileID = journalled.fileID;
         event.documentID = journalled.documentID;
+        event.kind = journalled.objectKind;
         if (journalled.kind == JournalEvent::Kind::departed) event.flags = EventFlags::removed;
         batch.events.push_back(std::move(event));
     }

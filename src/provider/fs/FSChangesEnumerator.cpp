@@ -9,6 +9,7 @@
 #include "platform/foundation/Log.h"
 #include "platform/foundation/ThreadPool.h"
 #include "platform/revisions/RvStorageManager.h"
+#include "platform/revisions/VolumeIndex.h"
 #include "platform/roster/Roster.h"
 #include "platform/tessel/TesselErrors.h"
 #include "provider/ContainerContents.h"
@@ -147,19 +148,35 @@ void FSChangesEnumerator::stop() {
 
 // What is listed.
 
-FSChangesEnumerator::Identifiers FSChangesEnumerator::identifiersOf(const Event& event) const {
-    Identifiers identifiers;
-    if (event.fileID == FileID{}) return identifiers;
-    identifiers.push_back(CdlFileObjectIdentifier::fromFileID(static_cast<std::uint64_t>(event.fileID)));
-    const auto add = [&](DocumentID documentID) {
-        auto identifier = CdlFileObjectIdentifier::fromDocumentID(static_cast<std::uint32_t>(documentID));
-        if (documentID != DocumentID{} && std::ranges::find(identifiers, identifier) == identifiers.end())
-            identifiers.push_back(std::move(identifier));
-    };
-    add(event.documentID);
+/// Under which the object was listed where the event says, if it was: a file and a package under its document's, all else
+/// under its number's. What became a package, or was one, left its place as what it was.
+FSChangesEnumerator::Identifiers FSChangesEnumerator::identifiersOf(const Event& event) {
     const auto store = RvStorageManager::defaultManager().store();
-    if (const auto object = store ? store->object(event.fileID) : std::nullopt) add(object->documentID);
-    return identifiers;
+    if (event.fileID == FileID{} || !store) return {};
+    DocumentID documentID = event.documentID;
+    if (!(event.flags & EventFlags::removed)) {
+        bool isListed = true;
+        store->indexed(event.fileID, [&](const IndexedObject& object) {
+            isListed = object.isListed;
+            if (documentID == DocumentID{}) documentID = object.documentID;
+        });
+        // Nobody was ever given an identifier of it.
+        if (!isListed) return {};
+    }
+    if (event.kind != ObjectKind::file && event.kind != ObjectKind::package)
+        return {CdlFileObjectIdentifier::fromFileID(static_cast<std::uint64_t>(event.fileID))};
+    if (documentID == DocumentID{}) return {};
+    return {CdlFileObjectIdentifier::fromDocumentID(static_cast<std::uint32_t>(documentID))};
+}
+
+/// Whether the document ended together with its object: the event before says so, and where.
+bool FSChangesEnumerator::isToldByPath(const Event& event) {
+    const auto history = EventHistory::shared();
+    if (!history || event.id < 2) return false;
+    const auto before = history->pathEvents(event.id - 2, 1);
+    if (!before.ok() || before->events.empty()) return false;
+    const Event& left = before->events.front();
+    return left.id == event.id - 1 && (left.flags & EventFlags::removed) && left.documentID == event.documentID;
 }
 
 Result<FSChangesEnumerator::Answer> FSChangesEnumerator::ask(FSEventReader& reader,
@@ -260,7 +277,8 @@ void FSChangesEnumerator::askAbout(FSEventReader& reader, const Event& event, co
 FSEventReaderDelegate::LookFurther FSChangesEnumerator::readerDidReceiveEvent(FSEventReader& reader, const Event& event,
                                                                               std::string_view path) {
     reader.assertOnQueue();
-    if (path.empty() || container_contents::covers(container_, urls_, path)) return LookFurther::yes;
+    if (path.empty()) return isToldByPath(event) ? LookFurther::no : LookFurther::yes;
+    if (container_contents::covers(container_, urls_, path)) return LookFurther::yes;
     logDebug("dropping fsevent at {}; URL is not directly in the container (eventID: {})", path, event.id);
     return LookFurther::no;
 }
@@ -279,14 +297,8 @@ void FSChangesEnumerator::readerDidUpdateItem(FSEventReader& reader, const Event
     reader.assertOnQueue();
     // Of a document, what is at its file may be another one by now.
     if (reader.mode() == FSEventReaderMode::docIDBased && item->itemIdentifier() != identifier)
-        return askAbout(reader, event, {identifier});
-    Changes changes;
-    changes.changes.emplace_back(item);
-    // A folder that was a package was a document.
-    Identifiers others;
-    if (isFileIdentifier(item->itemIdentifier())) others = identifiersOf(event);
-    std::erase(others, item->itemIdentifier());
-    askAbout(reader, event, others, std::move(changes));
+        return askAbout(reader, event, {identifier}, {});
+    forwardEvent(reader, event, {.changes = {item}});
 }
 
 void FSChangesEnumerator::readerDidDeleteItem(FSEventReader& reader, const Event& event,
@@ -299,7 +311,7 @@ void FSChangesEnumerator::readerDidDropEvent(FSEventReader& reader, const Event&
                                              const TesselItemIdentifier& identifier) {
     reader.assertOnQueue();
     const bool isOfDocument = reader.mode() == FSEventReaderMode::docIDBased;
-    askAbout(reader, event, isOfDocument ? Identifiers{identifier} : identifiersOf(event));
+    askAbout(reader, event, isOfDocument ? Identifiers{identifier} : identifiersOf(event), {});
 }
 
 void FSChangesEnumerator::readerMustScan(FSEventReader& reader, const Event& event) {

@@ -30,8 +30,8 @@ struct FSReaderState {
 /// listing of the container deliver this object now, under this identifier? If so, the item is forwarded as an update,
 /// otherwise the identifier as deleted. So a client that applies what it is given, and then lists, finds nothing new.
 ///
-/// An event whose object is not where the event says puts the identifiers that it had to that question: those of its
-/// file ID, of the document that it had, and of the one that the store says is there now.
+/// An event whose object is not where the event says puts the identifiers that it had there to that question: that of
+/// the document that it was, or of its file ID where it was none.
 ///
 /// The anchor that is handed back stands behind the last event that was handled wholly. A batch ends before an event
 /// whose changes would not fit; only a scan of a folder goes beyond it.
@@ -67,8 +67,8 @@ private:
     using Identifiers = std::vector<TesselItemIdentifier>;
     /// What one event comes to.
     struct Changes {
-        std::vector<Change> changes;
-        std::vector<std::string> foldersToScan;  ///< taken out of the client's view while what is in them is listed
+        std::vector<Change> changes{};
+        std::vector<std::string> foldersToScan{};  ///< taken out of the client's view while what is in them is listed
     };
     /// What came of one question.
     struct Answer;
@@ -82,12 +82,13 @@ private:
     std::shared_ptr<FSEventReader> makeReader(FSEventReaderMode mode, bool verbose);
 
     // What is listed.
-    Identifiers identifiersOf(const Event& event) const;
+    static Identifiers identifiersOf(const Event& event);
+    static bool isToldByPath(const Event& event);
     Result<Answer> ask(FSEventReader& reader, const TesselItemIdentifier& identifier);
     Result<Answer> askOnce(FSEventReader& reader, const TesselItemIdentifier& identifier);
     Result<Answer> answerOf(KsURL entry, const TesselItemIdentifier& identifier);
     bool changesWhatIsBelow(const Event& event, const Answer& moved) const;
-    void askAbout(FSEventReader& reader, const Event& event, const Identifiers& identifiers, Changes changes = {});
+    void askAbout(FSEventReader& reader, const Event& event, const Identifiers& identifiers, Changes changes);
 
     // What is forwarded.
     bool isBatchFull() const;

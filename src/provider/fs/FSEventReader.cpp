@@ -130,10 +130,10 @@ struct FSEventReader::Look {
     enum class Kind { flags, nothing, scan, directoryMoved, deleted, dropped, item };
     Kind kind = Kind::nothing;
     const Event* event = nullptr;
-    TesselItemIdentifier identifier;  ///< deleted, dropped and item: the event's own
-    std::optional<KsURL> entry;       ///< item: until it is made
-    std::string path;                 ///< item: of the entry
-    std::shared_ptr<const TesselItem> item;
+    TesselItemIdentifier identifier{};  ///< deleted, dropped and item: the event's own
+    std::optional<KsURL> entry{};       ///< item: until it is made
+    std::string path{};                 ///< item: of the entry
+    std::shared_ptr<const TesselItem> item{};
 };
 
 std::shared_ptr<FSEventReader> FSEventReader::create(std::vector<KsURL> urls, FSEventReaderMode mode, bool verbose,
@@ -388,11 +388,11 @@ Result<FSEventReader::Look> FSEventReader::lookAtDocument(FSEventReaderDelegate&
 
 FSEventReaderGatherPhaseResumeStatus FSEventReader::canResumeGatherPhase(const std::vector<KsURL>& on,
                                                                          std::uint64_t previousEventID) {
+    // Of a listing that began while nothing could be replayed. Nothing is known here of one that began later.
+    if (FSGatherWitness::shared().holds(on, previousEventID)) return CanResume();
     const auto history = EventHistory::shared();
-    if (!history || !history->canReplayAfter(previousEventID)) {
-        if (FSGatherWitness::shared().holds(on, previousEventID)) return CanResume();
+    if (!history || !history->isReady() || !history->canReplayAfter(previousEventID))
         return CantReplayHistoricalFSEvents();
-    }
     const std::string key = ResumedListings::keyOf(*history, on, previousEventID);
     const auto reader = create(on, FSEventReaderMode::pathBased, /*verbose=*/false,
                                ResumedListings::shared().reached(key, previousEventID));

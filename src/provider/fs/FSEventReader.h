@@ -116,8 +116,8 @@ public:
     /// the replay of the history, and is not to be called on a reader's queue. `previousEventID` is the one that the
     /// listing's first page was given.
     ///
-    /// A listing that began while nothing could be replayed is judged by what it has seen (FSGatherWitness), and waits
-    /// for nothing.
+    /// A listing that began while nothing could be replayed is judged by what it has seen (FSGatherWitness) first, and
+    /// waits for nothing while that holds.
     static FSEventReaderGatherPhaseResumeStatus canResumeGatherPhase(const std::vector<KsURL>& on,
                                                                      std::uint64_t previousEventID);
 

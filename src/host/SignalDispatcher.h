@@ -1,0 +1,45 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "platform/foundation/Mutex.h"
+#include "platform/tessel/TesselManager.h"
+
+namespace cindral {
+
+/// What the provider may ask of this host: passes signals of containers on to whoever subscribed.
+///
+/// A completion is called at once: nobody's slowness holds up the provider. There is no search index, so a deletion from
+/// it has nothing to delete.
+///
+/// Thread safety: all operations, from any thread.
+class SignalDispatcher final : public TesselManager::Host {
+public:
+    /// Called on the provider's threads, by several at a time; only passes on.
+    using Receiver = std::function<void(const TesselItemIdentifier& container)>;
+    std::uint64_t subscribe(Receiver receiver);
+    /// Returns when no call to the receiver is under way any more. Not to be called by the receiver.
+    void unsubscribe(std::uint64_t subscription);
+
+    void signalEnumerator(const TesselItemIdentifier& container, TesselManager::Completion completion) override;
+    void deleteSearchableItems(const std::vector<std::string>& domains, TesselManager::Completion completion) override;
+
+private:
+    struct Subscription {
+        std::shared_ptr<const Receiver> receiver;
+        int calls = 0;  ///< under way
+    };
+    std::vector<std::pair<std::uint64_t, std::shared_ptr<const Receiver>>> beginCalls();
+    void endCall(std::uint64_t subscription);
+
+    Mutex mutex_;
+    Condition callEnded_;
+    std::map<std::uint64_t, Subscription> subscriptions_ GUARDED_BY(mutex_);
+    std::uint64_t lastSubscription_ GUARDED_BY(mutex_) = 0;
+};
+
+}  // namespace cindral
