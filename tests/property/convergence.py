@@ -255,9 +255,12 @@ class Convergence:
         fresh, restarts = listed(self.host, view.container)
         self.count["listings that began again"] += restarts
         self.count["comparisons"] += 1
-        lines = view.differences(fresh, lambda item: item.get("fileID") in several)
+        lines = view.differences(fresh, lambda item: item.get("fileID") in several, self._had_several_names)
         if lines:
             raise Difference("\n".join([f"the view of {view.container} is not what it lists:", *lines, self._second_look(view, several)]))
+
+    def _had_several_names(self, item):
+        return not self.operations.names_outside_are_told and item.get("fileID") in self.operations.had_several_names
 
     def _second_look(self, view, several):
         """For whoever looks for the reason: whether it is late, or lost."""
@@ -265,7 +268,8 @@ class Convergence:
             return ""
         time.sleep(3)
         view.catch_up()
-        lines = view.differences(listed(self.host, view.container)[0], lambda item: item.get("fileID") in several)
+        lines = view.differences(listed(self.host, view.container)[0], lambda item: item.get("fileID") in several,
+                                 self._had_several_names)
         return "(three seconds later it still is not)" if lines else "(three seconds later it is)"
 
     def _count_changes(self, changes):

@@ -220,9 +220,10 @@ class Operations:
         self.tree = tree
         self.random = tree.random
         self.size = size
-        # inotify tells nothing of a name that a file is given in a folder that isn't watched; from the next look at the
-        # file on it does.
+        # inotify tells nothing of a name that a file is given in a folder that isn't watched, or that is gone before the
+        # folder's events are read; from the next look at the file on it does.
         self.names_outside_are_told = True
+        self.had_several_names = set()
         self.growing = [(self.make_file, 10), (self.make_folder, 4), (self.make_tree, 1), (self.move_in, 3), (self.hard_link, 2),
                         (self.symbolic_link, 2), (self.hard_link_outside, 1)]
         self.steady = [(self.write, 6), (self.append, 6), (self.truncate, 3), (self.write_mapped, 3), (self.rename, 8),
@@ -563,6 +564,7 @@ class Operations:
         source = self.tree.path(node)
         other = self.tree.add(folder, self.tree.unused(folder), "file", node.names)
         os.link(source, self.tree.path(other))
+        self.had_several_names.add(os.lstat(source).st_ino)
         return f"link {source} {self.tree.path(other)}"
 
     def hard_link_outside(self):

@@ -100,11 +100,12 @@ class ContainerView:
             self.items.pop(one, None)
             gone.extend(below.pop(one, ()))
 
-    def differences(self, fresh, is_one_of_several_names=lambda item: False):
+    def differences(self, fresh, is_one_of_several_names=lambda item: False, had_several_names=lambda item: False):
         """Lines that tell in what the view is not the fresh listing.
 
         `fileURL` of an item below a moved folder is as of when the item was last sent. An object with several names is
-        listed under one of them, whichever; in a folder it may be listed under one that lies elsewhere.
+        listed under one of them, whichever; in a folder it may be listed under one that lies elsewhere. Where it isn't told
+        that an object was given a name and lost it again, its version is left out as well.
         """
         lines = []
         for identifier in sorted(self.items.keys() | fresh.keys()):
@@ -116,6 +117,8 @@ class ContainerView:
                 lines.append(f"{'missing' if mine is None else 'too many'}: {mine or theirs}")
                 continue
             left_out = {"fileURL"} | ({"filename", "parentIdentifier", "typeIdentifier", "isTrashed"} if several else set())
+            if had_several_names(theirs):
+                left_out.add("versionIdentifier")
             keys = sorted(key for key in (mine.keys() | theirs.keys()) - left_out if mine.get(key) != theirs.get(key))
             if keys:
                 told = ", ".join(f"{key} is {mine.get(key)!r}, should be {theirs.get(key)!r}" for key in keys)

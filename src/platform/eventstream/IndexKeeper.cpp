@@ -305,6 +305,7 @@ void IndexKeeper::lost(FileID parent, std::string_view name, const Known& known,
     if (!known.isAt(parent, name)) {
         // One of its other names. The number of names is part of its status.
         changes().removeName(known.object.fileID, parent, name);
+        packagesChanged(parent);
         dirtyObjects_.insert(known.object.fileID);
         return;
     }
@@ -386,7 +387,10 @@ Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name
     const IndexedObject& object = known.object;
     const std::optional<Known> here = findAt(folder.fileID, name);
     const bool isKnownName = here && here->object.fileID == object.fileID;
-    if (!isKnownName) changes().addName(object.fileID, folder.fileID, name);
+    if (!isKnownName) {
+        changes().addName(object.fileID, folder.fileID, name);
+        packagesChanged(folder.fileID);
+    }
     if (object.changeTime != stampOf(status.changeTime) || object.size != sizeOf(status)) {
         put(object.parent, known.name, status, false);
     }
@@ -447,6 +451,9 @@ void IndexKeeper::put(FileID parent, std::string_view name, const FileStatus& st
     object.hasOtherNames = !status.isDirectory() && status.names > 1;
     changes().put(object);
     packagesChanged(parent);
+    if (object.hasOtherNames && journal_ == Journal::yes) {
+        for (const VolumeStore::Name& other : store_.otherNames(object.fileID)) packagesChanged(other.parent);
+    }
     // A file with one name is not met again before it is written, except under another name: it is looked up there.
     const bool mayBeMetAgain =
         status.isDirectory() || object.hasOtherNames || placed_.contains(object.fileID) || journal_ == Journal::yes;

@@ -547,6 +547,18 @@ TEST_P(RecorderTest, tellsOfAPackageWhenSomethingInItChanges) {
     EXPECT_EQ(changes(), (Changes{"p.folio", "p.folio/d/a"}));
 }
 
+TEST_P(RecorderTest, tellsOfAPackageWhenAFileOfWhichItHasANameChanges) {
+    makeFolder("p.folio");
+    write("a");
+    start();
+    link("a", "p.folio/b");
+    EXPECT_TRUE(changes().contains("p.folio"));
+    append("a", "more");
+    EXPECT_TRUE(changes().contains("p.folio"));
+    remove("p.folio/b");
+    EXPECT_TRUE(changes().contains("p.folio"));
+}
+
 TEST_P(RecorderTest, tellsOfEverythingInAFolderThatBecomesAPackage) {
     makeFolder("p");
     write("p/a");
