@@ -512,10 +512,11 @@ void ts_trashUnderFolder(const KsURL& url, const KsURL& trashFolder, FileOperati
     });
 }
 
-std::shared_ptr<TesselProgress> ts_deleteWithCompletionHandler(const KsURL& url, FileDeletionCompletion completion) {
+std::shared_ptr<TesselProgress> ts_deleteWithCompletionHandler(const KsURL& url, FileDeletionCompletion completion,
+                                                               std::optional<std::uint64_t> fileID) {
     auto progress = std::make_shared<TesselProgress>();
-    inBackground([url, progress, completion = std::move(completion)] {
-        const Result<void> removed = blocking([&] { return file_operations::remove(url, *progress); });
+    inBackground([url, fileID, progress, completion = std::move(completion)] {
+        const Result<void> removed = blocking([&] { return file_operations::remove(url, *progress, fileID); });
         completion(removed.ok() ? std::nullopt : std::optional(removed.error()));
     });
     return progress;

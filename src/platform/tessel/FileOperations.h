@@ -63,7 +63,9 @@ void ts_trashUnderFolder(const KsURL& url, const KsURL& trashFolder, FileOperati
 ///
 /// That all of a folder can be deleted is looked at first; until then it can be cancelled. Then it vanishes in one step,
 /// and only the time that takes is still to pass: an error on the way is logged, and what is left is out of sight.
-std::shared_ptr<TesselProgress> ts_deleteWithCompletionHandler(const KsURL& url, FileDeletionCompletion completion);
+/// With a file ID, only the object with that number is deleted: ESTALE when another has the name.
+std::shared_ptr<TesselProgress> ts_deleteWithCompletionHandler(const KsURL& url, FileDeletionCompletion completion,
+                                                               std::optional<std::uint64_t> fileID = std::nullopt);
 
 /// The same as plain functions, on the caller's thread.
 namespace file_operations {

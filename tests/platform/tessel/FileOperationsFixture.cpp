@@ -18,7 +18,6 @@ namespace cindral::test {
 
 namespace {
 
-constexpr uid_t kSomebody = 65533;
 // Whole seconds and nanoseconds, both of which a copy keeps.
 constexpr timespec kThen[2] = {{1'000'000'000, 123'456'789}, {1'100'000'000, 987'654'321}};
 
@@ -77,22 +76,6 @@ std::optional<std::string> FileOperationsTest::attribute(const std::string& path
     const ssize_t size = ::lgetxattr(path.c_str(), name, value.data(), value.size());
     if (size < 0) return std::nullopt;
     return std::string(value.data(), static_cast<std::size_t>(size));
-}
-
-OrdinaryPerson::OrdinaryPerson() : wasRoot_(::geteuid() == 0) {
-    if (wasRoot_ && (::setegid(kSomebody) != 0 || ::seteuid(kSomebody) != 0)) std::abort();
-}
-
-OrdinaryPerson::~OrdinaryPerson() {
-    if (wasRoot_ && (::seteuid(0) != 0 || ::setegid(0) != 0)) std::abort();
-}
-
-void OrdinaryPerson::giveTo(const std::string& path) {
-    if (::geteuid() != 0) return;
-    if (::lchown(path.c_str(), kSomebody, kSomebody) != 0) std::abort();
-    for (const auto& entry : std::filesystem::recursive_directory_iterator(path)) {
-        if (::lchown(entry.path().c_str(), kSomebody, kSomebody) != 0) std::abort();
-    }
 }
 
 }  // namespace cindral::test

@@ -24,6 +24,7 @@
 #include "platform/tessel/StagingFolder.h"
 #include "platform/tessel/TesselManager.h"
 #include "support/LogCapture.h"
+#include "support/OrdinaryPerson.h"
 
 namespace cindral {
 namespace {
