@@ -10,11 +10,9 @@
 #include "platform/foundation/ThreadPool.h"
 #include "platform/revisions/RvStorageManager.h"
 #include "platform/revisions/VolumeIndex.h"
-#include "platform/roster/Roster.h"
 #include "platform/tessel/TesselErrors.h"
 #include "provider/ContainerContents.h"
 #include "provider/KsURL+CdlFileObjectIdentifier.h"
-#include "provider/Utilities.h"
 
 namespace cindral {
 
@@ -77,12 +75,12 @@ struct FSChangesEnumerator::Answer {
     enum class Kind {
         listed,         ///< under the identifier that was asked for
         notListed,      ///< not at all, or under another
-        passedThrough,  ///< itself not, but what is below it
+        passedThrough,  ///< a folder of which no item can be made, while what is in it is listed
         moving,         ///< it is not where the store says
     };
     Kind kind = Kind::notListed;
-    std::shared_ptr<const TesselItem> item;  ///< of what is there, also where it is listed under another identifier
-    std::string path;
+    std::shared_ptr<const TesselItem> item{};  ///< listed
+    std::string path{};                        ///< moving: where it is not
 };
 
 std::shared_ptr<FSChangesEnumerator> FSChangesEnumerator::create(TesselItemIdentifier container,
@@ -148,11 +146,12 @@ void FSChangesEnumerator::stop() {
 
 // What is listed.
 
-/// Under which the object was listed where the event says, if it was: a file and a package under its document's, all else
-/// under its number's. What became a package, or was one, left its place as what it was.
-FSChangesEnumerator::Identifiers FSChangesEnumerator::identifiersOf(const Event& event) {
+/// Under which the object was listed where the event says; none where it was not. A file and a package are listed under
+/// their document's identifier, all else under its number's. What became a package, or was one, left its place as what it
+/// was.
+std::optional<TesselItemIdentifier> FSChangesEnumerator::identifierOf(const Event& event) {
     const auto store = RvStorageManager::defaultManager().store();
-    if (event.fileID == FileID{} || !store) return {};
+    if (event.fileID == FileID{} || !store) return std::nullopt;
     DocumentID documentID = event.documentID;
     if (!(event.flags & EventFlags::removed)) {
         bool isListed = true;
@@ -161,12 +160,12 @@ FSChangesEnumerator::Identifiers FSChangesEnumerator::identifiersOf(const Event&
             if (documentID == DocumentID{}) documentID = object.documentID;
         });
         // Nobody was ever given an identifier of it.
-        if (!isListed) return {};
+        if (!isListed) return std::nullopt;
     }
     if (event.kind != ObjectKind::file && event.kind != ObjectKind::package)
-        return {CdlFileObjectIdentifier::fromFileID(static_cast<std::uint64_t>(event.fileID))};
-    if (documentID == DocumentID{}) return {};
-    return {CdlFileObjectIdentifier::fromDocumentID(static_cast<std::uint32_t>(documentID))};
+        return CdlFileObjectIdentifier::fromFileID(static_cast<std::uint64_t>(event.fileID));
+    if (documentID == DocumentID{}) return std::nullopt;
+    return CdlFileObjectIdentifier::fromDocumentID(static_cast<std::uint32_t>(documentID));
 }
 
 /// Whether the document ended together with its object: the event before says so, and where.
@@ -206,72 +205,44 @@ Result<FSChangesEnumerator::Answer> FSChangesEnumerator::askOnce(FSEventReader& 
     FSFoundEntry found = TRY(reader.entryFinder().find(*path));
     if (found.standing == FSFoundEntry::Standing::outside) return Answer{};
     if (found.standing == FSFoundEntry::Standing::missing || !isObject(*object, TRY(found.url->status())))
-        return Answer{Answer::Kind::moving, nullptr, *std::move(path)};
+        return Answer{.kind = Answer::Kind::moving, .path = *std::move(path)};
     return answerOf(*std::move(found.url), identifier);
 }
 
 Result<FSChangesEnumerator::Answer> FSChangesEnumerator::answerOf(KsURL entry, const TesselItemIdentifier& identifier) {
-    Answer answer;
-    answer.path = entry.path();
+    if (!container_contents::isListed(container_, entry)) return Answer{};
     const bool isEntered = container_contents::isDeep(container_) && entry.ts_isFolder();
-    if (container_contents::isListed(container_, entry)) {
-        std::vector<KsURL> entries;
-        entries.push_back(std::move(entry));
-        TesselItems items = TRY(container_contents::itemsOf(std::move(entries)));
-        if (!items.empty()) answer.item = std::move(items.front());
-    }
-    if (answer.item && answer.item->itemIdentifier() == identifier) {
-        answer.kind = Answer::Kind::listed;
-    } else if (!answer.item && isEntered) {
-        answer.kind = Answer::Kind::passedThrough;
-    }
-    return answer;
+    std::vector<KsURL> entries;
+    entries.push_back(std::move(entry));
+    TesselItems items = TRY(container_contents::itemsOf(std::move(entries)));
+    if (items.empty() && isEntered) return Answer{.kind = Answer::Kind::passedThrough};
+    if (items.empty() || items.front()->itemIdentifier() != identifier) return Answer{};
+    return Answer{.kind = Answer::Kind::listed, .item = std::move(items.front())};
 }
 
-/// Whether the items below a folder that moved are others now: in the trash or out of it, or another application's. No
-/// event tells of them, because nothing happened to them.
-bool FSChangesEnumerator::changesWhatIsBelow(const Event& event, const Answer& moved) const {
-    if (!(event.flags & EventFlags::removed) || !container_contents::isDeep(container_)) return false;
-    const KsURL* now = moved.item->fileURL();
-    if (!now->ts_isFolder()) return false;
-    const KsURL before = KsURL::fileURL(event.path);
-    return isInTrash(before) != isInTrash(*now) ||
-           RoBundleProxy::proxyWithContaining(before) != RoBundleProxy::proxyWithContaining(*now);
-}
-
-void FSChangesEnumerator::askAbout(FSEventReader& reader, const Event& event, const Identifiers& identifiers,
-                                   Changes changes) {
-    std::vector<std::shared_ptr<const TesselItem>> seen;
-    for (const TesselItemIdentifier& identifier : identifiers) {
-        if (container_contents::isOfFoldersOnly(container_) && !isFileIdentifier(identifier)) {
-            logDebug("dropping fsevent at {}; item is not a directory", event.path);
-            continue;
-        }
-        const auto known = std::ranges::find(seen, identifier, [](const auto& item) { return item->itemIdentifier(); });
-        if (known != seen.end()) {
-            changes.changes.emplace_back(*known);
-            continue;
-        }
-        Result<Answer> answer = ask(reader, identifier);
-        if (!answer.ok()) return endWithError(reader, answer.error());
-        if (answer->item) seen.push_back(answer->item);
-        switch (answer->kind) {
-            case Answer::Kind::listed:
-                changes.changes.emplace_back(answer->item);
-                if (changesWhatIsBelow(event, *answer)) changes.foldersToScan.push_back(answer->path);
-                break;
-            case Answer::Kind::notListed: changes.changes.emplace_back(identifier); break;
-            case Answer::Kind::passedThrough:
-                // It was listed under the name that it left. What is in it is still listed, and a client takes it out
-                // together with the folder.
-                if (!(event.flags & EventFlags::removed)) break;
-                changes.changes.emplace_back(identifier);
-                changes.foldersToScan.push_back(answer->path);
-                break;
-            case Answer::Kind::moving: return askAgain(reader);
-        }
+/// Puts the identifier that the event's object was listed under to the question.
+void FSChangesEnumerator::askAbout(FSEventReader& reader, const Event& event,
+                                   const std::optional<TesselItemIdentifier>& identifier) {
+    if (!identifier) return;
+    if (container_contents::isOfFoldersOnly(container_) && !isFileIdentifier(*identifier)) {
+        logDebug("dropping fsevent at {}; item is not a directory", event.path);
+        return;
     }
-    forwardEvent(reader, event, changes);
+    Result<Answer> answer = ask(reader, *identifier);
+    // A folder's number may be a link's now: that is another item, and what was below the folder is gone with it.
+    if (answer.ok() && answer->item && event.kind == ObjectKind::folder && !answer->item->fileURL()->ts_isFolder())
+        answer->kind = Answer::Kind::notListed;
+    if (!answer.ok()) return endWithError(reader, answer.error());
+    switch (answer->kind) {
+        case Answer::Kind::listed: forward(std::move(answer->item)); break;
+        case Answer::Kind::notListed: forward(*identifier); break;
+        case Answer::Kind::passedThrough:
+            // A client that takes the folder out takes out what is in it, too.
+            if (event.flags & EventFlags::removed) forward(*identifier);
+            break;
+        case Answer::Kind::moving: return askAgain(reader);
+    }
+    didHandle(reader, event);
 }
 
 FSEventReaderDelegate::LookFurther FSChangesEnumerator::readerDidReceiveEvent(FSEventReader& reader, const Event& event,
@@ -297,8 +268,9 @@ void FSChangesEnumerator::readerDidUpdateItem(FSEventReader& reader, const Event
     reader.assertOnQueue();
     // Of a document, what is at its file may be another one by now.
     if (reader.mode() == FSEventReaderMode::docIDBased && item->itemIdentifier() != identifier)
-        return askAbout(reader, event, {identifier}, {});
-    forwardEvent(reader, event, {.changes = {item}});
+        return askAbout(reader, event, identifier);
+    forward(item);
+    didHandle(reader, event);
 }
 
 void FSChangesEnumerator::readerDidDeleteItem(FSEventReader& reader, const Event& event,
@@ -311,23 +283,29 @@ void FSChangesEnumerator::readerDidDropEvent(FSEventReader& reader, const Event&
                                              const TesselItemIdentifier& identifier) {
     reader.assertOnQueue();
     const bool isOfDocument = reader.mode() == FSEventReaderMode::docIDBased;
-    askAbout(reader, event, isOfDocument ? Identifiers{identifier} : identifiersOf(event), {});
+    askAbout(reader, event, isOfDocument ? identifier : identifierOf(event));
 }
 
 void FSChangesEnumerator::readerMustScan(FSEventReader& reader, const Event& event) {
     reader.assertOnQueue();
-    Changes changes;
+    std::vector<KsURL> folders;
     for (const KsURL& url : urls_) {
-        if (isAtOrBelow(url.path(), event.path)) changes.foldersToScan.push_back(url.path());
+        if (isAtOrBelow(url.path(), event.path)) folders.push_back(url);
     }
-    if (!container_contents::covers(container_, urls_, event.path))
-        return askAbout(reader, event, {}, std::move(changes));
-    if (container_contents::isDeep(container_)) {
+    if (container_contents::covers(container_, urls_, event.path)) {
         const Result<FSFoundEntry> found = reader.entryFinder().find(event.path);
         if (!found.ok()) return endWithError(reader, found.error());
-        if (found->url && found->url->ts_isFolder()) changes.foldersToScan.push_back(event.path);
+        if (found->url && container_contents::isListed(container_, *found->url)) {
+            const Result<TesselItems> items = container_contents::itemsOf({*found->url});
+            if (!items.ok()) return endWithError(reader, items.error());
+            for (const auto& item : *items) forward(item);
+        }
+        if (found->url && found->url->ts_isFolder() && container_contents::isDeep(container_))
+            folders.push_back(*found->url);
     }
-    askAbout(reader, event, identifiersOf(event), std::move(changes));
+    const Result<void> scanned = scan(folders);
+    if (!scanned.ok()) return endWithError(reader, scanned.error());
+    didHandle(reader, event);
 }
 
 // What is forwarded.
@@ -339,12 +317,6 @@ bool FSChangesEnumerator::isBatchFull() const {
         logError("invalid number of changes ({} - {} shouldn't be greater than {})", numberOfChanges_,
                  currentToken_.offset, kChangesBatchMax);
     return unflushed > kChangesBatchMax - 1;
-}
-
-/// Whether the changes of one more event belong into the batch. The first event's always do.
-bool FSChangesEnumerator::fits(std::size_t count) const {
-    if (numberOfChanges_ <= currentToken_.offset) return true;
-    return checkedSum(numberOfChanges_ - currentToken_.offset, count) <= kChangesBatchMax;
 }
 
 void FSChangesEnumerator::forward(const Change& change) {
@@ -363,13 +335,8 @@ void FSChangesEnumerator::forwardDeletion(const TesselItemIdentifier& identifier
     observer_->didDeleteItemsWithIdentifiers({identifier});
 }
 
-void FSChangesEnumerator::forwardEvent(FSEventReader& reader, const Event& event, const Changes& changes) {
-    if (!fits(changes.changes.size())) return finish(reader, reader.lastProcessedFSEventID());
-    for (const Change& change : changes.changes) forward(change);
-    std::vector<KsURL> folders;
-    for (const std::string& path : changes.foldersToScan) folders.push_back(KsURL::fileURL(path));
-    const Result<void> scanned = scan(folders);
-    if (!scanned.ok()) return endWithError(reader, scanned.error());
+/// The event's changes were forwarded: what it stands at is a position.
+void FSChangesEnumerator::didHandle(FSEventReader& reader, const Event& event) {
     if (isBatchFull()) finish(reader, event.id);
 }
 

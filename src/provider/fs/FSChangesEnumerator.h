@@ -33,8 +33,9 @@ struct FSReaderState {
 /// An event whose object is not where the event says puts the identifiers that it had there to that question: that of
 /// the document that it was, or of its file ID where it was none.
 ///
-/// The anchor that is handed back stands behind the last event that was handled wholly. A batch ends before an event
-/// whose changes would not fit; only a scan of a folder goes beyond it.
+/// An event comes to one change at most, but for a scan, which is never cut: the anchor that is handed back stands behind
+/// the last event that was handled wholly. Of what changes with a folder that moves (it is in the trash now, or in a
+/// package), the events of what is below it tell.
 ///
 /// Thread safety: create(), start() and stop(), from any thread. All else on the reader's queue.
 class FSChangesEnumerator : public FSEventReaderDelegate, public std::enable_shared_from_this<FSChangesEnumerator> {
@@ -64,12 +65,6 @@ public:
 private:
     /// One change of what a client has: an item as it is now, or an identifier of nothing that is listed.
     using Change = std::variant<std::shared_ptr<const TesselItem>, TesselItemIdentifier>;
-    using Identifiers = std::vector<TesselItemIdentifier>;
-    /// What one event comes to.
-    struct Changes {
-        std::vector<Change> changes{};
-        std::vector<std::string> foldersToScan{};  ///< taken out of the client's view while what is in them is listed
-    };
     /// What came of one question.
     struct Answer;
     /// Which object an URL named when the enumeration began; none where none.
@@ -82,20 +77,18 @@ private:
     std::shared_ptr<FSEventReader> makeReader(FSEventReaderMode mode, bool verbose);
 
     // What is listed.
-    static Identifiers identifiersOf(const Event& event);
+    static std::optional<TesselItemIdentifier> identifierOf(const Event& event);
     static bool isToldByPath(const Event& event);
     Result<Answer> ask(FSEventReader& reader, const TesselItemIdentifier& identifier);
     Result<Answer> askOnce(FSEventReader& reader, const TesselItemIdentifier& identifier);
     Result<Answer> answerOf(KsURL entry, const TesselItemIdentifier& identifier);
-    bool changesWhatIsBelow(const Event& event, const Answer& moved) const;
-    void askAbout(FSEventReader& reader, const Event& event, const Identifiers& identifiers, Changes changes);
+    void askAbout(FSEventReader& reader, const Event& event, const std::optional<TesselItemIdentifier>& identifier);
 
     // What is forwarded.
     bool isBatchFull() const;
-    bool fits(std::size_t count) const;
     void forward(const Change& change);
     void forwardDeletion(const TesselItemIdentifier& identifier);
-    void forwardEvent(FSEventReader& reader, const Event& event, const Changes& changes);
+    void didHandle(FSEventReader& reader, const Event& event);
     Result<void> scan(const std::vector<KsURL>& folders);
 
     // How it ends.

@@ -74,9 +74,6 @@ public:
 /// An item is exactly what a listing of the directories would deliver. The items of events that come together are
 /// identified together. Events that can't be mapped are dropped with a line of the log, and stop nothing.
 ///
-/// Directories that are packages, or lie in one, have no events of their own: what happens in a package is an event of
-/// the package. That is reported as readerMustScan().
-///
 /// Thread safety: all operations, from any thread. The delegate is called on the reader's queue.
 class FSEventReader : public std::enable_shared_from_this<FSEventReader> {
 public:
