@@ -144,7 +144,7 @@ void answerChanges(JsonRpcReply& reply, const Result<ChangesBatch>& changes, con
 }
 
 void enumerateChanges(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const Params given(params, *reply);
+    const RequestParams given(params, *reply);
     const auto container = given.string("container");
     if (!container) return;
     const auto anchor = given.base64("anchor");
@@ -156,7 +156,7 @@ void enumerateChanges(const HostMethodsContext& context, const Json& params, con
 }
 
 void startMonitoring(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const auto container = Params(params, *reply).string("container");
+    const auto container = RequestParams(params, *reply).string("container");
     if (!container) return;
     const auto started = context.monitor.start(*container);
     if (!started.ok()) return answerWithError(*reply, started.error(), context.paths);
@@ -164,7 +164,7 @@ void startMonitoring(const HostMethodsContext& context, const Json& params, cons
 }
 
 void stopMonitoring(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const auto container = Params(params, *reply).string("container");
+    const auto container = RequestParams(params, *reply).string("container");
     if (!container) return;
     context.monitor.stop(*container);
     reply->result([](std::string& out) { out += "{}"; });
