@@ -103,6 +103,8 @@ void EventStream::State::deliverUpTo(std::uint64_t bound) {
             logError("can't read the event history; {}", batch.error().description());
             return sayDropped();
         }
+        // The journal may have been trimmed past the position since it was last asked.
+        if (!history->canReplayAfter(position)) return sayDropped();
         position = std::max(position, batch->upTo);
         std::erase_if(batch->events, [this](const Event& event) { return !isWatched(event); });
         if (!batch->events.empty()) deliver(batch->events);

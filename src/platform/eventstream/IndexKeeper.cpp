@@ -94,16 +94,17 @@ Result<void> IndexKeeper::workOff() {
     openFolders_.clear();
     contexts_.clear();
     if (!done.ok()) {
+        // Replacements stay: each is looked at anew before a document is handed over, and can't be found again.
         changes_.reset();
         placed_.clear();
         departures_.clear();
-        replacements_.clear();
         everythingIsDirty_ = true;
     }
     return done;
 }
 
 Result<void> IndexKeeper::rounds() {
+    openFailure_.reset();
     TRY(takeHints());
     bool isFirst = true;
     for (int round = 0; round < kRoundsMax; ++round) {
@@ -118,6 +119,7 @@ Result<void> IndexKeeper::rounds() {
         TRY(takeHints());
         TRY(endRound(!isDirty()));
         TRY(flush());
+        if (openFailure_) return *std::exchange(openFailure_, std::nullopt);
     }
     return {};
 }
@@ -176,7 +178,12 @@ Result<void> IndexKeeper::lookAtDirtyFolder(FileID fileID, FolderDirt dirt) {
 /// then; one that was closed is compared when it is opened again.
 void IndexKeeper::lookAgainLater(FileID fileID, FolderDirt dirt) {
     const std::optional<Known> known = find(fileID);
-    if (!known || known->object.isClosed || ++dirt.attempts > kAttemptsMax) return;
+    if (!known || known->object.isClosed) return;
+    if (++dirt.attempts > kAttemptsMax) {
+        // Never without anybody looking: it is compared at each call until it can be watched.
+        unwatched_.insert(fileID);
+        return;
+    }
     FolderDirt& later = dirtyFolders_[fileID];
     later.attempts = std::max(later.attempts, dirt.attempts);
     later.names.merge(dirt.names);
@@ -186,8 +193,9 @@ Result<void> IndexKeeper::lookAtObject(FileID fileID) {
     if (rootWithID(fileID) != nullptr) return {};
     const std::optional<Known> known = find(fileID);
     if (!known) return {};
-    const auto folder = openFolder(known->object.parent);
-    return folder ? look(*folder, known->name) : Result<void>();
+    if (const auto folder = openFolder(known->object.parent)) return look(*folder, known->name);
+    if (rootWithID(known->object.parent) == nullptr) lookAgainLater(known->object.parent, {{known->name}, 0});
+    return {};
 }
 
 /// Gives up what did not turn up. In a quiet round nothing is dirty any more, so nothing can; otherwise what was lost in
@@ -204,12 +212,7 @@ Result<void> IndexKeeper::endRound(bool isQuiet) {
     }
     departures_.insert(departures_.end(), std::make_move_iterator(waiting.begin()),
                        std::make_move_iterator(waiting.end()));
-    if (departures_.empty()) TRY(resolveReplacements());
-    for (const FileID package : touchedPackages_) {
-        if (find(package)) changes().touch(package);
-    }
-    touchedPackages_.clear();
-    return {};
+    return departures_.empty() ? resolveReplacements() : Result<void>();
 }
 
 Result<void> IndexKeeper::giveUp(const Departure& departure) {
@@ -265,6 +268,8 @@ IndexChanges& IndexKeeper::changes() {
 
 Result<void> IndexKeeper::flush() {
     placed_.clear();
+    // In one transaction with what changed inside of them.
+    for (const FileID package : std::exchange(touchedPackages_, {})) changes().touch(package);
     if (!changes_ || changes_->empty()) return {};
     const auto changes = std::exchange(changes_, nullptr);
     changeCount_ += changes->size();
@@ -339,6 +344,10 @@ Result<void> IndexKeeper::seeKnown(OpenFolder& folder, std::string_view name, co
         return seeOtherName(folder, name, status, known);
     }
     // Where two changes may bear the same stamp, a hint alone says that there was one.
+    if (isFolder) noteClosed(object.fileID, isClosed);
+    const bool showsOtherwise = isFolder && (object.isClosed != isClosed || object.kind != kindOf(status, name));
+    // What is below is touched in the same transaction, so it is to be in the index by then.
+    if (showsOtherwise) TRY(flush());
     if (!isChanged && object.isClosed == isClosed && (!isHinted || folder.stampsAreDistinct || isFolder)) return {};
     put(folder.fileID, name, status, isClosed);
     rememberAttributes(folder, name, known);
@@ -347,7 +356,9 @@ Result<void> IndexKeeper::seeKnown(OpenFolder& folder, std::string_view name, co
         watchNames(folder, name, status);
         return {};
     }
-    if (object.isClosed == isClosed && object.kind == kindOf(status, name)) return {};
+    // A listing has recorded it before the recorder came to it: what is in it is still to be read.
+    if (object.changeTime == 0 && !isClosed) toScan_.push_back(object.fileID);
+    if (!showsOtherwise) return {};
     // What is below shows, or no longer shows, where it did not, or did.
     contexts_.clear();
     if (!isClosed) toScan_.push_back(object.fileID);
@@ -367,19 +378,24 @@ Result<void> IndexKeeper::seeMoved(OpenFolder& folder, std::string_view name, co
     }
     packagesChanged(object.parent);
     if (!status.isDirectory()) {
+        const bool mayHoldOldName = status.names > 1 && !openFolder(object.parent);
         put(folder.fileID, name, status, false);
+        // Its old folder is on its way to another place, with the name in it.
+        if (mayHoldOldName) changes().addName(object.fileID, object.parent, known.name);
         arrived(folder.fileID, name, object.fileID);
         watchNames(folder, name, status);
         return {};
     }
+    noteClosed(object.fileID, isClosed);
     const Context before = contextInside(object.parent, known.name, object.kind);
+    const Context after = contextInside(folder.fileID, name, kindOf(status, name));
+    // What is below is touched in the same transaction, so it is to be in the index by then.
+    if (before.differsFrom(after)) TRY(flush());
     put(folder.fileID, name, status, isClosed);
     arrived(folder.fileID, name, object.fileID);
     contexts_.clear();
-    const Context after = contextInside(folder.fileID, name, kindOf(status, name));
-    if (before.root != after.root) toScan_.push_back(object.fileID);
-    if (before.differsFrom(after)) TRY(touchBelow(object.fileID));
-    return {};
+    if ((before.root != after.root || object.changeTime == 0) && !isClosed) toScan_.push_back(object.fileID);
+    return before.differsFrom(after) ? touchBelow(object.fileID) : Result<void>();
 }
 
 Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name, const FileStatus& status,
@@ -417,6 +433,7 @@ Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, cons
     }
     const bool isFolder = status.isDirectory();
     const bool isClosed = isFolder && !sys::isReadableDirectory(folder.fd.get(), std::string(name).c_str());
+    if (isFolder) noteClosed(fileID, isClosed);
     put(folder.fileID, name, status, isClosed);
     arrived(folder.fileID, name, fileID);
     if (isFolder) {
@@ -425,6 +442,14 @@ Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, cons
         watchNames(folder, name, status);
     }
     return {};
+}
+
+void IndexKeeper::noteClosed(FileID folder, bool isClosed) {
+    if (isClosed) {
+        closed_.insert(folder);
+    } else {
+        closed_.erase(folder);
+    }
 }
 
 /// A folder whose entries changed is itself changed.

@@ -75,6 +75,10 @@ public:
     const std::set<FileID>& unwatchedFolders() const { return unwatched_; }
     /// Whether the sources' watches ran out.
     bool reachedWatchLimit() const { return reachedWatchLimit_; }
+    /// Folders that can't be read.
+    const std::set<FileID>& closedFolders() const { return closed_; }
+    /// Whether something is left to be done: more came than one call takes, or it failed.
+    bool isBehind() const { return isDirty() || !departures_.empty(); }
     /// Changes of the index that were made since the start.
     std::uint64_t changeCount() const { return changeCount_; }
 
@@ -124,6 +128,7 @@ private:
     Result<void> seeNew(OpenFolder& folder, std::string_view name, const FileStatus& status,
                         const std::optional<Known>& formerHolder);
     void lost(FileID parent, std::string_view name, const Known& known, std::optional<FileID> newcomer);
+    void noteClosed(FileID folder, bool isClosed);
     void lookAtFolderItself(OpenFolder& folder);
     void put(FileID parent, std::string_view name, const FileStatus& status, bool isClosed);
     void rememberAttributes(const OpenFolder& folder, std::string_view name, const Known& known);
@@ -174,6 +179,7 @@ private:
 
     // The tree.
     std::shared_ptr<OpenFolder> openFolder(FileID folder);
+    void noteOpenFailure(const KsError& error);
     Result<std::shared_ptr<OpenFolder>> open(FileID folder, std::string_view path, const Root& root) const;
     bool holds(FileID parent, const std::string& name, FileID fileID, std::int64_t birthTime);
     std::optional<FileStatus> statusAt(FileID parent, const std::string& name);
@@ -209,6 +215,8 @@ private:
 
     RecentDepartures recent_;
     std::uint64_t changeCount_ = 0;
+    std::optional<KsError> openFailure_;  // Of this round.
+    std::set<FileID> closed_;
 };
 
 }  // namespace cindral

@@ -72,7 +72,11 @@ Result<void> IndexKeeper::compareUnwatched() {
     for (const FileID fileID : unwatched) {
         const auto folder = openFolder(fileID);
         if (!folder) {
-            if (!find(fileID) && rootWithID(fileID) == nullptr) unwatched_.erase(fileID);
+            if (find(fileID)) {
+                scanLater(fileID);
+            } else if (rootWithID(fileID) == nullptr) {
+                unwatched_.erase(fileID);
+            }
             continue;
         }
         watch(*folder);
@@ -110,6 +114,7 @@ Result<void> IndexKeeper::scan(FileID top) {
         const auto folder = open(next.fileID, next.path, root);
         if (!folder.ok()) {
             logDebug("can't read the folder {}; {}", next.path, folder.error().description());
+            noteOpenFailure(folder.error());
             scanLater(next.fileID);
             continue;
         }
@@ -130,6 +135,8 @@ void IndexKeeper::scanLater(FileID folder) {
         dirtyObjects_.insert(folder);
     } else {
         unreached_.erase(folder);
+        // Never without anybody looking: it is compared at each call until it can be watched.
+        if (known && !known->object.isClosed) unwatched_.insert(folder);
     }
 }
 
@@ -150,6 +157,7 @@ Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfold
     const std::uint64_t recorded = store_.childCount(folder.fileID);
     Entries entries;
     alignas(8) std::array<std::byte, kDirectoryBytes> buffer;
+    bool sawAll = true;
     (void)::lseek(folder.fd.get(), 0, SEEK_SET);
     while (true) {
         const Result<std::size_t> read = sys::getdents(folder.fd.get(), buffer);
@@ -170,7 +178,8 @@ Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfold
                 if (status.error().isPosix(ENOENT)) continue;
                 logDebug("can't look at {}/{}; {}", folder.path, record->name, status.error().description());
                 // What can't be looked at is not gone.
-                return {};
+                sawAll = false;
+                continue;
             }
             if (status->device != folder.root->directory->status.device) continue;
             entries.entries.push_back({record->name, *status});
@@ -182,7 +191,7 @@ Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfold
             subfolders->push_back({FileID{entry.status.fileID}, joined(folder.path, entry.name)});
         }
     }
-    return entries.recordedHere == recorded ? Result<void>() : findLost(folder, entries.seen);
+    return !sawAll || entries.recordedHere == recorded ? Result<void>() : findLost(folder, entries.seen);
 }
 
 Result<void> IndexKeeper::compareBatch(OpenFolder& folder, Entries& entries, GoesOn goesOn) {
@@ -277,6 +286,7 @@ void IndexKeeper::watchNames(const OpenFolder& folder, std::string_view name, co
 void IndexKeeper::forgetWatch(FileID fileID) {
     for (const auto& source : sources_) source->forget(fileID);
     unwatched_.erase(fileID);
+    closed_.erase(fileID);
 }
 
 // MARK: Subtrees
@@ -327,10 +337,9 @@ Result<void> IndexKeeper::removeBelow(FileID folder) {
 
 Result<void> IndexKeeper::touchBelow(FileID folder) {
     if (journal_ == Journal::no) return {};
-    TRY(flush());
     return forEachBelow(folder, [this](const Below& below) -> Result<void> {
         changes().touch(below.fileID);
-        return flushWhenFull();
+        return {};
     });
 }
 
@@ -366,6 +375,13 @@ Result<std::shared_ptr<IndexKeeper::OpenFolder>> IndexKeeper::open(FileID fileID
     return folder;
 }
 
+/// A folder that can't be opened because it is not there, or not for us, is one thing; that nothing can be opened for
+/// want of descriptors, memory or a sound disk is another: the round has failed then.
+void IndexKeeper::noteOpenFailure(const KsError& error) {
+    constexpr std::array<int, 6> kNotThere = {ENOENT, ENOTDIR, ELOOP, ESTALE, EACCES, EXDEV};
+    if (std::ranges::none_of(kNotThere, [&](int code) { return error.isPosix(code); })) openFailure_ = error;
+}
+
 /// Null when it can't be opened where the index has it.
 std::shared_ptr<IndexKeeper::OpenFolder> IndexKeeper::openFolder(FileID fileID) {
     if (const auto found = openFolders_.find(fileID); found != openFolders_.end()) return found->second;
@@ -384,7 +400,12 @@ std::shared_ptr<IndexKeeper::OpenFolder> IndexKeeper::openFolder(FileID fileID) 
         for (auto name = names.rbegin(); name != names.rend(); ++name) path = joined(path, *name);
     }
     Result<std::shared_ptr<OpenFolder>> folder = open(fileID, path, *root);
-    if (!folder.ok()) return nullptr;
+    if (!folder.ok()) {
+        // Without a root, nothing at all can be said.
+        if (rootWithID(fileID) != nullptr) openFailure_ = folder.error();
+        noteOpenFailure(folder.error());
+        return nullptr;
+    }
     if (openFolders_.size() >= kOpenFoldersMax) openFolders_.clear();
     return openFolders_.emplace(fileID, *std::move(folder)).first->second;
 }

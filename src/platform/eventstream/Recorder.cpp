@@ -29,6 +29,7 @@ constexpr std::chrono::milliseconds kGatherTime{5};
 // After a failure, such as a full disk.
 constexpr std::chrono::milliseconds kRetryDelay{5'000};
 constexpr std::uint64_t kEventsBetweenTrims = 100'000;
+constexpr int kPathTriesMax = 3;
 // An audit works a fifth of the time.
 constexpr int kAuditRest = 4;
 
@@ -99,30 +100,47 @@ void Recorder::run() {
         finished(started);
         if (started.ok() || stopping_) break;
         logError("can't read the roots; {}", started.error().description());
-        (void)waitForNews(kRetryDelay);
+        rest(kRetryDelay);
     }
     tellObservers();
     lastNews_ = options_.now();
     nextAudit_ = lastNews_ + options_.auditInterval;
     if (!options_.recordsByItself) return;
     std::chrono::milliseconds timeout = options_.auditAfterIdle;
+    bool isBehind = false;
     while (!stopping_) {
-        switch (waitForNews(timeout)) {
-            case Wake::stop: return;
-            case Wake::timeout: timeout = idle(); continue;
-            case Wake::news: break;
+        // What is left of the last time waits for no news.
+        const Wake wake = waitForNews(isBehind ? std::chrono::milliseconds(0) : timeout);
+        if (wake == Wake::stop) return;
+        if (wake == Wake::timeout && !isBehind) {
+            timeout = idle();
+            continue;
         }
-        lastNews_ = options_.now();
-        timeout = options_.auditAfterIdle;
+        const std::uint64_t before = store_->currentEventID();
         if (const Result<void> settled = settle(); !settled.ok() && !stopping_) {
             logError("can't record what happens; {}", settled.error().description());
-            pollfd wake{wakeFd_.get(), POLLIN, 0};
-            (void)::poll(&wake, 1, static_cast<int>(kRetryDelay.count()));
+            rest(kRetryDelay);
         }
+        // A mark on the file system wakes us for much that is none of ours: that is no reason to put an audit off.
+        if (store_->currentEventID() != before) lastNews_ = options_.now();
+        timeout = std::max(std::chrono::milliseconds(1), untilAudit());
         trim();
-        pollfd wake{wakeFd_.get(), POLLIN, 0};
-        (void)::poll(&wake, 1, static_cast<int>(kGatherTime.count()));
+        rest(kGatherTime);
+        const MutexLock lock(mutex_);
+        isBehind = keeper_.isBehind();
     }
+}
+
+/// Unless it is to stop, or there are new roots.
+void Recorder::rest(std::chrono::milliseconds time) {
+    pollfd wake{wakeFd_.get(), POLLIN, 0};
+    (void)::poll(&wake, 1, static_cast<int>(time.count()));
+}
+
+/// Until the next step of an audit: when nothing has happened for a while, and the last audit was long enough ago.
+std::chrono::milliseconds Recorder::untilAudit() const {
+    const auto due = std::max(lastNews_ + options_.auditAfterIdle, isAuditing_ ? lastNews_ : nextAudit_);
+    return std::chrono::duration_cast<std::chrono::milliseconds>(due - options_.now());
 }
 
 Recorder::Wake Recorder::waitForNews(std::chrono::milliseconds timeout) {
@@ -239,26 +257,20 @@ void Recorder::trim() {
 /// A step of an audit when one is due. Answers how long to rest.
 std::chrono::milliseconds Recorder::idle() {
     const auto begin = options_.now();
-    if (begin < nextAudit_ && begin - lastNews_ >= options_.auditAfterIdle) {
-        return std::chrono::duration_cast<std::chrono::milliseconds>(nextAudit_ - begin) + std::chrono::milliseconds(1);
-    }
+    if (const auto left = untilAudit(); left > std::chrono::milliseconds(0)) return left + std::chrono::milliseconds(1);
     {
         const MutexLock lock(mutex_);
-        if (auditStack_.empty()) {
-            if (begin < nextAudit_) return options_.auditAfterIdle;
-            nextAudit_ = begin + options_.auditInterval;
-            auditStack_.assign(keeper_.rootIDs().begin(), keeper_.rootIDs().end());
-        }
+        if (auditStack_.empty()) auditStack_.assign(keeper_.rootIDs().begin(), keeper_.rootIDs().end());
         const FileID folder = auditStack_.back();
         auditStack_.pop_back();
         const std::uint64_t before = keeper_.changeCount();
         const Result<std::vector<FileID>> subfolders = keeper_.compareFolder(folder);
         if (subfolders.ok()) auditStack_.insert(auditStack_.end(), subfolders->begin(), subfolders->end());
         const std::uint64_t differences = keeper_.changeCount() - before;
-        if (auditStack_.empty()) trimmedAt_ = 0;
+        isAuditing_ = !auditStack_.empty();
+        if (!isAuditing_) nextAudit_ = options_.now() + options_.auditInterval;
         const MutexLock stateLock(stateMutex_);
         status_.auditedDifferences += differences;
-        if (auditStack_.empty()) return options_.auditAfterIdle;
     }
     tellObservers();
     const auto took = std::chrono::duration_cast<std::chrono::milliseconds>(options_.now() - begin);
@@ -372,6 +384,10 @@ void Recorder::noteState() {
         if (!root.source)
             status.uncovered.push_back({root.directory->path, "its file system does not tell of changes"});
     }
+    for (const FileID folder : keeper_.closedFolders()) {
+        std::map<FileID, std::string> paths;
+        status.uncovered.push_back({pathOf(*this->roots(), keeper_.rootIDs(), folder, paths), "it can't be read"});
+    }
     if (keeper_.reachedWatchLimit() && inotify_) {
         const EventSource::Usage usage = inotify_->usage();
         const std::size_t unwatched = keeper_.unwatchedFolders().size();
@@ -456,9 +472,20 @@ Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_
     std::map<FileID, std::string> paths;
     for (const JournalEvent& journalled : found) {
         std::string folder = pathOf(*roots, rootIDs, journalled.parent, paths);
+        std::string name = journalled.name;
+        // A folder on the way may have moved between two looks at the index: it leads to a root at every moment.
+        for (int tries = 0; folder.empty() && tries < kPathTriesMax; ++tries) {
+            FileID parent{};
+            store_->indexed(journalled.fileID, [&](const IndexedObject& object) {
+                if (object.eventID == journalled.id) parent = object.parent, name = object.name;
+            });
+            if (parent == FileID{}) break;
+            paths.clear();
+            folder = pathOf(*roots, rootIDs, parent, paths);
+        }
         Event event;
         if (!folder.empty()) {
-            event.path = std::move(folder) + "/" + journalled.name;
+            event.path = std::move(folder) + "/" + name;
         } else if (journalled.kind == JournalEvent::Kind::departed && !journalled.path.empty()) {
             // Its folder is gone as well.
             const auto root = std::ranges::find(rootIDs, journalled.root);

@@ -105,6 +105,8 @@ private:
     enum class Wake { news, timeout, stop };
     Wake waitForNews(std::chrono::milliseconds timeout);
     std::chrono::milliseconds idle();
+    std::chrono::milliseconds untilAudit() const;
+    void rest(std::chrono::milliseconds time);
     std::shared_ptr<const Roots> roots() const;
     std::string pathOf(const Roots& roots, std::span<const FileID> rootIDs, FileID folder,
                        std::map<FileID, std::string>& known) const;
@@ -128,6 +130,7 @@ private:
     // The thread's.
     std::chrono::steady_clock::time_point lastNews_;
     std::chrono::steady_clock::time_point nextAudit_;
+    bool isAuditing_ = false;
     std::uint64_t trimmedAt_ = 0;
 
     mutable Mutex stateMutex_;

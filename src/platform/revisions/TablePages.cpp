@@ -150,7 +150,7 @@ private:
         std::size_t valueBytes = 0;  // Of each of a key's values, where it may have several; otherwise 0.
         bool isFixed = false;        // The values of one key, which are its keys.
         std::uint64_t entries = 0;
-        std::optional<Bytes> previousKey = std::nullopt;
+        std::optional<Bytes> previousKey;
         bool separatorBefore = false;  // previousKey came from a branch: the next key may be equal to it.
     };
     Walk walk_;
@@ -310,11 +310,15 @@ Result<bool> Checker::checkSeveral(const Node& node) {
     }
     if ((node.head.flags & ~kTable) != kSeveral)
         return damaged(fmt::format("\"{}\" has values of no kind", walk_.name));
-    Walk outer = std::exchange(
-        walk_, Walk{.name = fmt::format("values of {}", walk_.name), .keyBytes = walk_.valueBytes, .isFixed = true});
+    Walk inner;
+    inner.name = fmt::format("values of {}", walk_.name);
+    inner.keyBytes = walk_.valueBytes;
+    inner.isFixed = true;
+    std::swap(walk_, inner);
+    Walk& outer = inner;
     const bool isGood = (node.head.flags & kTable) != 0 ? TRY(checkValueTree(node)) : checkPageWithin(node);
     outer.entries += walk_.entries;
-    walk_ = std::move(outer);
+    std::swap(walk_, outer);
     return isGood;
 }
 
@@ -382,7 +386,10 @@ bool Checker::checkFreeList(ByteView value) {
 }
 
 Result<bool> Checker::checkTree(const Tree& tree, std::string_view name, std::size_t keyBytes, std::size_t valueBytes) {
-    walk_ = {.name = std::string(name), .keyBytes = keyBytes, .valueBytes = valueBytes};
+    walk_ = Walk();
+    walk_.name = name;
+    walk_.keyBytes = keyBytes;
+    walk_.valueBytes = valueBytes;
     return walkTree(tree);
 }
 

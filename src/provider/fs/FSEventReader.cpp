@@ -51,6 +51,9 @@ public:
     void readerDidLoseEvents(FSEventReader& /*reader*/, const Event& /*event*/) override {
         decide(CantReplayHistoricalFSEvents());
     }
+    void readerDidFail(FSEventReader& /*reader*/, const KsError& /*error*/) override {
+        decide(CantReplayHistoricalFSEvents());
+    }
     void readerDidFinishHistory(FSEventReader& /*reader*/, std::uint64_t eventID) override {
         reached_ = eventID;
         decide(CanResume());

@@ -526,7 +526,6 @@ TEST_P(VolumeIndexTest, refusesWhatCanNotBe) {
         EXPECT_TRUE(store_->apply(names, {}).error().isPosix(EINVAL));
     }
     EXPECT_EQ(store_->currentEventID(), 1U);
-    EXPECT_TRUE(store_->rememberAttributes(DocumentID{}, {}).error().isPosix(EINVAL));
     EXPECT_EQ(*store_->apply(IndexChanges(), {}), 1U);
 }
 
