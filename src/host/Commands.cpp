@@ -7,6 +7,7 @@
 #include "host/ContainerListing.h"
 #include "host/ContainerMonitor.h"
 #include "host/Descriptor.h"
+#include "host/EditCommands.h"
 #include "host/HostError.h"
 #include "host/ItemWriter.h"
 #include "host/JsonText.h"
@@ -25,14 +26,6 @@ bool isManyFolders(const TesselItemIdentifier& container) {
 
 bool isExpired(const KsError& error) {
     return error.is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::pageExpired));
-}
-
-/// Errors that all say: there is nothing of that name.
-bool isNoSuchItem(const KsError& error) {
-    return error.is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::noSuchItem)) ||
-           error.is(kTSErrorDomain, static_cast<std::int64_t>(TSErrorCode::itemNotFound)) ||
-           error.is("CindralProvider.LocalTesselKitError", 0) ||
-           error.is(kKsGeneralErrorDomain, kKsFileNoSuchFileError);
 }
 
 }  // namespace
@@ -57,6 +50,7 @@ Result<void> Commands::run() {
         case HostCommand::changes: return changes();
         case HostCommand::watch: return watch();
         case HostCommand::status: return status();
+        case HostCommand::edit: return EditCommands(context_, EditTerminal::ofProcess(), output_).run();
         case HostCommand::rpc: break;
     }
     return usageFailure("that is no command that prints");
@@ -73,20 +67,28 @@ KsError Commands::failure(const KsError& error) const {
 
 Result<TesselItemIdentifier> Commands::identifier() const {
     const auto& named = context_.options.item;
-    if (!named) return kTesselRootContainerItemIdentifier;
-    return isIdentifier(*named) ? Result<TesselItemIdentifier>(*named) : identifierAt(*named);
+    return named ? identifierOf(context_, *named) : Result<TesselItemIdentifier>(kTesselRootContainerItemIdentifier);
 }
 
-Result<TesselItemIdentifier> Commands::identifierAt(const std::string& path) const {
+Result<TesselItemIdentifier> Commands::identifierOf(const Context& context, const std::string& named) {
+    return isIdentifier(named) ? Result<TesselItemIdentifier>(named) : identifierAt(context, named);
+}
+
+Result<std::string> Commands::absolutePath(const Context& context, const std::string& path) {
+    if (path.starts_with('/')) return path;
+    if (context.environment.workingFolder.empty())
+        return hostFailure("the working folder is gone: a path must be absolute");
+    return context.environment.workingFolder + "/" + path;
+}
+
+Result<TesselItemIdentifier> Commands::identifierAt(const Context& context, const std::string& path) {
     // An empty path names nothing, not the working folder.
     if (path.empty()) return hostFailure("no such item: the path is empty");
-    if (path.front() != '/' && context_.environment.workingFolder.empty()) {
-        return hostFailure("the working folder is gone: a path must be absolute");
-    }
-    const std::string absolute = path.front() == '/' ? path : context_.environment.workingFolder + "/" + path;
-    const KsURL url = KsURL::fileURL(context_.paths.presentedPath(absolute));
-    auto identifier = context_.client.provider().persistentIdentifierForItemAtURL(url);
-    if (!identifier) return hostFailure(fmt::format("no such item: {}", subject()));
+    const std::string absolute = TRY(absolutePath(context, path));
+    const KsURL url = KsURL::fileURL(context.paths.presentedPath(absolute));
+    if (url.path() == context.paths.presented()) return kTesselRootContainerItemIdentifier;
+    auto identifier = context.client.provider().persistentIdentifierForItemAtURL(url);
+    if (!identifier) return hostFailure(fmt::format("no such item: {}", terminalText(path)));
     return *std::move(identifier);
 }
 
@@ -168,7 +170,7 @@ Result<void> Commands::url() {
 
 Result<void> Commands::id() {
     // Always a path, whatever it looks like.
-    printValue("identifier", TRY(identifierAt(*context_.options.item)));
+    printValue("identifier", TRY(identifierAt(context_, *context_.options.item)));
     return {};
 }
 

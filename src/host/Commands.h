@@ -41,6 +41,10 @@ public:
     /// How an item is named on the command line: an identifier has a well-known name or begins like one; all else is a
     /// path.
     static bool isIdentifier(std::string_view item);
+    static Result<TesselItemIdentifier> identifierOf(const Context& context, const std::string& named);
+    static Result<TesselItemIdentifier> identifierAt(const Context& context, const std::string& path);
+    /// An error where there is no working folder for it to be relative to.
+    static Result<std::string> absolutePath(const Context& context, const std::string& path);
 
 private:
     Result<void> list();
@@ -55,7 +59,6 @@ private:
 
     /// The item that was named; the root container where none was.
     Result<TesselItemIdentifier> identifier() const;
-    Result<TesselItemIdentifier> identifierAt(const std::string& path) const;
     Result<std::shared_ptr<const TesselItem>> item() const;
     /// The named item's text, or the storage's path.
     std::string subject() const;

@@ -57,6 +57,12 @@ int exitStatusOf(const KsError& error) {
     return error.is(kCindralHostErrorDomain, kExitUsage) ? kExitUsage : kExitFailed;
 }
 
+bool isNoSuchItem(const KsError& error) {
+    return error.is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::noSuchItem)) ||
+           error.is(kTSErrorDomain, static_cast<std::int64_t>(TSErrorCode::itemNotFound)) ||
+           error.is(kProviderErrorDomain, 0) || error.is(kKsGeneralErrorDomain, kKsFileNoSuchFileError);
+}
+
 std::string messageOf(const KsError& error) {
     const std::string_view text = interfaceMessage(error);
     return text.empty() ? error.reason() : std::string(text);

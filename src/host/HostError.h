@@ -21,6 +21,9 @@ KsError usageFailure(std::string message);
 
 int exitStatusOf(const KsError& error);
 
+/// Whether the error says: there is nothing of that name.
+bool isNoSuchItem(const KsError& error);
+
 /// What an error means, for people: the domain's own text, or what the host interface says of its codes.
 std::string messageOf(const KsError& error);
 

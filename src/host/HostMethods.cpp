@@ -4,88 +4,18 @@
 
 #include <optional>
 
+#include "host/EditMethods.h"
 #include "host/HostError.h"
 #include "host/ItemWriter.h"
 #include "host/JsonText.h"
+#include "host/RequestParams.h"
 #include "platform/foundation/Base64.h"
+#include "platform/tessel/TesselErrors.h"
 
 namespace cindral {
 namespace {
 
 using Reply = std::shared_ptr<JsonRpcReply>;
-
-/// The parameters of one request. A value that is not what it should be is answered at once, and none comes back.
-class Params {
-public:
-    Params(const Json& params, JsonRpcReply& reply) : params_(params), reply_(reply) {}
-
-    bool has(const char* name) const { return params_.contains(name); }
-
-    std::optional<std::string> string(const char* name) const {
-        const auto found = params_.find(name);
-        if (found == params_.end()) return refuse(fmt::format("\"{}\" is missing", name));
-        if (!found->is_string()) return refuse(fmt::format("\"{}\" is not a string", name));
-        return found->get<std::string>();
-    }
-
-    /// The bytes of a page or an anchor. What they say is the provider's to judge.
-    std::optional<Bytes> base64(const char* name) const {
-        const auto text = string(name);
-        if (!text) return std::nullopt;
-        auto bytes = base64Decode(*text);
-        if (!bytes) refuse(fmt::format("\"{}\" is not base64", name));
-        return bytes;
-    }
-
-    std::optional<KsURL> urlOrPath() const {
-        if (has("url") == has("path")) {
-            refuse("one of \"url\" and \"path\" is needed");
-            return std::nullopt;
-        }
-        return has("url") ? url() : path();
-    }
-
-    /// Where a listing begins: the page that was handed out, or the first one in the order asked for.
-    std::optional<TesselPage> page() const {
-        if (has("page") && has("sort")) {
-            refuse("\"sort\" is for the first page");
-            return std::nullopt;
-        }
-        if (has("page")) return base64("page");
-        if (!has("sort")) return tesselInitialPageSortedByName();
-        const auto sort = string("sort");
-        if (!sort) return std::nullopt;
-        if (*sort == "name") return tesselInitialPageSortedByName();
-        if (*sort == "date") return tesselInitialPageSortedByDate();
-        refuse("\"sort\" is neither \"name\" nor \"date\"");
-        return std::nullopt;
-    }
-
-private:
-    std::optional<std::string> refuse(std::string_view message) const {
-        reply_.error(JsonRpcCode::invalidParams, message);
-        return std::nullopt;
-    }
-
-    std::optional<KsURL> url() const {
-        const auto text = string("url");
-        if (!text) return std::nullopt;
-        auto parsed = KsURL::parse(*text);
-        if (!parsed) refuse("\"url\" is not a URL of this machine");
-        return parsed;
-    }
-
-    std::optional<KsURL> path() const {
-        const auto text = string("path");
-        if (!text) return std::nullopt;
-        if (text->starts_with('/') && text->find('\0') == std::string::npos) return KsURL::fileURL(*text);
-        refuse("\"path\" is not an absolute path");
-        return std::nullopt;
-    }
-
-    const Json& params_;
-    JsonRpcReply& reply_;
-};
 
 /// A value that may be none, as the one member of an object.
 template <typename Append>
@@ -109,12 +39,6 @@ void answerBase64(JsonRpcReply& reply, std::string_view key, const std::optional
         appendBase64(out, *bytes);
         out += '"';
     });
-}
-
-void answerItem(JsonRpcReply& reply, const Result<std::shared_ptr<const TesselItem>>& item,
-                const PresentedPaths& paths) {
-    if (!item.ok()) return answerWithError(reply, item.error(), paths);
-    reply.result([&](std::string& out) { ItemWriter(paths).append(out, **item); });
 }
 
 void answerPage(JsonRpcReply& reply, const Result<ItemsPage>& page, const PresentedPaths& paths) {
@@ -141,12 +65,12 @@ void answerPage(JsonRpcReply& reply, const Result<ItemsPage>& page, const Presen
 }
 
 void itemForIdentifier(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const auto identifier = Params(params, *reply).string("identifier");
+    const auto identifier = RequestParams(params, *reply).string("identifier");
     if (identifier) answerItem(*reply, context.client.provider().itemForIdentifier(*identifier), context.paths);
 }
 
 void urlForItem(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const auto identifier = Params(params, *reply).string("identifier");
+    const auto identifier = RequestParams(params, *reply).string("identifier");
     if (!identifier) return;
     const auto url = context.client.provider().URLForItemWithPersistentIdentifier(*identifier);
     answerOptional(*reply, "url", url.has_value(),
@@ -154,7 +78,7 @@ void urlForItem(const HostMethodsContext& context, const Json& params, const Rep
 }
 
 void identifierForItemAtURL(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const auto url = Params(params, *reply).urlOrPath();
+    const auto url = RequestParams(params, *reply).urlOrPath();
     if (!url) return;
     const auto identifier =
         context.client.provider().persistentIdentifierForItemAtURL(context.paths.presentedURL(*url));
@@ -163,7 +87,7 @@ void identifierForItemAtURL(const HostMethodsContext& context, const Json& param
 }
 
 void enumerateItems(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const Params given(params, *reply);
+    const RequestParams given(params, *reply);
     const auto container = given.string("container");
     if (!container) return;
     const auto page = given.page();
@@ -174,7 +98,7 @@ void enumerateItems(const HostMethodsContext& context, const Json& params, const
 }
 
 void currentSyncAnchor(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const auto container = Params(params, *reply).string("container");
+    const auto container = RequestParams(params, *reply).string("container");
     if (!container) return;
     context.client.currentSyncAnchor(*container,
                                      [reply, &paths = context.paths](Result<std::optional<TesselSyncAnchor>> anchor) {
@@ -220,7 +144,7 @@ void answerChanges(JsonRpcReply& reply, const Result<ChangesBatch>& changes, con
 }
 
 void enumerateChanges(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const Params given(params, *reply);
+    const RequestParams given(params, *reply);
     const auto container = given.string("container");
     if (!container) return;
     const auto anchor = given.base64("anchor");
@@ -232,7 +156,7 @@ void enumerateChanges(const HostMethodsContext& context, const Json& params, con
 }
 
 void startMonitoring(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const auto container = Params(params, *reply).string("container");
+    const auto container = RequestParams(params, *reply).string("container");
     if (!container) return;
     const auto started = context.monitor.start(*container);
     if (!started.ok()) return answerWithError(*reply, started.error(), context.paths);
@@ -240,14 +164,14 @@ void startMonitoring(const HostMethodsContext& context, const Json& params, cons
 }
 
 void stopMonitoring(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const auto container = Params(params, *reply).string("container");
+    const auto container = RequestParams(params, *reply).string("container");
     if (!container) return;
     context.monitor.stop(*container);
     reply->result([](std::string& out) { out += "{}"; });
 }
 
 void defaultContainer(const HostMethodsContext& context, const Json& params, const Reply& reply) {
-    const auto bundleIdentifier = Params(params, *reply).string("bundleIdentifier");
+    const auto bundleIdentifier = RequestParams(params, *reply).string("bundleIdentifier");
     if (!bundleIdentifier) return;
     context.client.provider().defaultApplicationContainerForBundleIdentifier(
         *bundleIdentifier, [reply, &paths = context.paths](const Result<std::shared_ptr<const TesselItem>>& item) {
@@ -267,14 +191,24 @@ void answerWithError(JsonRpcReply& reply, const KsError& error, const PresentedP
     data += R"(,"code":)";
     appendJsonNumber(data, error.code());
     for (const auto& [key, value] : error.userInfo()) {
-        if (key == "message" || key == "domain" || key == "code") continue;
+        if (key == "message" || key == "domain" || key == "code" || key == "collidingURL") continue;
         data += ',';
         appendJsonString(data, key);
         data += ':';
         appendJsonString(data, key == "path" ? paths.realPath(value) : value);
     }
+    if (const auto item = collidingItem(error)) {
+        data += R"(,"item":)";
+        ItemWriter(paths).append(data, *item);
+    }
     data += '}';
     reply.error(JsonRpcCode::operationFailed, messageOf(error), data);
+}
+
+void answerItem(JsonRpcReply& reply, const Result<std::shared_ptr<const TesselItem>>& item,
+                const PresentedPaths& paths) {
+    if (!item.ok()) return answerWithError(reply, item.error(), paths);
+    reply.result([&](std::string& out) { ItemWriter(paths).append(out, **item); });
 }
 
 JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context) {
@@ -291,7 +225,7 @@ JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context) {
         {"defaultContainer", defaultContainer},
         {"status", status},
     };
-    JsonRpcServer::Methods methods;
+    JsonRpcServer::Methods methods = makeEditMethods(context);
     for (const auto& entry : kHandlers) {
         methods.emplace(entry.first, [context, handler = entry.second](const Json& params, const Reply& reply) {
             handler(context, params, reply);

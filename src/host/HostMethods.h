@@ -23,5 +23,7 @@ JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context);
 
 /// Answers with what a provider refused: its domain and code, and the named texts, paths as clients know them.
 void answerWithError(JsonRpcReply& reply, const KsError& error, const PresentedPaths& paths);
+void answerItem(JsonRpcReply& reply, const Result<std::shared_ptr<const TesselItem>>& item,
+                const PresentedPaths& paths);
 
 }  // namespace cindral

@@ -36,6 +36,7 @@ struct Words {
     bool intoPackages = false;
     std::string since;
     std::string item;
+    EditOptions edit;
 };
 
 enum class Argument { none, optionalItem, item, path };
@@ -124,22 +125,33 @@ void addCommands(CLI::App& app, Words& words) {
     }
 }
 
-const CommandDescription& chosenCommand(const CLI::App& app) {
+/// None for a command that changes something.
+const CommandDescription* chosenCommand(const CLI::App& app) {
     const CLI::App* chosen = app.get_subcommands().front();
-    return *std::ranges::find_if(kCommands,
-                                 [&](const CommandDescription& each) { return chosen->get_name() == each.name; });
+    const auto* found = std::ranges::find_if(
+        kCommands, [&](const CommandDescription& each) { return chosen->get_name() == each.name; });
+    return found != std::end(kCommands) ? found : nullptr;
+}
+
+/// What the chosen command is and is about.
+void readCommand(const CLI::App& app, const Words& words, HostOptions& options) {
+    const CLI::App* chosen = app.get_subcommands().front();
+    const CommandDescription* description = chosenCommand(app);
+    if (description == nullptr) {
+        options.command = HostCommand::edit;
+        options.edit = words.edit;
+        options.edit.command = editCommandNamed(chosen->get_name()).value_or(EditCommand::tags);
+        return;
+    }
+    options.command = description->command;
+    const char* argument = description->argument == Argument::path ? "PATH" : "ITEM";
+    const bool hasItem = description->argument != Argument::none && chosen->get_option_no_throw(argument)->count() > 0;
+    if (hasItem) options.item = words.item;
 }
 
 HostOptions optionsOf(const CLI::App& app, const Words& words, const HostEnvironment& environment) {
     HostOptions options;
-    const CommandDescription& description = chosenCommand(app);
-    options.command = description.command;
-    const bool hasItem = description.argument != Argument::none &&
-                         app.get_subcommands()
-                                 .front()
-                                 ->get_option_no_throw(description.argument == Argument::path ? "PATH" : "ITEM")
-                                 ->count() > 0;
-    if (hasItem) options.item = words.item;
+    readCommand(app, words, options);
     options.storage = words.storage.empty() ? documentsFolder(environment) : absolutePath(words.storage, environment);
     if (!words.state.empty()) {
         options.state = absolutePath(words.state, environment);
@@ -193,6 +205,7 @@ std::variant<HostOptions, HostReply> parseHostOptions(std::span<const std::strin
     Words parsed;
     addOptions(app, parsed);
     addCommands(app, parsed);
+    addEditCommands(app, parsed.edit);
     app.set_version_flag("--version", fmt::format("cindral {}", hostVersion()), "Print the version and exit.");
     app.set_help_flag("-h,--help", "Say what can be said and exit.");
     for (CLI::App* command : app.get_subcommands({}))

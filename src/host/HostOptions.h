@@ -6,11 +6,12 @@
 #include <variant>
 #include <vector>
 
+#include "host/EditOptions.h"
 #include "host/HostEnvironment.h"
 
 namespace cindral {
 
-enum class HostCommand { ls, tree, info, url, id, anchor, changes, watch, status, rpc };
+enum class HostCommand { ls, tree, info, url, id, anchor, changes, watch, status, rpc, edit };
 enum class RecorderChoice { automatic, inotify, fanotify };
 /// "auto", "inotify", "fanotify".
 std::string_view recorderChoiceName(RecorderChoice choice);
@@ -28,6 +29,7 @@ struct HostOptions {
     RecorderChoice recorder = RecorderChoice::automatic;
     bool json = false;
     bool intoPackages = false;  ///< tree
+    EditOptions edit;           ///< edit
     std::string since;          ///< changes: an anchor, as printed
 };
 

@@ -83,7 +83,8 @@ bool records(HostCommand command) {
         case HostCommand::tree:
         case HostCommand::info:
         case HostCommand::url:
-        case HostCommand::id: return false;
+        case HostCommand::id:
+        case HostCommand::edit: return false;
     }
     return false;
 }

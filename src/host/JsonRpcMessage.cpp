@@ -12,14 +12,6 @@ namespace {
 
 constexpr double kExactFractionMax = 9'007'199'254'740'992.0;  // 2^53: beyond it a double skips integers.
 
-/// The id as it is to be echoed; none where it is of a kind that no id is, or can't be echoed exactly.
-std::optional<std::string> echoOf(const Json& id) {
-    if (id.is_string()) return jsonString(id.get_ref<const std::string&>());
-    if (id.is_number_float() && !(std::abs(id.get<double>()) < kExactFractionMax)) return std::nullopt;
-    if (id.is_number() || id.is_null()) return id.dump();
-    return std::nullopt;
-}
-
 JsonRpcFault invalidRequest(std::string message, std::string id = "null") {
     return {JsonRpcCode::invalidRequest, std::move(message), std::move(id)};
 }
@@ -34,7 +26,7 @@ JsonRpcEntry requestOf(Json&& value) {
 
     std::string id;
     if (const Json* given = member(value, "id")) {
-        auto echo = echoOf(*given);
+        auto echo = jsonRpcIDText(*given);
         if (!echo) return invalidRequest("The id is neither a string, a number of 64 bits nor null");
         id = *std::move(echo);
     }
@@ -122,6 +114,13 @@ JsonRpcLine decodeJsonRpcLine(std::string_view line) {
     JsonRpcLine result;
     result.entries.push_back(requestOf(std::move(value)));
     return result;
+}
+
+std::optional<std::string> jsonRpcIDText(const Json& id) {
+    if (id.is_string()) return jsonString(id.get_ref<const std::string&>());
+    if (id.is_number_float() && !(std::abs(id.get<double>()) < kExactFractionMax)) return std::nullopt;
+    if (id.is_number() || id.is_null()) return id.dump();
+    return std::nullopt;
 }
 
 std::string encodeJsonRpcFault(const JsonRpcFault& fault) {

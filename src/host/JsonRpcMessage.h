@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <nlohmann/json.hpp>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <variant>
@@ -63,6 +64,9 @@ JsonRpcLine decodeJsonRpcLine(std::string_view line);
 /// Whether the text is nested deeper than that, or holds more values, brackets in strings not counted. The text need
 /// not be JSON.
 bool isJsonTooComplex(std::string_view text, std::size_t depthMax, std::size_t valuesMax);
+
+/// The id as it is to be echoed, as JSON text; none where it is of a kind that no id is, or can't be echoed exactly.
+std::optional<std::string> jsonRpcIDText(const Json& id);
 
 /// One answer as JSON text, without a newline.
 std::string encodeJsonRpcFault(const JsonRpcFault& fault);

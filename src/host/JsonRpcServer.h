@@ -1,6 +1,5 @@
 #pragma once
 
-#include <atomic>
 #include <functional>
 #include <map>
 #include <memory>
@@ -25,12 +24,22 @@ public:
     virtual void result(const std::function<void(std::string& out)>& append) = 0;
     /// `data` is JSON text; empty for none.
     virtual void error(JsonRpcCode code, std::string_view message, std::string_view data = {}) = 0;
+
+    /// The request's id as JSON text; empty for a notification.
+    virtual const std::string& id() const = 0;
+    /// Sends a notification about the request: a line, newline included. None is sent once the request is answered.
+    virtual void notify(std::string_view line) = 0;
+    /// What to do when the client cancels the request: at once where it has already, never once it is answered.
+    virtual void setCancellation(std::function<void()> cancellation) = 0;
 };
 
 /// Answers the requests of one client: finds the method, runs it beside others, writes each answer as one line.
 ///
 /// At most kRequestsInFlightMax requests are under way; receiving waits meanwhile, so that a client that sends faster
 /// than it is served costs no memory. The answers of a batch come as one line when all are there.
+///
+/// One method is its own: "cancel", which passes on to a request under way (by its id, "request") that its client no
+/// longer wants it. It is answered with {} whether or not there still is such a request.
 ///
 /// Thread safety: one thread receives; answers may come from any.
 class JsonRpcServer {
@@ -64,8 +73,9 @@ private:
 
     void receive(JsonRpcEntry entry, const std::shared_ptr<Answers>& answers);
     void start(JsonRpcRequest request, const std::shared_ptr<Answers>& answers);
+    void cancel(const Json& params, JsonRpcReply& reply);
     void enter();
-    void leave();
+    void leave(const std::string& id);
 
     const Methods methods_;
     const Sink sink_;
@@ -73,6 +83,7 @@ private:
     Mutex mutex_;
     Condition changed_;
     std::size_t inFlight_ GUARDED_BY(mutex_) = 0;
+    std::multimap<std::string, std::weak_ptr<Reply>> cancellable_ GUARDED_BY(mutex_);  ///< by id
 };
 
 }  // namespace cindral

@@ -6,8 +6,10 @@
 #include <utility>
 
 #include "platform/foundation/Log.h"
+#include "platform/foundation/RootDirectories.h"
 #include "platform/roster/Roster.h"
 #include "platform/tessel/NotificationCenter.h"
+#include "platform/tessel/StagingFolder.h"
 #include "platform/tessel/TesselErrors.h"
 #include "platform/tessel/TesselManager.h"
 #include "provider/AppRefresh.h"
@@ -63,6 +65,8 @@ LocalTesselKit::LocalTesselKit()
 }
 
 std::shared_ptr<LocalTesselKit> LocalTesselKit::init() {
+    // What an earlier process left half done goes before anybody looks.
+    for (const auto& root : RootDirectories::shared().all()) StagingFolder::removeAbandoned(*root);
     std::shared_ptr<LocalTesselKit> provider(new LocalTesselKit);
     NotificationCenter& center = requiredDistributedCenter();
     const InstalledAppsProxy* proxy = provider->installedAppsProxy_.get();
@@ -147,8 +151,12 @@ std::optional<TesselItemIdentifier> LocalTesselKit::persistentIdentifierForItemA
 }
 
 Result<std::shared_ptr<const TesselItem>> LocalTesselKit::itemForIdentifier(const TesselItemIdentifier& identifier) {
+    return std::shared_ptr<const TesselItem>(TRY(fetchItem(identifier)));
+}
+
+Result<std::shared_ptr<const LocalItem>> LocalTesselKit::fetchItem(const TesselItemIdentifier& identifier) {
     const LogSection section("fetching item's properties for \"{}\"", identifier);
-    std::shared_ptr<const TesselItem> item = resolveItem(identifier);
+    std::shared_ptr<const LocalItem> item = resolveItem(identifier);
     if (!item) {
         logError("item lookup failed for identifier \"{}\"", identifier);
         return errorFor(LocalTesselKitError::invalidItemIdentifier).with("identifier", identifier);

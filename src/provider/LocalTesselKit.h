@@ -37,6 +37,37 @@ public:
     void stopProvidingItemAtURL(const KsURL& url) override;
     void itemChangedAtURL(const KsURL& url) override;
 
+    std::shared_ptr<TesselProgress> importDocumentAtURL(const KsURL& url, const TesselItemIdentifier& parent,
+                                                        ItemCompletion completion) override;
+    void createDirectoryWithName(const std::string& name, const TesselItemIdentifier& parent,
+                                 ItemCompletion completion) override;
+    void renameItemWithIdentifier(const TesselItemIdentifier& identifier, const std::string& name,
+                                  ItemCompletion completion) override;
+    std::shared_ptr<TesselProgress> reparentItemWithIdentifier(const TesselItemIdentifier& identifier,
+                                                               const TesselItemIdentifier& parent,
+                                                               const std::optional<std::string>& newName,
+                                                               ItemCompletion completion) override;
+    std::shared_ptr<TesselProgress> deleteItemWithIdentifier(const TesselItemIdentifier& identifier,
+                                                             Completion completion) override;
+
+    /// The trash is the folder ".Trash" in the first folder "Documents" of the item's path. A trashed item bears the
+    /// date, and where it was.
+    void trashItemWithIdentifier(const TesselItemIdentifier& identifier, ItemCompletion completion) override;
+    void untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
+                                   const std::optional<TesselItemIdentifier>& parent,
+                                   ItemCompletion completion) override;
+    /// Of the storage and of every app library. What has no date yet is given one and kept; links, FIFOs and the like,
+    /// which can't bear one, go by when they last changed, which being trashed is.
+    void removeTrashedItemsOlderThanDate(const KsDate& date, Completion completion) override;
+
+    /// An app library's is never written: its item comes back as it is.
+    void setLastUsedDate(const std::optional<KsDate>& date, const TesselItemIdentifier& identifier,
+                         ItemCompletion completion) override;
+    void setTagData(const std::optional<Bytes>& tagData, const TesselItemIdentifier& identifier,
+                    ItemCompletion completion) override;
+    void setFavoriteRank(std::optional<std::int64_t> rank, const TesselItemIdentifier& identifier,
+                         ItemCompletion completion) override;
+
     void defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier,
                                                         ItemCompletion completion) override;
 
@@ -49,12 +80,28 @@ private:
 
     LocalTesselKit();
     static void notificationCallback(const void* observer, std::string_view name);
-    std::optional<KsURL> urlForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier);
-    std::optional<TesselItemIdentifier> persistentIdentifierForItemAt(const KsURL& url);
+    static std::optional<KsURL> urlForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier);
+    static std::optional<TesselItemIdentifier> persistentIdentifierForItemAt(const KsURL& url);
     static std::shared_ptr<const LocalItem> resolveItem(const TesselItemIdentifier& identifier,
                                                         LocalItem::Customs customs = LocalItem::Customs());
     /// The URL of an item, or the host's no-such-item error.
     static Result<KsURL> urlForItem(const TesselItemIdentifier& identifier);
+
+    // What edits share. Static: what answers them may outlast the provider.
+    static Result<std::shared_ptr<const LocalItem>> fetchItem(const TesselItemIdentifier& identifier);
+    /// What there is at a URL after an edit.
+    static Result<std::shared_ptr<const TesselItem>> itemAtURL(const KsURL& url);
+    /// An edit's error as the host knows it: of a name that is taken, with the item that has it.
+    static KsError translated(const KsError& error);
+    static Result<std::shared_ptr<const TesselItem>> converted(const Result<KsURL>& result);
+    static void putBack(const TesselItemIdentifier& identifier, const std::optional<TesselItemIdentifier>& parent,
+                        const ItemCompletion& completion);
+    static std::optional<KsURL> destinationOfUntrash(const LocalItem& item,
+                                                     const std::optional<TesselItemIdentifier>& parent);
+    static Result<std::shared_ptr<const TesselItem>> withAttribute(const KsURL& url,
+                                                                   const TesselItemIdentifier& identifier,
+                                                                   std::string_view name,
+                                                                   const std::optional<Bytes>& value);
 
     SerialQueue appRefreshQueue_{"cindral.app-refresh.queue"};
     TSPacer appRefreshPacer_;

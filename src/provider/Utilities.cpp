@@ -1,15 +1,14 @@
 #include "provider/Utilities.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <sys/xattr.h>
-
 #include <cerrno>
 #include <cstdlib>
 #include <string>
 
 #include "platform/foundation/Log.h"
 #include "platform/foundation/RootDirectories.h"
+#include "platform/foundation/SysEdits.h"
+#include "platform/tessel/FileOperations.h"
+#include "platform/tessel/StagingFolder.h"
 #include "platform/tessel/TesselManager.h"
 
 namespace cindral {
@@ -36,24 +35,13 @@ void logXattrFailure(std::string_view what, std::string_view name, const KsError
     }
 }
 
-std::optional<KsError> xattrWriteFailure(std::string_view verb, std::string_view name) {
-    const KsError error = KsError::errorWithPOSIXCode();
+std::optional<KsError> xattrWriteFailure(std::string_view verb, std::string_view name, const KsError& error) {
     if (error.isPosix(EACCES)) {
         logDebug("can't {} xattr \"{}\"; {}", verb, name, error.description());
     } else {
         logError("can't {} xattr \"{}\"; {}", verb, name, error.description());
     }
     return error;
-}
-
-/// Makes a folder unless it is there. What is there otherwise is an error: a link or a file would lead elsewhere.
-Result<void> makeFolderIn(const KsURL& folder, std::string_view name) {
-    const UniqueFd parent = TRY(folder.open(O_PATH | O_DIRECTORY));
-    const std::string text(name);
-    if (::mkdirat(parent.get(), text.c_str(), 0700) == 0) return {};
-    const KsError error = KsError::errorWithPOSIXCode();
-    if (!error.isPosix(EEXIST) || !TRY(sys::statx(parent.get(), text.c_str())).isDirectory()) return error;
-    return {};
 }
 
 template <typename T>
@@ -109,11 +97,12 @@ std::optional<Bytes> initWithValueOfXattr(std::string_view name, const KsURL& ur
 std::optional<KsError> setXattr(int fd, const std::optional<Bytes>& value, std::string_view name) {
     const std::string full = inUserNamespace(name);
     if (value) {
-        if (::fsetxattr(fd, full.c_str(), value->data(), value->size(), 0) == 0) return std::nullopt;
-        return xattrWriteFailure("set", name);
+        const Result<void> set = sys::fsetxattr(fd, full.c_str(), *value);
+        return set.ok() ? std::nullopt : xattrWriteFailure("set", name, set.error());
     }
-    if (::fremovexattr(fd, full.c_str()) == 0 || errno == ENODATA) return std::nullopt;
-    return xattrWriteFailure("remove", name);
+    const Result<void> removed = sys::fremovexattr(fd, full.c_str());
+    if (removed.ok() || removed.error().isPosix(ENODATA)) return std::nullopt;
+    return xattrWriteFailure("remove", name, removed.error());
 }
 
 std::optional<bool> boolResourceValue(const KsURL& url, ResourceKey key) {
@@ -162,10 +151,9 @@ double mainScreenScale() {
 }
 
 KsURL temporaryLocalFolderURL() {
-    static constexpr std::string_view kName = ".TemporaryLocalFolder";
     const KsURL storage = TesselManager::defaultManager().documentStorageURL();
-    const KsURL folder = storage.appendingPathComponent(kName);
-    const Result<void> made = makeFolderIn(storage, kName);
+    KsURL folder = storage.appendingPathComponent(kTemporaryLocalFolderName);
+    const Result<void> made = file_operations::makeFolderUnlessThere(folder);
     if (!made.ok()) logError("can't create temporary directory; {}", made.error().description());
     return folder;
 }

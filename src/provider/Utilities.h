@@ -29,7 +29,8 @@ inline constexpr std::string_view kXattrTagDataName = "com.vemra.metadata:_kMDIt
 /// The attribute's bytes, read without following a final link; none when it is absent or can't be read (logged, unless
 /// absent).
 std::optional<Bytes> initWithValueOfXattr(std::string_view name, const KsURL& url);
-/// Sets the attribute of an open file, or removes it when there is no value. Removing what is not there succeeds.
+/// Sets the attribute of an open file (O_PATH will do), or removes it when there is no value. Removing what is not there
+/// succeeds.
 std::optional<KsError> setXattr(int fd, const std::optional<Bytes>& value, std::string_view name);
 
 /// Resource values as a type: none when absent, of another type, or unreadable; the last is logged at error level.

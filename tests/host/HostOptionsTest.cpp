@@ -3,6 +3,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <map>
+
 namespace cindral {
 namespace {
 
@@ -181,6 +183,83 @@ TEST(HostOptions, changesNeedsAnAnchor) {
     EXPECT_EQ(std::get<HostOptions>(given).command, HostCommand::changes);
     EXPECT_EQ(std::get<HostOptions>(given).since, "MA==");
     EXPECT_EQ(std::get<HostOptions>(given).item, "fid=2");
+}
+
+TEST(EditOptions, nameTheirItemsInOrder) {
+    const HostOptions moved = options({"mv", "a", "did=1", "--keep-both", "folder", "--json"});
+    EXPECT_EQ(moved.command, HostCommand::edit);
+    EXPECT_EQ(moved.edit.command, EditCommand::mv);
+    EXPECT_THAT(moved.edit.words, ElementsAre("a", "did=1", "folder"));
+    EXPECT_TRUE(moved.edit.keepsBoth);
+    EXPECT_TRUE(moved.json);
+    EXPECT_THAT(options({"rm", "--yes", "--", "-rf", "--yes"}).edit.words, ElementsAre("-rf", "--yes"));
+    EXPECT_EQ(options({"import", "a", "--to", "#com.example"}).edit.folder, "#com.example");
+    EXPECT_EQ(options({"mkdir", "a", "--in", "fid=2"}).edit.folder, "fid=2");
+    EXPECT_EQ(options({"favorite", "a", "--rank", "-3"}).edit.rank, -3);
+    EXPECT_EQ(options({"empty-trash", "--older-than", "30d"}).edit.olderThan, "30d");
+    EXPECT_TRUE(options({"touch-used", "a", "--clear"}).edit.isCleared);
+}
+
+TEST(EditOptions, areCheckedForTheirNumber) {
+    for (const auto& words : std::vector<std::vector<std::string>>{{"import"},
+                                                                   {"mkdir"},
+                                                                   {"rename", "a"},
+                                                                   {"rename", "a", "b", "c"},
+                                                                   {"mv", "a"},
+                                                                   {"rm"},
+                                                                   {"trash"},
+                                                                   {"restore"},
+                                                                   {"empty-trash", "a"},
+                                                                   {"tag", "a"},
+                                                                   {"untag", "a"},
+                                                                   {"tags"},
+                                                                   {"favorite"},
+                                                                   {"unfavorite"},
+                                                                   {"touch-used"},
+                                                                   {"favorite", "a", "--rank", "x"},
+                                                                   {"favorite", "a", "--rank", "9223372036854775808"},
+                                                                   {"empty-trash", "--older-than", "soon"},
+                                                                   {"touch-used", "a", "--date", "2026-13-01"},
+                                                                   {"trash", "a", "--yes"}}) {
+        expectUsageFailure(words);
+    }
+}
+
+TEST(EditOptions, everyCommandIsKnownByItsName) {
+    const std::map<std::string, EditCommand> commands{{"import", EditCommand::importFiles},
+                                                      {"mkdir", EditCommand::mkdir},
+                                                      {"rename", EditCommand::rename},
+                                                      {"mv", EditCommand::mv},
+                                                      {"rm", EditCommand::rm},
+                                                      {"trash", EditCommand::trash},
+                                                      {"restore", EditCommand::restore},
+                                                      {"empty-trash", EditCommand::emptyTrash},
+                                                      {"tag", EditCommand::tag},
+                                                      {"untag", EditCommand::untag},
+                                                      {"tags", EditCommand::tags},
+                                                      {"favorite", EditCommand::favorite},
+                                                      {"unfavorite", EditCommand::unfavorite},
+                                                      {"touch-used", EditCommand::touchUsed}};
+    for (const auto& [name, command] : commands) {
+        EXPECT_EQ(editCommandNamed(name), command) << name;
+        EXPECT_EQ(reply({name, "--help"}).exitStatus, 0) << name;
+    }
+    EXPECT_EQ(editCommandNamed("ls"), std::nullopt);
+}
+
+TEST(MomentOf, isAnAgeADayOrADate) {
+    const KsDate now{1'000'000'000, 5};
+    EXPECT_EQ(momentOf("0s", now), now);
+    EXPECT_EQ(momentOf("90s", now), (KsDate{999'999'910, 5}));
+    EXPECT_EQ(momentOf("2m", now), (KsDate{999'999'880, 5}));
+    EXPECT_EQ(momentOf("1h", now), (KsDate{999'996'400, 5}));
+    EXPECT_EQ(momentOf("30d", now), (KsDate{997'408'000, 5}));
+    EXPECT_EQ(momentOf("2w", now), (KsDate{998'790'400, 5}));
+    EXPECT_EQ(momentOf("2001-09-09", now), (KsDate{999'993'600, 0}));
+    EXPECT_EQ(momentOf("2001-09-09T01:46:40.5+00:00", now), (KsDate{1'000'000'000, 500'000'000}));
+    for (const char* text :
+         {"", "d", "30", "30y", "-1d", "1.5d", "30 d", "999999999999999999w", "99999999999999999999s", "yesterday"})
+        EXPECT_EQ(momentOf(text, now), std::nullopt) << text;
 }
 
 }  // namespace

@@ -195,5 +195,69 @@ TEST_F(JsonRpcServerTest, boundsWhatABatchCosts) {
     EXPECT_EQ(refused, 3U);
 }
 
+TEST_F(JsonRpcServerTest, cancelsARequestUnderWay) {
+    methods_.emplace("wait", [](const Json&, const Reply& reply) {
+        auto cancelled = std::make_shared<DispatchSemaphore>(0);
+        reply->setCancellation([cancelled] { cancelled->signal(); });
+        cancelled->wait();
+        reply->error(JsonRpcCode::operationFailed, "cancelled", {});
+    });
+    EXPECT_THAT(answersTo({call("wait", "7"), call("cancel", "8", R"({"request":7})")}),
+                UnorderedElementsAre(fault(-32000, "cancelled", "7"), R"({"jsonrpc":"2.0","id":8,"result":{}})"));
+}
+
+// A request may be cancelled before it has begun: it is told as soon as it wants to know.
+TEST_F(JsonRpcServerTest, cancelsARequestThatHasNotBegun) {
+    auto mayBegin = std::make_shared<DispatchSemaphore>(0);
+    methods_.emplace("late", [mayBegin](const Json&, const Reply& reply) {
+        mayBegin->wait();
+        bool isCancelled = false;
+        reply->setCancellation([&] { isCancelled = true; });
+        reply->result([&](std::string& out) { out += isCancelled ? "true" : "false"; });
+    });
+    std::vector<std::string> answers;
+    {
+        JsonRpcServer server(methods_, [&](std::string_view line) {
+            const MutexLock lock(mutex_);
+            answers.emplace_back(line.substr(0, line.size() - 1));
+        });
+        server.receiveLine(call("late", R"("a")"));
+        server.receiveLine(call("late", R"("b")"));
+        server.receiveLine(call("cancel", "1", R"({"request":"a"})"));
+        mayBegin->signal();
+        mayBegin->signal();
+    }
+    EXPECT_THAT(answers, UnorderedElementsAre(R"({"jsonrpc":"2.0","id":1,"result":{}})",
+                                              R"({"jsonrpc":"2.0","id":"a","result":true})",
+                                              R"({"jsonrpc":"2.0","id":"b","result":false})"));
+}
+
+TEST_F(JsonRpcServerTest, cancellingAnythingElseIsNothing) {
+    EXPECT_THAT(
+        answersTo({call("cancel", "1", R"({"request":99})"), call("cancel", "2", R"({"request":2})"),
+                   call("cancel", "3", R"({"request":null})")}),
+        UnorderedElementsAre(R"({"jsonrpc":"2.0","id":1,"result":{}})", R"({"jsonrpc":"2.0","id":2,"result":{}})",
+                             R"({"jsonrpc":"2.0","id":3,"result":{}})"));
+    for (const char* params : {"{}", R"({"request":[]})", R"({"request":true})", R"({"request":1e300})"}) {
+        EXPECT_THAT(answersTo({call("cancel", "4", params)}),
+                    ElementsAre(fault(-32602, "\\\"request\\\" is not the id of a request", "4")));
+    }
+    EXPECT_THAT(answersTo({call("cancel", "5", "[]")}),
+                ElementsAre(fault(-32602, "Parameters are given by name", "5")));
+}
+
+TEST_F(JsonRpcServerTest, notifiesUntilItHasAnswered) {
+    methods_.emplace("tell", [](const Json&, const Reply& reply) {
+        reply->notify("about " + reply->id() + "\n");
+        reply->result([](std::string& out) { out += "1"; });
+        reply->notify("too late\n");
+        bool isCalled = false;
+        reply->setCancellation([&] { isCalled = true; });
+        EXPECT_FALSE(isCalled);
+    });
+    EXPECT_THAT(answersTo({call("tell", "7")}), ElementsAre("about 7", R"({"jsonrpc":"2.0","id":7,"result":1})"));
+    EXPECT_THAT(answersTo({R"({"jsonrpc":"2.0","method":"tell"})"}), IsEmpty());
+}
+
 }  // namespace
 }  // namespace cindral

@@ -1,6 +1,7 @@
 #include "support/TemporaryFolder.h"
 
 #include <gtest/gtest.h>
+#include <sys/xattr.h>
 
 #include <cstdlib>
 #include <filesystem>
@@ -8,8 +9,10 @@
 
 namespace cindral::test {
 
-TemporaryFolder::TemporaryFolder() {
-    std::string pattern = ::testing::TempDir();
+TemporaryFolder::TemporaryFolder() : TemporaryFolder(::testing::TempDir()) {}
+
+TemporaryFolder::TemporaryFolder(const std::string& parent) {
+    std::string pattern = parent;
     if (!pattern.ends_with('/')) pattern += '/';
     pattern += "cindral-XXXXXX";
     if (::mkdtemp(pattern.data()) == nullptr) std::abort();
@@ -33,6 +36,15 @@ std::string TemporaryFolder::file(std::string_view name, std::string_view conten
 std::string TemporaryFolder::folder(std::string_view name) const {
     std::filesystem::create_directories(*this / name);
     return *this / name;
+}
+
+std::string TemporaryFolder::inMemory() {
+    const std::string memory = "/dev/shm";
+    std::string pattern = memory + "/cindral-XXXXXX";
+    if (::mkdtemp(pattern.data()) == nullptr) return ::testing::TempDir();
+    const bool keepsAttributes = ::setxattr(pattern.c_str(), "user.probe", "", 0, 0) == 0;
+    std::filesystem::remove(pattern);
+    return keepsAttributes ? memory : ::testing::TempDir();
 }
 
 }  // namespace cindral::test

@@ -9,6 +9,7 @@ namespace cindral::test {
 class TemporaryFolder {
 public:
     TemporaryFolder();
+    explicit TemporaryFolder(const std::string& parent);
     ~TemporaryFolder();
     TemporaryFolder(const TemporaryFolder&) = delete;
     TemporaryFolder& operator=(const TemporaryFolder&) = delete;
@@ -19,6 +20,10 @@ public:
     /// Writes a file below the folder, making the folders on the way.
     std::string file(std::string_view name, std::string_view contents = "") const;
     std::string folder(std::string_view name) const;
+
+    /// Where folders are in memory, and nothing waits for a disk; where that keeps no attributes of one's own, the
+    /// usual place.
+    static std::string inMemory();
 
 private:
     std::string path_;

@@ -26,7 +26,15 @@ const KsError::UserInfo& KsError::userInfo() const {
 KsError KsError::with(std::string key, std::string value) const {
     UserInfo info = userInfo();
     info.insert_or_assign(std::move(key), std::move(value));
-    return {domain_, code_, std::move(info)};
+    KsError error(domain_, code_, std::move(info));
+    error.attachment_ = attachment_;
+    return error;
+}
+
+KsError KsError::withAttachment(std::shared_ptr<const KsErrorAttachment> attachment) const {
+    KsError error = *this;
+    error.attachment_ = std::move(attachment);
+    return error;
 }
 
 std::string KsError::reason() const {

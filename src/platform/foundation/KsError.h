@@ -17,6 +17,14 @@ inline constexpr std::int64_t kKsFileNoSuchFileError = 260;
 inline constexpr std::int64_t kKsFileWriteNoPermissionError = 513;
 inline constexpr std::int64_t kKsFileWriteFileExistsError = 516;
 
+/// What an error holds besides texts. Whoever made it knows the type.
+struct KsErrorAttachment {
+    KsErrorAttachment() = default;
+    virtual ~KsErrorAttachment() = default;
+    KsErrorAttachment(const KsErrorAttachment&) = delete;
+    KsErrorAttachment& operator=(const KsErrorAttachment&) = delete;
+};
+
 /// What went wrong: a domain, a code within it, and optionally named texts that say with what.
 ///
 /// In the POSIX domain the code is an errno value.
@@ -45,6 +53,10 @@ public:
     const UserInfo& userInfo() const;
     KsError with(std::string key, std::string value) const;
 
+    KsError withAttachment(std::shared_ptr<const KsErrorAttachment> attachment) const;
+    /// Null when there is none.
+    const KsErrorAttachment* attachment() const { return attachment_.get(); }
+
     /// A line for people: what the code means, and the domain and code themselves.
     std::string description() const;
     /// What the code means, for a message on a terminal: "No such file or directory".
@@ -56,6 +68,7 @@ private:
     std::string_view domain_;
     std::int64_t code_;
     std::shared_ptr<const UserInfo> info_;
+    std::shared_ptr<const KsErrorAttachment> attachment_;
 };
 
 }  // namespace cindral

@@ -9,6 +9,7 @@
 #include <sys/stat.h>
 #include <sys/statvfs.h>
 #include <sys/syscall.h>
+#include <sys/sysmacros.h>
 #include <sys/utsname.h>
 #include <sys/vfs.h>
 #include <sys/xattr.h>
@@ -21,6 +22,8 @@
 #include <cstring>
 #include <fstream>
 #include <iterator>
+
+#include "platform/foundation/SysFaults.h"
 
 namespace cindral {
 
@@ -99,7 +102,7 @@ Result<UniqueFd> open(const char* path, int flags, mode_t mode) {
 
 Result<UniqueFd> openat(int directory, const char* name, int flags, mode_t mode) {
     while (true) {
-        const int fd = ::openat(directory, name, flags | O_CLOEXEC, mode);
+        const int fd = isToFail("openat") ? -1 : ::openat(directory, name, flags | O_CLOEXEC, mode);
         if (fd >= 0) return UniqueFd(fd);
         if (errno != EINTR) return KsError::posix(errno);
     }
@@ -112,7 +115,7 @@ Result<UniqueFd> openat2(int directory, const char* path, int flags, std::uint64
     how.flags = static_cast<std::uint64_t>(flags) | O_CLOEXEC;
     how.resolve = resolve | RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS;
     while (true) {
-        const long fd = ::syscall(SYS_openat2, directory, path, &how, sizeof how);
+        const long fd = isToFail("openat2") ? -1 : ::syscall(SYS_openat2, directory, path, &how, sizeof how);
         if (fd >= 0) return UniqueFd(static_cast<int>(fd));
         // EAGAIN: a rename elsewhere raced with the walk, which then can't prove that it stayed beneath.
         if (errno != EINTR && errno != EAGAIN) return KsError::posix(errno);
@@ -138,7 +141,7 @@ Result<UniqueFd> openBeneath(int directory, std::string_view relativePath, int f
 Result<FileStatus> statx(int directory, const char* name) {
     struct ::statx raw;
     const int flags = AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT | (*name == '\0' ? AT_EMPTY_PATH : 0);
-    while (::statx(directory, name, flags, STATX_BASIC_STATS | STATX_BTIME, &raw) != 0) {
+    while (isToFail("statx") || ::statx(directory, name, flags, STATX_BASIC_STATS | STATX_BTIME, &raw) != 0) {
         if (errno != EINTR) return KsError::posix(errno);
     }
     FileStatus status;
@@ -153,18 +156,20 @@ Result<FileStatus> statx(int directory, const char* name) {
     status.owner = raw.stx_uid;
     status.group = raw.stx_gid;
     status.names = raw.stx_nlink;
+    status.accessTime = dateOf(raw.stx_atime);
+    status.specialDevice = makedev(raw.stx_rdev_major, raw.stx_rdev_minor);
     return status;
 }
 
 Result<bool> hasXattrs(int directory, const char* name, std::string& names) {
     char buffer[512];
-    const ssize_t size = listxattrOnce(directory, name, buffer, sizeof buffer);
+    const ssize_t size = isToFail("listxattr") ? -1 : listxattrOnce(directory, name, buffer, sizeof buffer);
     if (size >= 0) {
         names.assign(buffer, static_cast<std::size_t>(size));
         return size > 0;
     }
     if (errno == ENOTSUP) return false;
-    if (errno != ERANGE) return KsError::posix(errno);
+    if (errno != ERANGE && errno != EINTR) return KsError::posix(errno);
     names = TRY(listxattrat(directory, name));
     return !names.empty();
 }
@@ -172,7 +177,8 @@ Result<bool> hasXattrs(int directory, const char* name, std::string& names) {
 Result<std::string> listxattrat(int directory, const char* name) {
     std::string names;
     while (true) {
-        const ssize_t size = listxattrOnce(directory, name, nullptr, 0);
+        const ssize_t size = isToFail("listxattr") ? -1 : listxattrOnce(directory, name, nullptr, 0);
+        if (size < 0 && errno == EINTR) continue;
         if (size < 0) return errno == ENOTSUP ? Result<std::string>(std::string()) : KsError::posix(errno);
         names.resize(static_cast<std::size_t>(size));
         if (size == 0) return names;
@@ -186,16 +192,22 @@ Result<std::string> listxattrat(int directory, const char* name) {
 }
 
 Result<std::size_t> getxattrat(int directory, const char* name, const char* attribute, std::span<std::byte> buffer) {
-    const ssize_t size = getxattrOnce(directory, name, attribute, buffer.data(), buffer.size());
-    if (size < 0) return KsError::posix(errno);
-    return static_cast<std::size_t>(size);
+    while (true) {
+        const ssize_t size =
+            isToFail("getxattr") ? -1 : getxattrOnce(directory, name, attribute, buffer.data(), buffer.size());
+        if (size >= 0) return static_cast<std::size_t>(size);
+        if (errno != EINTR) return KsError::posix(errno);
+    }
 }
 
 Result<bool> isWritable(int directory, const char* name) {
     const int flags = AT_EACCESS | (*name == '\0' ? AT_EMPTY_PATH : AT_SYMLINK_NOFOLLOW);
-    if (::faccessat(directory, name, W_OK, flags) == 0) return true;
-    if (errno == EACCES || errno == EROFS || errno == EPERM || errno == ETXTBSY) return false;
-    return KsError::posix(errno);
+    while (isToFail("faccessat") || ::faccessat(directory, name, W_OK, flags) != 0) {
+        if (errno == EINTR) continue;
+        if (errno == EACCES || errno == EROFS || errno == EPERM || errno == ETXTBSY) return false;
+        return KsError::posix(errno);
+    }
+    return true;
 }
 
 bool isReadableDirectory(int directory, const char* name) {
@@ -437,7 +449,8 @@ Result<std::string> pathOfDescriptor(int fd) {
 
 Result<std::size_t> getdents(int directory, std::span<std::byte> buffer) {
     while (true) {
-        const long size = ::syscall(SYS_getdents64, directory, buffer.data(), buffer.size());
+        const long size =
+            isToFail("getdents64") ? -1 : ::syscall(SYS_getdents64, directory, buffer.data(), buffer.size());
         if (size >= 0) return static_cast<std::size_t>(size);
         if (errno != EINTR) return KsError::posix(errno);
     }

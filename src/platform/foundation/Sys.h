@@ -31,6 +31,8 @@ struct FileStatus {
     uid_t owner = 0;
     gid_t group = 0;
     std::uint32_t names = 1;  ///< hard links
+    KsDate accessTime;
+    dev_t specialDevice = 0;  ///< what a device node stands for
 
     bool isDirectory() const { return S_ISDIR(mode); }
     bool isRegular() const { return S_ISREG(mode); }

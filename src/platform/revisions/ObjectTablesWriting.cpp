@@ -21,6 +21,10 @@ constexpr std::size_t kForgottenAtOnce = 20'000;
 // Children that are sorted in memory when their list is made anew.
 constexpr std::size_t kChildrenAtOnce = 1'000'000;
 constexpr std::size_t kPagesOfOneRebuildStep = 512;
+// What a transaction leaves free is used again by the next but one, and the file is larger by both. So a small file gets
+// small transactions: these, or a part of its pages, if that is more.
+constexpr std::size_t kPagesOfATransactionMin = 128;
+constexpr std::size_t kPartOfATransaction = 16;
 
 }  // namespace
 
@@ -344,6 +348,9 @@ Result<void> ObjectTables::write(const Overlay& overlay, const TablesHead& head,
         {handedOver.size(), [&](Writer& to, std::size_t i) { return to.put(handedOver[i]); }},
     }};
 
+    MDB_envinfo info{};
+    mdb_env_info(environment_, &info);
+    pagesMax = std::min(pagesMax, std::max(kPagesOfATransactionMin, info.me_last_pgno / kPartOfATransaction));
     TablesHead finished = head;
     finished.begunBatch = head.appliedBatch;
     Work::Position position;

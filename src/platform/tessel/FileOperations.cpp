@@ -2,13 +2,525 @@
 
 #include <fcntl.h>
 #include <linux/openat2.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
-#include <string>
+#include <algorithm>
+#include <cerrno>
+#include <utility>
 #include <vector>
 
+#include "platform/foundation/Log.h"
+#include "platform/foundation/RootDirectories.h"
+#include "platform/foundation/SerialQueue.h"
 #include "platform/foundation/Sys.h"
+#include "platform/foundation/SysEdits.h"
+#include "platform/foundation/ThreadPool.h"
+#include "platform/tessel/FreeName.h"
+#include "platform/tessel/StagingFolder.h"
+#include "platform/tessel/TesselManager.h"
+#include "platform/tessel/TreeCopy.h"
+#include "platform/tessel/TreeRemoval.h"
 
 namespace cindral {
+
+namespace {
+
+using Root = std::shared_ptr<const RootDirectory>;
+
+constexpr mode_t kAsTheUmaskSays = 0777;
+constexpr mode_t kOwnerOnly = 0700;
+constexpr mode_t kPrivateFile = 0600;
+
+/// An open folder in a root, and its path as presented.
+struct Folder {
+    Root root;
+    UniqueFd fd;
+    FileStatus status;
+    std::string path;
+
+    std::string pathOf(std::string_view name) const { return path + "/" + std::string(name); }
+};
+
+/// An entry of an open folder.
+struct Place {
+    Folder folder;
+    std::string name;
+    FileStatus status;  ///< of the entry itself
+
+    std::string path() const { return folder.pathOf(name); }
+};
+
+/// The interface's word for an error of the file system, with the path that it is about.
+KsError failure(const KsError& error, const std::string& path) {
+    const auto known = error.userInfo().find("path");
+    const std::string& where = known != error.userInfo().end() ? known->second : path;
+    if (error.isPosix(ENOENT)) return {kKsGeneralErrorDomain, kKsFileNoSuchFileError, {{"path", where}}};
+    return known != error.userInfo().end() ? error : error.with("path", where);
+}
+
+KsError refusal(const std::string& path) {
+    return KsError::errorFileWriteNoPermission().with("path", path);
+}
+
+KsError collision(const std::string& path) {
+    return {kKsGeneralErrorDomain,
+            kKsFileWriteFileExistsError,
+            {{"path", path}, {"collidingURL", KsURL::fileURL(path).absoluteString()}}};
+}
+
+bool isSameObject(const FileStatus& a, const FileStatus& b) {
+    return a.fileID == b.fileID && a.device == b.device;
+}
+
+NameKind nameKindOf(const KsURL& url) {
+    return url.ts_isFolder() ? NameKind::folder : NameKind::document;
+}
+
+Result<Folder> openFolder(const KsURL& url) {
+    Folder folder;
+    folder.path = url.path();
+    folder.root = RootDirectories::shared().rootHolding(folder.path);
+    if (!folder.root || !url.isFileURL()) return refusal(folder.path);
+    auto fd = RootDirectories::open(folder.path, O_PATH | O_DIRECTORY);
+    if (!fd.ok()) return failure(fd.error(), folder.path);
+    folder.fd = std::move(*fd);
+    auto status = sys::statx(folder.fd.get(), "");
+    if (!status.ok()) return failure(status.error(), folder.path);
+    folder.status = *status;
+    return folder;
+}
+
+/// Whether the object may not be moved away: a root, what holds one, the folder for what is temporary.
+bool isFixed(const KsURL& url) {
+    const std::string& path = url.path();
+    for (const Root& root : RootDirectories::shared().all()) {
+        const std::string_view fixed = root->path;
+        if (fixed.starts_with(path) && (fixed.size() == path.size() || fixed[path.size()] == '/')) return true;
+    }
+    const std::string temporary = TesselManager::defaultManager().documentStorageURL().path() + "/";
+    return path == temporary + std::string(kTemporaryLocalFolderName);
+}
+
+bool isRootObject(const FileStatus& status) {
+    return std::ranges::any_of(RootDirectories::shared().all(),
+                               [&](const Root& root) { return isSameObject(root->status, status); });
+}
+
+/// Where something is that is to be moved away, renamed or deleted.
+Result<Place> openPlace(const KsURL& url) {
+    const std::optional<KsURL> parent = url.deletingLastPathComponent();
+    if (!parent || isFixed(url)) return refusal(url.path());
+    Place place{TRY(openFolder(*parent)), std::string(url.lastPathComponent()), {}};
+    const Result<FileStatus> status = sys::statx(place.folder.fd.get(), place.name.c_str());
+    if (!status.ok()) return failure(status.error(), url.path());
+    place.status = *status;
+    if (isRootObject(place.status)) return refusal(url.path());
+    return place;
+}
+
+/// Whether the folder is in the other or is it, going up from it.
+Result<bool> isWithin(int folder, const FileStatus& outer) {
+    UniqueFd at = TRY(sys::openat(folder, ".", O_PATH | O_DIRECTORY));
+    FileStatus status = TRY(sys::statx(at.get(), ""));
+    while (!isSameObject(status, outer)) {
+        UniqueFd above = TRY(sys::openat(at.get(), "..", O_PATH | O_DIRECTORY));
+        const FileStatus next = TRY(sys::statx(above.get(), ""));
+        if (isSameObject(next, status)) return false;  // The top.
+        at = std::move(above);
+        status = next;
+    }
+    return true;
+}
+
+/// renameat2 with RENAME_NOREPLACE, by other means where the file system doesn't know it: a folder takes the place of an
+/// empty one made for it, anything else gets a second name and loses the first.
+Result<void> renameWithoutReplacing(int from, const char* name, int to, const char* newName) {
+    const Result<void> renamed = sys::renameat2(from, name, to, newName, RENAME_NOREPLACE);
+    if (renamed.ok() || !renamed.error().isPosix(EINVAL)) return renamed;
+    const FileStatus status = TRY(sys::statx(from, name));
+    if (!status.isDirectory()) {
+        TRY(sys::linkat(from, name, to, newName));
+        const Result<void> unlinked = sys::unlinkat(from, name);
+        if (!unlinked.ok()) (void)sys::unlinkat(to, newName);
+        return unlinked;
+    }
+    if (TRY(isWithin(to, status))) return KsError::posix(EINVAL);
+    TRY(sys::mkdirat(to, newName, kOwnerOnly));
+    const Result<void> moved = sys::renameat2(from, name, to, newName, 0);
+    if (!moved.ok()) (void)sys::unlinkat(to, newName, AT_REMOVEDIR);
+    return moved;
+}
+
+/// The staging folder that is one rename away from the folder: the storage's, else one on the folder's own root.
+Result<std::unique_ptr<StagingFolder>> stagingFor(const Folder& folder,
+                                                  StagingFolder::Contents contents = StagingFolder::Contents::mayGo) {
+    const Root storage =
+        RootDirectories::shared().rootHolding(TesselManager::defaultManager().documentStorageURL().path());
+    if (storage && storage->status.device == folder.status.device) return StagingFolder::make(storage, contents);
+    return StagingFolder::make(folder.root, contents);
+}
+
+/// Calls `move` for the staging folder; once more with one on the folder's own root where the first was on another
+/// mount. (Mounts of one device can't be told by its number.)
+template <typename Move>
+Result<void> withStagingFor(const Folder& folder, Move move) {
+    const auto staging = stagingFor(folder);
+    if (!staging.ok()) return staging.error();
+    const Result<void> moved = move(**staging);
+    if (moved.ok() || !moved.error().isPosix(EXDEV)) return moved;
+    return move(*TRY(StagingFolder::make(folder.root)));
+}
+
+/// Gives what was built in the staging folder its place.
+Result<void> putInPlace(const StagingFolder& staging, const Folder& folder, const std::string& name) {
+    const FileStatus status = TRY(sys::statx(staging.fd(), StagingFolder::kItemName));
+    // A folder that may not be written can't be moved: it gets its mode afterwards.
+    const bool isLocked = status.isDirectory() && (status.mode & S_IWUSR) == 0;
+    UniqueFd handle;
+    if (isLocked) {
+        handle = TRY(sys::openat(staging.fd(), StagingFolder::kItemName, O_PATH | O_NOFOLLOW | O_DIRECTORY));
+        TRY(sys::fchmod(handle.get(), (status.mode & 07777) | S_IWUSR));
+    }
+    TRY(renameWithoutReplacing(staging.fd(), StagingFolder::kItemName, folder.fd.get(), name.c_str()));
+    if (!isLocked) return {};
+    const Result<void> restored = sys::fchmod(handle.get(), status.mode & 07777);
+    if (!restored.ok()) logError("can't set the mode of {}; {}", folder.pathOf(name), restored.error().description());
+    return {};
+}
+
+/// What is to be copied: an entry of an open folder, anywhere.
+struct Source {
+    UniqueFd folder;
+    std::string name;
+    FileStatus status;
+};
+
+Result<Source> openSource(const KsURL& url) {
+    Source source;
+    const std::optional<KsURL> parent = url.isFileURL() ? url.deletingLastPathComponent() : std::nullopt;
+    if (!parent) return KsError::posix(EINVAL, url.path());
+    source.name = url.lastPathComponent();
+    TRY(ts_checkName(source.name));
+    const bool isInRoot = RootDirectories::shared().rootHolding(parent->path()) != nullptr;
+    constexpr int kFlags = O_PATH | O_DIRECTORY;
+    auto folder = isInRoot ? RootDirectories::open(parent->path(), kFlags) : sys::open(parent->path().c_str(), kFlags);
+    if (!folder.ok()) return failure(folder.error(), url.path());
+    source.folder = std::move(*folder);
+    const auto status = sys::statx(source.folder.get(), source.name.c_str());
+    if (!status.ok()) return failure(status.error(), url.path());
+    source.status = *status;
+    return source;
+}
+
+/// Copies a file into a new one without a name, and links that: nobody ever sees a part of it, and nothing is left of it
+/// when the process ends. EOPNOTSUPP where the file system has no such files.
+Result<void> importFile(const Source& source, const Folder& folder, const std::string& path, TesselProgress& progress) {
+    const UniqueFd handle = TRY(sys::openat(source.folder.get(), source.name.c_str(), O_PATH | O_NOFOLLOW));
+    const FileStatus status = TRY(sys::statx(handle.get(), ""));
+    if (!status.isRegular()) return KsError::posix(ESTALE);
+    const UniqueFd contents = TRY(sys::reopen(handle.get(), O_RDONLY | O_NONBLOCK | O_NOCTTY));
+    Result<UniqueFd> file = sys::openat(folder.fd.get(), ".", O_TMPFILE | O_WRONLY, kPrivateFile);
+    // EISDIR and EINVAL: a kernel or a file system that takes it for an ordinary folder.
+    if (!file.ok() && (file.error().isPosix(EISDIR) || file.error().isPosix(EINVAL))) return KsError::posix(EOPNOTSUPP);
+    if (!file.ok()) return file.error();
+    progress.setTotal(status.size, 1);
+    TRY(TreeCopy(progress, path, {}).copyFile(contents.get(), status, file->get()));
+    TRY(progress.check());
+    TRY(sys::linkDescriptor(file->get(), folder.fd.get(), source.name.c_str()));
+    progress.advance(0, 1);
+    return {};
+}
+
+Result<void> importByStaging(const Source& source, const Folder& folder, const std::string& path,
+                             TesselProgress& progress) {
+    if (source.status.isDirectory() && TRY(isWithin(folder.fd.get(), source.status))) return KsError::posix(EINVAL);
+    return withStagingFor(folder, [&](StagingFolder& staging) -> Result<void> {
+        TRY(measureTree(source.folder.get(), source.name.c_str(), path, &staging.status(), progress));
+        TreeCopy copy(progress, path, {.attributeLoss = AttributeLoss::isLogged, .excluded = &staging.status()});
+        TRY(copy.copy(source.folder.get(), source.name.c_str(), staging.fd(), StagingFolder::kItemName));
+        TRY(progress.check());
+        return putInPlace(staging, folder, source.name);
+    });
+}
+
+/// The answer of an edit that was to give something a place.
+Result<KsURL> answer(const Result<void>& done, const Folder& folder, const std::string& name,
+                     const std::string& subject) {
+    if (done.ok()) return KsURL::fileURL(folder.pathOf(name));
+    if (done.error().isPosix(EEXIST)) return collision(folder.pathOf(name));
+    return failure(done.error(), subject);
+}
+
+/// Undoes a rename into a staging folder, under another name where the old one has been taken.
+void putBack(StagingFolder& staging, const Folder& folder, const std::string& name, const FileStatus& status) {
+    Result<void> back = renameWithoutReplacing(staging.fd(), StagingFolder::kItemName, folder.fd.get(), name.c_str());
+    const NameKind kind = status.isDirectory() ? NameKind::folder : NameKind::document;
+    for (std::uint64_t number = 2; !back.ok() && back.error().isPosix(EEXIST); ++number) {
+        const std::string other = alternativeName(name, kind, number);
+        back = renameWithoutReplacing(staging.fd(), StagingFolder::kItemName, folder.fd.get(), other.c_str());
+    }
+    if (back.ok()) return;
+    staging.keep();
+    logError("{} was left in {}; {}", folder.pathOf(name), staging.path(), back.error().description());
+}
+
+/// Takes an entry out of its folder, if it is the object that is meant.
+Result<void> takeAway(const Folder& folder, const std::string& name, const FileStatus& meant, StagingFolder& staging) {
+    TRY(sys::renameat2(folder.fd.get(), name.c_str(), staging.fd(), StagingFolder::kItemName, 0));
+    const Result<FileStatus> taken = sys::statx(staging.fd(), StagingFolder::kItemName);
+    if (taken.ok() && isSameObject(*taken, meant)) return {};
+    // Something else has taken the name since it was looked at.
+    putBack(staging, folder, name, taken.ok() ? *taken : meant);
+    return taken.ok() ? KsError::posix(ESTALE) : taken.error();
+}
+
+/// Takes the source of a finished copy away, unless it is not what was copied any more.
+Result<void> removeCopied(const Place& place, const Folder& target, const std::string& name) {
+    // Kept until it is certain that the copy is all there is: who writes to the source meanwhile writes to what was
+    // copied before.
+    const auto kept = TRY(stagingFor(place.folder, StagingFolder::Contents::areKept));
+    TRY(takeAway(place.folder, place.name, place.status, *kept));
+    const Result<void> same = compareTrees(kept->fd(), StagingFolder::kItemName, target.fd.get(), name.c_str(),
+                                           place.path(), Thoroughness::stamps, nullptr);
+    if (!same.ok()) {
+        putBack(*kept, place.folder, place.name, place.status);
+        return same;
+    }
+    const Result<void> released = kept->letGo();
+    if (!released.ok()) putBack(*kept, place.folder, place.name, place.status);
+    return released;
+}
+
+Result<void> moveToOtherDevice(const Place& place, const Folder& folder, const std::string& name,
+                               TesselProgress& progress) {
+    const std::string path = place.path();
+    if (place.status.isDirectory())
+        TRY(checkTreeIsRemovable(place.folder.fd.get(), place.name.c_str(), path, progress));
+    TRY(measureTree(place.folder.fd.get(), place.name.c_str(), path, nullptr, progress));
+    auto staging = TRY(stagingFor(folder));
+    TreeCopy copy(progress, path, {.attributeLoss = AttributeLoss::isAnError, .excluded = nullptr});
+    TRY(copy.copy(place.folder.fd.get(), place.name.c_str(), staging->fd(), StagingFolder::kItemName));
+    TRY(sys::syncfs(staging->fd()));
+    TRY(compareTrees(place.folder.fd.get(), place.name.c_str(), staging->fd(), StagingFolder::kItemName, path,
+                     Thoroughness::contents, &progress));
+    TRY(progress.check());
+    const FileStatus built = TRY(sys::statx(staging->fd(), StagingFolder::kItemName));
+    TRY(putInPlace(*staging, folder, name));
+    const Result<void> removed = removeCopied(place, folder, name);
+    if (removed.ok()) return {};
+    // The source is where it was: the copy goes again.
+    const Result<void> undone = takeAway(folder, name, built, *staging);
+    if (!undone.ok()) logError("{} was left as a copy; {}", folder.pathOf(name), undone.error().description());
+    return removed;
+}
+
+Result<void> moveOnce(const Place& place, const Folder& folder, const std::string& name, TesselProgress& progress) {
+    const Result<void> moved =
+        renameWithoutReplacing(place.folder.fd.get(), place.name.c_str(), folder.fd.get(), name.c_str());
+    if (moved.ok() || !moved.error().isPosix(EXDEV)) return moved;
+    return moveToOtherDevice(place, folder, name, progress);
+}
+
+/// Takes the entry out of sight, and then removes it. Once it is out of sight, it is deleted.
+Result<void> removeByStaging(const Place& place, TesselProgress* progress) {
+    return withStagingFor(place.folder, [&](StagingFolder& staging) -> Result<void> {
+        TRY(takeAway(place.folder, place.name, place.status, staging));
+        const Result<void> removed = removeTree(staging.fd(), StagingFolder::kItemName, place.path(), progress);
+        if (!removed.ok()) logError("can't remove all of {}; {}", place.path(), removed.error().description());
+        return {};
+    });
+}
+
+}  // namespace
+
+namespace file_operations {
+
+Result<KsURL> importUnderFolder(const KsURL& source, const KsURL& folder, TesselProgress& progress) {
+    const Folder target = TRY(openFolder(folder));
+    const Source opened = TRY(openSource(source));
+    const std::string& path = source.path();
+    if (opened.status.isRegular()) {
+        const Result<void> done = importFile(opened, target, path, progress);
+        if (done.ok() || !done.error().isPosix(EOPNOTSUPP)) return answer(done, target, opened.name, path);
+    }
+    return answer(importByStaging(opened, target, path, progress), target, opened.name, path);
+}
+
+Result<KsURL> createSubFolder(const KsURL& folder, const std::string& name) {
+    TRY(ts_checkName(name));
+    const Folder target = TRY(openFolder(folder));
+    return answer(sys::mkdirat(target.fd.get(), name.c_str(), kAsTheUmaskSays), target, name, target.pathOf(name));
+}
+
+Result<KsURL> rename(const KsURL& url, const std::string& newName) {
+    const std::optional<KsURL> parent = url.deletingLastPathComponent();
+    if (!parent) return refusal(url.path());
+    TesselProgress progress;
+    return reparent(url, *parent, newName, Bouncing::isRefused, progress);
+}
+
+Result<KsURL> reparent(const KsURL& url, const KsURL& folder, const std::optional<std::string>& newName,
+                       Bouncing bouncing, TesselProgress& progress) {
+    if (newName) TRY(ts_checkName(*newName));
+    const Place place = TRY(openPlace(url));
+    const Folder target = TRY(openFolder(folder));
+    const std::string name = newName.value_or(place.name);
+    if (isSameObject(place.folder.status, target.status) && name == place.name) return KsURL::fileURL(place.path());
+    Result<void> moved = moveOnce(place, target, name, progress);
+    std::string given = name;
+    const NameKind kind = bouncing == Bouncing::isAllowed ? nameKindOf(url) : NameKind::document;
+    for (std::uint64_t number = 2; bouncing == Bouncing::isAllowed && !moved.ok() && moved.error().isPosix(EEXIST);
+         ++number) {
+        given = alternativeName(name, kind, number);
+        moved = moveOnce(place, target, given, progress);
+    }
+    return answer(moved, target, given, url.path());
+}
+
+Result<KsURL> trash(const KsURL& url, const KsURL& trashFolder) {
+    const Place place = TRY(openPlace(url));
+    const Folder target = TRY(openFolder(trashFolder));
+    const Result<void> moved =
+        renameWithoutReplacing(place.folder.fd.get(), place.name.c_str(), target.fd.get(), place.name.c_str());
+    return answer(moved, target, place.name, url.path());
+}
+
+Result<void> remove(const KsURL& url, TesselProgress& progress, std::optional<std::uint64_t> fileID) {
+    const Place place = TRY(openPlace(url));
+    const int folder = place.folder.fd.get();
+    const char* name = place.name.c_str();
+    if (fileID && *fileID != place.status.fileID) return failure(KsError::posix(ESTALE), url.path());
+    Result<void> removed;
+    if (!place.status.isDirectory() && !fileID) {
+        progress.setTotal(0, 1);
+        removed = sys::unlinkat(folder, name);
+    } else if (!place.status.isDirectory()) {
+        removed = removeByStaging(place, nullptr);
+    } else {
+        removed = checkTreeIsRemovable(folder, name, url.path(), progress);
+        // An empty folder goes at once, whatever its own mode.
+        if (removed.ok()) removed = sys::unlinkat(folder, name, AT_REMOVEDIR);
+        if (!removed.ok() && (removed.error().isPosix(ENOTEMPTY) || removed.error().isPosix(EEXIST))) {
+            removed = progress.check();
+            if (removed.ok()) removed = removeByStaging(place, &progress);
+        }
+    }
+    if (!removed.ok()) return failure(removed.error(), url.path());
+    return {};
+}
+
+Result<void> makeFolderUnlessThere(const KsURL& folder) {
+    const std::optional<KsURL> parent = folder.deletingLastPathComponent();
+    if (!parent) return {};
+    const Folder above = TRY(openFolder(*parent));
+    const std::string name(folder.lastPathComponent());
+    const Result<void> made = sys::mkdirat(above.fd.get(), name.c_str(), kOwnerOnly);
+    if (made.ok()) return {};
+    const Result<FileStatus> status = sys::statx(above.fd.get(), name.c_str());
+    if (status.ok() && status->isDirectory()) return {};
+    return answer(made, above, name, folder.path()).error();
+}
+
+}  // namespace file_operations
+
+Result<void> ts_checkName(std::string_view name) {
+    const bool isName = !name.empty() && name != "." && name != ".." && name.find('/') == std::string_view::npos &&
+                        name.find('\0') == std::string_view::npos;
+    if (!isName) return KsError::posix(EINVAL, std::string(name));
+    if (name.size() > kNameBytesMax) return KsError::posix(ENAMETOOLONG, std::string(name));
+    return {};
+}
+
+std::optional<KsURL> ts_collidingURL(const KsError& error) {
+    if (!error.is(kKsGeneralErrorDomain, kKsFileWriteFileExistsError)) return std::nullopt;
+    const auto url = error.userInfo().find("collidingURL");
+    return url != error.userInfo().end() ? KsURL::parse(url->second) : std::nullopt;
+}
+
+Result<void> ts_withReadWriteAccess(const KsURL& url, const std::function<Result<void>(int fd)>& body) {
+    const Result<UniqueFd> fd = url.open(O_PATH | O_NOFOLLOW);
+    if (!fd.ok()) return failure(fd.error(), url.path());
+    return body(fd->get());
+}
+
+namespace {
+
+/// Runs the work on a thread of the pool, which counts as blocked meanwhile: disks make it wait.
+template <typename Work>
+void inBackground(Work work) {
+    dispatchAsync([work = std::move(work)]() mutable { work(); });
+}
+
+template <typename Work>
+auto blocking(Work work) {
+    const ThreadPool::BlockingRegion region;
+    return work();
+}
+
+}  // namespace
+
+std::shared_ptr<TesselProgress> ts_importUnderFolder(const KsURL& source, const KsURL& folder,
+                                                     FileOperationCompletion completion) {
+    auto progress = std::make_shared<TesselProgress>();
+    inBackground([source, folder, progress, completion = std::move(completion)] {
+        completion(blocking([&] { return file_operations::importUnderFolder(source, folder, *progress); }));
+    });
+    return progress;
+}
+
+void ts_createSubFolder(const KsURL& folder, std::string name, FileOperationCompletion completion) {
+    inBackground([folder, name = std::move(name), completion = std::move(completion)] {
+        completion(blocking([&] { return file_operations::createSubFolder(folder, name); }));
+    });
+}
+
+void ts_renameWithNewName(const KsURL& url, std::string newName, FileOperationCompletion completion) {
+    inBackground([url, newName = std::move(newName), completion = std::move(completion)] {
+        completion(blocking([&] { return file_operations::rename(url, newName); }));
+    });
+}
+
+namespace {
+
+std::shared_ptr<TesselProgress> reparentInBackground(const KsURL& url, const KsURL& folder,
+                                                     std::optional<std::string> newName, Bouncing bouncing,
+                                                     FileOperationCompletion completion) {
+    auto progress = std::make_shared<TesselProgress>();
+    inBackground([url, folder, newName = std::move(newName), bouncing, progress, completion = std::move(completion)] {
+        completion(blocking([&] { return file_operations::reparent(url, folder, newName, bouncing, *progress); }));
+    });
+    return progress;
+}
+
+}  // namespace
+
+std::shared_ptr<TesselProgress> ts_reparentUnderFolder(const KsURL& url, const KsURL& folder,
+                                                       std::optional<std::string> newName,
+                                                       FileOperationCompletion completion) {
+    return reparentInBackground(url, folder, std::move(newName), Bouncing::isRefused, std::move(completion));
+}
+
+std::shared_ptr<TesselProgress> ts_reparentUnderFolder(const KsURL& url, const KsURL& folder, Bouncing bouncing,
+                                                       FileOperationCompletion completion) {
+    return reparentInBackground(url, folder, std::nullopt, bouncing, std::move(completion));
+}
+
+void ts_trashUnderFolder(const KsURL& url, const KsURL& trashFolder, FileOperationCompletion completion) {
+    inBackground([url, trashFolder, completion = std::move(completion)] {
+        completion(blocking([&] { return file_operations::trash(url, trashFolder); }));
+    });
+}
+
+std::shared_ptr<TesselProgress> ts_deleteWithCompletionHandler(const KsURL& url, FileDeletionCompletion completion,
+                                                               std::optional<std::uint64_t> fileID) {
+    auto progress = std::make_shared<TesselProgress>();
+    inBackground([url, fileID, progress, completion = std::move(completion)] {
+        const Result<void> removed = blocking([&] { return file_operations::remove(url, *progress, fileID); });
+        completion(removed.ok() ? std::nullopt : std::optional(removed.error()));
+    });
+    return progress;
+}
 
 Result<std::uint64_t> ts_directorySize(const KsURL& directory) {
     const UniqueFd top = TRY(directory.open(O_PATH | O_DIRECTORY));

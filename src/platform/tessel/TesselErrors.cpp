@@ -5,6 +5,11 @@
 namespace cindral {
 namespace {
 
+struct Collision final : KsErrorAttachment {
+    explicit Collision(std::shared_ptr<const TesselItem> inTheWay) : item(std::move(inTheWay)) {}
+    const std::shared_ptr<const TesselItem> item;
+};
+
 KsError error(TesselErrorCode code, KsError::UserInfo info) {
     return {kTesselErrorDomain, static_cast<std::int64_t>(code), std::move(info)};
 }
@@ -23,9 +28,16 @@ KsError tesselErrorForExpiredPage() {
     return error(TesselErrorCode::pageExpired, {{"message", "The page or sync anchor has expired"}});
 }
 
-KsError tesselErrorForCollisionAtPath(std::string path) {
-    return error(TesselErrorCode::filenameCollision,
-                 {{"message", "An item with that name already exists"}, {"path", std::move(path)}});
+KsError tesselErrorForCollisionWithItem(std::shared_ptr<const TesselItem> item) {
+    KsError::UserInfo info{{"message", "An item with that name already exists"}};
+    if (const KsURL* url = item->fileURL()) info.emplace("path", url->path());
+    return error(TesselErrorCode::filenameCollision, std::move(info))
+        .withAttachment(std::make_shared<const Collision>(std::move(item)));
+}
+
+std::shared_ptr<const TesselItem> collidingItem(const KsError& error) {
+    const auto* collision = dynamic_cast<const Collision*>(error.attachment());
+    return collision != nullptr ? collision->item : nullptr;
 }
 
 KsError tsInvalidParameterError(std::string parameter, std::string value) {

@@ -1,6 +1,9 @@
 #pragma once
 
+#include <memory>
+
 #include "platform/foundation/KsError.h"
+#include "platform/tessel/TesselItem.h"
 #include "platform/tessel/TesselTypes.h"
 
 namespace cindral {
@@ -21,8 +24,10 @@ enum class TSErrorCode : std::int64_t { invalidParameter = 1, itemNotFound = 2 }
 KsError tesselErrorForNonExistentItemWithIdentifier(const TesselItemIdentifier& identifier);
 /// A page or sync anchor that can't be resumed: the host lists anew.
 KsError tesselErrorForExpiredPage();
-/// "path" in the user info is the item in the way.
-KsError tesselErrorForCollisionAtPath(std::string path);
+/// Holds the item in the way: collidingItem(). "path" in the user info is its path where it has one.
+KsError tesselErrorForCollisionWithItem(std::shared_ptr<const TesselItem> item);
+/// The item in the way, of an error that a name collides; null for any other.
+std::shared_ptr<const TesselItem> collidingItem(const KsError& error);
 /// "parameter" and "value" in the user info.
 KsError tsInvalidParameterError(std::string parameter, std::string value);
 KsError tsItemNotFoundError(const TesselItemIdentifier& identifier);

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -9,6 +10,7 @@
 #include "platform/foundation/Result.h"
 #include "platform/tessel/TesselEnumerator.h"
 #include "platform/tessel/TesselItem.h"
+#include "platform/tessel/TesselProgress.h"
 
 namespace cindral {
 
@@ -34,6 +36,41 @@ public:
     virtual void startProvidingItemAtURL(const KsURL& url, Completion completion) = 0;
     virtual void stopProvidingItemAtURL(const KsURL& url) = 0;
     virtual void itemChangedAtURL(const KsURL& url) = 0;
+
+    // Edits. Each answers once, on any thread, also after the call has returned, with the item that there is afterwards
+    // or an error. Where progress comes back, it can be followed and cancelled. A name that is taken is answered with
+    // tesselErrorForCollisionWithItem(). A provider that does not offer one answers ENOTSUP: the default of each.
+
+    /// Copies a document or folder from anywhere into a container.
+    virtual std::shared_ptr<TesselProgress> importDocumentAtURL(const KsURL& url, const TesselItemIdentifier& parent,
+                                                                ItemCompletion completion);
+    virtual void createDirectoryWithName(const std::string& name, const TesselItemIdentifier& parent,
+                                         ItemCompletion completion);
+    virtual void renameItemWithIdentifier(const TesselItemIdentifier& identifier, const std::string& name,
+                                          ItemCompletion completion);
+    /// Moves; without a new name the item keeps its own.
+    virtual std::shared_ptr<TesselProgress> reparentItemWithIdentifier(const TesselItemIdentifier& identifier,
+                                                                       const TesselItemIdentifier& parent,
+                                                                       const std::optional<std::string>& newName,
+                                                                       ItemCompletion completion);
+    virtual std::shared_ptr<TesselProgress> deleteItemWithIdentifier(const TesselItemIdentifier& identifier,
+                                                                     Completion completion);
+    virtual void trashItemWithIdentifier(const TesselItemIdentifier& identifier, ItemCompletion completion);
+    /// Takes an item out of the trash: to the parent, where one is named and will do, else to where it was.
+    virtual void untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
+                                           const std::optional<TesselItemIdentifier>& parent,
+                                           ItemCompletion completion);
+    /// Deletes what was trashed before the date. Answers when all deletions are done, with the first error.
+    virtual void removeTrashedItemsOlderThanDate(const KsDate& date, Completion completion);
+
+    // The user's metadata of an item. None takes it away.
+    virtual void setLastUsedDate(const std::optional<KsDate>& date, const TesselItemIdentifier& identifier,
+                                 ItemCompletion completion);
+    /// `tagData` is what tsTagsData() makes.
+    virtual void setTagData(const std::optional<Bytes>& tagData, const TesselItemIdentifier& identifier,
+                            ItemCompletion completion);
+    virtual void setFavoriteRank(std::optional<std::int64_t> rank, const TesselItemIdentifier& identifier,
+                                 ItemCompletion completion);
 
     /// The default save location of an application.
     virtual void defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier,

@@ -6,6 +6,9 @@
 #include <algorithm>
 #include <array>
 
+#include "host/FakeProvider.h"
+#include "platform/tessel/TesselTags.h"
+
 namespace cindral {
 namespace {
 
@@ -24,11 +27,31 @@ TEST(TesselErrors, anExpiredPageNamesNothing) {
     EXPECT_THAT(error.userInfo(), ElementsAre(Pair("message", "The page or sync anchor has expired")));
 }
 
-TEST(TesselErrors, aCollisionNamesTheItemInTheWay) {
-    const KsError error = tesselErrorForCollisionAtPath("/storage/Documents/a");
+TEST(TesselErrors, aCollisionHoldsTheItemInTheWay) {
+    const auto item = std::make_shared<test::FakeItem>();
+    item->url = KsURL::fileURL("/storage/Documents/a");
+    const KsError error = tesselErrorForCollisionWithItem(item);
     EXPECT_TRUE(error.is("TesselErrorDomain", -1003));
     EXPECT_THAT(error.userInfo(), ElementsAre(Pair("message", "An item with that name already exists"),
                                               Pair("path", "/storage/Documents/a")));
+    EXPECT_EQ(collidingItem(error), item);
+    // It comes along with the error, whoever passes it on.
+    EXPECT_EQ(collidingItem(KsError(error).with("more", "text")), item);
+    EXPECT_EQ(collidingItem(tesselErrorForExpiredPage()), nullptr);
+}
+
+TEST(TesselTags, areReadAsTheyWereWritten) {
+    const std::vector<TSTag> tags{{"green"}, {""}, {"\xf0\x9f\x8c\xb2"}, {"green"}};
+    EXPECT_EQ(tsGetTagsFromTagsData(tsTagsData(tags)), tags);
+    EXPECT_EQ(tsGetTagsFromTagsData(tsTagsData({})), std::vector<TSTag>());
+    EXPECT_EQ(tsGetTagsFromTagsData(bytesOf(std::string_view("no tags"))), std::nullopt);
+}
+
+// More than one list of values is otherwise allowed to hold.
+TEST(TesselTags, anyNumberOfThemIsRead) {
+    std::vector<TSTag> tags;
+    for (int i = 0; i < 100'000; ++i) tags.push_back({std::to_string(i)});
+    EXPECT_EQ(tsGetTagsFromTagsData(tsTagsData(tags)), tags);
 }
 
 TEST(TesselErrors, anInvalidParameterIsNamedWithItsValue) {

@@ -1,0 +1,143 @@
+#include "host/EditMethods.h"
+
+#include <optional>
+#include <utility>
+#include <vector>
+
+#include "host/ProgressNotifier.h"
+#include "host/RequestParams.h"
+#include "platform/tessel/TesselTags.h"
+
+namespace cindral {
+namespace {
+
+using Reply = std::shared_ptr<JsonRpcReply>;
+
+TesselExtension::ItemCompletion itemCompletion(const HostMethodsContext& context, const Reply& reply) {
+    return [reply, &paths = context.paths](const Result<std::shared_ptr<const TesselItem>>& item) {
+        answerItem(*reply, item, paths);
+    };
+}
+
+TesselExtension::Completion completion(const HostMethodsContext& context, const Reply& reply) {
+    return [reply, &paths = context.paths](const std::optional<KsError>& error) {
+        if (error) return answerWithError(*reply, *error, paths);
+        reply->result([](std::string& out) { out += "{}"; });
+    };
+}
+
+void importDocument(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const RequestParams given(params, *reply);
+    const auto url = given.urlOrPath();
+    const auto parent = url ? given.string("parent") : std::nullopt;
+    if (!parent) return;
+    const auto progress = context.client.provider().importDocumentAtURL(context.paths.presentedURL(*url), *parent,
+                                                                        itemCompletion(context, reply));
+    ProgressNotifier::follow(progress, reply);
+}
+
+void createDirectory(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const RequestParams given(params, *reply);
+    const auto name = given.string("name");
+    const auto parent = name ? given.string("parent") : std::nullopt;
+    if (!parent) return;
+    context.client.provider().createDirectoryWithName(*name, *parent, itemCompletion(context, reply));
+}
+
+void renameItem(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const RequestParams given(params, *reply);
+    const auto identifier = given.string("identifier");
+    const auto name = identifier ? given.string("name") : std::nullopt;
+    if (!name) return;
+    context.client.provider().renameItemWithIdentifier(*identifier, *name, itemCompletion(context, reply));
+}
+
+void reparentItem(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const RequestParams given(params, *reply);
+    const auto identifier = given.string("identifier");
+    const auto parent = identifier ? given.string("parent") : std::nullopt;
+    std::optional<std::string> name;
+    if (!parent || !given.optionalString("name", name)) return;
+    const auto progress = context.client.provider().reparentItemWithIdentifier(*identifier, *parent, name,
+                                                                               itemCompletion(context, reply));
+    ProgressNotifier::follow(progress, reply);
+}
+
+void deleteItem(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const auto identifier = RequestParams(params, *reply).string("identifier");
+    if (!identifier) return;
+    const auto progress = context.client.provider().deleteItemWithIdentifier(*identifier, completion(context, reply));
+    ProgressNotifier::follow(progress, reply);
+}
+
+void trashItem(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const auto identifier = RequestParams(params, *reply).string("identifier");
+    if (!identifier) return;
+    context.client.provider().trashItemWithIdentifier(*identifier, itemCompletion(context, reply));
+}
+
+void untrashItem(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const RequestParams given(params, *reply);
+    const auto identifier = given.string("identifier");
+    std::optional<std::string> parent;
+    if (!identifier || !given.optionalString("parent", parent)) return;
+    context.client.provider().untrashItemWithIdentifier(*identifier, parent, itemCompletion(context, reply));
+}
+
+void removeTrashedItemsOlderThan(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const auto date = RequestParams(params, *reply).date("date");
+    if (!date) return;
+    context.client.provider().removeTrashedItemsOlderThanDate(*date, completion(context, reply));
+}
+
+void setLastUsedDate(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const RequestParams given(params, *reply);
+    const auto identifier = given.string("identifier");
+    if (!identifier) return;
+    const auto date = given.isNull("date") ? std::nullopt : given.date("date");
+    if (!date && !given.isNull("date")) return;
+    context.client.provider().setLastUsedDate(date, *identifier, itemCompletion(context, reply));
+}
+
+void setTags(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const RequestParams given(params, *reply);
+    const auto identifier = given.string("identifier");
+    auto labels = identifier ? given.strings("tags") : std::nullopt;
+    if (!labels) return;
+    std::vector<TSTag> tags;
+    tags.reserve(labels->size());
+    for (std::string& label : *labels) tags.push_back({std::move(label)});
+    context.client.provider().setTagData(tsTagsData(tags), *identifier, itemCompletion(context, reply));
+}
+
+void setFavoriteRank(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const RequestParams given(params, *reply);
+    const auto identifier = given.string("identifier");
+    if (!identifier) return;
+    const auto rank = given.isNull("rank") ? std::nullopt : given.integer("rank");
+    if (!rank && !given.isNull("rank")) return;
+    context.client.provider().setFavoriteRank(rank, *identifier, itemCompletion(context, reply));
+}
+
+}  // namespace
+
+JsonRpcServer::Methods makeEditMethods(const HostMethodsContext& context) {
+    using Handler = void (*)(const HostMethodsContext&, const Json&, const Reply&);
+    constexpr std::pair<const char*, Handler> kHandlers[] = {
+        {"importDocument", importDocument},   {"createDirectory", createDirectory},
+        {"renameItem", renameItem},           {"reparentItem", reparentItem},
+        {"deleteItem", deleteItem},           {"trashItem", trashItem},
+        {"untrashItem", untrashItem},         {"removeTrashedItemsOlderThan", removeTrashedItemsOlderThan},
+        {"setLastUsedDate", setLastUsedDate}, {"setTags", setTags},
+        {"setFavoriteRank", setFavoriteRank},
+    };
+    JsonRpcServer::Methods methods;
+    for (const auto& entry : kHandlers) {
+        methods.emplace(entry.first, [context, handler = entry.second](const Json& params, const Reply& reply) {
+            handler(context, params, reply);
+        });
+    }
+    return methods;
+}
+
+}  // namespace cindral
