@@ -11,10 +11,12 @@
 #include <filesystem>
 #include <fstream>
 #include <nlohmann/json.hpp>
+#include <thread>
 
 #include "host/Descriptor.h"
 #include "host/FakeProvider.h"
 #include "host/HostError.h"
+#include "platform/foundation/Base64.h"
 #include "support/TemporaryFolder.h"
 
 namespace cindral {
@@ -72,6 +74,36 @@ protected:
         }
         return lines;
     }
+
+    /// The lines of a command that goes on until it is stopped, as they come.
+    class Running {
+    public:
+        Running(CommandsTest& test, HostCommand command, std::optional<std::string> item) {
+            int fds[2];
+            if (::pipe2(fds, O_CLOEXEC) != 0) std::abort();
+            readEnd_.reset(fds[0]);
+            writeEnd_.reset(fds[1]);
+            thread_ = std::thread([this, &test, command, item = std::move(item)] {
+                TextOutput output(writeEnd_.get(), /*isTerminal=*/false);
+                test.runInto(output, command, item);
+                output.finish();
+                writeEnd_.reset();
+            });
+        }
+        ~Running() { thread_.join(); }
+        std::string line() {
+            std::string line;
+            char c = 0;
+            while (*descriptor::read(readEnd_.get(), {&c, 1}) == 1 && c != '\n') line += c;
+            return line;
+        }
+        void stopReading() { readEnd_.reset(); }
+
+    private:
+        UniqueFd readEnd_;
+        UniqueFd writeEnd_;
+        std::thread thread_;
+    };
 
     const test::TemporaryFolder folder_;
     const std::string real_ = std::filesystem::canonical(folder_.path()).string() + "/data";
@@ -334,6 +366,84 @@ TEST_F(CommandsTest, tellsOfOutputThatCannotBeWritten) {
     TextOutput output(full.get(), /*isTerminal=*/false);
     runInto(output, HostCommand::ls);
     EXPECT_EQ(output.finish(), KsError::posix(ENOSPC));
+}
+
+TEST_F(CommandsTest, changesPrintsAllThatIsToCome) {
+    document("did=3", "a b\n.txt");
+    provider_->folder("fid=2", "folder").url = KsURL::fileURL("/nowhere/Documents/folder");
+    document("did=4", "folder/c.txt", "fid=2").file = 44;
+    provider_->changes[kTesselRootContainerItemIdentifier] = {{{"u did=3", "d did=9"}, "second", true, std::nullopt},
+                                                              {{"u fid=2", "d did=3"}, "third", false, std::nullopt}};
+    options_.since = base64Encode(bytesOf("first"));
+    EXPECT_EQ(run(HostCommand::changes),
+              "updated  a b\\x0A.txt\ndeleted  did=9\nupdated  folder\ndeleted  a b\\x0A.txt\nanchor   " +
+                  base64Encode(bytesOf("third")) + "\n");
+    EXPECT_EQ(failure_, "");
+    EXPECT_EQ(provider_->askedAnchors, (std::vector<std::string>{"first", "second"}));
+}
+
+TEST_F(CommandsTest, changesPrintsJSON) {
+    document("did=3", "a.txt");
+    provider_->changes[kTesselRootContainerItemIdentifier] = {{{"u did=3", "d did=9"}, "next", false, std::nullopt}};
+    options_.since = base64Encode(bytesOf("first"));
+    options_.json = true;
+    const auto lines = jsonLines(run(HostCommand::changes));
+    ASSERT_EQ(lines.size(), 3U);
+    EXPECT_EQ(lines[0]["updated"]["identifier"], "did=3");
+    EXPECT_EQ(lines[1], (json{{"deleted", "did=9"}}));
+    EXPECT_EQ(lines[2], (json{{"anchor", base64Encode(bytesOf("next"))}}));
+}
+
+TEST_F(CommandsTest, changesTellsWhatIsWrongWithAnAnchor) {
+    options_.since = base64Encode(bytesOf("first"));
+    EXPECT_EQ(run(HostCommand::changes), "");
+    EXPECT_EQ(failure_, real_ + ": the anchor has expired; list again, and take a new one");
+    options_.since = "!";
+    EXPECT_EQ(run(HostCommand::changes), "");
+    EXPECT_EQ(failure_, "the anchor is not base64");
+    options_.since = base64Encode(bytesOf("first"));
+    document("did=3", "a.txt");
+    run(HostCommand::changes, "did=3");
+    EXPECT_EQ(failure_, "did=3 is not a folder");
+}
+
+TEST_F(CommandsTest, watchPrintsWhatChangesUntilItIsStopped) {
+    document("did=3", "a.txt").document = 3;
+    provider_->folder("fid=2", "folder").url = KsURL::fileURL("/nowhere/Documents/folder");
+    provider_->document("did=3", "a.txt", "fid=2").url = KsURL::fileURL("/nowhere/Documents/folder/a.txt");
+    provider_->changes["fid=2"] = {{{"u did=3"}, "second", true, std::nullopt},
+                                   {{}, "third", false, std::nullopt},
+                                   {{}, "", false, tesselErrorForExpiredPage()},
+                                   {{"d did=3"}, "fourth", false, std::nullopt}};
+    {
+        Running watch(*this, HostCommand::watch, "fid=2");
+        EXPECT_EQ(watch.line(), "updated  folder/a.txt");
+        signals_.signalEnumerator("fid=3", {});
+        signals_.signalEnumerator("fid=2", {});
+        EXPECT_EQ(watch.line(), "unknown  anything may have changed");
+        signals_.signalEnumerator("fid=2", {});
+        EXPECT_EQ(watch.line(), "deleted  folder/a.txt");
+        descriptor::interrupt(stop_);
+        EXPECT_EQ(watch.line(), "") << "the end";
+    }
+    EXPECT_EQ(failure_, "");
+    EXPECT_EQ(provider_->askedAnchors, (std::vector<std::string>{"fid=2", "second", "third", "fid=2"}));
+}
+
+TEST_F(CommandsTest, watchEndsWhenNobodyReads) {
+    document("did=3", "a.txt");
+    provider_->changes[kTesselRootContainerItemIdentifier] = {{{"u did=3"}, "next", false, std::nullopt}};
+    Running watch(*this, HostCommand::watch, std::nullopt);
+    EXPECT_EQ(watch.line(), "updated  a.txt");
+    watch.stopReading();
+}
+
+TEST_F(CommandsTest, watchNeedsAFolder) {
+    document("did=3", "a.txt");
+    EXPECT_EQ(run(HostCommand::watch, "did=3"), "");
+    EXPECT_EQ(failure_, "did=3 is not a folder");
+    EXPECT_EQ(run(HostCommand::watch, "fid=99"), "");
+    EXPECT_EQ(failure_, "no such item: fid=99");
 }
 
 }  // namespace

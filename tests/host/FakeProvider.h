@@ -99,6 +99,16 @@ public:
     std::function<void(const std::string& container, std::size_t offset)> beforePage;
     /// A page that is no first page is answered as expired as often as this says.
     int expiries = 0;
+    /// What enumerating changes of a container answers, in order; the last of it from then on. Expired where nothing is
+    /// said.
+    struct Changes {
+        std::vector<std::string> log;  ///< "u IDENTIFIER" of an item of the tree, or "d IDENTIFIER"
+        std::string anchor;
+        bool moreComing = false;
+        std::optional<KsError> error;
+    };
+    std::map<std::string, std::vector<Changes>> changes;
+    std::vector<std::string> askedAnchors;  ///< of enumerations of changes
     /// Pages are answered on a queue of the enumerator's, after the call has returned.
     bool isAsynchronous = false;
     /// Observers are dropped without an end.
@@ -168,8 +178,24 @@ public:
         queue_.async([this, observer, page] { list(*observer, page); });
     }
     void enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,
-                                     const TesselSyncAnchor& /*anchor*/) override {
-        observer->finishEnumeratingWithError(tesselErrorForExpiredPage());
+                                     const TesselSyncAnchor& anchor) override {
+        provider_->askedAnchors.emplace_back(textOf(anchor));
+        if (provider_->dropsObservers) return;
+        auto& script = provider_->changes[container_];
+        if (script.empty()) return observer->finishEnumeratingWithError(tesselErrorForExpiredPage());
+        const FakeProvider::Changes said = script.front();
+        if (script.size() > 1) script.erase(script.begin());
+        if (said.error) return observer->finishEnumeratingWithError(*said.error);
+        for (const std::string& line : said.log) {
+            const std::string identifier = line.substr(2);
+            if (line.front() == 'u') {
+                observer->didUpdateItems({provider_->items_.at(identifier)});
+            } else {
+                observer->didDeleteItemsWithIdentifiers({identifier});
+            }
+        }
+        const ByteView bytes = bytesOf(said.anchor);
+        observer->finishEnumeratingChangesUpToSyncAnchor(TesselSyncAnchor(bytes.begin(), bytes.end()), said.moreComing);
     }
     void currentSyncAnchorWithCompletionHandler(
         std::function<void(std::optional<TesselSyncAnchor>)> completion) override {

@@ -173,6 +173,18 @@ TEST(HostOptions, sayNothingOfFoldersWhereThereIsNoHome) {
     EXPECT_EQ(std::get<HostOptions>(parsed).state, "");
 }
 
+TEST(HostOptions, changesNeedsAnAnchor) {
+    const auto missing = parseHostOptions(std::vector<std::string>{"changes"}, HostEnvironment{});
+    ASSERT_TRUE(std::holds_alternative<HostReply>(missing));
+    EXPECT_EQ(std::get<HostReply>(missing).exitStatus, 2);
+    const auto given =
+        parseHostOptions(std::vector<std::string>{"changes", "fid=2", "--since", "MA=="}, HostEnvironment{});
+    ASSERT_TRUE(std::holds_alternative<HostOptions>(given));
+    EXPECT_EQ(std::get<HostOptions>(given).command, HostCommand::changes);
+    EXPECT_EQ(std::get<HostOptions>(given).since, "MA==");
+    EXPECT_EQ(std::get<HostOptions>(given).item, "fid=2");
+}
+
 TEST(EditOptions, nameTheirItemsInOrder) {
     const HostOptions moved = options({"mv", "a", "did=1", "--keep-both", "folder", "--json"});
     EXPECT_EQ(moved.command, HostCommand::edit);

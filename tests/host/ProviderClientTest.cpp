@@ -94,5 +94,69 @@ TEST_F(ProviderClientTest, letsGoOfEveryEnumeratorThatAnswersLater) {
     EXPECT_EQ(provider_->enumeratorsInvalidated, 20);
 }
 
+TEST_F(ProviderClientTest, collectsChangesInTheirOrder) {
+    provider_->document("did=3", "a.txt", "fid=2");
+    provider_->changes["fid=2"] = {{{"d did=9", "u did=3", "d fid=9"}, "next", true, std::nullopt}};
+    ProviderClient client(provider_);
+    const auto batch = client.changesSince("fid=2", *client.anchor("fid=2").value());
+    ASSERT_TRUE(batch.ok());
+    ASSERT_EQ(batch->log.size(), 3U);
+    EXPECT_EQ(batch->log[0].item, nullptr);
+    EXPECT_EQ(batch->log[0].identifier, "did=9");
+    EXPECT_EQ(batch->log[1].item->filename(), "a.txt");
+    EXPECT_EQ(batch->log[2].identifier, "fid=9");
+    EXPECT_EQ(textOf(batch->anchor), "next");
+    EXPECT_TRUE(batch->moreComing);
+    EXPECT_EQ(provider_->askedAnchors, (std::vector<std::string>{"fid=2"}));
+}
+
+TEST_F(ProviderClientTest, passesErrorsOfChangesOn) {
+    ProviderClient client(provider_);
+    EXPECT_EQ(client.changesSince("fid=9", {}).error(), tesselErrorForNonExistentItemWithIdentifier("fid=9"));
+    EXPECT_EQ(client.changesSince("fid=2", {}).error(), tesselErrorForExpiredPage());
+    provider_->dropsObservers = true;
+    EXPECT_EQ(client.changesSince("fid=2", {}).error(), KsError::posix(ECANCELED));
+}
+
+// Who stops monitoring stops the enumerator, and the request that another thread is in with it.
+TEST_F(ProviderClientTest, asksAgainWhenChangesAreCutShort) {
+    provider_->changes["fid=2"] = {{{}, "", false, KsError::posix(ECANCELED)},
+                                   {{}, "", false, KsError::posix(ECANCELED)},
+                                   {{}, "next", false, std::nullopt}};
+    ProviderClient client(provider_);
+    EXPECT_EQ(textOf(client.changesSince("fid=2", {})->anchor), "next");
+    EXPECT_EQ(provider_->askedAnchors.size(), 3U);
+    provider_->changes["fid=2"] = {{{}, "", false, KsError::posix(ECANCELED)}};
+    EXPECT_EQ(client.changesSince("fid=2", {}).error(), KsError::posix(ECANCELED)) << "not for ever";
+}
+
+TEST_F(ProviderClientTest, keepsAnEnumeratorStartedWhileItIsMonitored) {
+    {
+        ProviderClient client(provider_);
+        ASSERT_TRUE(client.startMonitoring("fid=2").ok());
+        ASSERT_TRUE(client.startMonitoring(kTesselRootContainerItemIdentifier).ok());
+        EXPECT_EQ(provider_->enumeratorsStarted, 2);
+        EXPECT_EQ(provider_->enumeratorsInvalidated, 0);
+        client.stopMonitoring("fid=2");
+        client.stopMonitoring(kTesselRootContainerItemIdentifier);
+        client.stopMonitoring("fid=2");
+        EXPECT_EQ(provider_->enumeratorsStopped, 2);
+        EXPECT_EQ(client.startMonitoring("fid=9").error(), tesselErrorForNonExistentItemWithIdentifier("fid=9"));
+    }
+    EXPECT_EQ(provider_->enumeratorsInvalidated, provider_->enumeratorsMade);
+}
+
+TEST_F(ProviderClientTest, monitorsAFolderWhereItWasFoundLast) {
+    provider_->changes["fid=2"] = {{{}, "next", false, std::nullopt}};
+    {
+        ProviderClient client(provider_);
+        ASSERT_TRUE(client.startMonitoring("fid=2").ok());
+        for (int i = 0; i < 3; ++i) ASSERT_TRUE(client.changesSince("fid=2", {}).ok());
+        EXPECT_EQ(provider_->enumeratorsMade, 4) << "each request looks the folder up";
+        EXPECT_EQ(provider_->enumeratorsStarted, 4) << "and monitors what it found";
+    }
+    EXPECT_EQ(provider_->enumeratorsInvalidated, 4);
+}
+
 }  // namespace
 }  // namespace cindral

@@ -216,6 +216,102 @@ TEST_F(RpcConnectionTest, findsAnApplicationsContainer) {
               (Json{{"domain", "TSErrorDomain"}, {"code", 1}, {"parameter", "bundleIdentifier"}, {"value", "none"}}));
 }
 
+TEST_F(RpcConnectionTest, enumeratesChanges) {
+    fake_->changes["fid=2"] = {{{"d did=9", "u did=3", "u fid=2", "d fid=\x01"}, "\xff next", true, std::nullopt}};
+    const Json changes =
+        result("enumerateChanges", {{"container", "fid=2"}, {"anchor", base64Encode(bytesOf("given"))}});
+    EXPECT_EQ(fake_->askedAnchors, (std::vector<std::string>{"given"}));
+    ASSERT_EQ(changes["updated"].size(), 2U);
+    EXPECT_EQ(changes["updated"][0], result("itemForIdentifier", {{"identifier", "did=3"}}));
+    EXPECT_EQ(changes["updated"][1]["identifier"], "fid=2");
+    EXPECT_EQ(changes["deleted"], (Json{"did=9", "fid=\x01"}));
+    EXPECT_EQ(changes["log"], Json::parse(R"([["d","did=9"],["u","did=3"],["u","fid=2"],["d","fid=\u0001"]])"));
+    EXPECT_EQ(changes["anchor"], base64Encode(bytesOf("\xff next")));
+    EXPECT_EQ(changes["moreComing"], true);
+    EXPECT_EQ(changes.size(), 5U);
+}
+
+TEST_F(RpcConnectionTest, enumeratesNoChanges) {
+    fake_->changes["fid=2"] = {{{}, "next", false, std::nullopt}};
+    EXPECT_EQ(result("enumerateChanges", {{"container", "fid=2"}, {"anchor", ""}}),
+              (Json{{"updated", Json::array()},
+                    {"deleted", Json::array()},
+                    {"anchor", base64Encode(bytesOf("next"))},
+                    {"moreComing", false},
+                    {"log", Json::array()}}));
+}
+
+TEST_F(RpcConnectionTest, refusesAnchorsThatAreNone) {
+    for (const Json& anchor : {Json("!"), Json("MA"), Json(nullptr), Json(1)})
+        expectInvalid("enumerateChanges", {{"container", "fid=2"}, {"anchor", anchor}});
+    expectInvalid("enumerateChanges", {{"container", "fid=2"}});
+    expectInvalid("enumerateChanges", {{"anchor", "MA=="}});
+    EXPECT_EQ(error("enumerateChanges", {{"container", "fid=2"}, {"anchor", "MA=="}})["data"],
+              (Json{{"domain", "TesselErrorDomain"}, {"code", -1002}}));
+    EXPECT_EQ(error("enumerateChanges", {{"container", "fid=9"}, {"anchor", "MA=="}})["data"]["code"], -1001);
+}
+
+TEST_F(RpcConnectionTest, answersMonitoring) {
+    EXPECT_EQ(result("startMonitoring", {{"container", "fid=2"}}), Json::object());
+    EXPECT_EQ(result("stopMonitoring", {{"container", "fid=2"}}), Json::object()) << "also of what is not monitored";
+    EXPECT_EQ(error("startMonitoring", {{"container", "fid=9"}})["data"]["code"], -1001);
+    expectInvalid("startMonitoring", Json::object());
+    expectInvalid("stopMonitoring", {{"container", 1}});
+    EXPECT_EQ(fake_->enumeratorsInvalidated, fake_->enumeratorsMade) << "it ends with the connection";
+}
+
+// A client that is connected for as long as the test wants.
+class LiveConnection {
+public:
+    explicit LiveConnection(RpcService service)
+        : server_(
+              [this, service] { EXPECT_TRUE(serveRpc(input_.readEnd.get(), output_.writeEnd.get(), service).ok()); }) {}
+    ~LiveConnection() {
+        input_.writeEnd.reset();
+        server_.join();
+    }
+    void send(const std::string& method, const std::string& container) {
+        const Json request{{"jsonrpc", "2.0"}, {"id", 1}, {"method", method}, {"params", {{"container", container}}}};
+        EXPECT_TRUE(descriptor::writeAll(input_.writeEnd.get(), request.dump() + "\n").ok());
+    }
+    Json receive() {
+        std::string line;
+        char c = 0;
+        while (*descriptor::read(output_.readEnd.get(), {&c, 1}) == 1 && c != '\n') line += c;
+        return Json::parse(line);
+    }
+
+private:
+    Pipe input_;
+    Pipe output_;
+    std::thread server_;
+};
+
+TEST_F(RpcConnectionTest, tellsOfSignalsWhileAContainerIsMonitored) {
+    LiveConnection client(service());
+    LiveConnection other(service());
+    const auto signal = [&](const std::string& container) {
+        bool isCompleted = false;
+        signals_.signalEnumerator(container, [&](const std::optional<KsError>& error) { isCompleted = !error; });
+        EXPECT_TRUE(isCompleted) << "at once";
+    };
+    client.send("startMonitoring", "fid=2");
+    client.send("startMonitoring", "fid=2");
+    for (int i = 0; i < 2; ++i) EXPECT_EQ(client.receive()["result"], Json::object());
+    other.send("startMonitoring", kTesselRootContainerItemIdentifier);
+    EXPECT_EQ(other.receive()["result"], Json::object());
+    const Json told{{"jsonrpc", "2.0"}, {"method", "signal"}, {"params", {{"container", "fid=2"}}}};
+    signal("fid=2");
+    EXPECT_EQ(client.receive(), told);
+    signal(kTesselRootContainerItemIdentifier);
+    EXPECT_EQ(other.receive()["params"]["container"], kTesselRootContainerItemIdentifier);
+    client.send("stopMonitoring", "fid=2");
+    EXPECT_EQ(client.receive()["result"], Json::object());
+    signal("fid=2");
+    client.send("status", "");
+    EXPECT_TRUE(client.receive().contains("result")) << "nothing came in between";
+}
+
 TEST_F(RpcConnectionTest, answersStatus) {
     EXPECT_EQ(result("status", Json::object()), (Json{{"version", "x"}}));
 }
