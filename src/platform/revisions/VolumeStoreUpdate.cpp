@@ -67,9 +67,6 @@ VolumeStore::Implementation::Update::Object& VolumeStore::Implementation::Update
 DocumentID VolumeStore::Implementation::Update::sight(const ObjectSighting& sighting) {
     Object& seen = object(sighting.fileID);
     if (seen.isThere && seen.now.birthTime != sighting.birthTime) {
-        // A folder's number: what was in the folder that had it goes with it, which is the recorder's to say.
-        const bool wasFolder = seen.now.kind == ObjectKind::folder || seen.now.kind == ObjectKind::package;
-        if (seen.now.changeTime != 0 && wasFolder) return {};
         // Another object under the number. What the recorder had looked at does not vanish without an event.
         if (seen.now.changeTime != 0) {
             remove(seen);
