@@ -624,6 +624,7 @@ class InotifyChangesTest(WhatChangesMean, ChangesTest):
 
     def test_the_status_names_the_recorder(self):
         self.start()
+        self.view(WORKING_SET)
         status = self.call("status")
         self.assertEqual((status["recorder"], status["coverage"]), ("inotify", "full"))
 
@@ -650,6 +651,7 @@ if may_use_fanotify():
 
         def test_the_status_names_the_recorder(self):
             self.start()
+            self.view(WORKING_SET)
             status = self.call("status")
             self.assertEqual((status["recorder"], status["coverage"]), ("fanotify", "full"))
 
@@ -677,6 +679,7 @@ class AutomaticRecorderTest(ChangesTest):
 
     def test_takes_what_this_user_may_have(self):
         self.start()
+        self.view(WORKING_SET)  # Waits until the roots have been read: before that nobody records.
         self.assertEqual(self.call("status")["recorder"], "fanotify" if may_use_fanotify(self.storage) else "inotify")
 
 

@@ -417,6 +417,7 @@ class LookupsTest(SystemTest):
         self.make_file("report.txt")
         client = self.client()
         client.items(ROOT)
+        client.call("currentSyncAnchor", container=ROOT)  # Waits until the roots have been read.
         status = client.call("status")
         self.assertEqual(status["storage"], self.storage)
         self.assertEqual(status["state"], self.state)
