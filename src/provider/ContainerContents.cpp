@@ -79,8 +79,12 @@ EnumeratorOptions scanOptions(const TesselItemIdentifier& container, const std::
     return options;
 }
 
+bool isTrashName(std::string_view name) {
+    return name == kTrashName;
+}
+
 bool isListed(const TesselItemIdentifier& container, const KsURL& entry) {
-    if (entry.lastPathComponent() == kTrashName) return false;
+    if (isTrashName(entry.lastPathComponent())) return false;
     const Result<FileStatus> status = entry.status();
     if (!status.ok() || isOfAnotherDevice(entry, *status)) return false;
     return !isOfFoldersOnly(container) || entry.ts_isFolder();

@@ -32,6 +32,8 @@ EnumeratorOptions scanOptions(const TesselItemIdentifier& container, const std::
 /// Whether the container lists such an entry, come upon in one of its folders or, where it is deep, below them. An entry
 /// that was mounted from elsewhere is left out, which is said once in the log: its number names nothing here.
 bool isListed(const TesselItemIdentifier& container, const KsURL& entry);
+/// Whether entries of the name are listed nowhere, while what is in them may be.
+bool isTrashName(std::string_view name);
 
 /// The items of entries of open folders (KsURL::child), in their order, without those of which none can be made and
 /// without further names of an object.

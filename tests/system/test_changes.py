@@ -234,6 +234,38 @@ class WhatChangesMean:
         self.changes(everything)
         self.assertEqual({item["isTrashed"] for item in everything.items.values()}, {False})
 
+    def test_what_is_in_a_trash_stays_whatever_happens_to_the_trash(self):
+        """A folder that was listed becomes one that is not, while what is in it still is."""
+        self.make_file("folder", "below", "file.txt")
+        os.mkdir(self.path("other"))
+        self.start()
+        views = self.views(WORKING_SET, ALL_DIRECTORIES)
+        trash, other_trash = self.path(".Trash"), self.path("other", ".Trash")
+
+        def both():
+            for view in views:
+                self.changes(view)
+            self.assertIn("below", {item["filename"] for item in views[0].items.values()})
+
+        os.rename(self.path("folder"), trash)
+        both()
+        self.make_file(".Trash", "new.txt")
+        both()
+        os.rename(trash, other_trash)
+        both()
+        os.mkdir(trash)
+        both()
+        os.rename(other_trash, os.path.join(trash, ".Trash"))
+        both()
+        # Within a trash, which is no reason to tell of what is in it.
+        os.rename(os.path.join(trash, ".Trash"), os.path.join(trash, "folder"))
+        both()
+        os.rename(os.path.join(trash, "folder"), os.path.join(trash, ".Trash"))
+        both()
+        self.restart()
+        os.rename(os.path.join(trash, ".Trash"), os.path.join(self.path("other"), ".Trash"))
+        both()
+
     def test_both_sides_of_an_exchange_are_told(self):
         self.make_file("a", "file.txt")
         self.make_file("b")

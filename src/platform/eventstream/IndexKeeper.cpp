@@ -30,6 +30,7 @@ constexpr std::size_t kChangesAtOnceMax = 1'000;
 constexpr int kRoundsMax = 8;
 // A folder that can't be reached so often keeps moving, or can't be opened for a reason of its own.
 constexpr int kAttemptsMax = 6;
+constexpr std::string_view kTrashName = ".Trash";
 // A number given to an object younger than this was given while it was being saved.
 constexpr std::int64_t kYoungNanoseconds = 60'000'000'000;
 
@@ -389,13 +390,15 @@ Result<void> IndexKeeper::seeMoved(OpenFolder& folder, std::string_view name, co
     noteClosed(object.fileID, isClosed);
     const Context before = contextInside(object.parent, known.name, object.kind);
     const Context after = contextInside(folder.fileID, name, kindOf(status, name));
+    // A folder that becomes a trash is no item any more, wherever it is: what is in it is told of after it.
+    const bool isShownOtherwise = before.differsFrom(after) || (name == kTrashName && known.name != kTrashName);
     // What is below is touched in the same transaction, so it is to be in the index by then.
-    if (before.differsFrom(after)) TRY(flush());
+    if (isShownOtherwise) TRY(flush());
     put(folder.fileID, name, status, isClosed);
     arrived(folder.fileID, name, object.fileID);
     contexts_.clear();
     if ((before.root != after.root || object.changeTime == 0) && !isClosed) toScan_.push_back(object.fileID);
-    return before.differsFrom(after) ? touchBelow(object.fileID) : Result<void>();
+    return isShownOtherwise ? touchBelow(object.fileID) : Result<void>();
 }
 
 Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name, const FileStatus& status,
@@ -595,7 +598,7 @@ std::optional<IndexKeeper::Known> IndexKeeper::findAt(FileID parent, std::string
 
 IndexKeeper::Context IndexKeeper::contextInside(FileID parent, std::string_view name, ObjectKind kind) {
     Context context = contextOf(parent);
-    if (name == ".Trash") context.isInTrash = true;
+    if (name == kTrashName) context.isInTrash = true;
     return kind == ObjectKind::package ? (context.packages.emplace_back(), context) : context;
 }
 
@@ -608,7 +611,7 @@ const IndexKeeper::Context& IndexKeeper::contextOf(FileID folder) {
     const std::optional<Known> known = rootWithID(folder) == nullptr ? find(folder) : std::nullopt;
     if (known) {
         context = contextOf(known->object.parent);
-        if (known->name == ".Trash") context.isInTrash = true;
+        if (known->name == kTrashName) context.isInTrash = true;
         if (known->object.kind == ObjectKind::package) context.packages.push_back(folder);
     } else {
         context.root = folder;

@@ -75,7 +75,7 @@ struct FSChangesEnumerator::Answer {
     enum class Kind {
         listed,         ///< under the identifier that was asked for
         notListed,      ///< not at all, or under another
-        passedThrough,  ///< a folder of which no item can be made, while what is in it is listed
+        passedThrough,  ///< a folder of which there is no item, while what is in it is listed
         moving,         ///< it is not where the store says
     };
     Kind kind = Kind::notListed;
@@ -210,14 +210,22 @@ Result<FSChangesEnumerator::Answer> FSChangesEnumerator::askOnce(FSEventReader& 
 }
 
 Result<FSChangesEnumerator::Answer> FSChangesEnumerator::answerOf(KsURL entry, const TesselItemIdentifier& identifier) {
-    if (!container_contents::isListed(container_, entry)) return Answer{};
     const bool isEntered = container_contents::isDeep(container_) && entry.ts_isFolder();
+    if (!container_contents::isListed(container_, entry)) {
+        const bool isTrash = container_contents::isTrashName(entry.lastPathComponent());
+        return Answer{.kind = isEntered && isTrash ? Answer::Kind::passedThrough : Answer::Kind::notListed};
+    }
     std::vector<KsURL> entries;
     entries.push_back(std::move(entry));
     TesselItems items = TRY(container_contents::itemsOf(std::move(entries)));
     if (items.empty() && isEntered) return Answer{.kind = Answer::Kind::passedThrough};
     if (items.empty() || items.front()->itemIdentifier() != identifier) return Answer{};
     return Answer{.kind = Answer::Kind::listed, .item = std::move(items.front())};
+}
+
+/// Whether what left its place was a trash there, and so not listed.
+bool FSChangesEnumerator::leftTrash(const Event& event) {
+    return container_contents::isTrashName(std::string_view(event.path).substr(event.path.rfind('/') + 1));
 }
 
 /// Puts the identifier that the event's object was listed under to the question.
@@ -237,8 +245,8 @@ void FSChangesEnumerator::askAbout(FSEventReader& reader, const Event& event,
         case Answer::Kind::listed: forward(std::move(answer->item)); break;
         case Answer::Kind::notListed: forward(*identifier); break;
         case Answer::Kind::passedThrough:
-            // A client that takes the folder out takes out what is in it, too.
-            if (event.flags & EventFlags::removed) forward(*identifier);
+            // A client that takes the folder out takes out what is in it, too: only when it was listed where it was.
+            if ((event.flags & EventFlags::removed) && !leftTrash(event)) forward(*identifier);
             break;
         case Answer::Kind::moving: return askAgain(reader);
     }
