@@ -6,6 +6,7 @@ import mmap
 import os
 import plistlib
 import random
+import shutil
 import signal
 import unittest
 
@@ -233,6 +234,26 @@ class WhatChangesMean:
         self.assert_changes(root, updated=[folder])
         self.changes(everything)
         self.assertEqual({item["isTrashed"] for item in everything.items.values()}, {False})
+
+    def test_what_moved_out_of_a_folder_that_moved_and_went_stays(self):
+        """Told in one go: the folder's own way must not take along what left it on the way."""
+        for end in (shutil.rmtree, lambda folder: os.rename(folder, folder + ".folio"),
+                    lambda folder: os.rename(folder, self.path(".Trash"))):
+            self.make_file("a", "b", "c", "d", "kept.txt")
+            self.start()
+            views = self.views(WORKING_SET, ALL_DIRECTORIES)
+            settle = self.view(ROOT)
+            os.rename(self.path("a", "b"), self.path("a", "moved"))
+            self.changes(settle)
+            os.rename(self.path("a", "moved", "c"), self.path("c"))
+            self.changes(settle)
+            end(self.path("a", "moved"))
+            for view in views:
+                self.changes(view)
+            self.assertIn("kept.txt", {item["filename"] for item in views[0].items.values()})
+            self._end(self.host)
+            for entry in os.scandir(self.storage):
+                shutil.rmtree(entry)
 
     def test_what_is_in_a_trash_stays_whatever_happens_to_the_trash(self):
         """A folder that was listed becomes one that is not, while what is in it still is."""

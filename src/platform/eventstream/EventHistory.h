@@ -23,6 +23,7 @@ enum class EventFlags : std::uint32_t {
     idsWrapped = 0x08,
     historyDone = 0x10,  ///< no path: what was to be replayed has been
     removed = 0x200,     ///< the object left the path: deleted, or moved elsewhere
+    renamed = 0x800,  ///< with `removed`: it went on as the same object, and another event tells where it is or ended
 };
 constexpr EventFlags operator|(EventFlags a, EventFlags b) {
     return static_cast<EventFlags>(static_cast<std::uint32_t>(a) | static_cast<std::uint32_t>(b));

@@ -498,7 +498,9 @@ Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_
         event.fileID = journalled.fileID;
         event.documentID = journalled.documentID;
         event.kind = journalled.objectKind;
-        if (journalled.kind == JournalEvent::Kind::departed) event.flags = EventFlags::removed;
+        if (journalled.kind == JournalEvent::Kind::departed) {
+            event.flags = journalled.goesOn ? EventFlags::removed | EventFlags::renamed : EventFlags::removed;
+        }
         batch.events.push_back(std::move(event));
     }
     return batch;

@@ -5,7 +5,11 @@ namespace cindral {
 namespace {
 
 // The first byte of a value of the table `events`. Written to disk: add numbers, never change one.
-enum class EventKind : std::uint8_t { present = 1, departed = 2 };
+enum class EventKind : std::uint8_t { present = 1, departed = 2, moved = 3 };
+
+bool isOf(EventKind kind, ByteView bytes) {
+    return !bytes.empty() && bytes[0] == std::byte{static_cast<std::uint8_t>(kind)};
+}
 
 constexpr std::size_t kNameSizeOffset = Departure::kHeadBytes - 2;
 
@@ -14,7 +18,7 @@ constexpr std::size_t kNameSizeOffset = Departure::kHeadBytes - 2;
 Bytes Departure::encode() const {
     Bytes bytes(kHeadBytes + name.size() + path.size());
     std::byte* to = bytes.data();
-    storeInteger(to, static_cast<std::uint8_t>(EventKind::departed));
+    storeInteger(to, static_cast<std::uint8_t>(goesOn ? EventKind::moved : EventKind::departed));
     storeInteger(to + 1, static_cast<std::uint64_t>(fileID));
     storeInteger(to + 9, static_cast<std::uint32_t>(documentID));
     storeInteger(to + 13, static_cast<std::uint64_t>(parent));
@@ -27,8 +31,8 @@ Bytes Departure::encode() const {
 }
 
 std::optional<Departure> Departure::decode(ByteView bytes) {
-    if (bytes.size() < kHeadBytes || bytes[0] != std::byte{static_cast<std::uint8_t>(EventKind::departed)})
-        return std::nullopt;
+    const bool goesOn = isOf(EventKind::moved, bytes);
+    if (bytes.size() < kHeadBytes || (!goesOn && !isOf(EventKind::departed, bytes))) return std::nullopt;
     const std::size_t nameSize = loadInteger<std::uint16_t>(bytes.data() + kNameSizeOffset);
     const ByteView names = bytes.subspan(kHeadBytes);
     if (nameSize > PackedRecord::kNameBytesMax || nameSize > names.size() || names.size() - nameSize > kPathBytesMax)
@@ -42,6 +46,7 @@ std::optional<Departure> Departure::decode(ByteView bytes) {
         .root = FileID{loadInteger<std::uint64_t>(bytes.data() + 22)},
         .name = textOf(names.first(nameSize)),
         .path = textOf(names.subspan(nameSize)),
+        .goesOn = goesOn,
     };
 }
 
@@ -66,8 +71,7 @@ void Presence::encode(std::byte* to) const {
 }
 
 std::optional<Presence> Presence::decode(ByteView bytes) {
-    if (bytes.size() != kBytes || bytes[0] != std::byte{static_cast<std::uint8_t>(EventKind::present)})
-        return std::nullopt;
+    if (bytes.size() != kBytes || !isOf(EventKind::present, bytes)) return std::nullopt;
     return Presence{FileID{loadInteger<std::uint64_t>(bytes.data() + 1)}};
 }
 

@@ -23,6 +23,7 @@ struct Departure {
     FileID root{};
     std::string_view name;
     std::string_view path;
+    bool goesOn = false;  ///< it is listed as the same object wherever it went; otherwise it ended here
 
     static constexpr std::size_t kHeadBytes = 1 + 8 + 4 + 8 + 1 + 8 + 2;
     /// A path that is longer is left out: no call of the system could be given it in one piece.

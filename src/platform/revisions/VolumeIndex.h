@@ -36,7 +36,7 @@ struct IndexedObject {
 struct JournalEvent {
     enum class Kind : std::uint8_t {
         present = 1,   ///< the object is to be looked at where it is now: `parent`, `name` and `objectKind` are today's
-        departed = 2,  ///< the object left the place `parent`, `name`
+        departed = 2,  ///< the object left the place `parent`, `name`; see `goesOn`
         document = 3,  ///< `documentID` went from `fileID` to `target`
     };
     std::uint64_t id = 0;
@@ -48,6 +48,7 @@ struct JournalEvent {
     ObjectKind objectKind = ObjectKind::other;
     std::string path = {};  ///< departed only: where it was below its root when it left, should `parent` be gone, too
     FileID root{};          ///< departed only: the root that `path` is below
+    bool goesOn = false;    ///< departed only: it was listed as the same object elsewhere after it
     FileID target{};        ///< document only; 0: the document no longer exists
 };
 

@@ -26,7 +26,8 @@ JournalEvent eventOf(std::uint64_t id, const Departure& departure) {
             .name = std::string(departure.name),
             .objectKind = departure.objectKind,
             .path = std::string(departure.path),
-            .root = departure.root};
+            .root = departure.root,
+            .goesOn = departure.goesOn};
 }
 
 JournalEvent eventOf(std::uint64_t id, FileID fileID) {

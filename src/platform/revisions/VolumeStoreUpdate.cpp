@@ -94,6 +94,9 @@ DocumentID VolumeStore::Implementation::Update::sight(const ObjectSighting& sigh
 
 namespace {
 
+// Folders of this name are no items, whatever they were before.
+constexpr std::string_view kTrashName = ".Trash";
+
 /// Whether an object's identifier has another form now.
 bool changesForm(ObjectKind before, ObjectKind now) {
     return (before == ObjectKind::folder) != (now == ObjectKind::folder);
@@ -107,7 +110,7 @@ void VolumeStore::Implementation::Update::put(const IndexedObject& given, std::s
     const PackedRecord before = changed.now;
     const bool moved = !changed.isThere || !before.isAt(given.parent, name);
     if (changed.isThere && before.isKnownToSomebody() && (moved || changesForm(before.kind, given.kind))) {
-        depart(changed);
+        depart(changed, !changesForm(before.kind, given.kind) && name != kTrashName);
     }
     if (changed.isThere && (moved || before.kind != given.kind)) placesChanged(before);
     changed.now = {.parent = given.parent,
@@ -132,7 +135,7 @@ void VolumeStore::Implementation::Update::remove(FileID fileID) {
 
 void VolumeStore::Implementation::Update::remove(Object& gone) {
     if (!gone.isThere) return;
-    if (gone.now.isKnownToSomebody()) depart(gone);
+    if (gone.now.isKnownToSomebody()) depart(gone, /*goesOn=*/false);
     if (const DocumentID itsDocument = gone.now.documentID; itsDocument != DocumentID{}) {
         // Not a document that went to another object since.
         const auto known = document(itsDocument);
@@ -159,7 +162,7 @@ void VolumeStore::Implementation::Update::announce(Object& object) {
     if (journals_) object.now.eventID = nextEvent_++;
 }
 
-void VolumeStore::Implementation::Update::depart(const Object& object) {
+void VolumeStore::Implementation::Update::depart(const Object& object, bool goesOn) {
     if (!journals_) return;
     const Place place = placeOf(object);
     const Departure departure{.fileID = object.fileID,
@@ -168,7 +171,8 @@ void VolumeStore::Implementation::Update::depart(const Object& object) {
                               .objectKind = object.now.kind,
                               .root = place.root.value_or(FileID{}),
                               .name = object.now.name,
-                              .path = place.path};
+                              .path = place.path,
+                              .goesOn = goesOn};
     departures_.emplace_back(nextEvent_++, departure.encode());
 }
 

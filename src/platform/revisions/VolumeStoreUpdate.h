@@ -73,7 +73,7 @@ private:
 
     void remove(Object& object);
     void forget(Object& object);
-    void depart(const Object& object);
+    void depart(const Object& object, bool goesOn);
     void announce(Object& object);
     void changeDocument(DocumentID documentID, FileID source, FileID target);
     std::optional<DocumentRecord> document(DocumentID documentID) const;

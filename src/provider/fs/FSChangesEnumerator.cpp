@@ -75,7 +75,8 @@ struct FSChangesEnumerator::Answer {
     enum class Kind {
         listed,         ///< under the identifier that was asked for
         notListed,      ///< not at all, or under another
-        passedThrough,  ///< a folder of which there is no item, while what is in it is listed
+        passedThrough,  ///< a folder of which no item can be made, while what is in it is listed
+        trash,          ///< one that is no item by its name, while what is in it is listed
         moving,         ///< it is not where the store says
     };
     Kind kind = Kind::notListed;
@@ -213,7 +214,7 @@ Result<FSChangesEnumerator::Answer> FSChangesEnumerator::answerOf(KsURL entry, c
     const bool isEntered = container_contents::isDeep(container_) && entry.ts_isFolder();
     if (!container_contents::isListed(container_, entry)) {
         const bool isTrash = container_contents::isTrashName(entry.lastPathComponent());
-        return Answer{.kind = isEntered && isTrash ? Answer::Kind::passedThrough : Answer::Kind::notListed};
+        return Answer{.kind = isEntered && isTrash ? Answer::Kind::trash : Answer::Kind::notListed};
     }
     std::vector<KsURL> entries;
     entries.push_back(std::move(entry));
@@ -221,6 +222,14 @@ Result<FSChangesEnumerator::Answer> FSChangesEnumerator::answerOf(KsURL entry, c
     if (items.empty() && isEntered) return Answer{.kind = Answer::Kind::passedThrough};
     if (items.empty() || items.front()->itemIdentifier() != identifier) return Answer{};
     return Answer{.kind = Answer::Kind::listed, .item = std::move(items.front())};
+}
+
+/// Whether the event is where a folder that is no item now ceased to be one. A client that takes a folder out takes out
+/// what is in it, too, as far as it has been told: what moved out of it before it ended, but after it moved itself, is
+/// still in it when the move is told, and is not told of again.
+bool FSChangesEnumerator::isEndOfFolder(const Event& event) const {
+    if (!container_contents::isDeep(container_) || event.kind != ObjectKind::folder) return true;
+    return !(event.flags & EventFlags::renamed);
 }
 
 /// Whether what left its place was a trash there, and so not listed.
@@ -243,10 +252,14 @@ void FSChangesEnumerator::askAbout(FSEventReader& reader, const Event& event,
     if (!answer.ok()) return endWithError(reader, answer.error());
     switch (answer->kind) {
         case Answer::Kind::listed: forward(std::move(answer->item)); break;
-        case Answer::Kind::notListed: forward(*identifier); break;
+        case Answer::Kind::notListed:
+            if (isEndOfFolder(event)) forward(*identifier);
+            break;
         case Answer::Kind::passedThrough:
-            // A client that takes the folder out takes out what is in it, too: only when it was listed where it was.
-            if ((event.flags & EventFlags::removed) && !leftTrash(event)) forward(*identifier);
+            if (event.flags & EventFlags::removed) forward(*identifier);
+            break;
+        case Answer::Kind::trash:
+            if ((event.flags & EventFlags::removed) && isEndOfFolder(event) && !leftTrash(event)) forward(*identifier);
             break;
         case Answer::Kind::moving: return askAgain(reader);
     }
