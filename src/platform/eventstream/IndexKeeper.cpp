@@ -31,6 +31,8 @@ constexpr int kRoundsMax = 8;
 // A folder that can't be reached so often keeps moving, or can't be opened for a reason of its own.
 constexpr int kAttemptsMax = 6;
 constexpr std::string_view kTrashName = ".Trash";
+// A newcomer waits for so many rounds: one that looks, one that gives up what did not turn up.
+constexpr int kPutOffMax = 3;
 // A number given to an object younger than this was given while it was being saved.
 constexpr std::int64_t kYoungNanoseconds = 60'000'000'000;
 
@@ -94,6 +96,7 @@ Result<void> IndexKeeper::workOff() {
     const Result<void> done = rounds();
     openFolders_.clear();
     contexts_.clear();
+    putOff_.clear();
     if (!done.ok()) {
         // Replacements stay: each is looked at anew before a document is handed over, and can't be found again.
         changes_.reset();
@@ -326,6 +329,7 @@ Result<void> IndexKeeper::see(OpenFolder& folder, std::string_view name, const F
     if (known && known->object.birthTime == status.birthStamp()) {
         return seeKnown(folder, name, status, *known, isHinted);
     }
+    if (isHinted && known && known->isFolder() && TRY(putOff(folder, name, FileID{status.fileID}))) return {};
     return seeNew(folder, name, status, known);
 }
 
@@ -417,6 +421,20 @@ Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name
     return {};
 }
 
+/// Whether a newcomer with the number of a folder that is gone waits until what the index has in that one has turned up
+/// where it moved, or was given up: it is no longer there, but may well be somewhere.
+Result<bool> IndexKeeper::putOff(const OpenFolder& folder, std::string_view name, FileID number) {
+    TRY(flush());
+    std::vector<Departure> left;
+    TRY(store_.children(number, [&](const IndexedObject& object) {
+        left.push_back({number, std::string(object.name), object.fileID, object.birthTime, roundNumber_});
+    }));
+    if (left.empty() || ++putOff_[number] > kPutOffMax) return false;
+    departures_.insert(departures_.end(), std::make_move_iterator(left.begin()), std::make_move_iterator(left.end()));
+    dirtyFolders_[folder.fileID].names.emplace(name);
+    return true;
+}
+
 Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, const FileStatus& status,
                                  const std::optional<Known>& formerHolder) {
     const FileID fileID{status.fileID};
@@ -429,6 +447,8 @@ Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, cons
         packagesChanged(formerHolder->object.parent);
         if (formerHolder->isFolder()) {
             TRY(removeBelow(fileID));
+            // What was below and turns up elsewhere is new from here on, with all that is in it.
+            TRY(flush());
             contexts_.clear();
         }
         forgetWatch(fileID);

@@ -125,6 +125,7 @@ private:
     Result<void> seeMoved(OpenFolder& folder, std::string_view name, const FileStatus& status, const Known& known,
                           bool isClosed);
     Result<void> seeOtherName(OpenFolder& folder, std::string_view name, const FileStatus& status, const Known& known);
+    Result<bool> putOff(const OpenFolder& folder, std::string_view name, FileID number);
     Result<void> seeNew(OpenFolder& folder, std::string_view name, const FileStatus& status,
                         const std::optional<Known>& formerHolder);
     void lost(FileID parent, std::string_view name, const Known& known, std::optional<FileID> newcomer);
@@ -208,6 +209,7 @@ private:
     std::unordered_map<FileID, Known> placed_;  // Puts that are not written yet, of folders and objects that moved.
     std::vector<Departure> departures_;
     std::vector<Replacement> replacements_;
+    std::unordered_map<FileID, int> putOff_;  // Newcomers under a number whose former holder is not given up yet.
     std::uint64_t roundNumber_ = 0;
     std::unordered_map<FileID, Context> contexts_;
     std::unordered_set<FileID> touchedPackages_;

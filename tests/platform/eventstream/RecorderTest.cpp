@@ -135,6 +135,41 @@ TEST_P(RecorderTest, followsAFileThatMovesOnAndBack) {
     expectIndexIsTree();
 }
 
+// As a file system does that gives out a number again at once: the index is made to be what it was before.
+TEST_P(RecorderTest, keepsWhatLeftAFolderWhoseNumberIsANewOnesNow) {
+    write("kept");
+    makeFolder("moved");
+    write("moved/deep");
+    makeFolder("new");
+    start();
+    const DocumentID kept = list("kept");
+    const DocumentID deep = list("moved/deep");
+    const FileID reused = fileID("new");
+    IndexChanges before(IndexChanges::Journal::no);
+    before.put({.fileID = reused,
+                .birthTime = 1,
+                .parent = FileID{root_->status.fileID},
+                .name = "old",
+                .kind = ObjectKind::folder,
+                .changeTime = 1});
+    for (const std::string name : {"kept", "moved"}) {
+        store().indexed(fileID(name), [&](IndexedObject object) {
+            object.parent = reused;
+            object.name = name;
+            before.put(object);
+        });
+    }
+    const FileID rootID{root_->status.fileID};
+    ASSERT_TRUE(store().apply(before, {&rootID, 1}).ok());
+    rename("new", "newer");
+    rename("kept", "found");
+    rename("moved", "found too");
+    changes();
+    EXPECT_EQ(document("found"), kept);
+    EXPECT_EQ(document("found too/deep"), deep);
+    expectIndexIsTree();
+}
+
 TEST_P(RecorderTest, followsTwoFilesThatSwapNames) {
     write("a", "one");
     write("b", "two");
