@@ -105,7 +105,7 @@ class ContainerView:
 
         `fileURL` of an item below a moved folder is as of when the item was last sent. An object with several names is
         listed under one of them, whichever; in a folder it may be listed under one that lies elsewhere. Where it isn't told
-        that an object was given a name and lost it again, its version is left out as well.
+        that an object was given a name, was written under it and lost it again, what that changes is left out as well.
         """
         lines = []
         for identifier in sorted(self.items.keys() | fresh.keys()):
@@ -118,7 +118,7 @@ class ContainerView:
                 continue
             left_out = {"fileURL"} | ({"filename", "parentIdentifier", "typeIdentifier", "isTrashed"} if several else set())
             if had_several_names(theirs):
-                left_out.add("versionIdentifier")
+                left_out |= {"versionIdentifier", "documentSize", "contentModificationDate", "typeIdentifier"}
             keys = sorted(key for key in (mine.keys() | theirs.keys()) - left_out if mine.get(key) != theirs.get(key))
             if keys:
                 told = ", ".join(f"{key} is {mine.get(key)!r}, should be {theirs.get(key)!r}" for key in keys)
