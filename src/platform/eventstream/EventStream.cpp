@@ -15,7 +15,7 @@ namespace cindral {
 namespace {
 
 // Events that a callback is given at once: enough to share the cost of a transaction, few enough to stop between.
-constexpr std::size_t kEventsAtOnceMax = 256;
+constexpr std::size_t kEventsAtOnceMax = 100;
 constexpr std::string_view kDocumentTree = "/.docid";
 
 bool holds(std::string_view folder, std::string_view path) {

@@ -69,6 +69,7 @@ void IndexKeeper::setRoots(std::vector<Root> roots) {
 // MARK: Hints
 
 Result<void> IndexKeeper::takeHints() {
+    const MutexLock lock(sourcesMutex_);
     for (const auto& source : sources_) TRY(source->drain([this](const EventHint& hint) { note(hint); }));
     return {};
 }

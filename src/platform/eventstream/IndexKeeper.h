@@ -14,6 +14,7 @@
 
 #include "platform/eventstream/EventSource.h"
 #include "platform/eventstream/SafeSave.h"
+#include "platform/foundation/Mutex.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/foundation/Sys.h"
 #include "platform/revisions/VolumeIndex.h"
@@ -146,17 +147,24 @@ private:
         FileID fileID{};
         std::string path;  // below the root
     };
-    struct Entries;
+    struct Batch;
+    struct Comparison;
+    class TreeWalk;
+    class ReadAhead;
     enum class GoesOn { no, below };  ///< whether the comparison comes to subfolders by itself
     Result<void> compareUnwatched();
     Result<void> scanPending();
     Result<void> scan(FileID folder);
     void scanLater(FileID folder);
-    Result<void> compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders, GoesOn goesOn);
-    Result<void> compareBatch(OpenFolder& folder, Entries& entries, GoesOn goesOn);
+    Result<void> compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders);
+    static void readEntries(Batch& batch);
+    static void addSubfolders(const Batch& batch, std::vector<Subfolder>& subfolders);
+    Result<void> compareBatch(Comparison& comparison, Batch& batch, GoesOn goesOn);
     Result<void> seeCompared(OpenFolder& folder, const char* name, const FileStatus& status, GoesOn goesOn);
     Result<void> findLost(OpenFolder& folder, std::vector<std::uint64_t>& seen);
     void watch(const OpenFolder& folder);
+    Result<void> startWatching(const OpenFolder& folder) const EXCLUDES(sourcesMutex_);
+    void noteWatched(const OpenFolder& folder, const Result<void>& watched);
     void watchNames(const OpenFolder& folder, std::string_view name, const FileStatus& status);
     void forgetWatch(FileID fileID);
 
@@ -193,6 +201,8 @@ private:
     std::vector<Root> roots_;
     std::vector<FileID> rootIDs_;
     std::vector<std::shared_ptr<EventSource>> sources_;
+    /// Held while a source is called: the thread that reads ahead has folders watched. `sources_` itself stays meanwhile.
+    mutable Mutex sourcesMutex_;
 
     // What is to be looked at.
     std::unordered_map<FileID, FolderDirt> dirtyFolders_;

@@ -8,6 +8,7 @@
 
 #include "platform/eventstream/IndexKeeper.h"
 #include "platform/eventstream/IndexKeeperTypes.h"
+#include "platform/eventstream/IndexKeeperWalk.h"
 #include "platform/foundation/Log.h"
 
 // How folders are compared with the index, and how the tree is reached.
@@ -23,8 +24,12 @@ namespace {
 // Folders that are kept open for what comes next in them; well below what a process may have open.
 constexpr std::size_t kOpenFoldersMax = 128;
 constexpr std::size_t kDirectoryBytes = 65'536;
+// Room for less is not worth a call; more than the longest record takes.
+constexpr std::size_t kDirectoryBytesMin = 4'096;
 // Every folder's watch may bring news while others are read; the kernel's queue must not fill up meanwhile.
 constexpr std::size_t kFoldersBetweenHints = 8;
+// More folders than this are read ahead.
+constexpr std::size_t kFoldersBeforeReadingAhead = 16;
 // A folder that can't be reached so often keeps moving, or can't be opened for a reason of its own.
 constexpr int kScanAttemptsMax = 6;
 
@@ -57,7 +62,7 @@ Result<std::vector<FileID>> IndexKeeper::compareFolder(FileID fileID) {
     std::vector<FileID> subfolders;
     if (const auto folder = openFolder(fileID)) {
         std::vector<Subfolder> found;
-        const Result<void> compared = compareEntries(*folder, &found, GoesOn::no);
+        const Result<void> compared = compareEntries(*folder, &found);
         if (!compared.ok()) everythingIsDirty_ = true;
         TRY(Result<void>(compared));
         for (const Subfolder& subfolder : found) subfolders.push_back(subfolder.fileID);
@@ -80,7 +85,7 @@ Result<void> IndexKeeper::compareUnwatched() {
             continue;
         }
         watch(*folder);
-        TRY(compareEntries(*folder, nullptr, GoesOn::no));
+        TRY(compareEntries(*folder, nullptr));
         lookAtFolderItself(*folder);
     }
     return {};
@@ -96,7 +101,6 @@ Result<void> IndexKeeper::scanPending() {
     return {};
 }
 
-/// Watches first, then reads: what comes in between is told of twice, never not at all.
 Result<void> IndexKeeper::scan(FileID top) {
     TRY(flush());
     const auto first = openFolder(top);
@@ -104,27 +108,30 @@ Result<void> IndexKeeper::scan(FileID top) {
         scanLater(top);
         return {};
     }
-    const Root& root = *first->root;
-    std::vector<Subfolder> stack;
-    stack.push_back({top, first->path});
-    for (std::size_t count = 1; !stack.empty(); ++count) {
+    TreeWalk walk(*this, *first->root, {top, first->path});
+    std::optional<ReadAhead> ahead;
+    Comparison comparison;
+    std::size_t count = 0;
+    while (true) {
         if (options_.isStopping()) return KsError::posix(ECANCELED);
-        const Subfolder next = std::move(stack.back());
-        stack.pop_back();
-        const auto folder = open(next.fileID, next.path, root);
-        if (!folder.ok()) {
-            logDebug("can't read the folder {}; {}", next.path, folder.error().description());
-            noteOpenFailure(folder.error());
-            scanLater(next.fileID);
+        std::optional<Batch> batch = ahead ? ahead->next() : walk.next();
+        if (!batch) return {};
+        if (batch->isFirst && ++count % kFoldersBetweenHints == 0) TRY(takeHints());
+        if (!batch->folder) {
+            logDebug("can't read the folder {}; {}", batch->place.path, batch->error->description());
+            noteOpenFailure(*batch->error);
+            scanLater(batch->place.fileID);
             continue;
         }
-        unreached_.erase(next.fileID);
-        watch(**folder);
-        TRY(compareEntries(**folder, &stack, GoesOn::below));
+        if (batch->isFirst) {
+            unreached_.erase(batch->folder->fileID);
+            noteWatched(*batch->folder, batch->watched);
+        }
+        TRY(compareBatch(comparison, *batch, GoesOn::below));
         TRY(flushWhenFull());
-        if (count % kFoldersBetweenHints == 0) TRY(takeHints());
+        // What is small is done before a thread has started.
+        if (!ahead && count == kFoldersBeforeReadingAhead) ahead.emplace(walk);
     }
-    return {};
 }
 
 /// The folder has moved, or one above it, since its parent was read: it may be found in the next round. One that is gone
@@ -140,72 +147,78 @@ void IndexKeeper::scanLater(FileID folder) {
     }
 }
 
-/// Entries of a folder as they were just read.
-struct IndexKeeper::Entries {
-    struct Entry {
-        const char* name = nullptr;
-        FileStatus status;
-        bool isMatched = false;
-    };
-    std::vector<Entry> entries;
-    std::vector<FileID> fileIDs;
-    std::vector<std::uint64_t> seen;  // File IDs of all the entries so far.
-    std::uint64_t recordedHere = 0;   // Of them, those that the index has here.
-};
-
-Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders, GoesOn goesOn) {
-    const std::uint64_t recorded = store_.childCount(folder.fileID);
-    Entries entries;
-    alignas(8) std::array<std::byte, kDirectoryBytes> buffer;
-    bool sawAll = true;
+Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders) {
+    Comparison comparison;
+    Batch batch;
+    batch.folder = folder.shared_from_this();
+    batch.isFirst = true;
     (void)::lseek(folder.fd.get(), 0, SEEK_SET);
-    while (true) {
-        const Result<std::size_t> read = sys::getdents(folder.fd.get(), buffer);
-        if (!read.ok()) {
-            // What can't be read is not gone, and is no reason not to read the others.
-            logDebug("can't read the folder {}; {}", folder.path, read.error().description());
-            return {};
-        }
-        const std::size_t size = *read;
-        if (size == 0) break;
-        entries.entries.clear();
-        for (std::size_t at = 0; at < size;) {
-            const auto* record = reinterpret_cast<const DirectoryRecord*>(buffer.data() + at);
-            at += record->length;
-            if (record->isDots()) continue;
-            const Result<FileStatus> status = sys::statx(folder.fd.get(), record->name);
-            if (!status.ok()) {
-                if (status.error().isPosix(ENOENT)) continue;
-                logDebug("can't look at {}/{}; {}", folder.path, record->name, status.error().description());
-                // What can't be looked at is not gone.
-                sawAll = false;
-                continue;
-            }
-            if (status->device != folder.root->directory->status.device) continue;
-            entries.entries.push_back({record->name, *status});
-        }
-        TRY(compareBatch(folder, entries, goesOn));
-        if (subfolders == nullptr) continue;
-        for (const Entries::Entry& entry : entries.entries) {
-            if (!entry.status.isDirectory()) continue;
-            subfolders->push_back({FileID{entry.status.fileID}, joined(folder.path, entry.name)});
-        }
+    while (!batch.isLast) {
+        readEntries(batch);
+        TRY(compareBatch(comparison, batch, GoesOn::no));
+        if (subfolders != nullptr) addSubfolders(batch, *subfolders);
+        batch.isFirst = false;
     }
-    return !sawAll || entries.recordedHere == recorded ? Result<void>() : findLost(folder, entries.seen);
+    return {};
 }
 
-Result<void> IndexKeeper::compareBatch(OpenFolder& folder, Entries& entries, GoesOn goesOn) {
-    entries.fileIDs.clear();
-    for (const Entries::Entry& entry : entries.entries) {
-        entries.fileIDs.push_back(FileID{entry.status.fileID});
-        entries.seen.push_back(entry.status.fileID);
+/// The next entries of the batch's folder. Touches nothing of the keeper's.
+void IndexKeeper::readEntries(Batch& batch) {
+    const OpenFolder& folder = *batch.folder;
+    batch.entries.clear();
+    if (!batch.names) batch.names = std::make_unique_for_overwrite<std::byte[]>(kDirectoryBytes);
+    std::size_t size = 0;
+    // To the end where there is room: a folder that isn't large is one batch.
+    while (!batch.isLast && kDirectoryBytes - size >= kDirectoryBytesMin) {
+        const Result<std::size_t> read =
+            sys::getdents(folder.fd.get(), {batch.names.get() + size, kDirectoryBytes - size});
+        if (!read.ok()) batch.error = read.error();
+        batch.isLast = !read.ok() || *read == 0;
+        size += read.ok() ? *read : 0;
     }
-    TRY(store_.indexed(entries.fileIDs, [&](std::size_t i, const IndexedObject* object) {
-        Entries::Entry& entry = entries.entries[i];
+    for (std::size_t at = 0; at < size;) {
+        const auto* record = reinterpret_cast<const DirectoryRecord*>(batch.names.get() + at);
+        at += record->length;
+        if (record->isDots()) continue;
+        const Result<FileStatus> status = sys::statx(folder.fd.get(), record->name);
+        if (!status.ok()) {
+            if (status.error().isPosix(ENOENT)) continue;
+            logDebug("can't look at {}/{}; {}", folder.path, record->name, status.error().description());
+            // What can't be looked at is not gone.
+            batch.sawAll = false;
+            continue;
+        }
+        if (status->device != folder.root->directory->status.device) continue;
+        batch.entries.push_back({record->name, *status});
+    }
+}
+
+void IndexKeeper::addSubfolders(const Batch& batch, std::vector<Subfolder>& subfolders) {
+    for (const Batch::Entry& entry : batch.entries) {
+        if (!entry.status.isDirectory()) continue;
+        subfolders.push_back({FileID{entry.status.fileID}, joined(batch.folder->path, entry.name)});
+    }
+}
+
+Result<void> IndexKeeper::compareBatch(Comparison& comparison, Batch& batch, GoesOn goesOn) {
+    OpenFolder& folder = *batch.folder;
+    if (batch.isFirst) {
+        // What is counted and what is met are to be of one moment.
+        if (journal_ == Journal::yes) TRY(flush());
+        comparison = {.recorded = store_.childCount(folder.fileID)};
+    }
+    comparison.sawAll = comparison.sawAll && batch.sawAll;
+    comparison.fileIDs.clear();
+    for (const Batch::Entry& entry : batch.entries) {
+        comparison.fileIDs.push_back(FileID{entry.status.fileID});
+        comparison.seen.push_back(entry.status.fileID);
+    }
+    TRY(store_.indexed(comparison.fileIDs, [&](std::size_t i, const IndexedObject* object) {
+        Batch::Entry& entry = batch.entries[i];
         if (object == nullptr || object->parent != folder.fileID || object->name != entry.name ||
             object->birthTime != entry.status.birthStamp())
             return;
-        ++entries.recordedHere;
+        ++comparison.recordedHere;
         entry.isMatched = object->changeTime == stampOf(entry.status.changeTime) &&
                           object->size == sizeOf(entry.status) && object->kind == kindOf(entry.status, entry.name) &&
                           !object->isClosed && !object->hasOtherNames && entry.status.names == 1;
@@ -215,10 +228,17 @@ Result<void> IndexKeeper::compareBatch(OpenFolder& folder, Entries& entries, Goe
                               object->kind == kindOf(entry.status, entry.name);
         }
     }));
-    for (const Entries::Entry& entry : entries.entries) {
+    for (const Batch::Entry& entry : batch.entries) {
         if (!entry.isMatched) TRY(seeCompared(folder, entry.name, entry.status, goesOn));
     }
-    return {};
+    if (!batch.isLast) return {};
+    if (batch.error) {
+        // What can't be read is not gone, and is no reason not to read the others.
+        logDebug("can't read the folder {}; {}", folder.path, batch.error->description());
+        return {};
+    }
+    if (!comparison.sawAll || comparison.recordedHere == comparison.recorded) return {};
+    return findLost(folder, comparison.seen);
 }
 
 Result<void> IndexKeeper::seeCompared(OpenFolder& folder, const char* name, const FileStatus& status, GoesOn goesOn) {
@@ -256,19 +276,25 @@ Result<void> IndexKeeper::findLost(OpenFolder& folder, std::vector<std::uint64_t
 // MARK: Watching
 
 void IndexKeeper::watch(const OpenFolder& folder) {
+    noteWatched(folder, startWatching(folder));
+}
+
+/// EOPNOTSUPP where nothing tells of the root.
+Result<void> IndexKeeper::startWatching(const OpenFolder& folder) const {
     const auto& source = folder.root->source;
-    if (!source) {
-        unwatched_.insert(folder.fileID);
-        return;
-    }
-    const Result<void> watched = source->watchFolder(folder.fd.get(), folder.fileID);
+    if (!source) return KsError::posix(EOPNOTSUPP);
+    const MutexLock lock(sourcesMutex_);
+    return source->watchFolder(folder.fd.get(), folder.fileID);
+}
+
+void IndexKeeper::noteWatched(const OpenFolder& folder, const Result<void>& watched) {
     if (watched.ok()) {
         unwatched_.erase(folder.fileID);
         return;
     }
     if (watched.error().isPosix(ENOSPC)) {
         reachedWatchLimit_ = true;
-    } else {
+    } else if (folder.root->source) {
         logDebug("can't watch {}; {}", folder.path, watched.error().description());
     }
     unwatched_.insert(folder.fileID);
@@ -279,12 +305,23 @@ void IndexKeeper::watchNames(const OpenFolder& folder, std::string_view name, co
     if (!status.isRegular() || status.names < 2 || !folder.root->source) return;
     const Result<UniqueFd> file = sys::openat(folder.fd.get(), std::string(name).c_str(), O_PATH | O_NOFOLLOW);
     if (!file.ok()) return;
-    const Result<void> watched = folder.root->source->watchFile(file->get(), FileID{status.fileID});
-    if (!watched.ok()) logDebug("can't watch the file {}; {}", name, watched.error().description());
+    const Result<void> watched = [&] {
+        const MutexLock lock(sourcesMutex_);
+        return folder.root->source->watchFile(file->get(), FileID{status.fileID});
+    }();
+    if (watched.ok()) return;
+    logDebug("can't watch the file {}; {}", name, watched.error().description());
+    if (!watched.error().isPosix(ENOSPC)) return;
+    // Its folder is compared at each call until there are watches again.
+    reachedWatchLimit_ = true;
+    unwatched_.insert(folder.fileID);
 }
 
 void IndexKeeper::forgetWatch(FileID fileID) {
-    for (const auto& source : sources_) source->forget(fileID);
+    {
+        const MutexLock lock(sourcesMutex_);
+        for (const auto& source : sources_) source->forget(fileID);
+    }
     unwatched_.erase(fileID);
     closed_.erase(fileID);
 }

@@ -11,7 +11,7 @@
 namespace cindral {
 
 /// A folder of the index, open for reading. The descriptor keeps its number from being given to another.
-struct IndexKeeper::OpenFolder {
+struct IndexKeeper::OpenFolder : std::enable_shared_from_this<OpenFolder> {
     UniqueFd fd;
     FileID fileID{};
     std::string path;  ///< below the root, as of when it was opened
@@ -28,6 +28,33 @@ struct IndexKeeper::Known {
         return object.fileID == fileID && object.birthTime == birthTime;
     }
     bool isAt(FileID parent, std::string_view at) const { return object.parent == parent && name == at; }
+};
+
+/// Entries of a folder as they were just read, some of them or all.
+struct IndexKeeper::Batch {
+    struct Entry {
+        const char* name = nullptr;  ///< in `names`
+        FileStatus status;
+        bool isMatched = false;  ///< the index has it as it is
+    };
+    std::shared_ptr<OpenFolder> folder;  ///< null when it can't be opened
+    Subfolder place;                     ///< of a folder that can't be opened
+    std::optional<KsError> error;        ///< why it can't be opened, or not read any further
+    Result<void> watched;                ///< with the first of a folder
+    bool isFirst = false;
+    bool isLast = false;
+    bool sawAll = true;  ///< false when an entry could not be looked at
+    std::vector<Entry> entries;
+    std::unique_ptr<std::byte[]> names;
+};
+
+/// What was found of a folder so far.
+struct IndexKeeper::Comparison {
+    std::uint64_t recorded = 0;            ///< entries that the index has in it
+    std::uint64_t recordedHere = 0;        ///< of those that were seen
+    std::vector<std::uint64_t> seen = {};  ///< file IDs of all of them
+    std::vector<FileID> fileIDs = {};      ///< of the batch
+    bool sawAll = true;
 };
 
 struct IndexKeeper::Departure {
