@@ -68,10 +68,12 @@ std::optional<KsError> writeAttribute(const KsURL& url, std::string_view name, c
     return written.ok() ? std::nullopt : std::optional(written.error());
 }
 
-void setTrashDate(const KsURL& url, const KsDate& date) {
+/// False, after an error line, when it can't be set.
+bool setTrashDate(const KsURL& url, const KsDate& date) {
     logDebug("setting trash date on {}", url.description());
-    if (const auto error = writeAttribute(url, kXattrTrashDateName, keyed_archive::archive(date)))
-        logError("can't set {} of {}; {}", kXattrTrashDateName, url.description(), error->description());
+    const auto error = writeAttribute(url, kXattrTrashDateName, keyed_archive::archive(date));
+    if (error) logError("can't set {} of {}; {}", kXattrTrashDateName, url.description(), error->description());
+    return !error;
 }
 
 /// The root of the app library that holds the URL, the storage among them.
@@ -118,7 +120,7 @@ void LocalTesselKit::trashItemWithIdentifier(const TesselItemIdentifier& identif
     ts_trashUnderFolder(*url, *trash,
                         [former = *url, completion = std::move(completion)](const Result<KsURL>& trashed) {
                             if (!trashed.ok()) return completion(translated(trashed.error()));
-                            setTrashDate(*trashed, KsDate::now());
+                            (void)setTrashDate(*trashed, KsDate::now());
                             setPutBack(former, *trashed);
                             completion(itemAtURL(*trashed));
                         });
@@ -236,7 +238,7 @@ private:
 
     /// None where there was none, and one was given now.
     static std::optional<KsDate> trashDate(const KsURL& url, const FileStatus& status) {
-        // What can't bear attributes would never go: being trashed was the last that changed it.
+        // What can't bear attributes, or may not be given any, would never go: being trashed was the last that changed it.
         if (!status.isRegular() && !status.isDirectory()) return status.changeTime;
         const auto value = initWithValueOfXattr(kXattrTrashDateName, url);
         const auto date = value ? keyed_archive::unarchiveDate(*value) : std::nullopt;
@@ -246,8 +248,8 @@ private:
         } else {
             logDebug("can't find trash date for URL \"{}\"; set current date", url.description());
         }
-        setTrashDate(url, KsDate::now());
-        return std::nullopt;
+        if (setTrashDate(url, KsDate::now())) return std::nullopt;
+        return status.changeTime;
     }
 
     void fail(const KsError& error) {

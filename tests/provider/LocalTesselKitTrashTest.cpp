@@ -315,6 +315,20 @@ TEST_F(LocalTesselKitTrash, linksGoByWhenTheyLastChanged) {
     EXPECT_FALSE(exists(".Trash/link"));
 }
 
+// The mode of a file that may not be written forbids attributes too.
+TEST_F(LocalTesselKitTrash, whatCannotBeGivenADateGoesByWhenItLastChanged) {
+    for (const char* name : {"a", ".Trash/dated"}) ::chmod(storage_.file(name).c_str(), 0444);
+    setTrashDate(".Trash/dated", {KsDate::now().seconds + 7200, 0});
+    OrdinaryPerson::giveTo(storage_.outside().path());
+    const OrdinaryPerson person;
+    ASSERT_EQ(errorOf(trash(identifier("a"))), "");
+    EXPECT_EQ(sweep(kLater), std::nullopt);
+    EXPECT_TRUE(exists(".Trash/a"));
+    EXPECT_EQ(sweep({KsDate::now().seconds + 3600, 0}), std::nullopt);
+    EXPECT_FALSE(exists(".Trash/a"));
+    EXPECT_TRUE(exists(".Trash/dated"));
+}
+
 TEST_F(LocalTesselKitTrash, aSweepOfNothingIsDone) {
     const LogCapture log;
     EXPECT_EQ(sweep(kLater), std::nullopt);

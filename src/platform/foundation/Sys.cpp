@@ -55,11 +55,15 @@ std::string pathThroughDescriptor(int directory, const char* name) {
                          : fmt::format("/proc/self/fd/{}/{}", directory, name);
 }
 
-// With an empty name the path through /proc is the only way: a descriptor opened with O_PATH is no open file to the *at
-// calls.
+// With an empty name and a descriptor opened with O_PATH the path through /proc is the only way: that is no open file to
+// the other calls.
 ssize_t listxattrOnce(int directory, const char* name, char* buffer, std::size_t size) {
     if (*name != '\0' && hasXattratCalls()) {
         return ::syscall(kListxattratCall, directory, name, AT_SYMLINK_NOFOLLOW, buffer, size);
+    }
+    if (*name == '\0') {
+        const ssize_t got = ::flistxattr(directory, buffer, size);
+        if (got >= 0 || errno != EBADF) return got;
     }
     const std::string path = pathThroughDescriptor(directory, name);
     return *name == '\0' ? ::listxattr(path.c_str(), buffer, size) : ::llistxattr(path.c_str(), buffer, size);
@@ -70,6 +74,10 @@ ssize_t getxattrOnce(int directory, const char* name, const char* attribute, voi
         XattrArguments arguments{reinterpret_cast<std::uint64_t>(buffer), static_cast<std::uint32_t>(size), 0};
         return ::syscall(kGetxattratCall, directory, name, AT_SYMLINK_NOFOLLOW, attribute, &arguments,
                          sizeof arguments);
+    }
+    if (*name == '\0') {
+        const ssize_t got = ::fgetxattr(directory, attribute, buffer, size);
+        if (got >= 0 || errno != EBADF) return got;
     }
     const std::string path = pathThroughDescriptor(directory, name);
     return *name == '\0' ? ::getxattr(path.c_str(), attribute, buffer, size)

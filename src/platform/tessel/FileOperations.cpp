@@ -172,21 +172,29 @@ Result<void> withStagingFor(const Folder& folder, Move move) {
     return move(*TRY(StagingFolder::make(folder.root)));
 }
 
-/// Gives what was built in the staging folder its place.
-Result<void> putInPlace(const StagingFolder& staging, const Folder& folder, const std::string& name) {
-    const FileStatus status = TRY(sys::statx(staging.fd(), StagingFolder::kItemName));
-    // A folder that may not be written can't be moved: it gets its mode afterwards.
+/// Gives what was built in the temporary folder its place.
+Result<void> putInPlace(int from, const char* name, const Folder& folder, const std::string& newName) {
+    const auto rename = [&] { return renameWithoutReplacing(from, name, folder.fd.get(), newName.c_str()); };
+    const Result<void> renamed = rename();
+    if (renamed.ok() || !renamed.error().isPosix(EACCES)) return renamed;
+    // A folder that may not be written can't get another parent: it may for as long as it is moved.
+    const UniqueFd handle = TRY(sys::openat(from, name, O_PATH | O_NOFOLLOW));
+    const FileStatus status = TRY(sys::statx(handle.get(), ""));
     const bool isLocked = status.isDirectory() && (status.mode & S_IWUSR) == 0;
-    UniqueFd handle;
-    if (isLocked) {
-        handle = TRY(sys::openat(staging.fd(), StagingFolder::kItemName, O_PATH | O_NOFOLLOW | O_DIRECTORY));
-        TRY(sys::fchmod(handle.get(), (status.mode & 07777) | S_IWUSR));
-    }
-    TRY(renameWithoutReplacing(staging.fd(), StagingFolder::kItemName, folder.fd.get(), name.c_str()));
-    if (!isLocked) return {};
-    const Result<void> restored = sys::fchmod(handle.get(), status.mode & 07777);
-    if (!restored.ok()) logError("can't set the mode of {}; {}", folder.pathOf(name), restored.error().description());
-    return {};
+    const mode_t mode = status.mode & 07777;
+    if (!isLocked || !sys::fchmod(handle.get(), mode | S_IWUSR).ok()) return renamed;
+    const Result<void> moved = rename();
+    const Result<void> restored = sys::fchmod(handle.get(), mode);
+    if (!restored.ok())
+        logError("can't set the mode of {}; {}", folder.pathOf(newName), restored.error().description());
+    return moved;
+}
+
+/// Whether something lies in the storage's temporary folder, or below it.
+bool isTemporary(const Place& place) {
+    const KsURL storage = TesselManager::defaultManager().documentStorageURL();
+    const std::string temporary = storage.appendingPathComponent(kTemporaryLocalFolderName).path();
+    return place.path().starts_with(temporary + "/");
 }
 
 /// What is to be copied: an entry of an open folder, anywhere.
@@ -240,7 +248,7 @@ Result<void> importByStaging(const Source& source, const Folder& folder, const s
         TreeCopy copy(progress, path, {.attributeLoss = AttributeLoss::isLogged, .excluded = &staging.status()});
         TRY(copy.copy(source.folder.get(), source.name.c_str(), staging.fd(), StagingFolder::kItemName));
         TRY(progress.check());
-        return putInPlace(staging, folder, source.name);
+        return putInPlace(staging.fd(), StagingFolder::kItemName, folder, source.name);
     });
 }
 
@@ -306,7 +314,7 @@ Result<void> moveToOtherDevice(const Place& place, const Folder& folder, const s
                      Thoroughness::contents, &progress));
     TRY(progress.check());
     const FileStatus built = TRY(sys::statx(staging->fd(), StagingFolder::kItemName));
-    TRY(putInPlace(*staging, folder, name));
+    TRY(putInPlace(staging->fd(), StagingFolder::kItemName, folder, name));
     const Result<void> removed = removeCopied(place, folder, name);
     if (removed.ok()) return {};
     // The source is where it was: the copy goes again.
@@ -316,8 +324,10 @@ Result<void> moveToOtherDevice(const Place& place, const Folder& folder, const s
 }
 
 Result<void> moveOnce(const Place& place, const Folder& folder, const std::string& name, TesselProgress& progress) {
-    const Result<void> moved =
-        renameWithoutReplacing(place.folder.fd.get(), place.name.c_str(), folder.fd.get(), name.c_str());
+    const int from = place.folder.fd.get();
+    const Result<void> moved = isTemporary(place)
+                                   ? putInPlace(from, place.name.c_str(), folder, name)
+                                   : renameWithoutReplacing(from, place.name.c_str(), folder.fd.get(), name.c_str());
     if (moved.ok() || !moved.error().isPosix(EXDEV)) return moved;
     return moveToOtherDevice(place, folder, name, progress);
 }

@@ -69,7 +69,9 @@ Result<UniqueFd> openTemporaryFolder(const RootDirectory& root) {
 
 Result<std::unique_ptr<StagingFolder>> StagingFolder::make(std::shared_ptr<const RootDirectory> root,
                                                            Contents contents) {
-    UniqueFd temporary = TRY(openTemporaryFolder(*root));
+    Result<UniqueFd> opened = openTemporaryFolder(*root);
+    if (!opened.ok()) return opened.error().with("path", fmt::format("{}/{}", root->path, kTemporaryLocalFolderName));
+    UniqueFd temporary = *std::move(opened);
     while (true) {
         std::string name = newName(contents == Contents::mayGo ? kStagingPrefix : kKeptPrefix);
         const Result<void> made = sys::mkdirat(temporary.get(), name.c_str(), kOwnerOnly);

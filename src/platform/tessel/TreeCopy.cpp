@@ -188,7 +188,7 @@ Result<void> TreeCopy::copyFile(int source, const FileStatus& status, int target
 
 Result<void> TreeCopy::copyData(int source, const FileStatus& status, int target) {
     // Files of no size may still have contents: those that the kernel makes up.
-    if (status.size <= kSmallFileBytes) return copyByReading(source, target, 0, UINT64_MAX);
+    if (status.size <= kSmallFileBytes) return copyByReading(source, status.size, target, 0, UINT64_MAX);
     if (canClone_) {
         const Result<void> cloned = sys::ficlone(target, source);
         if (cloned.ok()) {
@@ -236,10 +236,11 @@ Result<void> TreeCopy::copyRange(int source, int target, std::uint64_t begin, st
         begin += *copied;
         progress_.advance(*copied, 0);
     }
-    return begin < end ? copyByReading(source, target, begin, end) : Result<void>();
+    return begin < end ? copyByReading(source, 0, target, begin, end) : Result<void>();
 }
 
-Result<void> TreeCopy::copyByReading(int source, int target, std::uint64_t begin, std::uint64_t end) {
+Result<void> TreeCopy::copyByReading(int source, std::uint64_t size, int target, std::uint64_t begin,
+                                     std::uint64_t end) {
     buffer_.resize(kBufferBytes);
     while (begin < end) {
         TRY(progress_.check());
@@ -249,6 +250,8 @@ Result<void> TreeCopy::copyByReading(int source, int target, std::uint64_t begin
         TRY(sys::pwrite(target, ByteView(buffer_).first(got), begin));
         begin += got;
         progress_.advance(got, 0);
+        // Files that the kernel makes up come in pieces; of all others, less than was asked for is the end.
+        if (got < wanted && begin == size) break;
     }
     return {};
 }

@@ -58,7 +58,7 @@ private:
     Result<void> copyData(int source, const FileStatus& status, int target);
     Result<void> copyExtents(int source, int target);
     Result<void> copyRange(int source, int target, std::uint64_t begin, std::uint64_t end);
-    Result<void> copyByReading(int source, int target, std::uint64_t begin, std::uint64_t end);
+    Result<void> copyByReading(int source, std::uint64_t size, int target, std::uint64_t begin, std::uint64_t end);
     Result<void> copyAttributes(int source, const FileStatus& status, int target);
     Result<void> copyAttribute(int source, const char* name, int target, mode_t mode);
 

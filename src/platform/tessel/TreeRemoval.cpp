@@ -66,12 +66,26 @@ private:
     std::uint64_t checkedFolder_ = 0;
 };
 
+/// Gives a folder's owner every right to it. False for somebody else's, or for what is no folder.
+bool unlock(int directory, const char* name) {
+    const Result<UniqueFd> handle = sys::openat(directory, name, O_PATH | O_NOFOLLOW | O_DIRECTORY);
+    return handle.ok() && sys::fchmod(handle->get(), S_IRWXU).ok();
+}
+
 class RemovingVisitor final : public TreeVisitor {
 public:
     RemovingVisitor(int directory, const char* name, TesselProgress* progress)
         : directory_(directory), name_(name), progress_(progress) {}
 
-    Result<Descend> willEnter(WalkedFolder& /*folder*/, const WalkedFolder* /*above*/) override { return Descend::yes; }
+    Result<Descend> willEnter(WalkedFolder& folder, const WalkedFolder* /*above*/) override {
+        // A mode forbids people to change what is in a folder, not a folder that is to go. What that doesn't help, the
+        // removal tells.
+        const bool isLocked = (folder.status.mode & S_IRWXU) != S_IRWXU && folder.status.owner == ::geteuid();
+        if (isLocked) (void)sys::fchmod(folder.fd.get(), S_IRWXU);
+        return Descend::yes;
+    }
+
+    bool hasUnlocked(const WalkedFolder& folder, const char* name) override { return unlock(folder.fd.get(), name); }
 
     Result<void> visit(const WalkedFolder& folder, const char* name) override {
         return remove(folder.fd.get(), name, 0);
@@ -115,7 +129,10 @@ Result<void> removeTree(int directory, const char* name, const std::string& path
     // A folder answers EISDIR here, and EPERM where the file system takes the standard at its word.
     if (!unlinked.error().isPosix(EISDIR) && !unlinked.error().isPosix(EPERM)) return unlinked;
     RemovingVisitor visitor(directory, name, progress);
-    return walkTree(TRY(sys::openDirectoryForReading(directory, name, O_NOFOLLOW)), path, visitor);
+    Result<UniqueFd> top = sys::openDirectoryForReading(directory, name, O_NOFOLLOW);
+    if (!top.ok() && top.error().isPosix(EACCES) && unlock(directory, name))
+        top = sys::openDirectoryForReading(directory, name, O_NOFOLLOW);
+    return walkTree(TRY(std::move(top)), path, visitor);
 }
 
 }  // namespace cindral

@@ -17,6 +17,9 @@ Result<void> checkTreeIsRemovable(int directory, const char* name, const std::st
 
 /// Removes the entry and everything below it, following nothing. What is gone already is no error. An error leaves the
 /// rest where it is. `progress` may be null; whether it was cancelled is not asked.
+///
+/// For what is out of sight already: the modes of the process's own folders are not asked, and changed where they stand
+/// in the way.
 Result<void> removeTree(int directory, const char* name, const std::string& path, TesselProgress* progress);
 
 }  // namespace cindral

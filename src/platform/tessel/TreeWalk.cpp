@@ -109,9 +109,13 @@ private:
 
     /// Goes into the entry that is to be a folder.
     Result<void> enter(const WalkedFolder& folder) {
+        bool isUnlocked = false;
         while (true) {
             Result<UniqueFd> fd = sys::openDirectoryForReading(folder.fd.get(), entry_.c_str(), O_NOFOLLOW);
             if (fd.ok()) return push(std::move(*fd), entry_);
+            if (fd.error().isPosix(EACCES) && !std::exchange(isUnlocked, true) &&
+                visitor_.hasUnlocked(folder, entry_.c_str()))
+                continue;
             if (!fd.error().isPosix(ENOENT) && !fd.error().isPosix(ENOTDIR) && !fd.error().isPosix(ELOOP))
                 return std::move(fd).error();
             // Gone, or something else now. A look tells which, and whether it is worth another try.

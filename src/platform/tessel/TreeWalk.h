@@ -31,6 +31,8 @@ public:
     virtual Result<Descend> willEnter(WalkedFolder& folder, const WalkedFolder* above) = 0;
     /// Anything but a folder. It may be gone already.
     virtual Result<void> visit(const WalkedFolder& folder, const char* name) = 0;
+    /// A folder of that name can't be opened for want of permission. Whether that was changed, and is worth another try.
+    virtual bool hasUnlocked(const WalkedFolder& /*folder*/, const char* /*name*/) { return false; }
     /// Everything in the folder has been visited. It may be asked to be read again, for what has come since.
     virtual Result<Leave> didLeave(WalkedFolder& folder, const WalkedFolder* above) = 0;
 };

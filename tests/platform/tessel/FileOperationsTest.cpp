@@ -868,6 +868,82 @@ TEST_F(FaultTest, everyKillLeavesAllOrNothing) {
     }
 }
 
+// A person's own folders that may not be written, or not even be read by their owner, are no reason to leave them there.
+TEST_F(FileOperationsTest, whatIsLeftBehindGoesWhateverItsModes) {
+    const std::string left = ".TemporaryLocalFolder/.staging-1-1/item";
+    file(left + "/written/a");
+    file(left + "/locked/deeper/b");
+    file(left + "/hidden/c");
+    for (const std::string name : {"/locked/deeper", "/locked"}) ::chmod(path(left + name).c_str(), 0555);
+    ::chmod(path(left + "/hidden").c_str(), 0);
+    ::chmod(path(left).c_str(), 0500);
+    OrdinaryPerson::giveTo(folder_.path());
+    const test::LogCapture log;
+    {
+        const OrdinaryPerson person;
+        StagingFolder::removeAbandoned(*RootDirectories::shared().rootHolding(storage_));
+    }
+    EXPECT_THAT(leftovers(), IsEmpty());
+    EXPECT_EQ(log.count("[ERROR]"), 0U);
+}
+
+TEST_F(FileOperationsTest, anImportOfLockedFoldersThatFailsLeavesNothing) {
+    makeTree(outside("source"));
+    ::chmod(outside("source/sub").c_str(), 0555);
+    ::chmod(outside("source").c_str(), 0555);
+    folder("target/source");
+    OrdinaryPerson::giveTo(folder_.path());
+    {
+        const OrdinaryPerson person;
+        EXPECT_EQ(errorOf(importUnderFolder(urlOf(outside("source")), url("target"), progress_)), kFileExists);
+        EXPECT_THAT(leftovers(), IsEmpty());
+    }
+    ::chmod(outside("source").c_str(), 0755);
+    ::chmod(outside("source/sub").c_str(), 0755);
+}
+
+// What was built in the temporary folder is to get its place, and its mode is nobody's wish to keep it there.
+TEST_F(FileOperationsTest, aFolderThatMayNotBeWrittenLeavesTheTemporaryFolder) {
+    file(".TemporaryLocalFolder/mine/locked/a");
+    file("target/locked/a");
+    for (const char* name : {".TemporaryLocalFolder/mine/locked", "target/locked"}) ::chmod(path(name).c_str(), 0555);
+    OrdinaryPerson::giveTo(folder_.path());
+    const auto move = [&](const char* name) {
+        const OrdinaryPerson person;
+        return errorOf(reparent(url(name), url(""), "moved", Bouncing::isRefused, progress_));
+    };
+    const auto modeOf = [&](const char* name) {
+        struct stat status {};
+        return ::stat(path(name).c_str(), &status) == 0 ? status.st_mode & 07777 : 0;
+    };
+    EXPECT_EQ(move("target/locked"), posix(EACCES));
+    EXPECT_EQ(modeOf("target/locked"), 0555U);
+    folder("moved");
+    EXPECT_EQ(move(".TemporaryLocalFolder/mine/locked"), kFileExists);
+    EXPECT_EQ(modeOf(".TemporaryLocalFolder/mine/locked"), 0555U);
+    fs::remove(path("moved"));
+    EXPECT_EQ(move(".TemporaryLocalFolder/mine/locked"), "");
+    EXPECT_EQ(modeOf("moved"), 0555U);
+}
+
+TEST_F(FileOperationsTest, aMissingTemporaryFolderIsNamed) {
+    makeTree(outside("source"));
+    file("target/full/a");
+    OrdinaryPerson::giveTo(folder_.path());
+    ::chmod(storage_.c_str(), 0555);
+    const OrdinaryPerson person;
+    const auto imported = importUnderFolder(urlOf(outside("source")), url("target"), progress_);
+    EXPECT_EQ(errorOf(imported), posix(EACCES));
+    EXPECT_EQ(imported.error().userInfo().at("path"), path(".TemporaryLocalFolder"));
+    const auto removed = remove(url("target/full"), progress_);
+    EXPECT_EQ(errorOf(removed), posix(EACCES));
+    EXPECT_EQ(removed.error().userInfo().at("path"), path(".TemporaryLocalFolder"));
+    // A file needs none.
+    EXPECT_EQ(errorOf(importUnderFolder(urlOf(outside("source/file")), url("target"), progress_)), "");
+    EXPECT_EQ(errorOf(remove(url("target/full/a"), progress_)), "");
+    ::chmod(storage_.c_str(), 0755);
+}
+
 TEST_F(FileOperationsTest, whatIsLeftByAProcessThatLivesIsNotCleared) {
     const auto root = RootDirectories::shared().rootHolding(storage_);
     auto staging = StagingFolder::make(root);
