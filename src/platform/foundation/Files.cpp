@@ -1,6 +1,7 @@
 #include "platform/foundation/Files.h"
 
 #include <fcntl.h>
+#include <fmt/format.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -44,6 +45,33 @@ Result<void> makeFolders(const std::string& path) {
         return KsError::posix(failure == EEXIST ? ENOTDIR : failure, folder);
     }
     return {};
+}
+
+Result<Bytes> readAll(const std::string& path, std::size_t max) {
+    // A handle first: what a name leads to is looked at before it is opened, so that no device ever is.
+    const UniqueFd handle = TRY(sys::open(path.c_str(), O_PATH));
+    return readAll(handle.get(), max);
+}
+
+Result<Bytes> readAll(int handle, std::size_t max) {
+    const FileStatus status = TRY(sys::statx(handle, ""));
+    if (!status.isRegular()) return KsError::posix(EINVAL);
+    if (status.size > max) return KsError::posix(EFBIG);
+    const UniqueFd file = TRY(sys::open(fmt::format("/proc/self/fd/{}", handle).c_str(), O_RDONLY | O_NONBLOCK));
+    // One byte more than there should be, to see that the file has not grown meanwhile.
+    Bytes bytes(status.size + 1);
+    std::size_t filled = 0;
+    while (true) {
+        const ssize_t got = ::read(file.get(), bytes.data() + filled, bytes.size() - filled);
+        if (got < 0 && errno == EINTR) continue;
+        if (got < 0) return KsError::posix(errno);
+        if (got == 0) break;
+        filled += static_cast<std::size_t>(got);
+        if (filled > max) return KsError::posix(EFBIG);
+        if (filled == bytes.size()) bytes.resize(filled * 2);
+    }
+    bytes.resize(filled);
+    return bytes;
 }
 
 Result<void> replace(const std::string& path, ByteView bytes) {

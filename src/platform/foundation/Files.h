@@ -12,6 +12,12 @@ namespace cindral::files {
 /// the POSIX domain, with the path in the way.
 Result<void> makeFolders(const std::string& path);
 
+/// What a regular file holds, links followed. EFBIG when it is more than `max` bytes; EINVAL for what is no file, which
+/// is never opened. POSIX errors.
+Result<Bytes> readAll(const std::string& path, std::size_t max);
+/// The same of an object that is open as a handle (O_PATH).
+Result<Bytes> readAll(int handle, std::size_t max);
+
 /// Puts a file with the bytes, for its owner alone, where the path leads, instead of the one that is there: a reader
 /// sees all of the one or all of the other, also after a power cut. The folder exists. Errors are of the POSIX domain,
 /// with the path; the file is then what it was, and nothing is left beside it.
