@@ -141,6 +141,7 @@ Result<void> HostProcess::connect() {
     }
     RoApplicationWorkspace::defaultWorkspace().setOwnRecord(ownRecord(paths_));
     TesselManager::defaultManager().setDocumentStorageURL(KsURL::fileURL(paths_.presented()));
+    TesselManager::defaultManager().setApplicationSupportURL(KsURL::fileURL(state_ + "/Application Support"));
     TesselManager::defaultManager().setHost(signals_);
     if (records(options_.command)) startRecorder();
     return {};

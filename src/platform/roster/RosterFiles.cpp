@@ -1,12 +1,10 @@
 #include "platform/roster/RosterFiles.h"
 
 #include <fcntl.h>
-#include <fmt/format.h>
-#include <unistd.h>
 
 #include <algorithm>
-#include <cerrno>
 
+#include "platform/foundation/Files.h"
 #include "platform/foundation/Sys.h"
 
 namespace cindral {
@@ -29,29 +27,11 @@ std::optional<UniqueFd> openFolder(int directory, const std::string& path, Links
 }
 
 std::optional<Bytes> read(int directory, const std::string& path, std::size_t max, Links links) {
-    // A handle first: what a name leads to is looked at before it is opened, so that no device ever is.
     const Result<UniqueFd> handle = openHandle(directory, path, links, 0);
     if (!handle.ok()) return std::nullopt;
-    const Result<FileStatus> status = sys::statx(handle->get(), "");
-    if (!status.ok() || !status->isRegular() || status->size > max) return std::nullopt;
-    const Result<UniqueFd> file =
-        sys::open(fmt::format("/proc/self/fd/{}", handle->get()).c_str(), O_RDONLY | O_NONBLOCK);
-    if (!file.ok()) return std::nullopt;
-
-    // One byte more than there should be, to see that the file has not grown beyond the limit meanwhile.
-    Bytes bytes(max < status->size + 1 ? max + 1 : status->size + 1);
-    std::size_t filled = 0;
-    while (filled < bytes.size()) {
-        const ssize_t got = ::read(file->get(), bytes.data() + filled, bytes.size() - filled);
-        if (got < 0 && errno == EINTR) continue;
-        if (got < 0) return std::nullopt;
-        if (got == 0) break;
-        filled += static_cast<std::size_t>(got);
-        if (filled == bytes.size() && filled <= max) bytes.resize(std::min(max + 1, filled * 2));
-    }
-    if (filled > max) return std::nullopt;
-    bytes.resize(filled);
-    return bytes;
+    Result<Bytes> bytes = files::readAll(handle->get(), max);
+    if (!bytes.ok()) return std::nullopt;
+    return *std::move(bytes);
 }
 
 std::optional<KeyFile> readKeyFile(int directory, const std::string& path, Links links) {
