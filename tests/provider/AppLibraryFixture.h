@@ -8,8 +8,8 @@
 #include "platform/foundation/Dispatch.h"
 #include "platform/roster/RosterSources.h"
 #include "platform/tessel/TesselManager.h"
+#include "provider/HistoryFixture.h"
 #include "provider/LocalAppLibraryManager.h"
-#include "provider/ProviderFixture.h"
 
 namespace cindral::test {
 
@@ -47,23 +47,19 @@ private:
     std::vector<std::vector<std::string>> deletedDomains_ GUARDED_BY(mutex_);
 };
 
-/// What a change observer is told, in order: "u IDENTIFIER", "d IDENTIFIER", and how it ends.
-class RecordingChangeObserver : public TesselChangeObserver {
+/// What a change observer is told, in order: "u IDENTIFIER", "d IDENTIFIER"; and which calls there were.
+class ChangeCalls : public TesselChangeObserver {
 public:
     void didUpdateItems(TesselItems items) override {
-        calls.push_back("update");
-        for (const auto& item : items) {
-            log.push_back("u " + item->itemIdentifier());
-            updated.push_back(item);
-        }
+        calls.emplace_back("update");
+        for (const auto& item : items) log.push_back("u " + item->itemIdentifier());
     }
     void didDeleteItemsWithIdentifiers(std::vector<TesselItemIdentifier> identifiers) override {
-        calls.push_back("delete");
+        calls.emplace_back("delete");
         for (const auto& identifier : identifiers) log.push_back("d " + identifier);
     }
-    void finishEnumeratingChangesUpToSyncAnchor(TesselSyncAnchor newAnchor, bool more) override {
+    void finishEnumeratingChangesUpToSyncAnchor(TesselSyncAnchor newAnchor, bool /*moreComing*/) override {
         anchor = std::move(newAnchor);
-        moreComing = more;
         finished.signal();
     }
     void finishEnumeratingWithError(const KsError& why) override {
@@ -73,15 +69,13 @@ public:
 
     std::vector<std::string> calls;
     std::vector<std::string> log;
-    TesselItems updated;
     std::optional<TesselSyncAnchor> anchor;
-    bool moreComing = false;
     std::optional<KsError> error;
     DispatchSemaphore finished{0};
 };
 
 /// A provider's platform with a registry of applications: desktop entries in a folder, each with a data container.
-class AppLibraryTest : public ProviderTest {
+class AppLibraryTest : public HistoryTest {
 protected:
     AppLibraryTest();
     ~AppLibraryTest() override;
@@ -105,7 +99,6 @@ protected:
     void save(LocalAppLibraryCacheSource source, std::uint64_t version);
     static std::vector<std::string> identifiers(const TesselItems& items);
 
-    LogCapture log_;
     std::shared_ptr<RecordingHost> host_ = std::make_shared<RecordingHost>();
     TemporaryFolder apps_;
 };

@@ -177,7 +177,7 @@ TEST_F(LocalAppLibraryManagerTest, isNotUpgradedToItsOwnVersion) {
     install("a");
     save(kMain, 5);
     const auto main = manager(kMain);
-    RecordingChangeObserver observer;
+    ChangeCalls observer;
     EXPECT_FALSE(main->upgradeFromMainCache(&observer, true));
     EXPECT_TRUE(observer.calls.empty());
     EXPECT_TRUE(host_->deletedDomains().empty());
@@ -192,7 +192,7 @@ TEST_F(LocalAppLibraryManagerTest, anUpgradeTellsWhatThereIsThenWhatIsGone) {
     uninstall("a");
     install("c");
     EXPECT_TRUE(refresh());
-    RecordingChangeObserver observer;
+    ChangeCalls observer;
     EXPECT_TRUE(main->upgradeFromMainCache(&observer, true));
     EXPECT_EQ(observer.calls, (Names{"update", "delete"}));
     EXPECT_EQ(observer.log, (Names{"u #b", "u #c", "d #a"}));
@@ -221,7 +221,7 @@ TEST_F(LocalAppLibraryManagerTest, anUpgradeToNothingTellsOfDeletionsAlone) {
     const auto main = manager(kMain);
     uninstall("a");
     EXPECT_TRUE(refresh());
-    RecordingChangeObserver observer;
+    ChangeCalls observer;
     EXPECT_TRUE(main->upgradeFromMainCache(&observer, false));
     EXPECT_EQ(observer.calls, Names{"delete"});
     EXPECT_EQ(observer.log, Names{"d #a"});
