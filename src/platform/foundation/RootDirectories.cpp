@@ -136,6 +136,10 @@ void RootDirectories::tellObserver() {
     });
 }
 
+void RootDirectories::waitForObserver() {
+    observerQueue_.sync([] {});
+}
+
 std::vector<std::shared_ptr<const RootDirectory>> RootDirectories::all() const {
     const MutexLock lock(mutex_);
     return roots_ ? *roots_ : Roots();

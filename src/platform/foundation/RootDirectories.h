@@ -63,6 +63,10 @@ public:
     /// setObserver() that replaces it.
     using Observer = std::function<void(const std::vector<std::shared_ptr<const RootDirectory>>&)>;
     void setObserver(Observer observer);
+    /// Has the observer called as after a change.
+    void tellObserver();
+    /// Returns when the observer has been told of every change that was made before the call.
+    void waitForObserver();
 
     /// The root that is or holds the path, by whole components; the innermost when there are several; null when there
     /// is none.
@@ -91,7 +95,6 @@ private:
     enum class TakeBack { no, yes };
     void changeApplicationContainers(const std::vector<std::string>& paths, TakeBack takeBack);
     void put(std::shared_ptr<const RootDirectory> root) REQUIRES(mutex_);
-    void tellObserver();
 
     mutable Mutex mutex_;
     std::shared_ptr<const std::vector<std::shared_ptr<const RootDirectory>>> roots_ GUARDED_BY(mutex_);
