@@ -117,6 +117,7 @@ LocalAppLibraryManager::LocalAppLibraryManager(LocalAppLibraryCacheSource source
             add(record, std::move(item), content);
         } else {
             logDebug("can't create app library from bundle proxy");
+            content.identifiersWithoutItem.insert(record->appLibraryIdentifier());
         }
     }
     take(std::move(content), loaded.versionToken);
@@ -132,12 +133,7 @@ void LocalAppLibraryManager::add(const std::shared_ptr<const RoBundleProxy>& rec
 void LocalAppLibraryManager::addIfQualified(const std::shared_ptr<const RoBundleProxy>& record, RoBundleProxies& list) {
     if (!record) return logError("enumerate Application provided nil proxy");
     const auto* application = dynamic_cast<const RoApplicationProxy*>(record.get());
-    if (application == nullptr || !application->dataContainerURL()) return;
-    const auto info = application->objectsForInfoDictionaryKeys({kSupportsDocumentBrowserKey});
-    if (!info) return;
-    const auto browser = info->find(kSupportsDocumentBrowserKey);
-    const bool supportsBrowser = browser != info->end() && browser->second == PropertyList(true);
-    if (!supportsBrowser && !(application->supportsOpenInPlace() && application->fileSharingEnabled())) return;
+    if (application == nullptr || application->publication() != RoApplicationProxy::Publication::published) return;
     const std::string& identifier = application->bundleIdentifier();
     logDebug("add {}", identifier.empty() ? "<unknown>" : identifier);
     list.push_back(record);
@@ -158,6 +154,7 @@ LocalAppLibraryManager::Content LocalAppLibraryManager::contentOf(const RoBundle
             add(record, std::move(item), content);
         } else {
             logDebug("can't create app library for {}", record->bundleIdentifier());
+            content.identifiersWithoutItem.insert(record->appLibraryIdentifier());
         }
     }
     return content;
@@ -188,14 +185,14 @@ bool LocalAppLibraryManager::upgradeFromMainCache(TesselChangeObserver* observer
 }
 
 std::vector<TesselItemIdentifier> LocalAppLibraryManager::identifiersMissingFrom(const Content& content) {
-    std::vector<TesselItemIdentifier> missing;
+    std::set<TesselItemIdentifier> missing;
     queue_.sync([&] {
         queue_.assertCurrent();
-        for (const auto& [identifier, item] : content_.appLibrariesByItemIDs) {
-            if (!content.appLibrariesByItemIDs.contains(identifier)) missing.push_back(identifier);
-        }
+        missing = content_.identifiersWithoutItem;
+        for (const auto& [identifier, item] : content_.appLibrariesByItemIDs) missing.insert(identifier);
     });
-    return missing;
+    std::erase_if(missing, [&](const auto& each) { return content.appLibrariesByItemIDs.contains(each); });
+    return {missing.begin(), missing.end()};
 }
 
 void LocalAppLibraryManager::deleteIndexOf(const std::vector<TesselItemIdentifier>& identifiers) {

@@ -4,6 +4,7 @@
 #include <map>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -39,8 +40,7 @@ public:
     /// Reads the registry into the main cache. Whether that changed: another application, or another order, is a change.
     /// Waits for the background queue, unless it is on it.
     static bool refreshAppLibraries();
-    /// Adds the record to the list when the application qualifies: it has a data container, and says that it supports
-    /// the document browser, or both open-in-place and file sharing.
+    /// Adds the record to the list when it is an application's, whose documents are published.
     static void addIfQualified(const std::shared_ptr<const RoBundleProxy>& record, RoBundleProxies& list);
 
     /// Whether there was another list to take. Its items and the identifiers that are gone are told to the observer, if
@@ -73,6 +73,8 @@ private:
     struct Content {
         std::map<TesselItemIdentifier, std::shared_ptr<const LocalAppLibraryItem>> appLibrariesByItemIDs;
         std::map<std::string, Library> bundleProxiesByRootURLs;  ///< by path
+        /// Of records that no item could be made from: clients may have been told of one when it could.
+        std::set<TesselItemIdentifier> identifiersWithoutItem;
     };
 
     LocalAppLibraryManager(LocalAppLibraryCacheSource source, bool isShared);

@@ -6,10 +6,13 @@
 #include <algorithm>
 #include <utility>
 
+#include "platform/eventstream/EventHistory.h"
 #include "platform/foundation/Log.h"
+#include "platform/foundation/RootDirectories.h"
 #include "platform/tessel/TesselErrors.h"
 #include "platform/tessel/TesselManager.h"
 #include "provider/ContainerContents.h"
+#include "provider/KsURL+CdlFileObjectIdentifier.h"
 #include "provider/fs/FSChangeToken.h"
 
 namespace cindral {
@@ -18,11 +21,30 @@ namespace {
 
 // Entries of new roots that are made into items together.
 constexpr std::size_t kContentsBatchMax = 200;
+constexpr std::size_t kDeparturesBatchMax = 1000;
 // A scan ends early when a folder moves away from under it. One that ends so often is of a tree that never rests.
 constexpr int kContentsScansMax = 100;
 
 bool isInitialPage(const TesselPage& page) {
     return page == tesselInitialPageSortedByName() || page == tesselInitialPageSortedByDate();
+}
+
+bool isBelowAny(std::string_view path, const std::vector<KsURL>& roots) {
+    return std::ranges::any_of(roots, [&](const KsURL& root) {
+        return path.starts_with(root.path()) && path.substr(root.path().size()).starts_with('/');
+    });
+}
+
+std::vector<KsURL> without(std::vector<KsURL> urls, const std::vector<KsURL>& others) {
+    std::erase_if(urls, [&](const KsURL& url) { return std::ranges::find(others, url) != others.end(); });
+    return urls;
+}
+
+/// A manager as its cache has it between two refreshes: then the roots that it names are published.
+std::shared_ptr<LocalAppLibraryManager> makeManager(LocalAppLibraryCacheSource source) {
+    std::shared_ptr<LocalAppLibraryManager> manager;
+    LocalAppLibraryManager::backgroundQueue().sync([&] { manager = LocalAppLibraryManager::create(source); });
+    return manager;
 }
 
 /// Passes a page on, with the version of the list of app libraries in the page that follows: its offset counts over the
@@ -56,8 +78,8 @@ std::shared_ptr<LocalRootEnumerator> LocalRootEnumerator::initWithContainer(Tess
 
 LocalRootEnumerator::LocalRootEnumerator(TesselItemIdentifier container)
     : container_(std::move(container)),
-      appLibraryManager_(LocalAppLibraryManager::create(isWorkingSet() ? LocalAppLibraryCacheSource::workingSet
-                                                                       : LocalAppLibraryCacheSource::main)),
+      appLibraryManager_(
+          makeManager(isWorkingSet() ? LocalAppLibraryCacheSource::workingSet : LocalAppLibraryCacheSource::main)),
       localFileEnumerator_(LocalFileEnumerator::initWithContainer(container_, monitoredRoots())) {}
 
 std::vector<KsURL> LocalRootEnumerator::monitoredRoots() const {
@@ -162,14 +184,18 @@ bool LocalRootEnumerator::sendNews(TesselChangeObserver& observer, FSChangeToken
     const std::vector<KsURL> before = appLibraryManager_->rootURLs();
     if (!upgrade(&observer)) return true;
     token.appLibraryVersionToken = appLibraryManager_->versionToken();
-    std::vector<KsURL> added = appLibraryManager_->rootURLs();
-    std::erase_if(added, [&](const KsURL& root) { return std::ranges::find(before, root) != before.end(); });
-    return sendContents(observer, added);
+    const std::vector<KsURL> after = appLibraryManager_->rootURLs();
+    return sendDepartures(observer, without(before, after), token.streamEventID) &&
+           sendContents(observer, without(after, before));
 }
 
 bool LocalRootEnumerator::upgrade(TesselChangeObserver* observer) {
-    if (!appLibraryManager_->upgradeFromMainCache(observer, /*deleteIndexOfRemovedDomains=*/isWorkingSet()))
-        return false;
+    // Between two refreshes: so that the process's own list is the same, and what it has is published.
+    bool isUpgraded = false;
+    LocalAppLibraryManager::backgroundQueue().sync([&] {
+        isUpgraded = appLibraryManager_->upgradeFromMainCache(observer, /*deleteIndexOfRemovedDomains=*/isWorkingSet());
+    });
+    if (!isUpgraded) return false;
     updateMonitoredRoots();
     if (!isWorkingSet()) return true;
     if (const Result<void> saved = appLibraryManager_->saveToCache(); !saved.ok())
@@ -181,6 +207,8 @@ bool LocalRootEnumerator::upgrade(TesselChangeObserver* observer) {
 /// what came after that would miss it.
 bool LocalRootEnumerator::sendContents(TesselChangeObserver& observer, const std::vector<KsURL>& roots) const {
     if (roots.empty()) return true;
+    // From here on, what happens in them is recorded.
+    RootDirectories::shared().waitForObserver();
     std::vector<KsURL> entries;
     const auto send = [&]() -> Result<void> {
         if (entries.empty()) return {};
@@ -205,6 +233,38 @@ bool LocalRootEnumerator::sendContents(TesselChangeObserver& observer, const std
     if (scanned.ok()) return true;
     logError("can't list the app libraries that came; {}", scanned.error().description());
     observer.finishEnumeratingWithError(scanned.error());
+    return false;
+}
+
+/// A library that is gone takes what is below it out of a client's view, but for what it has under folders that are not
+/// listed themselves: a deep listing holds what is in the trash, without the folder that is its parent.
+bool LocalRootEnumerator::sendDepartures(TesselChangeObserver& observer, const std::vector<KsURL>& roots,
+                                         std::uint64_t since) const {
+    const auto history = EventHistory::shared();
+    if (roots.empty() || !history || !container_contents::isDeep(container_)) return true;
+    // What was below a root that is taken back is recorded as having departed.
+    RootDirectories::shared().waitForObserver();
+    Result<void> read = history->drain();
+    for (bool isLast = false; read.ok() && !isLast;) {
+        const Result<EventHistory::Batch> batch = history->pathEvents(since, kDeparturesBatchMax);
+        if (!batch.ok()) {
+            read = batch.error();
+            break;
+        }
+        std::vector<TesselItemIdentifier> gone;
+        for (const Event& event : batch->events) {
+            if (!(event.flags & EventFlags::removed) || !isBelowAny(event.path, roots)) continue;
+            gone.push_back(CdlFileObjectIdentifier::fromFileID(static_cast<std::uint64_t>(event.fileID)));
+            if (event.documentID != DocumentID{})
+                gone.push_back(CdlFileObjectIdentifier::fromDocumentID(static_cast<std::uint64_t>(event.documentID)));
+        }
+        if (!gone.empty()) observer.didDeleteItemsWithIdentifiers(std::move(gone));
+        since = batch->upTo;
+        isLast = batch->isLast;
+    }
+    if (read.ok()) return true;
+    logError("can't tell what was in the app libraries that went; {}", read.error().description());
+    observer.finishEnumeratingWithError(read.error());
     return false;
 }
 
@@ -236,6 +296,8 @@ bool LocalRootEnumerator::isCurrentAndRunning(const std::shared_ptr<LocalFileEnu
 
 void LocalRootEnumerator::currentSyncAnchorWithCompletionHandler(
     std::function<void(std::optional<TesselSyncAnchor>)> completion) {
+    // What happens after the anchor is recorded in every root of the list that it names.
+    RootDirectories::shared().waitForObserver();
     localFileEnumerator()->currentSyncAnchorWithCompletionHandler(
         [manager = appLibraryManager_, completion = std::move(completion)](std::optional<TesselSyncAnchor> anchor) {
             std::optional<FSChangeToken> token = anchor ? FSChangeToken::decode(*anchor) : std::nullopt;

@@ -54,6 +54,7 @@ private:
     bool upgrade(TesselChangeObserver* observer);
     void updateMonitoredRoots();
     bool sendContents(TesselChangeObserver& observer, const std::vector<KsURL>& roots) const;
+    bool sendDepartures(TesselChangeObserver& observer, const std::vector<KsURL>& roots, std::uint64_t since) const;
     bool isCurrentAndRunning(const std::shared_ptr<LocalFileEnumerator>& enumerator) const;
 
     // Constant after construction.

@@ -227,6 +227,22 @@ TEST_F(LocalAppLibraryManagerTest, anUpgradeToNothingTellsOfDeletionsAlone) {
     EXPECT_EQ(observer.log, Names{"d #a"});
 }
 
+// Its folder may have gone before the manager was loaded, and after a client was told of it.
+TEST_F(LocalAppLibraryManagerTest, anUpgradeTellsThatARecordWithoutAFolderIsGone) {
+    install("a");
+    install("b");
+    save(kMain, 5);
+    fs::remove_all(documents("a"));
+    const auto main = manager(kMain);
+    EXPECT_EQ(identifiers(main->items()), Names{"#b"});
+    look();
+    EXPECT_TRUE(refresh());
+    ChangeCalls observer;
+    EXPECT_TRUE(main->upgradeFromMainCache(&observer, true));
+    EXPECT_EQ(observer.log, (Names{"u #b", "d #a"}));
+    EXPECT_EQ(host_->deletedDomains(), (std::vector<Names>{{"a"}}));
+}
+
 TEST_F(LocalAppLibraryManagerTest, anIndexThatCannotBeDeletedStopsNothing) {
     install("a");
     install("b");

@@ -1,8 +1,11 @@
 #include "provider/LocalRootEnumerator.h"
 
+#include <fcntl.h>
+
 #include <algorithm>
 #include <filesystem>
 
+#include "platform/foundation/Sys.h"
 #include "provider/AppLibraryFixture.h"
 #include "provider/fs/FSChangesNotifier.h"
 
@@ -93,6 +96,19 @@ protected:
     static std::string itemIdentifierOf(KsURL& url) {
         const auto item = LocalItem::initWithURL(url);
         return item ? item->itemIdentifier() : "none";
+    }
+    /// What a recorder tells of what was listed below a folder that is no root any more.
+    void departAllBelow(const std::string& folder) {
+        for (const auto& entry : fs::recursive_directory_iterator(folder)) {
+            Event event;
+            event.path = entry.path();
+            event.flags = EventFlags::removed;
+            event.fileID = FileID{sys::statx(AT_FDCWD, event.path.c_str())->fileID};
+            const std::string identifier = identifierAt(event.path);
+            if (identifier.starts_with("did="))
+                event.documentID = DocumentID{static_cast<std::uint32_t>(std::stoul(identifier.substr(4)))};
+            history_->add(std::move(event));
+        }
     }
     std::string put(const std::string& application, const std::string& name) {
         return apps_.file("data/" + application + "/Documents/" + name);
@@ -393,10 +409,45 @@ TEST_F(LocalRootEnumeratorTest, aClientHearsOfEverythingInANewLibrary) {
     view.apply(allChanges(*all, view.anchor()));
     EXPECT_EQ(view.contents(), ClientView::contentsOf(ProviderTest::all(*all)));
     EXPECT_GT(view.contents().size(), 450U);
+    departAllBelow(documents("a"));
     uninstallAndPublish("a");
     view.apply(allChanges(*all, view.anchor()));
     EXPECT_EQ(view.contents(), ClientView::contentsOf(ProviderTest::all(*all)));
     EXPECT_EQ(view.contents().size(), 1U);
+}
+
+// The folder of the trash is never listed, so that nothing above goes along with what is in it.
+TEST_F(LocalRootEnumeratorTest, aClientHearsThatWhatWasInTheTrashOfALibraryIsGone) {
+    installAndPublish("a");
+    const auto everything = workingSet();
+    changesFrom(*everything, anchorOf(*everything));
+    const auto before = anchorOf(*everything);
+    Event event;
+    event.flags = EventFlags::removed;
+    const auto departed = [&](const std::string& path, std::uint64_t fileID, std::uint32_t documentID) {
+        event.path = path;
+        event.fileID = FileID{fileID};
+        event.documentID = DocumentID{documentID};
+        event.id = 0;
+        history_->add(event);
+    };
+    departed(documents("a") + "/.Trash/file.txt", 70, 7);
+    departed(documents("a") + "/.Trash/folder", 80, 0);
+    departed(documents("ab") + "/not below.txt", 90, 9);
+    event.flags = EventFlags();
+    departed(documents("a") + "/still there.txt", 100, 10);
+    uninstallAndPublish("a");
+    const auto deep = changesFrom(*everything, before);
+    EXPECT_EQ(deep->log, (Names{"d #a", "d fid=70", "d did=7", "d fid=80"}));
+    EXPECT_FALSE(deep->error);
+
+    installAndPublish("a");
+    const auto shallow = root();
+    const auto known = anchorOf(*shallow);
+    event.flags = EventFlags::removed;
+    departed(documents("a") + "/.Trash/other.txt", 110, 11);
+    uninstallAndPublish("a");
+    EXPECT_EQ(changesFrom(*shallow, known)->log, Names{"d #a"}) << "what is in a trash is not listed here";
 }
 
 // Monitoring

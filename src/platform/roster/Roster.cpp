@@ -108,6 +108,13 @@ std::optional<PropertyList::Dictionary> RoApplicationProxy::objectsForInfoDictio
     return objects;
 }
 
+RoApplicationProxy::Publication RoApplicationProxy::publication() const {
+    if (!dataContainerURL()) return Publication::hasNoDataContainer;
+    if (!objectsForInfoDictionaryKeys({kSupportsDocumentBrowserKey})) return Publication::cannotBeRead;
+    const bool isAskedFor = isSet(kSupportsDocumentBrowserKey) || (supportsOpenInPlace() && fileSharingEnabled());
+    return isAskedFor ? Publication::published : Publication::isNotAskedFor;
+}
+
 bool RoApplicationProxy::isSet(const char* key) const {
     if (!values_.infoDictionary) return false;
     const auto found = values_.infoDictionary->find(key);

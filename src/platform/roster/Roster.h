@@ -82,6 +82,10 @@ public:
 
     /// The values of those of the keys that the application has; none when its info dictionary can't be read.
     std::optional<PropertyList::Dictionary> objectsForInfoDictionaryKeys(const std::set<std::string>& keys) const;
+    /// Whether the application's documents are published: it has a data container, and says that it supports the document
+    /// browser, or both open-in-place and file sharing.
+    enum class Publication { published, hasNoDataContainer, cannotBeRead, isNotAskedFor };
+    Publication publication() const;
     bool supportsOpenInPlace() const { return isSet(kSupportsOpenInPlaceKey); }
     bool fileSharingEnabled() const { return isSet(kFileSharingEnabledKey); }
 
