@@ -138,6 +138,11 @@ struct RoApplicationWorkspace::Contents {
     std::vector<InstalledApplication> applications;
     std::unordered_map<std::string, const InstalledApplication*> byIdentifier;  ///< into applications
     std::map<std::string, std::shared_ptr<const RoApplicationProxy>, std::less<>> byContainer;
+
+    std::shared_ptr<const RoApplicationProxy> at(std::string_view container) const {
+        const auto found = byContainer.find(container);
+        return found == byContainer.end() ? nullptr : found->second;
+    }
 };
 
 RoApplicationWorkspace& RoApplicationWorkspace::defaultWorkspace() {
@@ -145,7 +150,8 @@ RoApplicationWorkspace& RoApplicationWorkspace::defaultWorkspace() {
     return workspace;
 }
 
-RoApplicationWorkspace::RoApplicationWorkspace() : contents_(std::make_shared<const Contents>()) {}
+RoApplicationWorkspace::RoApplicationWorkspace()
+    : contents_(std::make_shared<const Contents>()), former_(std::make_shared<const FormerRecords>()) {}
 
 void RoApplicationWorkspace::start(RosterSources sources) {
     stop();
@@ -164,6 +170,7 @@ void RoApplicationWorkspace::stop() {
     if (watcher) watcher->stop();
     const MutexLock lock(mutex_);
     contents_ = std::make_shared<const Contents>();
+    former_ = std::make_shared<const FormerRecords>();
 }
 
 void RoApplicationWorkspace::setContents(RosterContents found) {
@@ -182,9 +189,18 @@ void RoApplicationWorkspace::setContents(RosterContents found) {
         hasCome |= !wasThere || !isSameInstallation(*earlier->second, application);
     }
     const bool hasGone = kept < before->applications.size();
+    FormerRecords gone;
+    for (const InstalledApplication& application : before->applications) {
+        const auto& container = application.record->dataContainerURL();
+        if (container && !now->at(container->path()))
+            gone.emplace(container->path(), FormerRecord{application.record, application.type});
+    }
     {
         const MutexLock lock(mutex_);
         contents_ = std::move(now);
+        // Of one that went again, the later record.
+        gone.insert(former_->begin(), former_->end());
+        former_ = std::make_shared<const FormerRecords>(std::move(gone));
     }
     // After the new contents are there: whoever hears of it looks at them.
     if (hasCome) NotificationCenter::distributedCenter()->post(kApplicationRegisteredNotification);
@@ -207,10 +223,19 @@ std::shared_ptr<const RoBundleProxy> RoApplicationWorkspace::ownRecord() const {
     return ownRecord_;
 }
 
-void RoApplicationWorkspace::enumerateApplicationsOfType(unsigned type, const Block& block) const {
+void RoApplicationWorkspace::enumerateApplicationsOfType(unsigned type, const Block& block) {
+    forgetFormer(type);
     for (const InstalledApplication& application : contents()->applications) {
         if (application.type == type) block(application.record);
     }
+}
+
+/// Before the caller is told what is installed: what goes meanwhile may be among it.
+void RoApplicationWorkspace::forgetFormer(unsigned type) {
+    const MutexLock lock(mutex_);
+    FormerRecords kept = *former_;
+    std::erase_if(kept, [&](const auto& each) { return each.second.type == type; });
+    former_ = std::make_shared<const FormerRecords>(std::move(kept));
 }
 
 std::vector<InstalledApplication> RoApplicationWorkspace::applications() const {
@@ -224,35 +249,45 @@ std::shared_ptr<const RoApplicationProxy> RoApplicationWorkspace::applicationFor
     return found == now->byIdentifier.end() ? nullptr : found->second->record;
 }
 
+struct RoApplicationWorkspace::ByContainer {
+    std::shared_ptr<const Contents> now;
+    std::shared_ptr<const FormerRecords> former;
+    std::shared_ptr<const RoBundleProxy> own;
+
+    std::shared_ptr<const RoApplicationProxy> at(std::string_view container) const {
+        if (auto record = now->at(container)) return record;
+        const auto found = former->find(container);
+        return found == former->end() ? nullptr : found->second.record;
+    }
+};
+
+RoApplicationWorkspace::ByContainer RoApplicationWorkspace::byContainer() const {
+    const MutexLock lock(mutex_);
+    return {contents_, former_, ownRecord_};
+}
+
 std::shared_ptr<const RoApplicationProxy> RoApplicationWorkspace::applicationAt(const KsURL& url) const {
     if (!url.isFileURL()) return nullptr;
-    const auto now = contents();
+    const ByContainer records = byContainer();
     std::string_view path = url.path();
-    auto found = now->byContainer.find(path);
-    if (found == now->byContainer.end() && path.ends_with(kDocuments)) {
+    auto record = records.at(path);
+    if (!record && path.ends_with(kDocuments)) {
         path.remove_suffix(kDocuments.size());
-        found = now->byContainer.find(path.empty() ? "/" : path);
+        record = records.at(path.empty() ? "/" : path);
     }
-    return found == now->byContainer.end() ? nullptr : found->second;
+    return record;
 }
 
 std::shared_ptr<const RoBundleProxy> RoApplicationWorkspace::recordContaining(const KsURL& url) const {
     if (!url.isFileURL()) return nullptr;
-    std::shared_ptr<const Contents> now;
-    std::shared_ptr<const RoBundleProxy> own;
-    {
-        const MutexLock lock(mutex_);
-        now = contents_;
-        own = ownRecord_;
-    }
-    const bool hasOwn = own && own->dataContainerURL();
+    const ByContainer records = byContainer();
+    const bool hasOwn = records.own && records.own->dataContainerURL();
     const std::string& path = url.path();
     // From the innermost folder outwards.
     for (std::string_view folder = path; !folder.empty();) {
-        if (const auto found = now->byContainer.find(folder); found != now->byContainer.end())
-            return hasParentComponent(restBelow(path, folder)) ? nullptr : found->second;
-        if (hasOwn && own->dataContainerURL()->path() == folder)
-            return hasParentComponent(restBelow(path, folder)) ? nullptr : own;
+        if (auto record = records.at(folder)) return hasParentComponent(restBelow(path, folder)) ? nullptr : record;
+        if (hasOwn && records.own->dataContainerURL()->path() == folder)
+            return hasParentComponent(restBelow(path, folder)) ? nullptr : records.own;
         if (folder == "/") break;
         const std::size_t slash = folder.rfind('/');
         folder = slash == 0 || slash == std::string_view::npos ? std::string_view("/") : folder.substr(0, slash);

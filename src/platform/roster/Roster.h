@@ -1,6 +1,7 @@
 #pragma once
 
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <set>
@@ -113,6 +114,10 @@ struct InstalledApplication {
 /// changed: an application came, went, or has another name, container or key. Then the notifications of the registry
 /// are posted, on the registry's own thread, each at most once for a look.
 ///
+/// Who follows the notifications has the list of before until it enumerates again. So lookups by place go on to answer
+/// with the record of an application that went, until the applications of its type are enumerated: what is in a list is
+/// the same for all who look at it. Lookups by identifier answer from the last look alone.
+///
 /// Before it is started it knows the provider's own record alone.
 ///
 /// Thread safety: all operations, from any thread; start() and stop() by one at a time.
@@ -133,7 +138,7 @@ public:
     using Block = std::function<void(const std::shared_ptr<const RoBundleProxy>&)>;
     /// Calls the block for each installed application of the type (0 user-installed, 2 system-wide and other), in a
     /// stable order.
-    void enumerateApplicationsOfType(unsigned type, const Block& block) const;
+    void enumerateApplicationsOfType(unsigned type, const Block& block);
     /// All of them, type 0 first, in the same order.
     std::vector<InstalledApplication> applications() const;
 
@@ -145,11 +150,21 @@ public:
 private:
     RoApplicationWorkspace();
     struct Contents;
+    struct FormerRecord {
+        std::shared_ptr<const RoApplicationProxy> record;
+        unsigned type = 0;
+    };
+    using FormerRecords = std::map<std::string, FormerRecord, std::less<>>;  ///< by container
+    struct ByContainer;
+
     std::shared_ptr<const Contents> contents() const;
     void setContents(RosterContents contents);
+    void forgetFormer(unsigned type);
+    ByContainer byContainer() const;
 
     mutable Mutex mutex_;
     std::shared_ptr<const Contents> contents_ GUARDED_BY(mutex_);
+    std::shared_ptr<const FormerRecords> former_ GUARDED_BY(mutex_);
     std::shared_ptr<const RoBundleProxy> ownRecord_ GUARDED_BY(mutex_);
     std::shared_ptr<RosterWatcher> watcher_ GUARDED_BY(mutex_);
 };

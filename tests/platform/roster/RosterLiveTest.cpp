@@ -97,6 +97,35 @@ TEST_F(RosterLiveTest, answersWhoseContainerAURLIsIn) {
     workspace().setOwnRecord(nullptr);
 }
 
+// What lists its documents goes by the list of before until it has a new one.
+TEST_F(RosterLiveTest, whereAnApplicationWasIsKnownUntilItsTypeIsEnumerated) {
+    user_.install("a", FlatpakTree::named("a", "A"));
+    const std::string container = makeContainer("a");
+    while (!application("a") || !application("a")->dataContainerURL()) registered_.wait();
+    const auto record = application("a");
+    const auto url = KsURL::fileURL(container + "/Documents");
+    const auto enumerate = [](unsigned type) { workspace().enumerateApplicationsOfType(type, [](const auto&) {}); };
+    user_.uninstall("a");
+    while (application("a")) unregistered_.wait();
+    EXPECT_EQ(RoBundleProxy::proxyAt(url), record);
+    EXPECT_EQ(RoBundleProxy::proxyWithContaining(url), record);
+    EXPECT_EQ(RoBundleProxy::bundleProxyForIdentifier("a"), nullptr);
+    enumerate(2);
+    EXPECT_EQ(RoBundleProxy::proxyAt(url), record);
+
+    auto again = FlatpakTree::named("a", "Again");
+    again.commit = "2c3d";
+    user_.install("a", again);
+    while (!application("a")) registered_.wait();
+    EXPECT_EQ(RoBundleProxy::proxyAt(url), application("a"));
+    user_.uninstall("a");
+    while (application("a")) unregistered_.wait();
+    EXPECT_EQ(RoBundleProxy::proxyAt(url)->localizedName(), "Again");
+    enumerate(0);
+    EXPECT_EQ(RoBundleProxy::proxyAt(url), nullptr);
+    EXPECT_EQ(RoBundleProxy::proxyWithContaining(url), nullptr);
+}
+
 TEST_F(RosterLiveTest, enumeratesByType) {
     installEntry("entry", entry("E"));
     user_.install("mine", FlatpakTree::named("mine", "M"));
