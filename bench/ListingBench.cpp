@@ -120,6 +120,7 @@ public:
         RvStorageManager::defaultManager().setStore(std::move(*store));
         if (!RootDirectories::shared().add(storage, RootPolicy::storage).ok()) fail("can't open the storage");
         TesselManager::defaultManager().setDocumentStorageURL(KsURL::fileURL(storage));
+        TesselManager::defaultManager().setApplicationSupportURL(KsURL::fileURL(state + "/Application Support"));
         RoApplicationWorkspace::defaultWorkspace().setOwnRecord(std::make_shared<RoBundleProxy>(RoBundleProxy::Values{
             "com.vemra.CindralStorage", KsURL::fileURL(storage).deletingLastPathComponent(), "Documents"}));
     }

@@ -96,6 +96,9 @@ HostEnvironment HostEnvironment::from(const Lookup& lookup, std::string accountH
     environment.stateHome = absoluteOr(lookup("XDG_STATE_HOME"), environment.stateHome);
     environment.runtimeFolder = absoluteOr(lookup("XDG_RUNTIME_DIR"), "");
     environment.workingFolder = std::move(workingFolder);
+    environment.roster = RosterSources::from(lookup, environment.home);
+    if (!environment.configHome.empty())
+        environment.roster.choicesFile = environment.configHome + "/cindral/applications.conf";
     // Set and not empty, whatever the value: https://no-color.org.
     const bool noColor = !lookup("NO_COLOR").value_or("").empty();
     const std::string terminal = lookup("TERM").value_or("");

@@ -4,6 +4,8 @@
 #include <optional>
 #include <string>
 
+#include "platform/roster/RosterSources.h"
+
 namespace cindral {
 
 /// What the host takes from the process's surroundings, read once.
@@ -17,6 +19,7 @@ struct HostEnvironment {
     std::string workingFolder;  ///< what relative paths are relative to
     bool wantsColor = false;    ///< standard output is a terminal that can, and nobody asked for none
     bool hasLogLevel = false;   ///< $CINDRAL_LOG is set
+    RosterSources roster;       ///< where applications are looked for, without what the call's words say
 
     using Lookup = std::function<std::optional<std::string>(const char* name)>;
     /// From the variables alone. Relative values of the XDG variables are ignored, as their convention asks.

@@ -199,6 +199,14 @@ std::string_view recorderChoiceName(RecorderChoice choice) {
     return "auto";
 }
 
+RosterSources rosterSources(const HostOptions& options, const HostEnvironment& environment) {
+    RosterSources sources = environment.roster;
+    if (!options.flatpak) sources.flatpakUser = sources.flatpakSystem = sources.flatpakConfig = "";
+    sources.entryFolders = options.applications;
+    sources.storage = options.storage;
+    return sources;
+}
+
 std::variant<HostOptions, HostReply> parseHostOptions(std::span<const std::string> words,
                                                       const HostEnvironment& environment) {
     CLI::App app("Cindral shows a folder of documents as items with lasting identifiers.", "cindral");

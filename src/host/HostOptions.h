@@ -33,6 +33,9 @@ struct HostOptions {
     std::string since;          ///< changes: an anchor, as printed
 };
 
+/// Where applications are looked for: the environment's sources, and what the options say of them.
+RosterSources rosterSources(const HostOptions& options, const HostEnvironment& environment);
+
 /// What there is to say instead of working: help, the version, or what is wrong with the call's words.
 struct HostReply {
     int exitStatus = 0;

@@ -2,6 +2,7 @@
 
 #include <fmt/format.h>
 
+#include <algorithm>
 #include <cerrno>
 
 #include "host/HostError.h"
@@ -129,7 +130,10 @@ Result<std::unique_ptr<HostProcess>> HostProcess::start(HostOptions options, con
     std::unique_ptr<HostProcess> host(
         new HostProcess(std::move(options), std::move(paths), std::move(state), std::move(store)));
     TRY(host->connect());
+    RoApplicationWorkspace::defaultWorkspace().start(rosterSources(host->options_, environment));
     host->provider_ = makeProvider();
+    host->provider_->waitUntilReady();
+    if (records(host->options_.command)) host->startRecorder();
     return host;
 }
 
@@ -141,22 +145,33 @@ Result<void> HostProcess::connect() {
     }
     RoApplicationWorkspace::defaultWorkspace().setOwnRecord(ownRecord(paths_));
     TesselManager::defaultManager().setDocumentStorageURL(KsURL::fileURL(paths_.presented()));
+    TesselManager::defaultManager().setApplicationSupportURL(KsURL::fileURL(state_ + "/Application Support"));
+    signals_->setSearchableItems(std::make_shared<SearchableItemsInMemory>());
     TesselManager::defaultManager().setHost(signals_);
-    if (records(options_.command)) startRecorder();
     return {};
 }
 
-/// Before the provider is made, which asks for positions in the history.
+/// Once the provider has said which folders of applications it publishes: what was below one that seems to be no root any
+/// more would be forgotten, and come back under other numbers.
 void HostProcess::startRecorder() {
-    Recorder::Roots roots;
-    if (auto storage = RootDirectories::shared().rootHolding(paths_.presented())) roots.push_back(std::move(storage));
-    for (auto& root : RootDirectories::shared().all()) {
-        if (root->path != paths_.presented()) roots.push_back(std::move(root));
-    }
+    const auto storageFirst = [storage = paths_.presented()](Recorder::Roots roots) {
+        std::ranges::stable_partition(roots, [&](const auto& root) { return root->path == storage; });
+        return roots;
+    };
     Recorder::Options recorderOptions;
     recorderOptions.choice = recorderChoice(options_.recorder);
-    recorder_ = Recorder::start(store_, std::move(roots), std::move(recorderOptions));
+    recorder_ = Recorder::start(store_, storageFirst(RootDirectories::shared().all()), std::move(recorderOptions));
     EventHistory::setShared(recorder_);
+    const auto follow = [recorder = std::weak_ptr(recorder_), storageFirst](const Recorder::Roots& roots) {
+        const auto current = recorder.lock();
+        // What there was at the start is read first: until then, everything would seem to have just come.
+        if (!current || !current->drain().ok()) return;
+        if (const Result<void> set = current->setRoots(storageFirst(roots)); !set.ok())
+            logError("can't record what happens in the folders of applications; {}", set.error().description());
+    };
+    // From now on; and once for what may have changed since the recorder was told.
+    RootDirectories::shared().setObserver(follow);
+    RootDirectories::shared().tellObserver();
     RvStorageManager::defaultManager().setCatchUp([recorder = std::weak_ptr(recorder_)] {
         const auto current = recorder.lock();
         // Nobody waits for the first reading to find one object: the tree itself is searched meanwhile.
@@ -167,14 +182,17 @@ void HostProcess::startRecorder() {
 HostProcess::~HostProcess() {
     // Who waits for the history is let go of first.
     if (recorder_) recorder_->stop();
+    RoApplicationWorkspace::defaultWorkspace().stop();
     provider_.reset();
     // A provider that goes leaves its last work to the main queue.
     SerialQueue::main().sync([] {});
     TesselManager::defaultManager().setHost(nullptr);
     RoApplicationWorkspace::defaultWorkspace().setOwnRecord(nullptr);
     RvStorageManager::defaultManager().setCatchUp({});
+    RootDirectories::shared().setObserver(nullptr);
     EventHistory::setShared(nullptr);
     recorder_.reset();
+    RootDirectories::shared().setApplicationContainers({});
     RootDirectories::shared().remove(paths_.presented());
     RvStorageManager::defaultManager().setStore(nullptr);
     store_.reset();

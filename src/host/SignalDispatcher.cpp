@@ -47,8 +47,20 @@ void SignalDispatcher::signalEnumerator(const TesselItemIdentifier& container, T
     if (completion) completion(std::nullopt);
 }
 
-void SignalDispatcher::deleteSearchableItems(const std::vector<std::string>& /*domains*/,
+void SignalDispatcher::setSearchableItems(std::shared_ptr<SearchableItems> items) {
+    // What was there goes after the lock.
+    const MutexLock lock(mutex_);
+    searchableItems_.swap(items);
+}
+
+void SignalDispatcher::deleteSearchableItems(const std::vector<std::string>& domains,
                                              TesselManager::Completion completion) {
+    std::shared_ptr<SearchableItems> items;
+    {
+        const MutexLock lock(mutex_);
+        items = searchableItems_;
+    }
+    if (items) return items->deleteItems(domains, std::move(completion));
     if (completion) completion(std::nullopt);
 }
 

@@ -1,11 +1,13 @@
 #pragma once
 
+#include <functional>
+
 namespace cindral {
 
 /// Brings the app libraries up to date with the application registry, and signals the containers that changed. The
-/// pacer's event.
+/// pacer's event: one at a time.
 ///
-/// No source of applications is connected: there is nothing to compare, and nothing is signalled.
-void refreshApps();
+/// `refreshed` is called in between: the list is up to date, and nobody has been signalled.
+void refreshApps(const std::function<void()>& refreshed);
 
 }  // namespace cindral

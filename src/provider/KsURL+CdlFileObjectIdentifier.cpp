@@ -40,7 +40,8 @@ struct MatchedRoot {
 std::optional<MatchedRoot> matchRoot(std::string_view path) {
     std::string rewritten;
     const auto begins = [&](const KsURL& root) { return path.starts_with(properPath(root.path(), rewritten)); };
-    for (const KsURL& root : CdlAppLibraryManager::rootURLsForAppLibraries()) {
+    const auto libraries = CdlAppLibraryManager::sharedRootURLsForAppLibraries();
+    for (const KsURL& root : *libraries) {
         if (begins(root)) return MatchedRoot{std::make_shared<const KsURL>(root), false};
     }
     auto storage = TesselManager::defaultManager().sharedDocumentStorageURL();

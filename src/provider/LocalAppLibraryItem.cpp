@@ -1,7 +1,6 @@
 #include "provider/LocalAppLibraryItem.h"
 
-#include <algorithm>
-
+#include "platform/foundation/Fatal.h"
 #include "platform/foundation/Log.h"
 
 namespace cindral {
@@ -14,7 +13,7 @@ std::shared_ptr<const LocalAppLibraryItem> LocalAppLibraryItem::initWithBundlePr
     const KsURL documents = proxy.dataContainerURL()->appendingPathComponent("Documents");
     auto item = std::make_shared<LocalAppLibraryItem>(Passkey(), documents);
     Customs customs;
-    customs.itemID = "#" + proxy.bundleIdentifier();
+    customs.itemID = proxy.appLibraryIdentifier();
     customs.parentItemID = kTesselRootContainerItemIdentifier;
     customs.filename = proxy.localizedName();
     customs.bundleIdentifier = InternedString(proxy.bundleIdentifier());
@@ -25,6 +24,16 @@ std::shared_ptr<const LocalAppLibraryItem> LocalAppLibraryItem::initWithBundlePr
         if (documents.appendingPathComponent(hidden).status().ok()) --*item->childItemCount_;
     }
     return item;
+}
+
+std::shared_ptr<const LocalItem> LocalAppLibraryItem::init() {
+    fatal("LocalAppLibraryItem has no init()");
+}
+
+std::shared_ptr<const LocalItem> LocalAppLibraryItem::initWithURL(KsURL /*url*/, Customs /*customs*/) {
+    fatal(
+        "LocalAppLibraryItem has no "
+        "init(withURL:customItemID:customParentItemID:customFilename:hasVistorDomainIdentifier:bundleIdentifier:)");
 }
 
 }  // namespace cindral

@@ -1,10 +1,12 @@
 #include "provider/LocalTesselKit.h"
 
+#include <atomic>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <utility>
 
+#include "platform/foundation/Dispatch.h"
 #include "platform/foundation/Log.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/roster/Roster.h"
@@ -55,11 +57,27 @@ private:
     std::weak_ptr<LocalTesselKit> provider_ GUARDED_BY(mutex_);
 };
 
+class LocalTesselKit::FirstRefresh {
+public:
+    FirstRefresh() { group_.enter(); }
+    void end() {
+        if (!isOver_.exchange(true)) group_.leave();
+    }
+    void wait() {
+        if (!isOver_) group_.wait();
+    }
+
+private:
+    std::atomic<bool> isOver_ = false;
+    DispatchGroup group_;
+};
+
 LocalTesselKit::LocalTesselKit()
-    : appRefreshPacer_("cindral.app-refresh.pacer", appRefreshQueue_, kAppRefreshIntervalMin),
+    : firstRefresh_(std::make_shared<FirstRefresh>()),
+      appRefreshPacer_("cindral.app-refresh.pacer", appRefreshQueue_, kAppRefreshIntervalMin),
       installedAppsProxy_(std::make_shared<InstalledAppsProxy>()) {
     // Captures nothing of the provider: a refresh may outlast it.
-    appRefreshPacer_.setEventBlock(refreshApps);
+    appRefreshPacer_.setEventBlock([first = firstRefresh_] { refreshApps([&] { first->end(); }); });
     appRefreshPacer_.resume();
     appRefreshPacer_.signal();
 }
@@ -109,6 +127,10 @@ Result<KsURL> LocalTesselKit::urlForItem(const TesselItemIdentifier& identifier)
     const auto item = resolveItem(identifier, std::move(customs));
     if (!item) return tesselErrorForNonExistentItemWithIdentifier(identifier);
     return *item->fileURL();
+}
+
+void LocalTesselKit::waitUntilReady() {
+    firstRefresh_->wait();
 }
 
 std::optional<KsURL> LocalTesselKit::URLForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier) {

@@ -25,6 +25,9 @@ public:
     static std::shared_ptr<LocalTesselKit> init();
     ~LocalTesselKit() override;
 
+    /// Until the registry of applications has been looked at for the first time.
+    void waitUntilReady() override;
+
     std::optional<KsURL> URLForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier) override;
     std::optional<TesselItemIdentifier> persistentIdentifierForItemAtURL(const KsURL& url) override;
     Result<std::shared_ptr<const TesselItem>> itemForIdentifier(const TesselItemIdentifier& identifier) override;
@@ -77,6 +80,8 @@ public:
 private:
     /// What the notification centre knows instead of the provider, so that it never holds it.
     class InstalledAppsProxy;
+    /// Whether the first refresh is over. Shared with the refresh, which may outlast the provider.
+    class FirstRefresh;
 
     LocalTesselKit();
     static void notificationCallback(const void* observer, std::string_view name);
@@ -103,6 +108,7 @@ private:
                                                                    std::string_view name,
                                                                    const std::optional<Bytes>& value);
 
+    const std::shared_ptr<FirstRefresh> firstRefresh_;
     SerialQueue appRefreshQueue_{"cindral.app-refresh.queue"};
     TSPacer appRefreshPacer_;
     std::shared_ptr<InstalledAppsProxy> installedAppsProxy_;

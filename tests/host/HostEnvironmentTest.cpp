@@ -23,6 +23,26 @@ std::optional<std::string> chosen(std::string_view text) {
     return documentsFolderFrom(text, "/home/u");
 }
 
+TEST(HostEnvironment, saysWhereApplicationsAre) {
+    const RosterSources account = environment({}).roster;
+    EXPECT_EQ(account.flatpakUser, "/account/.local/share/flatpak");
+    EXPECT_EQ(account.flatpakSystem, "/var/lib/flatpak");
+    EXPECT_EQ(account.flatpakConfig, "/etc/flatpak");
+    EXPECT_EQ(account.applicationData, "/account/.var/app");
+    EXPECT_EQ(account.choicesFile, "/account/.config/cindral/applications.conf");
+    const RosterSources set = environment({{"HOME", "/home/u"},
+                                           {"XDG_CONFIG_HOME", "/conf"},
+                                           {"FLATPAK_USER_DIR", "/fu"},
+                                           {"FLATPAK_SYSTEM_DIR", "/fs"},
+                                           {"FLATPAK_CONFIG_DIR", "relative"},
+                                           {"LANG", "de_AT.UTF-8"}})
+                                  .roster;
+    EXPECT_EQ(set.flatpakUser + set.flatpakSystem, "/fu/fs");
+    EXPECT_EQ(set.flatpakConfig, "/etc/flatpak");
+    EXPECT_EQ(set.choicesFile, "/conf/cindral/applications.conf");
+    EXPECT_EQ(set.localeNames, (std::vector<std::string>{"de_AT", "de"}));
+}
+
 TEST(HostEnvironment, takesTheFoldersOfTheConventionWhereNothingIsSaid) {
     const HostEnvironment plain = environment({{"HOME", "/home/u"}});
     EXPECT_EQ(plain.configHome, "/home/u/.config");

@@ -262,5 +262,22 @@ TEST(MomentOf, isAnAgeADayOrADate) {
         EXPECT_EQ(momentOf(text, now), std::nullopt) << text;
 }
 
+TEST(RosterSources, followTheWords) {
+    HostEnvironment surroundings = environment();
+    surroundings.roster.flatpakUser = "/u";
+    surroundings.roster.flatpakSystem = "/s";
+    surroundings.roster.flatpakConfig = "/c";
+    surroundings.roster.choicesFile = "/choices";
+    const RosterSources all =
+        rosterSources(options({"ls", "--apps", "one", "--apps", "/two", "--storage", "/docs"}), surroundings);
+    EXPECT_THAT(all.entryFolders, ElementsAre("/desk/one", "/two"));
+    EXPECT_EQ(all.storage, "/docs");
+    EXPECT_EQ(all.flatpakUser + all.flatpakSystem + all.flatpakConfig + all.choicesFile, "/u/s/c/choices");
+    const RosterSources none = rosterSources(options({"ls", "--no-flatpak"}), surroundings);
+    EXPECT_EQ(none.flatpakUser + none.flatpakSystem + none.flatpakConfig, "");
+    EXPECT_EQ(none.choicesFile, "/choices");
+    EXPECT_THAT(none.entryFolders, ElementsAre());
+}
+
 }  // namespace
 }  // namespace cindral

@@ -5,7 +5,6 @@
 #include <unistd.h>
 
 #include "platform/foundation/KeyedArchive.h"
-#include "provider/LocalAppLibraryItem.h"
 #include "provider/ProviderFixture.h"
 #include "provider/Utilities.h"
 
@@ -247,54 +246,6 @@ TEST_F(LocalItemTest, aPutBackRecordMustNotLeadOut) {
         EXPECT_EQ(item(".Trash/a.txt")->putBackURL(), std::nullopt) << hostile;
     }
     EXPECT_TRUE(log_.contains(LogLevel::error, "[ERROR] couldn't compute putback url"));
-}
-
-class LocalAppLibraryItemTest : public LocalItemTest {
-protected:
-    static std::shared_ptr<const LocalAppLibraryItem> library(const TemporaryFolder& container) {
-        return LocalAppLibraryItem::initWithBundleProxy(
-            RoBundleProxy({"org.example.App", KsURL::fileURL(container.path()), "Example"}));
-    }
-};
-
-TEST_F(LocalAppLibraryItemTest, isNamedLikeTheApplication) {
-    const TemporaryFolder container;
-    container.file("Documents/a.txt");
-    const auto item = library(container);
-    ASSERT_TRUE(item);
-    EXPECT_EQ(item->itemIdentifier(), "#org.example.App");
-    EXPECT_EQ(item->parentItemIdentifier(), kTesselRootContainerItemIdentifier);
-    EXPECT_EQ(item->filename(), "Example");
-    EXPECT_EQ(item->childItemCount(), 1U);
-    EXPECT_EQ(bits(*item), 3U);
-    EXPECT_TRUE(item->isAppLibrary());
-    EXPECT_EQ(*item->appContainerBundleIdentifier(), "org.example.App");
-    EXPECT_EQ(item->fileURL()->path(), container / "Documents");
-}
-
-TEST_F(LocalAppLibraryItemTest, inboxAndTrashDontCount) {
-    const TemporaryFolder container;
-    container.folder("Documents/Inbox");
-    container.folder("Documents/.Trash");
-    EXPECT_EQ(library(container)->childItemCount(), 0U);
-}
-
-TEST_F(LocalAppLibraryItemTest, hasNoUserMetadata) {
-    const TemporaryFolder container;
-    const std::string path = container.folder("Documents");
-    set(path, kXattrLastUsedDateName, KsDate{1'700'000'000, 0});
-    set(path, kXattrTagDataName, PropertyList::Array{"red"});
-    set(path, kXattrFavoriteRankName, std::uint64_t{7});
-    const auto item = library(container);
-    EXPECT_FALSE(item->lastUsedDate());
-    EXPECT_FALSE(item->tags());
-    EXPECT_FALSE(item->favoriteRank());
-}
-
-TEST_F(LocalAppLibraryItemTest, withoutADataContainerThereIsNone) {
-    EXPECT_FALSE(LocalAppLibraryItem::initWithBundleProxy(RoBundleProxy({"org.example.App", std::nullopt, "Example"})));
-    EXPECT_TRUE(
-        log_.contains(LogLevel::error, "[ERROR] can't create an app library item without a data container URL"));
 }
 
 }  // namespace

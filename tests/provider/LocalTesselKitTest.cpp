@@ -7,37 +7,13 @@
 
 #include "platform/tessel/NotificationCenter.h"
 #include "platform/tessel/TesselManager.h"
+#include "provider/AppLibraryFixture.h"
 #include "provider/CindralProvider.h"
 #include "provider/LocalRootEnumerator.h"
 #include "provider/LocalTesselKitError.h"
-#include "provider/ProviderFixture.h"
 
 namespace cindral::test {
 namespace {
-
-/// Remembers which containers were signalled.
-class RecordingHost : public TesselManager::Host {
-public:
-    void signalEnumerator(const TesselItemIdentifier& container, TesselManager::Completion completion) override {
-        {
-            const MutexLock lock(mutex_);
-            signalled_.push_back(container);
-        }
-        completion(std::nullopt);
-    }
-    void deleteSearchableItems(const std::vector<std::string>& /*domains*/,
-                               TesselManager::Completion completion) override {
-        completion(std::nullopt);
-    }
-    std::vector<TesselItemIdentifier> signalled() const {
-        const MutexLock lock(mutex_);
-        return signalled_;
-    }
-
-private:
-    mutable Mutex mutex_;
-    std::vector<TesselItemIdentifier> signalled_ GUARDED_BY(mutex_);
-};
 
 class LocalTesselKitTest : public ProviderTest {
 protected:

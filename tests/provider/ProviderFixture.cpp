@@ -3,6 +3,7 @@
 #include "platform/foundation/Dispatch.h"
 #include "platform/roster/Roster.h"
 #include "platform/tessel/TesselManager.h"
+#include "provider/LocalAppLibraryManager.h"
 #include "provider/fs/FSListingPositions.h"
 
 namespace cindral::test {
@@ -46,14 +47,22 @@ ProviderTest::ProviderTest() {
     FSListingPositions::shared().removeAll();
     if (!RootDirectories::shared().add(storage_.path(), RootPolicy::storage).ok()) std::abort();
     TesselManager::defaultManager().setDocumentStorageURL(storageURL());
+    TesselManager::defaultManager().setApplicationSupportURL(KsURL::fileURL(state_ / "Application Support"));
+    forgetAppLibraries();
     RoApplicationWorkspace::defaultWorkspace().setOwnRecord(std::make_shared<RoBundleProxy>(
         RoBundleProxy::Values{"com.vemra.CindralStorage", KsURL::fileURL(storage_.outside().path()), "Documents"}));
     reopenStore();
 }
 
 ProviderTest::~ProviderTest() {
+    forgetAppLibraries();
     RvStorageManager::defaultManager().setStore(nullptr);
     RootDirectories::shared().remove(storage_.path());
+}
+
+void ProviderTest::forgetAppLibraries() {
+    LocalAppLibraryCache::forgetShared();
+    LocalAppLibraryManager::forgetShared();
 }
 
 void ProviderTest::reopenStore() {

@@ -46,6 +46,8 @@ protected:
     KsURL storageURL() const { return KsURL::fileURL(storage_.path()); }
     /// Closes the store and opens it again, as a new process would.
     void reopenStore();
+    /// Has the lists of app libraries read from their files again, as a new process would.
+    static void forgetAppLibraries();
 
     static ListedPage page(TesselEnumerator& enumerator, const TesselPage& page);
     static ListedPage firstPage(TesselEnumerator& enumerator) {

@@ -168,6 +168,8 @@ class SystemTest(unittest.TestCase):
         self.environment = {
             name: value for name, value in os.environ.items() if not name.startswith("XDG_") and name != "CINDRAL_LOG"}
         self.environment["HOME"] = self.folder
+        for variable, name in (("FLATPAK_USER_DIR", "user"), ("FLATPAK_SYSTEM_DIR", "system"), ("FLATPAK_CONFIG_DIR", "etc")):
+            self.environment[variable] = os.path.join(self.folder, "flatpak", name)
 
     def _remove_folder(self):
         # What a test locked is opened again, so that also a person without privilege is rid of it.

@@ -381,10 +381,15 @@ Result<void> IndexKeeper::touchBelow(FileID folder) {
 }
 
 Result<void> IndexKeeper::removeTree(FileID folder) {
-    TRY(removeBelow(folder));
+    // What departs is journalled with its path below a root: of a root that is none any more, it is the one of then.
+    const std::vector<FileID> current = rootIDs_;
+    if (rootWithID(folder) == nullptr) rootIDs_.push_back(folder);
+    Result<void> removed = removeBelow(folder);
     forgetWatch(folder);
-    if (find(folder)) changes().remove(folder);
-    return flush();
+    if (removed.ok() && find(folder)) changes().remove(folder);
+    if (removed.ok()) removed = flush();
+    rootIDs_ = current;
+    return removed;
 }
 
 // MARK: The tree

@@ -46,6 +46,8 @@ bool tellsOfChanges(int folder) {
 
 // What is remembered for no document is of the volume itself: the set of types that its packages were told by.
 constexpr DocumentID kVolumeItself{0};
+// And where its roots are and were. A document of this number would be the last of four thousand millions.
+constexpr DocumentID kRootsOfTheVolume{0xFFFF'FFFF};
 
 Bytes currentTypes() {
     Bytes bytes(sizeof(std::uint64_t));
@@ -177,6 +179,7 @@ Result<void> Recorder::startUp() {
             TRY(store_->renewUUID());
             TRY(store_->rememberAttributes(kVolumeItself, currentTypes()));
         }
+        readFormerRoots();
         TRY(giveUpStaleRoots());
         TRY(keeper_.compareEverything(IndexKeeper::Journal::yes));
         TRY(recordRoots());
@@ -225,7 +228,27 @@ Result<void> Recorder::recordRoots() {
         changes.put(object);
     }
     if (!changes.empty()) TRY(store_->apply(changes, keeper_.rootIDs()));
-    return {};
+    return rememberRoots();
+}
+
+/// The journal outlives this process, and so may a client that has not heard yet of what departed.
+Result<void> Recorder::rememberRoots() {
+    RootPaths current;
+    for (const auto& root : *roots()) current.insert_or_assign(FileID{root->status.fileID}, root->path);
+    Bytes bytes;
+    {
+        const MutexLock lock(stateMutex_);
+        bytes = encodeRootPaths(current, formerRoots_);
+    }
+    if (store_->attributes(kRootsOfTheVolume) == bytes) return {};
+    return store_->rememberAttributes(kRootsOfTheVolume, bytes);
+}
+
+void Recorder::readFormerRoots() {
+    RootPaths paths = decodeRootPaths(store_->attributes(kRootsOfTheVolume));
+    for (const auto& root : *roots()) paths.erase(FileID{root->status.fileID});
+    const MutexLock lock(stateMutex_);
+    formerRoots_ = std::move(paths);
 }
 
 void Recorder::finished(const Result<void>& startUp) {
@@ -357,6 +380,8 @@ Result<void> Recorder::setRoots(Roots wanted) {
         keeper_.setRoots(sourcesFor(wanted));
         {
             const MutexLock stateLock(stateMutex_);
+            for (const auto& root : *roots_) formerRoots_[FileID{root->status.fileID}] = root->path;
+            for (const auto& root : wanted) formerRoots_.erase(FileID{root->status.fileID});
             roots_ = std::make_shared<const Roots>(std::move(wanted));
         }
         for (const FileID root : added) TRY(keeper_.compareTree(root));
@@ -464,6 +489,11 @@ Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_
     const auto roots = this->roots();
     std::vector<FileID> rootIDs;
     for (const auto& root : *roots) rootIDs.push_back(FileID{root->status.fileID});
+    RootPaths formerRoots;
+    {
+        const MutexLock lock(stateMutex_);
+        formerRoots = formerRoots_;
+    }
     Batch batch;
     batch.isLast = found.size() < max;
     batch.upTo = found.empty() ? after : found.back().id;
@@ -489,8 +519,11 @@ Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_
         } else if (journalled.kind == JournalEvent::Kind::departed && !journalled.path.empty()) {
             // Its folder is gone as well.
             const auto root = std::ranges::find(rootIDs, journalled.root);
-            if (root == rootIDs.end()) continue;
-            event.path = (*roots)[static_cast<std::size_t>(root - rootIDs.begin())]->path + "/" + journalled.path;
+            const auto former = formerRoots.find(journalled.root);
+            if (root == rootIDs.end() && former == formerRoots.end()) continue;
+            event.path = root == rootIDs.end() ? former->second
+                                               : (*roots)[static_cast<std::size_t>(root - rootIDs.begin())]->path;
+            event.path += "/" + journalled.path;
         } else {
             continue;
         }

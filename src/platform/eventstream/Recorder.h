@@ -13,6 +13,7 @@
 #include "platform/eventstream/EventHistory.h"
 #include "platform/eventstream/EventSource.h"
 #include "platform/eventstream/IndexKeeper.h"
+#include "platform/eventstream/RootPaths.h"
 #include "platform/foundation/Mutex.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/foundation/UniqueFd.h"
@@ -93,6 +94,8 @@ private:
     Result<void> startUp();
     Result<void> giveUpStaleRoots() REQUIRES(mutex_);
     Result<void> recordRoots() REQUIRES(mutex_);
+    Result<void> rememberRoots() REQUIRES(mutex_);
+    void readFormerRoots() REQUIRES(mutex_);
     std::vector<IndexKeeper::Root> sourcesFor(const Roots& roots) REQUIRES(mutex_);
     std::shared_ptr<EventSource> sourceFor(const RootDirectory& root) REQUIRES(mutex_);
     std::shared_ptr<EventSource> workingSource(std::shared_ptr<EventSource>& source, const SourceFactory& make,
@@ -138,6 +141,8 @@ private:
     bool isReady_ GUARDED_BY(stateMutex_) = false;
     std::optional<KsError> startError_ GUARDED_BY(stateMutex_);
     std::shared_ptr<const Roots> roots_ GUARDED_BY(stateMutex_);
+    /// Roots that are none any more, and where they were: what departed from them is told of under its path there.
+    RootPaths formerRoots_ GUARDED_BY(stateMutex_);
     std::vector<int> pollDescriptors_ GUARDED_BY(stateMutex_);
     Status status_ GUARDED_BY(stateMutex_);
 

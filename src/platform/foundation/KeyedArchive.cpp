@@ -17,8 +17,9 @@ constexpr const char* kRootKey = "root";
 bool isArchive(const PropertyList::Dictionary& top) {
     const auto archiver = top.find(kArchiverKey);
     const auto version = top.find(kVersionKey);
-    return top.size() == 3 && archiver != top.end() && archiver->second == PropertyList(kArchiver) &&
-           version != top.end() && version->second == PropertyList(kVersion) && top.contains(kRootKey);
+    return top.size() == (top.contains(kRootKey) ? 3 : 2) && archiver != top.end() &&
+           archiver->second == PropertyList(kArchiver) && version != top.end() &&
+           version->second == PropertyList(kVersion);
 }
 
 std::optional<std::int64_t> integerFrom(double real) {
@@ -34,10 +35,16 @@ Bytes archive(const PropertyList& root) {
         .encodeBinary();
 }
 
-std::optional<PropertyList> unarchiveRoot(ByteView bytes) {
+std::optional<Unarchived> unarchive(ByteView bytes) {
     const Result<PropertyList> list = PropertyList::decodeBinary(bytes);
     if (!list || !list->dictionary() || !isArchive(*list->dictionary())) return std::nullopt;
-    return *list->find(kRootKey);
+    const PropertyList* root = list->find(kRootKey);
+    return Unarchived{root == nullptr ? std::nullopt : std::optional(*root)};
+}
+
+std::optional<PropertyList> unarchiveRoot(ByteView bytes) {
+    std::optional<Unarchived> archive = unarchive(bytes);
+    return archive ? std::move(archive->root) : std::nullopt;
 }
 
 std::optional<KsDate> unarchiveDate(ByteView bytes) {

@@ -23,6 +23,12 @@ namespace cindral {
 namespace keyed_archive {
 
 Bytes archive(const PropertyList& root);
+/// What an archive holds.
+struct Unarchived {
+    std::optional<PropertyList> root;  ///< none: the archive has none
+};
+/// For who must tell an archive without a root object from bytes that are no archive of this version, which are none.
+std::optional<Unarchived> unarchive(ByteView bytes);
 /// The root object, whatever its class; none when the bytes are no archive of this version.
 std::optional<PropertyList> unarchiveRoot(ByteView bytes);
 

@@ -19,7 +19,21 @@ bool holds(std::string_view root, std::string_view path) {
 // Enough to tell a person what is the matter; a tree with more mounts than that has one matter only.
 constexpr std::size_t kLeftOutMax = 1000;
 
-using Roots = std::vector<std::shared_ptr<const RootDirectory>>;
+Result<std::shared_ptr<const RootDirectory>> openRoot(const std::string& path, RootPolicy policy) {
+    auto root = std::make_shared<RootDirectory>();
+    // An application may put a link in place of its Documents folder, to anywhere.
+    const int flags = policy == RootPolicy::applicationContainer ? O_NOFOLLOW : 0;
+    root->fd = TRY(sys::openDirectoryForReading(AT_FDCWD, path.c_str(), flags));
+    root->path = path;
+    root->status = TRY(sys::statx(root->fd.get(), ""));
+    root->policy = policy;
+    return std::shared_ptr<const RootDirectory>(std::move(root));
+}
+
+bool isSameRoot(const RootDirectory& a, const RootDirectory& b) {
+    return a.path == b.path && a.policy == b.policy && a.status.fileID == b.status.fileID &&
+           a.status.device == b.status.device && a.status.birthTime == b.status.birthTime;
+}
 
 }  // namespace
 
@@ -36,31 +50,97 @@ RootDirectories& RootDirectories::shared() {
 }
 
 Result<std::shared_ptr<const RootDirectory>> RootDirectories::add(const std::string& path, RootPolicy policy) {
-    auto root = std::make_shared<RootDirectory>();
-    root->fd = TRY(sys::openDirectoryForReading(AT_FDCWD, path.c_str()));
-    root->path = path;
-    root->status = TRY(sys::statx(root->fd.get(), ""));
-    root->policy = policy;
+    auto root = TRY(openRoot(path, policy));
+    {
+        const MutexLock lock(mutex_);
+        put(root);
+    }
+    tellObserver();
+    return root;
+}
 
-    const MutexLock lock(mutex_);
+void RootDirectories::put(std::shared_ptr<const RootDirectory> root) {
     Roots roots = roots_ ? *roots_ : Roots();
-    std::erase_if(roots, [&](const auto& other) { return other->path == path; });
-    roots.push_back(root);
+    std::erase_if(roots, [&](const auto& other) { return other->path == root->path; });
+    roots.push_back(std::move(root));
     // The longest first, so that the first that holds a path is the innermost.
     std::ranges::sort(roots, std::ranges::greater(), [](const auto& other) { return other->path.size(); });
     roots_ = std::make_shared<const Roots>(std::move(roots));
-    return std::shared_ptr<const RootDirectory>(std::move(root));
 }
 
 void RootDirectories::remove(std::string_view path) {
-    const MutexLock lock(mutex_);
-    if (!roots_) return;
-    Roots roots = *roots_;
-    std::erase_if(roots, [&](const auto& other) { return other->path == path; });
-    roots_ = std::make_shared<const Roots>(std::move(roots));
+    {
+        const MutexLock lock(mutex_);
+        if (!roots_) return;
+        Roots roots = *roots_;
+        if (std::erase_if(roots, [&](const auto& other) { return other->path == path; }) == 0) return;
+        roots_ = std::make_shared<const Roots>(std::move(roots));
+    }
+    tellObserver();
 }
 
-Roots RootDirectories::all() const {
+void RootDirectories::setApplicationContainers(const std::vector<std::string>& paths) {
+    changeApplicationContainers(paths, TakeBack::yes);
+}
+
+void RootDirectories::addApplicationContainers(const std::vector<std::string>& paths) {
+    changeApplicationContainers(paths, TakeBack::no);
+}
+
+void RootDirectories::changeApplicationContainers(const std::vector<std::string>& paths, TakeBack takeBack) {
+    Roots opened;
+    for (const std::string& path : paths) {
+        auto root = openRoot(path, RootPolicy::applicationContainer);
+        if (root.ok()) {
+            opened.push_back(*std::move(root));
+        } else {
+            logDebug("can't publish {}; {}", path, root.error().description());
+        }
+    }
+    const auto isOpened = [&](const std::string& path) {
+        return std::ranges::find(opened, path, [](const auto& root) { return root->path; }) != opened.end();
+    };
+    bool isChanged = false;
+    {
+        const MutexLock lock(mutex_);
+        Roots roots = roots_ ? *roots_ : Roots();
+        if (takeBack == TakeBack::yes) {
+            isChanged = std::erase_if(roots, [&](const auto& root) {
+                            return root->policy == RootPolicy::applicationContainer && !isOpened(root->path);
+                        }) > 0;
+            roots_ = std::make_shared<const Roots>(roots);
+        }
+        for (const auto& root : opened) {
+            const bool isKnown =
+                std::ranges::any_of(roots, [&](const auto& other) { return isSameRoot(*other, *root); });
+            if (isKnown) continue;
+            put(root);
+            isChanged = true;
+        }
+    }
+    if (isChanged) tellObserver();
+}
+
+void RootDirectories::setObserver(Observer observer) {
+    observerQueue_.sync([&] {
+        observerQueue_.assertCurrent();
+        observer_.swap(observer);
+    });
+}
+
+void RootDirectories::tellObserver() {
+    // Who changes the roots doesn't wait: the observer may read all that is new.
+    observerQueue_.async([this] {
+        observerQueue_.assertCurrent();
+        if (observer_) observer_(all());
+    });
+}
+
+void RootDirectories::waitForObserver() {
+    observerQueue_.sync([] {});
+}
+
+std::vector<std::shared_ptr<const RootDirectory>> RootDirectories::all() const {
     const MutexLock lock(mutex_);
     return roots_ ? *roots_ : Roots();
 }

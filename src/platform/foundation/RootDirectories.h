@@ -1,5 +1,6 @@
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -7,6 +8,7 @@
 
 #include "platform/foundation/Mutex.h"
 #include "platform/foundation/Result.h"
+#include "platform/foundation/SerialQueue.h"
 #include "platform/foundation/Sys.h"
 #include "platform/foundation/UniqueFd.h"
 
@@ -45,10 +47,26 @@ class RootDirectories {
 public:
     static RootDirectories& shared();
 
-    /// Opens the directory (links in the path itself are followed) and publishes it under `path`, replacing an earlier
-    /// one of that path.
+    /// Opens the directory (links in the path itself are followed; an application's Documents folder is none) and
+    /// publishes it under `path`, replacing an earlier one of that path.
     Result<std::shared_ptr<const RootDirectory>> add(const std::string& path, RootPolicy policy);
     void remove(std::string_view path);
+    /// Makes the Documents folders at the paths the only ones of applications that are published, at once: opens those
+    /// that are missing and those that another folder has taken the place of, and takes back all others. One that can't
+    /// be opened is left out, with a debug line.
+    void setApplicationContainers(const std::vector<std::string>& paths);
+    /// The same, without taking any back.
+    void addApplicationContainers(const std::vector<std::string>& paths);
+
+    /// Hears of every change of the roots, with all of them as they are: one call at a time, on a queue of its own
+    /// ("cindral.roots"), the last of them after the last change. Null hears nothing; a call never outlasts the
+    /// setObserver() that replaces it.
+    using Observer = std::function<void(const std::vector<std::shared_ptr<const RootDirectory>>&)>;
+    void setObserver(Observer observer);
+    /// Has the observer called as after a change.
+    void tellObserver();
+    /// Returns when the observer has been told of every change that was made before the call.
+    void waitForObserver();
 
     /// The root that is or holds the path, by whole components; the innermost when there are several; null when there
     /// is none.
@@ -73,9 +91,17 @@ public:
     static Result<UniqueFd> open(const std::string& path, int flags);
 
 private:
+    using Roots = std::vector<std::shared_ptr<const RootDirectory>>;
+    enum class TakeBack { no, yes };
+    void changeApplicationContainers(const std::vector<std::string>& paths, TakeBack takeBack);
+    void put(std::shared_ptr<const RootDirectory> root) REQUIRES(mutex_);
+
     mutable Mutex mutex_;
     std::shared_ptr<const std::vector<std::shared_ptr<const RootDirectory>>> roots_ GUARDED_BY(mutex_);
     std::vector<LeftOut> leftOut_ GUARDED_BY(mutex_);
+
+    SerialQueue observerQueue_{"cindral.roots"};  // Below what its tasks use.
+    Observer observer_ GUARDED_BY(observerQueue_);
 };
 
 }  // namespace cindral

@@ -44,7 +44,9 @@ bool isGood(const LogRecord& record) {
         case LogRecordType::otherNameGone: return record.value.size() == LogRecord::kNameHeadBytes;
         case LogRecordType::departure: return Departure::decode(record.value).has_value();
         case LogRecordType::documentChange: return DocumentChange::decode(record.value).has_value();
-        case LogRecordType::attributes: return isDocumentKey(record.key) && record.value.size() <= kAttributesBytesMax;
+        case LogRecordType::attributes:
+            // Of document 0: what is remembered of the volume itself.
+            return (record.key == 0 || isDocumentKey(record.key)) && record.value.size() <= kAttributesBytesMax;
         case LogRecordType::timeMark: return record.value.size() == sizeof(std::int64_t);
     }
     return false;

@@ -163,7 +163,8 @@ public:
     std::vector<Name> otherNames(FileID fileID) const;
 
     /// The attributes that a document had when they were last looked at, as given to rememberAttributes(): bytes that
-    /// the store doesn't read. Empty for none. What is remembered for document 0 is of the volume itself.
+    /// the store doesn't read. Empty for none. What is remembered for document 0 and for the last number is of the volume
+    /// itself.
     Bytes attributes(DocumentID document) const;
     Result<void> rememberAttributes(DocumentID document, ByteView attributes);
 

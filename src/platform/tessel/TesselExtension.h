@@ -26,6 +26,9 @@ public:
 
     virtual ~TesselExtension() = default;
 
+    /// Returns when the provider knows which folders it publishes. The host waits for that before its first request.
+    virtual void waitUntilReady() {}
+
     virtual std::optional<KsURL> URLForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier) = 0;
     virtual std::optional<TesselItemIdentifier> persistentIdentifierForItemAtURL(const KsURL& url) = 0;
     virtual Result<std::shared_ptr<const TesselItem>> itemForIdentifier(const TesselItemIdentifier& identifier) = 0;

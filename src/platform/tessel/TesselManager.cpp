@@ -23,6 +23,18 @@ void TesselManager::setDocumentStorageURL(KsURL url) {
     documentStorageURL_.swap(shared);
 }
 
+KsURL TesselManager::applicationSupportURL() const {
+    const MutexLock lock(mutex_);
+    if (!applicationSupportURL_) fatal("the application-support folder was asked for before the host has set it");
+    return *applicationSupportURL_;
+}
+
+void TesselManager::setApplicationSupportURL(KsURL url) {
+    auto shared = std::make_shared<const KsURL>(std::move(url));
+    const MutexLock lock(mutex_);
+    applicationSupportURL_.swap(shared);
+}
+
 void TesselManager::setHost(std::shared_ptr<Host> host) {
     // The host that was there goes after the lock: its end may call in here.
     const MutexLock lock(mutex_);

@@ -38,6 +38,9 @@ public:
     /// The same without a copy, for what is asked for every item.
     std::shared_ptr<const KsURL> sharedDocumentStorageURL() const;
     void setDocumentStorageURL(KsURL url);
+    /// The folder in which a provider may keep what it knows. Aborts when the host has not set it.
+    KsURL applicationSupportURL() const;
+    void setApplicationSupportURL(KsURL url);
     /// Null takes the host away: signals are then answered without an error and go nowhere.
     void setHost(std::shared_ptr<Host> host);
 
@@ -50,6 +53,7 @@ private:
 
     mutable Mutex mutex_;
     std::shared_ptr<const KsURL> documentStorageURL_ GUARDED_BY(mutex_);
+    std::shared_ptr<const KsURL> applicationSupportURL_ GUARDED_BY(mutex_);
     std::shared_ptr<Host> host_ GUARDED_BY(mutex_);
 };
 

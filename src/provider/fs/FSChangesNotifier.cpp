@@ -108,6 +108,11 @@ void FSChangesNotifier::startReader() {
     if (isStopped) reader_->stop();
 }
 
+bool FSChangesNotifier::isStarted() {
+    const MutexLock lock(mutex_);
+    return isStarted_;
+}
+
 void FSChangesNotifier::stop() {
     {
         const MutexLock lock(mutex_);

@@ -44,6 +44,7 @@ public:
     void setClient(std::weak_ptr<TesselEnumerator> client);
     void start();
     void stop();
+    bool isStarted();
     /// The host has come, and is given everything up to now: what is reported from here on is news.
     void hostDidEnumerate() { shouldSignalChange_ = false; }
 

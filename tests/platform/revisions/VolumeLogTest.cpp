@@ -193,6 +193,9 @@ TEST(VolumeLog, holdsNothingThatNoStoreWrites) {
     EXPECT_FALSE(isRead(LogRecordType::documentChange, 5, 19));
     EXPECT_TRUE(isRead(LogRecordType::attributes, 5, 65'536));
     EXPECT_FALSE(isRead(LogRecordType::attributes, 5, 65'537));
+    EXPECT_TRUE(isRead(LogRecordType::attributes, 0, 8));
+    EXPECT_TRUE(isRead(LogRecordType::attributes, (1ULL << 32) - 1, 8));
+    EXPECT_FALSE(isRead(LogRecordType::attributes, 1ULL << 32, 8));
     EXPECT_FALSE(isRead(LogRecordType::timeMark, 5, 7));
     EXPECT_FALSE(isRead(LogRecordType{0}, 5, 8));
     EXPECT_FALSE(isRead(LogRecordType{12}, 5, 8));

@@ -39,6 +39,27 @@ TEST_F(RosterTest, knowsNoRecordBeforeTheHostSetsOne) {
     EXPECT_FALSE(contains("/home/u/Documents"));
 }
 
+TEST(RoApplicationProxy, saysWhetherItsDocumentsArePublished) {
+    using Publication = RoApplicationProxy::Publication;
+    const auto publication = [](const std::optional<PropertyList::Dictionary>& info, bool hasContainer = true) {
+        RoBundleProxy::Values values{"a", std::nullopt, "A", info};
+        if (hasContainer) values.dataContainerURL = KsURL::fileURL("/data/a");
+        return RoApplicationProxy(values).publication();
+    };
+    EXPECT_EQ(publication(PropertyList::Dictionary{{kSupportsDocumentBrowserKey, true}}), Publication::published);
+    EXPECT_EQ(
+        publication(PropertyList::Dictionary{
+            {kSupportsDocumentBrowserKey, false}, {kSupportsOpenInPlaceKey, true}, {kFileSharingEnabledKey, true}}),
+        Publication::published);
+    EXPECT_EQ(publication(PropertyList::Dictionary{{kSupportsOpenInPlaceKey, true}}), Publication::isNotAskedFor);
+    EXPECT_EQ(publication(PropertyList::Dictionary{{kFileSharingEnabledKey, true}}), Publication::isNotAskedFor);
+    EXPECT_EQ(publication(PropertyList::Dictionary{{kSupportsDocumentBrowserKey, "true"}}), Publication::isNotAskedFor);
+    EXPECT_EQ(publication(PropertyList::Dictionary()), Publication::isNotAskedFor);
+    EXPECT_EQ(publication(std::nullopt), Publication::cannotBeRead);
+    EXPECT_EQ(publication(PropertyList::Dictionary{{kSupportsDocumentBrowserKey, true}}, false),
+              Publication::hasNoDataContainer);
+}
+
 TEST_F(RosterTest, handsOutTheOwnRecord) {
     setOwnContainer("/home/u");
     EXPECT_EQ(workspace().ownRecord(), own_);
