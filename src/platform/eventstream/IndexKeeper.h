@@ -155,6 +155,7 @@ private:
     Result<void> compareUnwatched();
     Result<void> scanPending();
     Result<void> scan(FileID folder);
+    Result<void> compareWalk(TreeWalk& walk);
     void scanLater(FileID folder);
     Result<void> compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders);
     static void readEntries(Batch& batch);
@@ -212,6 +213,7 @@ private:
     std::vector<FileID> toScan_;                 // Folders whose contents are to be compared, and what is below them.
     std::set<FileID> unwatched_;                 // Folders that no source tells about.
     bool reachedWatchLimit_ = false;
+    std::unordered_set<FileID>* forgotten_ = nullptr;  // While a tree is read: whose watches ended meanwhile.
 
     // The round's.
     std::unique_ptr<IndexChanges> changes_;

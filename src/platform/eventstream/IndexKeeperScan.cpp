@@ -109,6 +109,25 @@ Result<void> IndexKeeper::scan(FileID top) {
         return {};
     }
     TreeWalk walk(*this, *first->root, {top, first->path});
+    std::unordered_set<FileID> forgotten;
+    forgotten_ = &forgotten;
+    const Result<void> compared = compareWalk(walk);
+    forgotten_ = nullptr;
+    TRY(Result<void>(compared));
+    // Their numbers were others' before, whose watches ended when that was found: after these had been made.
+    for (const FileID fileID : forgotten) {
+        const auto folder = openFolder(fileID);
+        if (!folder) {
+            scanLater(fileID);
+            continue;
+        }
+        watch(*folder);
+        TRY(compareEntries(*folder, nullptr));
+    }
+    return {};
+}
+
+Result<void> IndexKeeper::compareWalk(TreeWalk& walk) {
     std::optional<ReadAhead> ahead;
     Comparison comparison;
     std::size_t count = 0;
@@ -322,6 +341,7 @@ void IndexKeeper::forgetWatch(FileID fileID) {
         const MutexLock lock(sourcesMutex_);
         for (const auto& source : sources_) source->forget(fileID);
     }
+    if (forgotten_ != nullptr) forgotten_->insert(fileID);
     unwatched_.erase(fileID);
     closed_.erase(fileID);
 }

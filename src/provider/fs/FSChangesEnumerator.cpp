@@ -122,13 +122,11 @@ std::shared_ptr<FSEventReader> FSChangesEnumerator::makeReader(FSEventReaderMode
 }
 
 void FSChangesEnumerator::start() {
-    std::shared_ptr<FSEventReader> reader;
-    {
-        const MutexLock lock(mutex_);
-        if (isOver_ || reader_) return;
-        reader_ = reader = makeReader(FSEventReaderMode::pathBased, /*verbose=*/false);
-    }
-    reader->start();
+    const MutexLock lock(mutex_);
+    if (isOver_ || reader_) return;
+    reader_ = makeReader(FSEventReaderMode::pathBased, /*verbose=*/false);
+    // With the lock: one that stop() knows of has been started, and can be stopped.
+    reader_->start();
 }
 
 void FSChangesEnumerator::stop() {
@@ -430,12 +428,11 @@ void FSChangesEnumerator::finishPathBased(const FSReaderState& position) {
     pathBasedReaderState_ = position;
     numberOfChanges_ = 0;
     std::shared_ptr<FSEventReader> reader = makeReader(FSEventReaderMode::docIDBased, /*verbose=*/true);
-    {
-        const MutexLock lock(mutex_);
-        if (isOver_) return;
-        reader_ = reader;
-    }
-    reader->start();
+    const MutexLock lock(mutex_);
+    if (isOver_) return;
+    // The one before, whose task this is, is let go of without the lock.
+    reader_.swap(reader);
+    reader_->start();
 }
 
 void FSChangesEnumerator::finishDocIDBased(FSEventReader& reader, const FSReaderState& position) {
