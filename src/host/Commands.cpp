@@ -14,10 +14,14 @@
 #include "host/TerminalText.h"
 #include "host/TreePrinter.h"
 #include "platform/foundation/Base64.h"
+#include "platform/foundation/Sys.h"
 #include "platform/tessel/TesselErrors.h"
 
 namespace cindral {
 namespace {
+
+// A wish: icons come in the sizes of the screen.
+constexpr unsigned kThumbnailPixels = 256;
 
 bool isManyFolders(const TesselItemIdentifier& container) {
     return container == kTesselRootContainerItemIdentifier || container == kTesselWorkingSetContainerItemIdentifier ||
@@ -51,6 +55,10 @@ Result<void> Commands::run() {
         case HostCommand::watch: return watch();
         case HostCommand::status: return status();
         case HostCommand::edit: return EditCommands(context_, EditTerminal::ofProcess(), output_).run();
+        case HostCommand::thumbnail: return thumbnail();
+        case HostCommand::apps:
+        case HostCommand::appsEnable:
+        case HostCommand::appsDisable:
         case HostCommand::rpc: break;
     }
     return usageFailure("that is no command that prints");
@@ -260,6 +268,28 @@ Result<void> Commands::status() {
         output_.line(fmt::format("{:<19} {}", key, terminalText(shown)));
     }
     return {};
+}
+
+Result<void> Commands::thumbnail() {
+    const std::string& file = context_.options.outputFile;
+    if (file.empty()) return hostFailure("the working folder is gone: the output must be an absolute path");
+    std::optional<Bytes> png;
+    const TesselItemIdentifier identifier = TRY(this->identifier());
+    context_.client.provider().fetchThumbnailsForItemIdentifiers(
+        {identifier}, kThumbnailPixels,
+        [&](const TesselItemIdentifier&, std::optional<Bytes> data) { png = std::move(data); },
+        [](const std::optional<KsError>&) {});
+    if (!png) return hostFailure(fmt::format("there is no thumbnail of {}", subject()));
+    if (file == "-") {
+        output_.buffer() += textOf(*png);
+        return {};
+    }
+    const auto written = [&]() -> Result<void> {
+        const UniqueFd fd = TRY(sys::open(file.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_NOCTTY, 0666));
+        return descriptor::writeAll(fd.get(), textOf(*png));
+    }();
+    if (written.ok()) return {};
+    return hostFailure(fmt::format("can't write {}: {}", terminalText(file), written.error().reason()));
 }
 
 }  // namespace cindral

@@ -56,6 +56,7 @@ private:
     Result<void> changes();
     Result<void> watch();
     Result<void> status();
+    Result<void> thumbnail();
 
     /// The item that was named; the root container where none was.
     Result<TesselItemIdentifier> identifier() const;

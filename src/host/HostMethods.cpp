@@ -15,6 +15,9 @@
 namespace cindral {
 namespace {
 
+/// Beyond this a size is as good as any: the provider takes it for a wish.
+constexpr std::int64_t kThumbnailPixelsMax = 65'536;
+
 using Reply = std::shared_ptr<JsonRpcReply>;
 
 /// A value that may be none, as the one member of an object.
@@ -179,6 +182,35 @@ void defaultContainer(const HostMethodsContext& context, const Json& params, con
         });
 }
 
+void fetchThumbnails(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const RequestParams given(params, *reply);
+    const auto identifiers = given.strings("identifiers");
+    if (!identifiers) return;
+    const auto size = given.integer("size");
+    if (!size) return;
+    if (*size <= 0) return reply->error(JsonRpcCode::invalidParams, "\"size\" is not a number of pixels");
+    // Each is answered in order, on this thread, before the completion.
+    auto out = std::make_shared<std::string>(R"({"thumbnails":[)");
+    context.client.provider().fetchThumbnailsForItemIdentifiers(
+        *identifiers, static_cast<unsigned>(std::min(*size, kThumbnailPixelsMax)),
+        [out](const TesselItemIdentifier& identifier, const std::optional<Bytes>& png) {
+            if (out->back() != '[') *out += ',';
+            *out += R"({"identifier":)";
+            appendJsonString(*out, identifier);
+            *out += R"(,"png":)";
+            if (png) {
+                *out += '"';
+                appendBase64(*out, *png);
+                *out += "\"}";
+            } else {
+                *out += "null}";
+            }
+        },
+        [out, reply](const std::optional<KsError>&) {
+            reply->result([&](std::string& text) { text += *out + "]}"; });
+        });
+}
+
 void status(const HostMethodsContext& context, const Json& /*params*/, const Reply& reply) {
     reply->result([&](std::string& out) { out += context.statusText(); });
 }
@@ -223,6 +255,7 @@ JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context) {
         {"startMonitoring", startMonitoring},
         {"stopMonitoring", stopMonitoring},
         {"defaultContainer", defaultContainer},
+        {"fetchThumbnails", fetchThumbnails},
         {"status", status},
     };
     JsonRpcServer::Methods methods = makeEditMethods(context);

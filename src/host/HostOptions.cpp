@@ -35,11 +35,12 @@ struct Words {
     bool json = false;
     bool intoPackages = false;
     std::string since;
+    std::string outputFile;
     std::string item;
     EditOptions edit;
 };
 
-enum class Argument { none, optionalItem, item, path };
+enum class Argument { none, optionalItem, item, path, application };
 
 struct CommandDescription {
     const char* name;
@@ -60,8 +61,18 @@ constexpr CommandDescription kCommands[] = {
      HostCommand::changes, Argument::optionalItem},
     {"watch", "Print what changes in a container, a line each, until it is interrupted.", HostCommand::watch,
      Argument::optionalItem},
+    {"thumbnail", "Write the thumbnail of an item into a file, as PNG.", HostCommand::thumbnail, Argument::item},
+    {"apps", "Show which applications are installed, and whose documents are published.", HostCommand::apps,
+     Argument::none},
     {"status", "Show where the host works and what it knows.", HostCommand::status, Argument::none},
     {"rpc", "Speak JSON-RPC 2.0 on standard input and output, one message a line.", HostCommand::rpc, Argument::none},
+};
+
+/// Words after "apps".
+constexpr CommandDescription kAppsCommands[] = {
+    {"enable", "Publish an application's documents, whatever its keys say; makes its Documents folder.",
+     HostCommand::appsEnable, Argument::application},
+    {"disable", "Don't publish an application's documents.", HostCommand::appsDisable, Argument::application},
 };
 
 RecorderChoice recorderOf(const std::string& name) {
@@ -107,6 +118,11 @@ void addArgument(CLI::App& command, Argument argument, Words& words) {
         case Argument::path:
             command.add_option("PATH", words.item, "A path, absolute or relative.")->type_name("")->required();
             return;
+        case Argument::application:
+            command.add_option("ID", words.item, "The application's identifier, as apps shows it.")
+                ->type_name("")
+                ->required();
+            return;
     }
 }
 
@@ -122,30 +138,63 @@ void addCommands(CLI::App& app, Words& words) {
         if (description.command == HostCommand::changes) {
             command->add_option("--since", words.since, "The anchor, in base64.")->type_name("ANCHOR")->required();
         }
+        if (description.command == HostCommand::thumbnail) {
+            command->add_option("-o,--output", words.outputFile, "Where to write; \"-\" is standard output.")
+                ->type_name("FILE")
+                ->required();
+        }
+        if (description.command == HostCommand::apps) {
+            for (const CommandDescription& each : kAppsCommands) {
+                CLI::App* inner = command->add_subcommand(each.name, each.description);
+                inner->fallthrough();
+                addArgument(*inner, each.argument, words);
+            }
+            command->require_subcommand(0, 1);
+        }
     }
+}
+
+/// The innermost command that was named.
+const CLI::App& chosenApp(const CLI::App& app) {
+    const CLI::App* chosen = app.get_subcommands().front();
+    const auto inner = chosen->get_subcommands();
+    return inner.empty() ? *chosen : *inner.front();
 }
 
 /// None for a command that changes something.
 const CommandDescription* chosenCommand(const CLI::App& app) {
-    const CLI::App* chosen = app.get_subcommands().front();
-    const auto* found = std::ranges::find_if(
-        kCommands, [&](const CommandDescription& each) { return chosen->get_name() == each.name; });
-    return found != std::end(kCommands) ? found : nullptr;
+    const CLI::App& chosen = chosenApp(app);
+    const std::span<const CommandDescription> commands =
+        chosen.get_parent() == &app ? std::span<const CommandDescription>(kCommands) : kAppsCommands;
+    const auto found =
+        std::ranges::find_if(commands, [&](const CommandDescription& each) { return chosen.get_name() == each.name; });
+    return found != commands.end() ? &*found : nullptr;
+}
+
+const char* nameOf(Argument argument) {
+    switch (argument) {
+        case Argument::none: return "";
+        case Argument::optionalItem:
+        case Argument::item: return "ITEM";
+        case Argument::path: return "PATH";
+        case Argument::application: return "ID";
+    }
+    return "";
 }
 
 /// What the chosen command is and is about.
 void readCommand(const CLI::App& app, const Words& words, HostOptions& options) {
-    const CLI::App* chosen = app.get_subcommands().front();
+    const CLI::App& chosen = chosenApp(app);
     const CommandDescription* description = chosenCommand(app);
     if (description == nullptr) {
         options.command = HostCommand::edit;
         options.edit = words.edit;
-        options.edit.command = editCommandNamed(chosen->get_name()).value_or(EditCommand::tags);
+        options.edit.command = editCommandNamed(chosen.get_name()).value_or(EditCommand::tags);
         return;
     }
     options.command = description->command;
-    const char* argument = description->argument == Argument::path ? "PATH" : "ITEM";
-    const bool hasItem = description->argument != Argument::none && chosen->get_option_no_throw(argument)->count() > 0;
+    const bool hasItem = description->argument != Argument::none &&
+                         chosen.get_option_no_throw(nameOf(description->argument))->count() > 0;
     if (hasItem) options.item = words.item;
 }
 
@@ -165,6 +214,7 @@ HostOptions optionsOf(const CLI::App& app, const Words& words, const HostEnviron
     options.json = words.json;
     options.intoPackages = words.intoPackages;
     options.since = words.since;
+    options.outputFile = words.outputFile == "-" ? "-" : absolutePath(words.outputFile, environment);
     return options;
 }
 
@@ -176,7 +226,7 @@ std::string helpText(const CLI::App& app) {
     const auto chosen = app.get_subcommands();
     if (chosen.empty()) return app.help();
     // The options stand with the program, before or after any command.
-    return chosen.front()->help(app.get_name()) + "\nOptions of every command: cindral --help\n";
+    return chosenApp(app).help(app.get_name()) + "\nOptions of every command: cindral --help\n";
 }
 
 /// What is wrong where no command was found. The library says that one is missing also of a word that is none.
@@ -216,8 +266,11 @@ std::variant<HostOptions, HostReply> parseHostOptions(std::span<const std::strin
     addEditCommands(app, parsed.edit);
     app.set_version_flag("--version", fmt::format("cindral {}", hostVersion()), "Print the version and exit.");
     app.set_help_flag("-h,--help", "Say what can be said and exit.");
-    for (CLI::App* command : app.get_subcommands({}))
+    for (CLI::App* command : app.get_subcommands({})) {
         command->set_help_flag("-h,--help", "Say what can be said and exit.");
+        for (CLI::App* inner : command->get_subcommands({}))
+            inner->set_help_flag("-h,--help", "Say what can be said and exit.");
+    }
     app.require_subcommand(1);
     app.footer("Exit status: 0 done; 1 the operation failed; 2 the call's words are off.");
 

@@ -11,7 +11,23 @@
 
 namespace cindral {
 
-enum class HostCommand { ls, tree, info, url, id, anchor, changes, watch, status, rpc, edit };
+enum class HostCommand {
+    ls,
+    tree,
+    info,
+    url,
+    id,
+    anchor,
+    changes,
+    watch,
+    status,
+    rpc,
+    edit,
+    thumbnail,
+    apps,
+    appsEnable,
+    appsDisable
+};
 enum class RecorderChoice { automatic, inotify, fanotify };
 /// "auto", "inotify", "fanotify".
 std::string_view recorderChoiceName(RecorderChoice choice);
@@ -21,7 +37,7 @@ std::string_view recorderChoiceName(RecorderChoice choice);
 /// Thread safety: a value.
 struct HostOptions {
     HostCommand command = HostCommand::tree;
-    std::optional<std::string> item;        ///< identifier or path, as written
+    std::optional<std::string> item;        ///< identifier or path, as written; of an application: its identifier
     std::string storage;                    ///< absolute, as written or the default; empty when nothing says where
     std::string state;                      ///< the same
     std::vector<std::string> applications;  ///< absolute
@@ -31,6 +47,7 @@ struct HostOptions {
     bool intoPackages = false;  ///< tree
     EditOptions edit;           ///< edit
     std::string since;          ///< changes: an anchor, as printed
+    std::string outputFile;     ///< thumbnail: absolute, or "-"
 };
 
 /// Where applications are looked for: the environment's sources, and what the options say of them.

@@ -85,7 +85,11 @@ bool records(HostCommand command) {
         case HostCommand::info:
         case HostCommand::url:
         case HostCommand::id:
-        case HostCommand::edit: return false;
+        case HostCommand::edit:
+        case HostCommand::thumbnail:
+        case HostCommand::apps:
+        case HostCommand::appsEnable:
+        case HostCommand::appsDisable: return false;
     }
     return false;
 }

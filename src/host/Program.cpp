@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 #include <unistd.h>
 
+#include "host/AppsCommands.h"
 #include "host/Commands.h"
 #include "host/Descriptor.h"
 #include "host/HostError.h"
@@ -41,6 +42,18 @@ int runRpc(const HostProcess& host) {
     return kExitDone;
 }
 
+bool isAppsCommand(HostCommand command) {
+    return command == HostCommand::apps || command == HostCommand::appsEnable || command == HostCommand::appsDisable;
+}
+
+/// Without a host of its own: there may be one that runs.
+int runApps(const HostOptions& options, const HostEnvironment& environment) {
+    TextOutput output(STDOUT_FILENO, ::isatty(STDOUT_FILENO) == 1);
+    const auto done = runAppsCommand(options, environment, output);
+    if (const auto error = output.finish()) return outputFailure(*error);
+    return done.ok() ? kExitDone : failWith(done.error());
+}
+
 int runCommand(const HostProcess& host, const HostEnvironment& environment) {
     TextOutput output(STDOUT_FILENO, ::isatty(STDOUT_FILENO) == 1);
     ProviderClient client(host.provider());
@@ -73,6 +86,7 @@ int runProgram(std::span<const std::string> words, const HostEnvironment& enviro
     // A person who looks at a listing has no use for the news of the machinery, unless they ask for it.
     if (!isRpc && !environment.hasLogLevel) log::setLevel(LogLevel::error);
 
+    if (isAppsCommand(options.command)) return runApps(options, environment);
     const auto host = HostProcess::start(std::move(options), environment, makeProvider);
     if (!host.ok()) return failWith(host.error());
     return isRpc ? runRpc(**host) : runCommand(**host, environment);

@@ -1,5 +1,7 @@
 #include "provider/LocalTesselKit.h"
 
+#include <fmt/ranges.h>
+
 #include <atomic>
 #include <chrono>
 #include <cstdio>
@@ -21,6 +23,7 @@
 #include "provider/LocalFileEnumerator.h"
 #include "provider/LocalRootEnumerator.h"
 #include "provider/LocalTesselKitError.h"
+#include "provider/LocalThumbnails.h"
 #include "provider/Utilities.h"
 
 namespace cindral {
@@ -228,6 +231,20 @@ void LocalTesselKit::defaultApplicationContainerForBundleIdentifier(const std::s
         return completion(tsInvalidParameterError("bundleIdentifier", bundleIdentifier));
     }
     completion(std::move(item));
+}
+
+void LocalTesselKit::fetchThumbnailsForItemIdentifiersWithType(const std::vector<TesselItemIdentifier>& identifiers,
+                                                               unsigned /*requestedSize*/,
+                                                               TypedThumbnailCompletion perThumbnail,
+                                                               Completion completion) {
+    const LogSection section("fetching thumbnails for [{}]", fmt::join(identifiers, ", "));
+    for (const TesselItemIdentifier& identifier : identifiers) {
+        std::optional<Bytes> thumbnail = thumbnailForItemIdentifier(identifier);
+        const std::optional<std::string> type =
+            thumbnail ? std::optional(std::string(kPngTypeIdentifier)) : std::nullopt;
+        perThumbnail(identifier, std::move(thumbnail), type);
+    }
+    completion(std::nullopt);
 }
 
 std::shared_ptr<TesselExtension> makeCindralProvider() {

@@ -74,6 +74,11 @@ public:
     void defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier,
                                                         ItemCompletion completion) override;
 
+    /// App libraries have their application's icon, everything else has none. On the caller's thread.
+    void fetchThumbnailsForItemIdentifiersWithType(const std::vector<TesselItemIdentifier>& identifiers,
+                                                   unsigned requestedSize, TypedThumbnailCompletion perThumbnail,
+                                                   Completion completion) override;
+
     SerialQueue& appRefreshQueue() { return appRefreshQueue_; }
     TSPacer& appRefreshPacer() { return appRefreshPacer_; }
 

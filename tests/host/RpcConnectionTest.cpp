@@ -322,8 +322,25 @@ TEST_F(RpcConnectionTest, saysWhatTheProviderDoesNotOffer) {
     EXPECT_EQ(refused["data"], (Json{{"domain", "KsPOSIXErrorDomain"}, {"code", ENOTSUP}}));
 }
 
+TEST_F(RpcConnectionTest, answersThumbnailsInTheOrderOfTheIdentifiers) {
+    const auto none = [](const char* identifier) { return Json{{"identifier", identifier}, {"png", nullptr}}; };
+    EXPECT_EQ(result("fetchThumbnails", {{"identifiers", {"did=2", "#a", "did=1"}}, {"size", 64}}),
+              (Json{{"thumbnails", {none("did=2"), none("#a"), none("did=1")}}}));
+    EXPECT_EQ(result("fetchThumbnails", {{"identifiers", Json::array()}, {"size", 1}}),
+              (Json{{"thumbnails", Json::array()}}));
+}
+
+TEST_F(RpcConnectionTest, refusesThumbnailsOfNoSizeAndOfNothing) {
+    for (const Json& params :
+         {Json{{"identifiers", {"a"}}}, Json{{"size", 1}}, Json{{"identifiers", "a"}, {"size", 1}},
+          Json{{"identifiers", {7}}, {"size", 1}}, Json{{"identifiers", {"a"}}, {"size", 0}},
+          Json{{"identifiers", {"a"}}, {"size", -1}}, Json{{"identifiers", {"a"}}, {"size", "1"}}}) {
+        EXPECT_EQ(error("fetchThumbnails", params)["code"], -32602) << params;
+    }
+}
+
 TEST_F(RpcConnectionTest, refusesMethodsThatAreNotThere) {
-    for (const char* method : {"fetchThumbnails", "Cancel", "", "itemforidentifier"}) {
+    for (const char* method : {"fetchThumbnail", "Cancel", "", "itemforidentifier"}) {
         EXPECT_EQ(error(method, Json::object())["code"], -32601) << method;
     }
 }

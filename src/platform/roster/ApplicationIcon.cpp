@@ -65,7 +65,9 @@ std::optional<Bytes> readIcon(int folder, const std::string& path, Links links) 
 }
 
 std::optional<Bytes> readNamed(int folder, const std::string& place, const std::string& name, Links links) {
-    if (hasKnownSuffix(name)) return readIcon(folder, place + "/" + name, links);
+    if (hasKnownSuffix(name)) {
+        if (auto bytes = readIcon(folder, place + "/" + name, links)) return bytes;
+    }
     for (const std::string_view suffix : kSuffixes) {
         if (auto bytes = readIcon(folder, (place + "/" + name).append(suffix), links)) return bytes;
     }

@@ -5,6 +5,8 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <utility>
+#include <vector>
 
 #include "platform/foundation/KsURL.h"
 #include "platform/foundation/Result.h"
@@ -78,6 +80,31 @@ public:
     /// The default save location of an application.
     virtual void defaultApplicationContainerForBundleIdentifier(const std::string& bundleIdentifier,
                                                                 ItemCompletion completion) = 0;
+
+    /// A thumbnail, or none; the second also with its type.
+    using ThumbnailCompletion = std::function<void(const TesselItemIdentifier&, std::optional<Bytes>)>;
+    using TypedThumbnailCompletion =
+        std::function<void(const TesselItemIdentifier&, std::optional<Bytes>, std::optional<std::string>)>;
+    /// Calls back once for each identifier, in their order, then the completion, always without an error: a provider
+    /// that draws no thumbnail leaves it to the host. The size is in pixels, and a wish.
+    virtual void fetchThumbnailsForItemIdentifiers(const std::vector<TesselItemIdentifier>& identifiers,
+                                                   unsigned requestedSize, ThumbnailCompletion perThumbnail,
+                                                   Completion completion) {
+        fetchThumbnailsForItemIdentifiersWithType(
+            identifiers, requestedSize,
+            [perThumbnail = std::move(perThumbnail)](const TesselItemIdentifier& identifier, std::optional<Bytes> data,
+                                                     const std::optional<std::string>& /*type*/) {
+                perThumbnail(identifier, std::move(data));
+            },
+            std::move(completion));
+    }
+    virtual void fetchThumbnailsForItemIdentifiersWithType(const std::vector<TesselItemIdentifier>& identifiers,
+                                                           unsigned /*requestedSize*/,
+                                                           TypedThumbnailCompletion perThumbnail,
+                                                           Completion completion) {
+        for (const TesselItemIdentifier& identifier : identifiers) perThumbnail(identifier, std::nullopt, std::nullopt);
+        completion(std::nullopt);
+    }
 };
 
 /// Makes a provider. Each provider library exports one function of this type.

@@ -1,0 +1,1 @@
+cindral_fuzz_target(IconImageFuzz DEPENDS cindral_imaging)

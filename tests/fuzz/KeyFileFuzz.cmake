@@ -1,0 +1,1 @@
+cindral_fuzz_target(KeyFileFuzz DEPENDS cindral_roster)

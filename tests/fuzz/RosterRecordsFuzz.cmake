@@ -1,0 +1,1 @@
+cindral_fuzz_target(RosterRecordsFuzz DEPENDS cindral_roster cindral_eventstream)
