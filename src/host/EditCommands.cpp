@@ -5,13 +5,13 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <chrono>
 #include <utility>
 
 #include "host/Descriptor.h"
 #include "host/HostError.h"
 #include "host/ItemWriter.h"
 #include "host/JsonText.h"
+#include "host/ProgressPace.h"
 #include "host/TerminalText.h"
 #include "platform/foundation/Dispatch.h"
 #include "platform/foundation/RootDirectories.h"
@@ -22,7 +22,6 @@ namespace cindral {
 namespace {
 
 constexpr std::string_view kFolderType = "inode/directory";
-constexpr std::chrono::milliseconds kShowIntervalMin{100};
 
 NameKind nameKindOf(const TesselItem& item) {
     return item.typeIdentifier() == kFolderType ? NameKind::folder : NameKind::document;
@@ -199,12 +198,9 @@ Result<void> EditCommands::print(const std::string& subject, const ItemResult& r
 
 void EditCommands::follow(const std::shared_ptr<TesselProgress>& progress, const std::string& subject) const {
     if (progress == nullptr || terminal_.show == nullptr) return;
-    using Clock = std::chrono::steady_clock;
     progress->setObserver([&show = terminal_.show, subject = terminalText(subject),
-                           last = std::make_shared<Clock::time_point>(Clock::now())](const auto& counts) {
-        if (Clock::now() - *last < kShowIntervalMin) return;
-        *last = Clock::now();
-        show(fmt::format("{}  {}", progressText(counts), subject));
+                           pace = std::make_shared<ProgressPace>()](const auto& counts) {
+        if (pace->isTimeToTell(counts)) show(fmt::format("{}  {}", progressText(counts), subject));
     });
 }
 

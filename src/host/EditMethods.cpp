@@ -1,11 +1,15 @@
 #include "host/EditMethods.h"
 
+#include <functional>
+#include <memory>
 #include <optional>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
 #include "host/ProgressNotifier.h"
 #include "host/RequestParams.h"
+#include "platform/foundation/Mutex.h"
 #include "platform/tessel/TesselTags.h"
 
 namespace cindral {
@@ -26,14 +30,55 @@ TesselExtension::Completion completion(const HostMethodsContext& context, const 
     };
 }
 
+/// Keeps the answer of an operation that is quicker than whoever is to follow it, so that much work is always told of.
+class HeldAnswer {
+public:
+    void give(std::function<void()> answer) {
+        {
+            const MutexLock lock(mutex_);
+            if (!isFollowed_) {
+                held_ = std::move(answer);
+                return;
+            }
+        }
+        answer();
+    }
+    void letGo() {
+        std::function<void()> held;
+        {
+            const MutexLock lock(mutex_);
+            isFollowed_ = true;
+            held.swap(held_);
+        }
+        if (held) held();
+    }
+
+private:
+    Mutex mutex_;
+    bool isFollowed_ GUARDED_BY(mutex_) = false;
+    std::function<void()> held_ GUARDED_BY(mutex_);
+};
+
+/// Starts an operation, `start`, with a completion that answers by `answer`, and follows its progress.
+template <typename Value, typename Start>
+void follow(const Reply& reply, std::function<void(Value)> answer, const Start& start) {
+    const auto held = std::make_shared<HeldAnswer>();
+    const auto progress = start([held, answer = std::move(answer)](const std::decay_t<Value>& value) {
+        held->give([answer, value] { answer(value); });
+    });
+    ProgressNotifier::follow(progress, reply);
+    held->letGo();
+}
+
 void importDocument(const HostMethodsContext& context, const Json& params, const Reply& reply) {
     const RequestParams given(params, *reply);
     const auto url = given.urlOrPath();
     const auto parent = url ? given.string("parent") : std::nullopt;
     if (!parent) return;
-    const auto progress = context.client.provider().importDocumentAtURL(context.paths.presentedURL(*url), *parent,
-                                                                        itemCompletion(context, reply));
-    ProgressNotifier::follow(progress, reply);
+    follow(reply, itemCompletion(context, reply), [&](TesselExtension::ItemCompletion completion) {
+        return context.client.provider().importDocumentAtURL(context.paths.presentedURL(*url), *parent,
+                                                             std::move(completion));
+    });
 }
 
 void createDirectory(const HostMethodsContext& context, const Json& params, const Reply& reply) {
@@ -58,16 +103,17 @@ void reparentItem(const HostMethodsContext& context, const Json& params, const R
     const auto parent = identifier ? given.string("parent") : std::nullopt;
     std::optional<std::string> name;
     if (!parent || !given.optionalString("name", name)) return;
-    const auto progress = context.client.provider().reparentItemWithIdentifier(*identifier, *parent, name,
-                                                                               itemCompletion(context, reply));
-    ProgressNotifier::follow(progress, reply);
+    follow(reply, itemCompletion(context, reply), [&](TesselExtension::ItemCompletion completion) {
+        return context.client.provider().reparentItemWithIdentifier(*identifier, *parent, name, std::move(completion));
+    });
 }
 
 void deleteItem(const HostMethodsContext& context, const Json& params, const Reply& reply) {
     const auto identifier = RequestParams(params, *reply).string("identifier");
     if (!identifier) return;
-    const auto progress = context.client.provider().deleteItemWithIdentifier(*identifier, completion(context, reply));
-    ProgressNotifier::follow(progress, reply);
+    follow(reply, completion(context, reply), [&](TesselExtension::Completion completion) {
+        return context.client.provider().deleteItemWithIdentifier(*identifier, std::move(completion));
+    });
 }
 
 void trashItem(const HostMethodsContext& context, const Json& params, const Reply& reply) {

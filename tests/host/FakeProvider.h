@@ -111,6 +111,8 @@ public:
     std::vector<std::string> askedAnchors;  ///< of enumerations of changes
     /// Pages are answered on a queue of the enumerator's, after the call has returned.
     bool isAsynchronous = false;
+    /// Deletions count so many items, and answer before the call returns.
+    std::uint64_t itemsDeletedAtOnce = 0;
     /// Observers are dropped without an end.
     bool dropsObservers = false;
 
@@ -139,6 +141,14 @@ public:
     Result<std::shared_ptr<TesselEnumerator>> enumeratorForContainerItemIdentifier(
         const TesselItemIdentifier& container) override;
 
+    std::shared_ptr<TesselProgress> deleteItemWithIdentifier(const TesselItemIdentifier& /*identifier*/,
+                                                             Completion completion) override {
+        auto progress = std::make_shared<TesselProgress>();
+        progress->setTotal(0, itemsDeletedAtOnce);
+        progress->advance(0, itemsDeletedAtOnce);
+        completion(std::nullopt);
+        return progress;
+    }
     void providePlaceholderAtURL(const KsURL& /*url*/, Completion completion) override { completion(std::nullopt); }
     void startProvidingItemAtURL(const KsURL& /*url*/, Completion completion) override { completion(std::nullopt); }
     void stopProvidingItemAtURL(const KsURL& /*url*/) override {}

@@ -114,6 +114,18 @@ protected:
     Result<void> served_;
 };
 
+// However quick it was: nobody could have followed it before the call returned.
+TEST_F(RpcConnectionTest, tellsOfMuchWorkBeforeItsAnswer) {
+    fake_->itemsDeletedAtOnce = 1000;
+    const std::string said =
+        exchange(R"({"jsonrpc":"2.0","id":1,"method":"deleteItem","params":{"identifier":"did=3"}})"
+                 "\n");
+    const std::size_t end = said.find('\n');
+    ASSERT_NE(end, std::string::npos);
+    EXPECT_EQ(Json::parse(said.substr(0, end))["params"]["completedItems"], 1000);
+    EXPECT_EQ(Json::parse(said.substr(end + 1))["result"], Json::object());
+}
+
 TEST_F(RpcConnectionTest, findsAnItem) {
     const Json item = result("itemForIdentifier", {{"identifier", "did=3"}});
     EXPECT_EQ(item["filename"], "a b.txt");

@@ -183,8 +183,7 @@ class EditCommandsTest(SystemTest):
     def test_a_person_sees_how_far_it_is(self):
         file = os.path.join(self.outside, "big")
         with open(file, "wb") as big:
-            for _ in range(512):
-                big.write(os.urandom(1 << 20))
+            big.write(os.urandom(2 << 20))
         status, said = self.on_terminal("import", file)
         self.assertEqual(status, 0)
         self.assertIn("%  ", said)
