@@ -120,8 +120,11 @@ TEST_F(LocalTesselKitOperations, deletesFilesFoldersAndPackages) {
         EXPECT_FALSE(exists(name));
     }
     storage_.file("a");
-    EXPECT_EQ(errorOf(remove(identifier("a"))), "");
+    const TesselItemIdentifier document = identifier("a");
+    const LogCapture log;
+    EXPECT_EQ(errorOf(remove(document)), "");
     EXPECT_FALSE(exists("a"));
+    EXPECT_TRUE(log.containsPart(LogLevel::debug, "delete item \"" + document + "\""));
 }
 
 TEST_F(LocalTesselKitOperations, anUnknownItemIsSaidToBeSoInTwoWays) {

@@ -5,6 +5,7 @@
 
 #include "platform/foundation/KeyedArchive.h"
 #include "platform/foundation/RootDirectories.h"
+#include "platform/foundation/SysFaults.h"
 #include "platform/roster/Roster.h"
 #include "platform/tessel/TesselManager.h"
 #include "provider/EditsFixture.h"
@@ -48,6 +49,10 @@ TEST_F(LocalTesselKitTrash, movesIntoTheTrashWithDateAndFormerPlace) {
     EXPECT_GE(trashDate(".Trash/ada.txt")->seconds, before.seconds);
     EXPECT_EQ(putBack(".Trash/ada.txt"), "Letters/2026/ada.txt");
     EXPECT_TRUE(log.contains(LogLevel::debug, "[DEBUG] trash is located at \"" + url(".Trash").description() + "\""));
+    EXPECT_TRUE(log.containsPart(LogLevel::debug, "trash item \"" + document + "\""));
+    EXPECT_TRUE(log.contains(LogLevel::debug, "[DEBUG] setting trash date on " + url(".Trash/ada.txt").description()));
+    EXPECT_TRUE(
+        log.contains(LogLevel::debug, "[DEBUG] setting putback string on " + url(".Trash/ada.txt").description()));
     EXPECT_TRUE(log.contains(
         LogLevel::debug, "[DEBUG] setting putback 'Letters/2026/ada.txt' on " + url(".Trash/ada.txt").description()));
 }
@@ -91,6 +96,42 @@ TEST_F(LocalTesselKitTrash, belongsToTheFirstDocumentsFolder) {
     EXPECT_TRUE(exists(".Trash/a"));
     EXPECT_FALSE(exists("more/Documents/.Trash"));
     EXPECT_EQ(putBack(".Trash/a"), "more/Documents/a");
+}
+
+// What vanishes between its identifier and its item has neither.
+TEST_F(LocalTesselKitTrash, anItemThatCannotBeMadeIsAnInvalidIdentifier) {
+    storage_.file(".Trash/a");
+    const TesselItemIdentifier trashed = identifier(".Trash/a");
+    const std::string line = "[ERROR] can't create item for URL \"" + url(".Trash/a").description() + "\"";
+    bool isSeen = false;
+    bool isReached = true;
+    for (int n = 1; isReached; ++n) {
+        isReached = false;
+        const LogCapture log;
+        const sys::FaultInjection faults([&, calls = 0](const char* /*call*/) mutable {
+            isReached |= ++calls >= n;
+            return calls >= n ? ENOENT : 0;
+        });
+        const auto answered = trash(trashed);
+        if (!log.contains(LogLevel::error, line)) continue;
+        isSeen = true;
+        EXPECT_EQ(errorOf(answered), kInvalidItemIdentifier);
+    }
+    EXPECT_TRUE(isSeen);
+}
+
+// The record of a library whose container holds the item, but not in its Documents folder.
+TEST_F(LocalTesselKitTrash, aPlaceOutsideOfTheLibrarysDocumentsIsNotRecorded) {
+    storage_.file("a");
+    const KsURL container = *KsURL::fileURL(storage_.outside().path()).deletingLastPathComponent();
+    RoApplicationWorkspace::defaultWorkspace().setOwnRecord(
+        std::make_shared<RoBundleProxy>(RoBundleProxy::Values{"com.example.Own", container, "Own"}));
+    const LogCapture log;
+    EXPECT_EQ(errorOf(trash(identifier("a"))), "");
+    EXPECT_TRUE(log.contains(LogLevel::error, "[ERROR] could't compute putback string (path: " + (storage_ / "a") +
+                                                  ", basePath: " + container.path() + "/Documents)"));
+    EXPECT_TRUE(trashDate(".Trash/a"));
+    EXPECT_EQ(putBack(".Trash/a"), std::nullopt);
 }
 
 class AnotherStorage : public EditsTest {
