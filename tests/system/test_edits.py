@@ -7,6 +7,7 @@ import tempfile
 import unittest
 
 from cindral_rpc import ROOT, Client, RpcError, SystemTest
+from installed_apps import Entries
 
 TEMPORARY = "TesselTemporaryLocalFolderItemIdentifier"
 UNKNOWN = "fid=18446744073709551615"
@@ -41,7 +42,7 @@ def tree_of(folder):
     return tree
 
 
-class EditsTest(SystemTest):
+class EditsFixture(SystemTest):
     def setUp(self):
         super().setUp()
         self.outside = tempfile.mkdtemp(prefix="cindral-outside-")
@@ -80,6 +81,8 @@ class EditsTest(SystemTest):
         self.assertEqual(error.data["item"]["identifier"], in_the_way)
         self.assertEqual(error.data["item"]["fileURL"][:8], "file:///")
 
+
+class EditsTest(EditsFixture):
     # --- What each method does --------------------------------------------------------------------------------------------
 
     def test_import_copies_a_document_and_answers_its_item(self):
@@ -543,6 +546,112 @@ class EditsTest(SystemTest):
         self.assertEqual(made, 50)
         self.assertEqual(client.finish(), 0)
         self.assertIsNone(client.next_message())
+
+
+class LibraryEditsTest(EditsFixture):
+    """Edits in the documents of an application."""
+
+    APPLICATION = "org.example.Writer"
+    LIBRARY = "#" + APPLICATION
+
+    def setUp(self):
+        super().setUp()
+        self.container = os.path.join(self.folder, "containers", self.APPLICATION)
+        self.library = os.path.join(self.container, "Documents")
+        os.makedirs(os.path.join(self.library, "Drafts"))
+        with open(self.document("Drafts", "novel"), "w", encoding="ascii") as file:
+            file.write("It was")
+        self.entries = Entries(os.path.join(self.folder, "entries"))
+        self.entries.install(self.APPLICATION, self.container)
+
+    def options(self, storage=None, state=None):
+        return [*super().options(storage, state), "--apps", self.entries.folder]
+
+    def client(self, **popen):
+        client = super().client(**popen)
+        self.assertIn(self.LIBRARY, [item["identifier"] for item in client.items(ROOT)])
+        return client
+
+    def document(self, *names):
+        return os.path.join(self.library, *names)
+
+    def test_a_library_takes_new_files_like_any_folder(self):
+        self.make_file("Letters", "a", contents=b"A")
+        client = self.client()
+        imported = client.call("importDocument", path=self.outside_file("b", b"B"), parent=self.LIBRARY)
+        made = client.call("createDirectory", name="new", parent=self.LIBRARY)
+        moved = client.call("reparentItem", identifier=client.identifier(self.path("Letters", "a")), parent=self.LIBRARY, name="c")
+        for item in (imported, made, moved):
+            self.assertEqual(item["parentIdentifier"], self.LIBRARY)
+        self.assertEqual(sorted(os.listdir(self.library)), ["Drafts", "b", "c", "new"])
+        self.assert_collision(made["identifier"], client.call, "createDirectory", name="new", parent=self.LIBRARY)
+        # Whole folders too, and back into the storage.
+        for name in ("tree/a", "tree/sub/b"):
+            self.outside_file(name, name.encode())
+        tree = client.call("importDocument", path=os.path.join(self.outside, "tree"), parent=self.LIBRARY)
+        self.assertEqual(tree_of(self.document("tree")), tree_of(os.path.join(self.outside, "tree")))
+        client.call("deleteItem", identifier=tree["identifier"])
+        back = client.call("reparentItem", identifier=moved["identifier"], parent=ROOT)
+        self.assertEqual((back["identifier"], back["parentIdentifier"]), (moved["identifier"], ROOT))
+        self.assertEqual(self.read("c"), b"A")
+        self.assertEqual(sorted(os.listdir(self.library)), ["Drafts", "b", "new"])
+
+    def test_a_library_stays_where_it_is(self):
+        client = self.client()
+        letters = client.identifier(self.path("Letters"))
+        before = tree_of(self.container)
+        for method, params in [("reparentItem", {"parent": letters}), ("renameItem", {"name": "new"}), ("trashItem", {}), ("deleteItem", {})]:
+            with self.subTest(method=method):
+                self.assert_error(GENERAL, 513, client.call, method, identifier=self.LIBRARY, **params)
+        # The trash was made for what then could not be put there.
+        if os.path.isdir(self.document(".Trash")):
+            os.rmdir(self.document(".Trash"))
+        self.assertEqual(tree_of(self.container), before)
+
+    def test_the_date_of_a_library_is_not_kept(self):
+        client = self.client()
+        before = os.listxattr(self.library)
+        for date in ("2026-11-20T09:52:00Z", None):
+            item = client.call("setLastUsedDate", identifier=self.LIBRARY, date=date)
+            self.assertEqual(item["identifier"], self.LIBRARY)
+            self.assertNotIn("lastUsedDate", item)
+        self.assertEqual(os.listxattr(self.library), before)
+
+    def test_a_library_has_a_trash_of_its_own(self):
+        client = self.client()
+        novel = client.identifier(self.document("Drafts", "novel"))
+        trashed = client.call("trashItem", identifier=novel)
+        self.assertTrue(trashed["isTrashed"])
+        self.assertIn(b"Drafts/novel", os.getxattr(self.document(".Trash", "novel"), PUT_BACK))
+        self.assertFalse(os.path.exists(self.path(".Trash")))
+        client.call("untrashItem", identifier=novel)
+        self.assertTrue(os.path.exists(self.document("Drafts", "novel")))
+        # Without the folder that it was in, it goes to the library, not to the storage.
+        client.call("trashItem", identifier=novel)
+        os.rmdir(self.document("Drafts"))
+        self.assertEqual(client.call("untrashItem", identifier=novel)["parentIdentifier"], self.LIBRARY)
+        client.call("trashItem", identifier=novel)
+        self.assertEqual(client.call("removeTrashedItemsOlderThan", date="2999-01-01T00:00:00Z"), {})
+        self.assertEqual(os.listdir(self.document(".Trash")), [])
+
+    def test_an_application_leads_no_edit_outside(self):
+        victim = os.path.dirname(self.outside_file("victim/a", b"untouched"))
+        os.symlink(victim, self.document("way"))
+        os.symlink(victim, self.document(".Trash"))
+        os.symlink(victim, self.document(".TemporaryLocalFolder"))
+        self.make_file("b")
+        client = self.client()
+        way, novel = client.identifier(self.document("way")), client.identifier(self.document("Drafts", "novel"))
+        document = client.identifier(self.path("b"))
+        before = tree_of(self.outside)
+        for method, params in [("createDirectory", {"name": "new", "parent": way}), ("importDocument", {"path": self.path("b"), "parent": way}),
+                               ("reparentItem", {"identifier": document, "parent": way}), ("trashItem", {"identifier": novel}),
+                               ("removeTrashedItemsOlderThan", {"date": "2999-01-01T00:00:00Z"})]:
+            with self.subTest(method=method), self.assertRaises(RpcError):
+                client.call(method, **params)
+        client.call("deleteItem", identifier=client.identifier(self.document("Drafts")))
+        client.call("deleteItem", identifier=way)
+        self.assertEqual(tree_of(self.outside), before)
 
 
 if __name__ == "__main__":
