@@ -231,8 +231,11 @@ def measure(options, files, recorder):
         latencies = []
         host.call("startMonitoring", container=WORKING_SET)
         for i in range(5):
-            anchor, _, _ = host.changes(anchor)
-            host.signals.clear()
+            # Who was signalled is not signalled again before it has asked.
+            host.signals.append({"params": {"container": WORKING_SET}})
+            while any(message.get("params", {}).get("container") == WORKING_SET for message in host.signals):
+                host.signals.clear()
+                anchor, _, _ = host.changes(anchor)
             begin = time.perf_counter()
             touch(storage, files, 1)
             while not any(message.get("params", {}).get("container") == WORKING_SET for message in host.signals):
