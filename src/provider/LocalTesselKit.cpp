@@ -42,6 +42,11 @@ NotificationCenter& requiredDistributedCenter() {
     return *center;
 }
 
+/// What an earlier process left half done goes before anybody looks.
+void removeAbandoned() {
+    for (const auto& root : RootDirectories::shared().all()) StagingFolder::removeAbandoned(*root);
+}
+
 }  // namespace
 
 class LocalTesselKit::InstalledAppsProxy {
@@ -63,8 +68,13 @@ private:
 class LocalTesselKit::FirstRefresh {
 public:
     FirstRefresh() { group_.enter(); }
+    /// One at a time.
     void end() {
-        if (!isOver_.exchange(true)) group_.leave();
+        if (isOver_) return;
+        // As at the start, in the folders that are known only now.
+        removeAbandoned();
+        isOver_ = true;
+        group_.leave();
     }
     void wait() {
         if (!isOver_) group_.wait();
@@ -86,8 +96,7 @@ LocalTesselKit::LocalTesselKit()
 }
 
 std::shared_ptr<LocalTesselKit> LocalTesselKit::init() {
-    // What an earlier process left half done goes before anybody looks.
-    for (const auto& root : RootDirectories::shared().all()) StagingFolder::removeAbandoned(*root);
+    removeAbandoned();
     std::shared_ptr<LocalTesselKit> provider(new LocalTesselKit);
     NotificationCenter& center = requiredDistributedCenter();
     const InstalledAppsProxy* proxy = provider->installedAppsProxy_.get();

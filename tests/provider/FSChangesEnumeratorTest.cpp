@@ -71,6 +71,8 @@ TEST_F(FSChangesEnumeratorDeathTest, needsAURL) {
 }
 
 TEST_F(FSChangesEnumeratorDeathTest, needsTheFirstReadersBookmark) {
+    // The reader's queue needs the pool's threads, which a copy of this process by fork would be without.
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
     const auto observer = std::make_shared<RecordingChangeObserver>();
     const auto enumerator = FSChangesEnumerator::create("fid=1", {storageURL()}, observer, tokenAt(since_), since_);
     const auto reader = FSEventReader::create({storageURL()}, FSEventReaderMode::docIDBased, true, since_);

@@ -2,6 +2,7 @@
 
 #include <filesystem>
 
+#include "provider/AppLibraryFixture.h"
 #include "provider/EditsFixture.h"
 
 namespace cindral::test {
@@ -161,6 +162,16 @@ TEST_F(LocalTesselKitOperations, whatIsLeftHalfDoneIsClearedAtTheNextStart) {
     provider_ = LocalTesselKit::init();
     EXPECT_FALSE(exists(".TemporaryLocalFolder/.staging-1-1"));
     EXPECT_TRUE(exists(".TemporaryLocalFolder/mine"));
+}
+
+class LibrariesAtStart : public AppLibraryTest {};
+
+TEST_F(LibrariesAtStart, whatIsLeftHalfDoneInThemIsClearedToo) {
+    install("org.example.Writer");
+    apps_.folder("data/org.example.Writer/Documents/.TemporaryLocalFolder/.staging-1-1/item");
+    const auto provider = LocalTesselKit::init();
+    provider->waitUntilReady();
+    EXPECT_TRUE(std::filesystem::is_empty(documents("org.example.Writer") + "/.TemporaryLocalFolder"));
 }
 
 TEST_F(LocalTesselKitOperations, aProviderMayGoWhileItsEditsAreUnderWay) {
