@@ -1,0 +1,2 @@
+add_executable(edits_bench EditsBench.cpp)
+target_link_libraries(edits_bench PRIVATE cindral_tessel)
