@@ -408,11 +408,12 @@ Result<void> remove(const KsURL& url, TesselProgress& progress, std::optional<st
     } else if (!place.status.isDirectory()) {
         removed = removeByStaging(place, nullptr);
     } else {
-        removed = checkTreeIsRemovable(folder, name, url.path(), progress);
-        // An empty folder goes at once, whatever its own mode.
+        removed = progress.check();
+        // An empty folder goes at once, whatever its own mode; of any other, this tells first what the file system refuses.
         if (removed.ok()) removed = sys::unlinkat(folder, name, AT_REMOVEDIR);
         if (!removed.ok() && (removed.error().isPosix(ENOTEMPTY) || removed.error().isPosix(EEXIST))) {
-            removed = progress.check();
+            removed = checkTreeIsRemovable(folder, name, url.path(), progress);
+            if (removed.ok()) removed = progress.check();
             if (removed.ok()) removed = removeByStaging(place, &progress);
         }
     }

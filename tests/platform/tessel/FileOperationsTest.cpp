@@ -561,6 +561,19 @@ TEST_F(FileOperationsTest, aFolderThatCannotBeDeletedWhollyIsNotDeletedAtAll) {
     ::chmod(path("tree/sub").c_str(), 0755);
 }
 
+TEST_F(FileOperationsTest, whatTheFileSystemRefusesIsToldAsItIs) {
+    file("target/full/a");
+    folder("target/empty");
+    for (const char* name : {"target/full", "target/empty"}) {
+        // As on a file system that is read-only: it says so whatever is asked, also whether something may be written.
+        const sys::FaultInjection faults([](const char* call) {
+            const std::string_view made(call);
+            return made == "unlinkat" || made == "faccessat" || made == "mkdirat" ? EROFS : 0;
+        });
+        EXPECT_EQ(errorOf(remove(url(name), progress_)), posix(EROFS)) << name;
+    }
+}
+
 TEST_F(FileOperationsTest, aFolderOfSomebodyElseIsNotDeleted) {
     makeTree(path("tree"));
     OrdinaryPerson::giveTo(folder_.path());
