@@ -11,7 +11,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -21,6 +20,7 @@
 #include <string>
 #include <vector>
 
+#include "Timing.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/tessel/FileOperations.h"
 #include "platform/tessel/TesselManager.h"
@@ -29,7 +29,6 @@ namespace cindral::bench {
 namespace {
 
 namespace fs = std::filesystem;
-using Clock = std::chrono::steady_clock;
 constexpr int kRounds = 5;
 
 struct Sizes {
@@ -45,16 +44,10 @@ struct Sizes {
     std::exit(1);
 }
 
-double seconds(const std::function<void()>& work) {
+/// With nothing left for the disk to do before.
+double secondsFromRest(const std::function<void()>& work) {
     ::sync();
-    const auto begin = Clock::now();
-    work();
-    return std::chrono::duration<double>(Clock::now() - begin).count();
-}
-
-double median(std::vector<double> values) {
-    std::ranges::sort(values);
-    return values[values.size() / 2];
+    return seconds(work);
 }
 
 void run(std::vector<std::string> words) {
@@ -120,9 +113,9 @@ private:
         std::vector<double> ours;
         const std::string source = folder_ + "/" + name;
         for (int round = 0; round < kRounds; ++round) {
-            theirs.push_back(seconds([&] { bench::run({"cp", "-a", source, folder_ + "/copy/"}); }));
+            theirs.push_back(secondsFromRest([&] { bench::run({"cp", "-a", source, folder_ + "/copy/"}); }));
             fs::remove_all(folder_ + "/copy/" + name);
-            ours.push_back(seconds([&] { importFile(source, storage_ + "/target"); }));
+            ours.push_back(secondsFromRest([&] { importFile(source, storage_ + "/target"); }));
             fs::remove_all(storage_ + "/target/" + name);
         }
         line(what, theirs, ours, 1.2);
@@ -141,9 +134,9 @@ private:
         std::vector<double> ours;
         for (int round = 0; round < kRounds; ++round) {
             makeTree(folder_ + "/copy/tree");
-            theirs.push_back(seconds([&] { bench::run({"rm", "-rf", folder_ + "/copy/tree"}); }));
+            theirs.push_back(secondsFromRest([&] { bench::run({"rm", "-rf", folder_ + "/copy/tree"}); }));
             makeTree(storage_ + "/target/tree");
-            ours.push_back(seconds([&] {
+            ours.push_back(secondsFromRest([&] {
                 TesselProgress progress;
                 const auto removed = file_operations::remove(KsURL::fileURL(storage_ + "/target/tree"), progress);
                 if (!removed.ok()) fail(removed.error().description());

@@ -15,7 +15,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -26,6 +25,7 @@
 #include <vector>
 
 #include "Floor.h"
+#include "Timing.h"
 #include "platform/foundation/Dispatch.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/revisions/RvStorageManager.h"
@@ -37,21 +37,9 @@
 namespace cindral::bench {
 namespace {
 
-using Clock = std::chrono::steady_clock;
 constexpr int kRounds = 5;
 constexpr long kSampleEntries = 50'000;
 constexpr int kFirstsMax = 10;  // Each needs a state of its own.
-
-double seconds(const std::function<void()>& work) {
-    const auto begin = Clock::now();
-    work();
-    return std::chrono::duration<double>(Clock::now() - begin).count();
-}
-
-double median(std::vector<double> values) {
-    std::ranges::sort(values);
-    return values[values.size() / 2];
-}
 
 [[noreturn]] void fail(const std::string& what) {
     fmt::print(stderr, "listing_bench: {}\n", what);

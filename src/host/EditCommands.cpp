@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <utility>
 
+#include "host/Awaited.h"
 #include "host/Descriptor.h"
 #include "host/HostError.h"
 #include "host/ItemWriter.h"
@@ -31,30 +32,6 @@ bool isCollision(const Result<std::shared_ptr<const TesselItem>>& result) {
     return !result.ok() &&
            result.error().is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::filenameCollision));
 }
-
-/// The answer of an edit, for a caller that has nothing else to do.
-template <typename Value>
-class Answer {
-public:
-    std::function<void(Value)> completion() {
-        return [state = state_](Value value) {
-            state->value = std::move(value);
-            state->given.signal();
-        };
-    }
-    Value wait() {
-        state_->given.wait();
-        return *std::move(state_->value);
-    }
-
-private:
-    // Shared, because who waits may be gone before the signal's call has returned.
-    struct State {
-        DispatchSemaphore given{0};
-        std::optional<Value> value;
-    };
-    std::shared_ptr<State> state_ = std::make_shared<State>();
-};
 
 std::string progressText(const TesselProgress::Counts& counts) {
     if (counts.totalBytes > 0) {
@@ -205,7 +182,7 @@ void EditCommands::follow(const std::shared_ptr<TesselProgress>& progress, const
 }
 
 EditCommands::ItemResult EditCommands::await(const std::string& subject, const Start& start) const {
-    Answer<ItemResult> answer;
+    Awaited<ItemResult> answer;
     const auto progress = start(answer.completion());
     follow(progress, subject);
     ItemResult result = answer.wait();
@@ -217,7 +194,7 @@ EditCommands::ItemResult EditCommands::await(const std::string& subject, const S
 std::optional<KsError> EditCommands::awaitEnd(
     const std::string& subject,
     const std::function<std::shared_ptr<TesselProgress>(TesselExtension::Completion)>& start) const {
-    Answer<std::optional<KsError>> answer;
+    Awaited<std::optional<KsError>> answer;
     const auto progress = start(answer.completion());
     follow(progress, subject);
     std::optional<KsError> error = answer.wait();

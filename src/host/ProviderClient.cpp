@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cerrno>
 
+#include "host/Awaited.h"
 #include "platform/foundation/SerialQueue.h"
 
 namespace cindral {
@@ -84,30 +85,6 @@ private:
     ProviderClient::ChangesCompletion completion_;
     const std::function<void(ProviderClient::ChangesCompletion)> retry_;
     ChangesBatch batch_;
-};
-
-/// Waits for a completion's value.
-template <typename Value>
-class Awaited {
-public:
-    std::function<void(Value)> completion() {
-        return [state = state_](Value value) {
-            state->value = std::move(value);
-            state->done.signal();
-        };
-    }
-    Value wait() {
-        state_->done.wait();
-        return *std::move(state_->value);
-    }
-
-private:
-    // Shared, because who waits may be gone before the signal's call has returned.
-    struct State {
-        DispatchSemaphore done{0};
-        std::optional<Value> value;
-    };
-    std::shared_ptr<State> state_ = std::make_shared<State>();
 };
 
 }  // namespace

@@ -5,6 +5,7 @@
 
 #include "platform/foundation/InternedString.h"
 #include "platform/foundation/Log.h"
+#include "platform/foundation/TrashName.h"
 #include "platform/revisions/RvStorageManager.h"
 #include "platform/roster/Roster.h"
 #include "provider/KsURL+CdlFileObjectIdentifier.h"
@@ -14,8 +15,6 @@
 namespace cindral::container_contents {
 
 namespace {
-
-constexpr std::string_view kTrashName = ".Trash";
 
 /// What the items of one folder have in common.
 struct FolderContext {

@@ -2,6 +2,7 @@
 
 #include "platform/foundation/Fatal.h"
 #include "platform/foundation/Log.h"
+#include "platform/foundation/TrashName.h"
 
 namespace cindral {
 
@@ -19,7 +20,7 @@ std::shared_ptr<const LocalAppLibraryItem> LocalAppLibraryItem::initWithBundlePr
     customs.bundleIdentifier = InternedString(proxy.bundleIdentifier());
     if (!item->build(std::move(customs))) return nullptr;
 
-    for (const char* hidden : {"Inbox", ".Trash"}) {
+    for (const std::string_view hidden : {std::string_view("Inbox"), kTrashName}) {
         if (item->childItemCount_.value_or(0) == 0) break;
         if (documents.appendingPathComponent(hidden).status().ok()) --*item->childItemCount_;
     }

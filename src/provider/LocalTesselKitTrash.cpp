@@ -12,6 +12,7 @@
 #include "platform/foundation/Mutex.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/foundation/SerialQueue.h"
+#include "platform/foundation/TrashName.h"
 #include "platform/roster/Roster.h"
 #include "platform/tessel/FileOperations.h"
 #include "platform/tessel/TesselErrors.h"
@@ -27,7 +28,6 @@ namespace cindral {
 namespace {
 
 constexpr std::string_view kDocumentsName = "Documents";
-constexpr std::string_view kTrashName = ".Trash";
 // Deletions of a sweep that are under way at the same time.
 constexpr std::uint64_t kSweepDeletionsMax = 8;
 

@@ -228,3 +228,35 @@ class SystemTest(unittest.TestCase):
 
 def base64_text(data):
     return base64.b64encode(data).decode()
+
+
+class OutsideTest(SystemTest):
+    """With a folder `outside` of everything that is published."""
+
+    def setUp(self):
+        super().setUp()
+        self.outside = tempfile.mkdtemp(prefix="cindral-outside-")
+        self.addCleanup(shutil.rmtree, self.outside)
+
+    def outside_file(self, name, contents=b"contents"):
+        path = os.path.join(self.outside, name)
+        os.makedirs(os.path.dirname(path), exist_ok=True)
+        with open(path, "wb") as file:
+            file.write(contents)
+        return path
+
+    def read(self, *names):
+        with open(self.path(*names), "rb") as file:
+            return file.read()
+
+
+def all_of_terminal(controller):
+    """What is written to a terminal until its other end is closed; closes this one."""
+    text = b""
+    try:
+        while data := os.read(controller, 65536):
+            text += data
+    except OSError:
+        pass  # The other end is closed.
+    os.close(controller)
+    return text

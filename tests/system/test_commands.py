@@ -6,7 +6,7 @@ import pty
 import subprocess
 import unittest
 
-from cindral_rpc import PROGRAM, ROOT, SystemTest
+from cindral_rpc import PROGRAM, ROOT, SystemTest, all_of_terminal
 
 
 class CommandsTest(SystemTest):
@@ -114,13 +114,7 @@ class CommandsTest(SystemTest):
         process = subprocess.Popen([PROGRAM, *words, *self.options()], env={**self.environment, "TERM": "xterm", **environment}, stdout=terminal,
                                    stdin=subprocess.DEVNULL, stderr=subprocess.DEVNULL)
         os.close(terminal)
-        text = b""
-        try:
-            while data := os.read(controller, 65536):
-                text += data
-        except OSError:
-            pass  # The other end is closed.
-        os.close(controller)
+        text = all_of_terminal(controller)
         self.assertEqual(process.wait(timeout=120), 0)
         return text
 

@@ -3,31 +3,16 @@
 import json
 import os
 import pty
-import shutil
 import subprocess
-import tempfile
 import unittest
 
-from cindral_rpc import PATIENCE, PROGRAM, SystemTest
+from cindral_rpc import PATIENCE, PROGRAM, OutsideTest, all_of_terminal
 
 
-class EditCommandsTest(SystemTest):
+class EditCommandsTest(OutsideTest):
     def setUp(self):
         super().setUp()
-        self.outside = tempfile.mkdtemp(prefix="cindral-outside-")
-        self.addCleanup(shutil.rmtree, self.outside)
         os.mkdir(self.path("Letters"))
-
-    def outside_file(self, name, contents=b"contents"):
-        path = os.path.join(self.outside, name)
-        os.makedirs(os.path.dirname(path), exist_ok=True)
-        with open(path, "wb") as file:
-            file.write(contents)
-        return path
-
-    def read(self, *names):
-        with open(self.path(*names), "rb") as file:
-            return file.read()
 
     def names(self, *folder):
         return sorted(name for name in os.listdir(self.path(*folder)) if not name.startswith("."))
@@ -153,13 +138,7 @@ class EditCommandsTest(SystemTest):
                                    stderr=terminal)
         os.close(terminal)
         os.write(controller, typed)
-        text = b""
-        try:
-            while data := os.read(controller, 65536):
-                text += data
-        except OSError:
-            pass  # The other end is closed.
-        os.close(controller)
+        text = all_of_terminal(controller)
         return process.wait(timeout=PATIENCE), text.decode()
 
     def test_rm_asks_a_person(self):

@@ -1,12 +1,10 @@
 """Edits over JSON-RPC: what is changed, what is answered, and what is never lost."""
 
 import os
-import shutil
 import stat
-import tempfile
 import unittest
 
-from cindral_rpc import ROOT, Client, RpcError, SystemTest
+from cindral_rpc import ROOT, Client, OutsideTest, RpcError
 from installed_apps import Entries
 
 TEMPORARY = "TesselTemporaryLocalFolderItemIdentifier"
@@ -42,11 +40,9 @@ def tree_of(folder):
     return tree
 
 
-class EditsFixture(SystemTest):
+class EditsFixture(OutsideTest):
     def setUp(self):
         super().setUp()
-        self.outside = tempfile.mkdtemp(prefix="cindral-outside-")
-        self.addCleanup(shutil.rmtree, self.outside)
         self.make_folder("Letters")
 
     def client(self, **popen):
@@ -58,17 +54,6 @@ class EditsFixture(SystemTest):
     def make_folder(self, *names):
         os.makedirs(self.path(*names), exist_ok=True)
         return self.path(*names)
-
-    def outside_file(self, name, contents=b"contents"):
-        path = os.path.join(self.outside, name)
-        os.makedirs(os.path.dirname(path), exist_ok=True)
-        with open(path, "wb") as file:
-            file.write(contents)
-        return path
-
-    def read(self, *names):
-        with open(self.path(*names), "rb") as file:
-            return file.read()
 
     def leftovers(self):
         try:

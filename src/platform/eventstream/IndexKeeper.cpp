@@ -9,6 +9,7 @@
 
 #include "platform/eventstream/IndexKeeperTypes.h"
 #include "platform/foundation/Log.h"
+#include "platform/foundation/TrashName.h"
 #include "platform/foundation/TypeDatabase.h"
 #include "platform/revisions/ObjectFinder.h"
 #include "platform/revisions/OwnAttributes.h"
@@ -30,7 +31,6 @@ constexpr std::size_t kChangesAtOnceMax = 1'000;
 constexpr int kRoundsMax = 8;
 // A folder that can't be reached so often keeps moving, or can't be opened for a reason of its own.
 constexpr int kAttemptsMax = 6;
-constexpr std::string_view kTrashName = ".Trash";
 // A newcomer waits for so many rounds: one that looks, one that gives up what did not turn up.
 constexpr int kPutOffMax = 3;
 // A number given to an object younger than this was given while it was being saved.

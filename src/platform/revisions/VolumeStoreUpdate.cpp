@@ -4,6 +4,7 @@
 #include <bit>
 #include <cerrno>
 
+#include "platform/foundation/TrashName.h"
 #include "platform/revisions/VolumeStoreReading.h"
 
 namespace cindral {
@@ -93,9 +94,6 @@ DocumentID VolumeStore::Implementation::Update::sight(const ObjectSighting& sigh
 }
 
 namespace {
-
-// Folders of this name are no items, whatever they were before.
-constexpr std::string_view kTrashName = ".Trash";
 
 /// Whether an object's identifier has another form now.
 bool changesForm(ObjectKind before, ObjectKind now) {
