@@ -255,6 +255,26 @@ class WhatChangesMean:
             for entry in os.scandir(self.storage):
                 shutil.rmtree(entry)
 
+    def test_what_left_a_folder_by_way_of_another_that_went_stays(self):
+        """The folder in between is told of no more, so clients still have all of it in the first one when that goes."""
+        self.make_file("first", "carrier", "a", "kept.txt")
+        self.start()
+        views = self.views(WORKING_SET, ALL_DIRECTORIES)
+        self.make_file("first", "carrier", "a", "below", "new.txt")
+        for view in views:
+            self.changes(view)
+        settle = self.view(ROOT)
+        os.rename(self.path("first", "carrier"), self.path("carrier"))
+        self.changes(settle)
+        shutil.rmtree(self.path("first"))
+        self.changes(settle)
+        os.rename(self.path("carrier", "a"), self.path("a"))
+        self.changes(settle)
+        shutil.rmtree(self.path("carrier"))
+        for view in views:
+            self.changes(view)
+        self.assertEqual(len(views[0].items), 4)
+
     def test_what_is_in_a_trash_stays_whatever_happens_to_the_trash(self):
         """A folder that was listed becomes one that is not, while what is in it still is."""
         self.make_file("folder", "below", "file.txt")

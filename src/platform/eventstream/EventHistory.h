@@ -23,6 +23,7 @@ enum class EventFlags : std::uint32_t {
     idsWrapped = 0x08,
     historyDone = 0x10,  ///< no path: what was to be replayed has been
     removed = 0x200,     ///< the object left the path: deleted, or moved elsewhere
+    cutOff = 0x400,      ///< with `removed`: the folder that it left is gone now, or is not where it was then
     renamed = 0x800,  ///< with `removed`: it went on as the same object, and another event tells where it is or ended
 };
 constexpr EventFlags operator|(EventFlags a, EventFlags b) {

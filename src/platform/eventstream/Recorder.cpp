@@ -500,6 +500,16 @@ Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_
     if (batch.isLast) batch.upTo = std::max(batch.upTo, current);
     batch.events.reserve(found.size());
     std::map<FileID, std::string> paths;
+    /// Where an object was when it left; empty where that was not recorded.
+    const auto placeLeft = [&](const JournalEvent& departure) -> std::string {
+        if (departure.path.empty()) return {};
+        const auto root = std::ranges::find(rootIDs, departure.root);
+        if (root != rootIDs.end()) {
+            return (*roots)[static_cast<std::size_t>(root - rootIDs.begin())]->path + "/" + departure.path;
+        }
+        const auto former = formerRoots.find(departure.root);
+        return former == formerRoots.end() ? std::string() : former->second + "/" + departure.path;
+    };
     for (const JournalEvent& journalled : found) {
         std::string folder = pathOf(*roots, rootIDs, journalled.parent, paths);
         std::string name = journalled.name;
@@ -515,24 +525,19 @@ Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_
         }
         Event event;
         if (!folder.empty()) {
-            event.path = std::move(folder) + "/" + name;
-        } else if (journalled.kind == JournalEvent::Kind::departed && !journalled.path.empty()) {
+            event.path = folder + "/" + name;
+        } else if (journalled.kind == JournalEvent::Kind::departed) {
             // Its folder is gone as well.
-            const auto root = std::ranges::find(rootIDs, journalled.root);
-            const auto former = formerRoots.find(journalled.root);
-            if (root == rootIDs.end() && former == formerRoots.end()) continue;
-            event.path = root == rootIDs.end() ? former->second
-                                               : (*roots)[static_cast<std::size_t>(root - rootIDs.begin())]->path;
-            event.path += "/" + journalled.path;
-        } else {
-            continue;
+            event.path = placeLeft(journalled);
         }
+        if (event.path.empty()) continue;
         event.id = journalled.id;
         event.fileID = journalled.fileID;
         event.documentID = journalled.documentID;
         event.kind = journalled.objectKind;
         if (journalled.kind == JournalEvent::Kind::departed) {
             event.flags = journalled.goesOn ? EventFlags::removed | EventFlags::renamed : EventFlags::removed;
+            if (folder.empty() || event.path != placeLeft(journalled)) event.flags = event.flags | EventFlags::cutOff;
         }
         batch.events.push_back(std::move(event));
     }

@@ -235,6 +235,16 @@ bool FSChangesEnumerator::leftTrash(const Event& event) {
     return container_contents::isTrashName(std::string_view(event.path).substr(event.path.rfind('/') + 1));
 }
 
+/// With all that is in a folder, where what it left went or moved itself: clients may have had it below something that was
+/// told to be gone before this event, and have taken out with that what has no newer event of its own.
+Result<void> FSChangesEnumerator::forwardMoved(const Event& event, std::shared_ptr<const TesselItem> item) {
+    std::vector<KsURL> folders;
+    const bool isCutOff = event.kind == ObjectKind::folder && (event.flags & EventFlags::cutOff);
+    if (isCutOff && container_contents::isDeep(container_)) folders.push_back(*item->fileURL());
+    forward(std::move(item));
+    return scan(folders);
+}
+
 /// Puts the identifier that the event's object was listed under to the question.
 void FSChangesEnumerator::askAbout(FSEventReader& reader, const Event& event,
                                    const std::optional<TesselItemIdentifier>& identifier) {
@@ -249,7 +259,11 @@ void FSChangesEnumerator::askAbout(FSEventReader& reader, const Event& event,
         answer->kind = Answer::Kind::notListed;
     if (!answer.ok()) return endWithError(reader, answer.error());
     switch (answer->kind) {
-        case Answer::Kind::listed: forward(std::move(answer->item)); break;
+        case Answer::Kind::listed: {
+            const Result<void> forwarded = forwardMoved(event, std::move(answer->item));
+            if (!forwarded.ok()) return endWithError(reader, forwarded.error());
+            break;
+        }
         case Answer::Kind::notListed:
             if (isEndOfFolder(event)) forward(*identifier);
             break;

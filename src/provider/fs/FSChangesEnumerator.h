@@ -79,6 +79,7 @@ private:
     // What is listed.
     static std::optional<TesselItemIdentifier> identifierOf(const Event& event);
     bool isEndOfFolder(const Event& event) const;
+    Result<void> forwardMoved(const Event& event, std::shared_ptr<const TesselItem> item);
     static bool leftTrash(const Event& event);
     static bool isToldByPath(const Event& event);
     Result<Answer> ask(FSEventReader& reader, const TesselItemIdentifier& identifier);
