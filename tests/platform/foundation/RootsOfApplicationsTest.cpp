@@ -22,6 +22,8 @@ protected:
         if (!roots_.add(storage_, RootPolicy::storage).ok()) std::abort();
         listen();
     }
+    // What the last changes set off may not be heard yet.
+    ~RootsOfApplicationsTest() override { roots_.setObserver(nullptr); }
     void listen() {
         roots_.setObserver([this](const auto& roots) { heard_.push_back(pathsOf(roots)); });
     }
