@@ -59,6 +59,7 @@ Result<void> Commands::run() {
         case HostCommand::apps:
         case HostCommand::appsEnable:
         case HostCommand::appsDisable:
+        case HostCommand::serve:
         case HostCommand::rpc: break;
     }
     return usageFailure("that is no command that prints");

@@ -66,6 +66,9 @@ constexpr CommandDescription kCommands[] = {
      Argument::none},
     {"status", "Show where the host works and what it knows.", HostCommand::status, Argument::none},
     {"rpc", "Speak JSON-RPC 2.0 on standard input and output, one message a line.", HostCommand::rpc, Argument::none},
+    {"serve",
+     "Be the daemon of the state folder: the other commands, and all who speak JSON-RPC, find it by its socket.",
+     HostCommand::serve, Argument::none},
 };
 
 /// Words after "apps".

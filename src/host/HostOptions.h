@@ -22,6 +22,7 @@ enum class HostCommand {
     watch,
     status,
     rpc,
+    serve,
     edit,
     thumbnail,
     apps,

@@ -79,7 +79,8 @@ bool records(HostCommand command) {
         case HostCommand::changes:
         case HostCommand::watch:
         case HostCommand::status:
-        case HostCommand::rpc: return true;
+        case HostCommand::rpc:
+        case HostCommand::serve: return true;
         case HostCommand::ls:
         case HostCommand::tree:
         case HostCommand::info:
@@ -118,14 +119,16 @@ HostProcess::HostProcess(HostOptions options, PresentedPaths paths, std::string 
     : options_(std::move(options)), paths_(std::move(paths)), state_(std::move(state)), store_(std::move(store)) {}
 
 Result<std::unique_ptr<HostProcess>> HostProcess::start(HostOptions options, const HostEnvironment& environment,
-                                                        TesselExtensionFactory makeProvider) {
+                                                        TesselExtensionFactory makeProvider, const Steps& steps) {
     if (options.storage.empty())
         return hostFailure("there is no home folder: say where the documents are with --storage");
     if (options.state.empty()) return hostFailure("there is no home folder: say where to keep the state with --state");
     TRY(storage_folders::checkApart(options.storage, options.state));
 
     std::string state = TRY(storage_folders::makeState(options.state));
+    if (steps.stateIsThere) TRY(steps.stateIsThere(state));
     auto store = TRY(openStore(state));
+    if (steps.stateIsOurs) TRY(steps.stateIsOurs(state));
     const std::string real = TRY(storage_folders::makeStorage(options.storage));
     auto paths = TRY(storage_folders::present(options.storage, real, state, environment));
     if (!paths.isSame()) logInfo("the storage {} is presented to the provider as {}", paths.real(), paths.presented());
@@ -205,6 +208,10 @@ HostProcess::~HostProcess() {
 void HostProcess::waitForHistory() const {
     // What went wrong was logged.
     if (recorder_) (void)recorder_->drain();
+}
+
+void HostProcess::beginStop() const {
+    if (recorder_ && !recorder_->isReady()) recorder_->stop();
 }
 
 std::string HostProcess::statusText() const {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <string>
 
@@ -20,15 +21,22 @@ namespace cindral {
 /// Thread safety: immutable once started.
 class HostProcess {
 public:
+    /// What else is to be done on the way, with the state folder's real path. An error ends the start; null does nothing.
+    struct Steps {
+        std::function<Result<void>(const std::string& state)> stateIsThere;  ///< and may be another process's
+        std::function<Result<void>(const std::string& state)> stateIsOurs;   ///< its store is locked
+    };
     /// Errors are the host's own, with a line for people.
     static Result<std::unique_ptr<HostProcess>> start(HostOptions options, const HostEnvironment& environment,
-                                                      TesselExtensionFactory makeProvider);
+                                                      TesselExtensionFactory makeProvider, const Steps& steps = {});
     ~HostProcess();
     HostProcess(const HostProcess&) = delete;
     HostProcess& operator=(const HostProcess&) = delete;
 
     const HostOptions& options() const { return options_; }
     const PresentedPaths& paths() const { return paths_; }
+    /// The state folder's real path.
+    const std::string& state() const { return state_; }
     const std::shared_ptr<TesselExtension>& provider() const { return provider_; }
 
     /// Where the provider's signals arrive.
@@ -38,6 +46,8 @@ public:
     void waitForHistory() const;
     /// What `status` answers, as JSON text.
     std::string statusText() const;
+    /// The end is near: who waits for the first reading of the roots is told that it will not come to its end.
+    void beginStop() const;
 
 private:
     HostProcess(HostOptions options, PresentedPaths paths, std::string state, std::shared_ptr<VolumeStore> store);

@@ -1,15 +1,24 @@
 #include "host/Program.h"
 
 #include <fmt/format.h>
+#include <sys/resource.h>
 #include <unistd.h>
+
+#include <optional>
+#include <vector>
 
 #include "host/AppsCommands.h"
 #include "host/Commands.h"
+#include "host/Daemon.h"
+#include "host/DaemonSocket.h"
 #include "host/Descriptor.h"
 #include "host/HostError.h"
 #include "host/HostOptions.h"
 #include "host/HostProcess.h"
 #include "host/RpcConnection.h"
+#include "host/ServiceManager.h"
+#include "host/SocketListener.h"
+#include "host/StateHandover.h"
 #include "host/StopSignals.h"
 #include "host/TerminalText.h"
 #include "host/TextOutput.h"
@@ -44,6 +53,61 @@ int runRpc(const HostProcess& host) {
 
 bool isAppsCommand(HostCommand command) {
     return command == HostCommand::apps || command == HostCommand::appsEnable || command == HostCommand::appsDisable;
+}
+
+/// Those that the service manager listens on for us, else one of our own.
+Result<std::vector<DaemonSocket>> makeSockets(const std::string& state, const HostEnvironment& environment,
+                                              ServiceManager& manager) {
+    std::vector<DaemonSocket> sockets;
+    for (UniqueFd& each : manager.takeLocalSockets())
+        sockets.push_back(TRY(DaemonSocket::adopt(std::move(each), state)));
+    if (sockets.empty()) sockets.push_back(TRY(DaemonSocket::listenFor(state, environment)));
+    return sockets;
+}
+
+/// A client takes a descriptor, and so does every event source; the usual limit is a relic of old system calls.
+void raiseDescriptorLimit() {
+    rlimit limit{};
+    if (::getrlimit(RLIMIT_NOFILE, &limit) != 0) return;
+    limit.rlim_cur = limit.rlim_max;
+    ::setrlimit(RLIMIT_NOFILE, &limit);
+}
+
+int runServe(HostOptions options, const HostEnvironment& environment, TesselExtensionFactory makeProvider) {
+    auto stopSignals = StopSignals::catchThem();
+    if (!stopSignals.ok()) return failWith(stopSignals.error());
+    raiseDescriptorLimit();
+    ServiceManager manager;
+    std::optional<StateHandover> handover;
+    std::vector<DaemonSocket> sockets;
+    const auto takeOver = [&](const std::string& state) -> Result<void> {
+        handover = TRY(StateHandover::begin(state, StateHandover::Part::daemon));
+        return {};
+    };
+    const auto listen = [&](const std::string& state) -> Result<void> {
+        auto made = makeSockets(state, environment, manager);
+        if (!made.ok()) {
+            const auto path = made.error().userInfo().find("path");
+            const std::string where =
+                path != made.error().userInfo().end() ? path->second : DaemonSocket::linkIn(state);
+            return hostFailure(fmt::format("can't listen at {}: {}", terminalText(where), made.error().reason()));
+        }
+        sockets = *std::move(made);
+        // Who connects from now on is answered, sooner or later.
+        handover.reset();
+        return {};
+    };
+    auto host = HostProcess::start(std::move(options), environment, makeProvider, {takeOver, listen});
+    if (!host.ok()) return failWith(host.error());
+
+    logInfo("serving {} at {}", (*host)->paths().real(), DaemonSocket::linkIn((*host)->state()));
+    Daemon daemon(**host, manager);
+    for (DaemonSocket& each : sockets) daemon.add(std::make_unique<SocketListener>(std::move(each)));
+    const auto served = daemon.run((*stopSignals)->descriptor(), [&] { (void)takeOver((*host)->state()); });
+    // Held until the store is closed: until then, nobody else could use it.
+    host->reset();
+    handover.reset();
+    return served.ok() ? kExitDone : failWith(hostFailure(fmt::format("can't serve: {}", served.error().reason())));
 }
 
 /// Without a host of its own: there may be one that runs.
@@ -83,10 +147,12 @@ int runProgram(std::span<const std::string> words, const HostEnvironment& enviro
     auto& options = std::get<HostOptions>(parsed);
 
     const bool isRpc = options.command == HostCommand::rpc;
+    const bool isServe = options.command == HostCommand::serve;
     // A person who looks at a listing has no use for the news of the machinery, unless they ask for it.
-    if (!isRpc && !environment.hasLogLevel) log::setLevel(LogLevel::error);
+    if (!isRpc && !isServe && !environment.hasLogLevel) log::setLevel(LogLevel::error);
 
     if (isAppsCommand(options.command)) return runApps(options, environment);
+    if (isServe) return runServe(std::move(options), environment, makeProvider);
     const auto host = HostProcess::start(std::move(options), environment, makeProvider);
     if (!host.ok()) return failWith(host.error());
     return isRpc ? runRpc(**host) : runCommand(**host, environment);

@@ -12,18 +12,25 @@
 namespace cindral {
 namespace {
 
-constexpr std::size_t kReadBytes = 256 << 10;
+constexpr std::size_t kReadBytes = 64 << 10;
 // A page of a listing fits in the pipe, so that the next one is begun while the client reads.
 constexpr std::size_t kPipeBytes = 1 << 20;
 
 class Receiver final : public LineSplitter::Receiver {
 public:
-    explicit Receiver(JsonRpcServer& server) : server_(server) {}
-    void didReadLine(std::string_view line) override { server_.receiveLine(line); }
-    void didSkipLongLine() override { server_.receiveLongLine(); }
+    Receiver(JsonRpcServer& server, LineSink& answers) : server_(server), answers_(answers) {}
+    void didReadLine(std::string_view line) override {
+        answers_.waitForRoom();
+        server_.receiveLine(line);
+    }
+    void didSkipLongLine() override {
+        answers_.waitForRoom();
+        server_.receiveLongLine();
+    }
 
 private:
     JsonRpcServer& server_;
+    LineSink& answers_;
 };
 
 /// The notification that something in a container has changed.
@@ -53,6 +60,10 @@ Result<void> serveRpc(int input, int output, const RpcService& service) {
     const UniqueFd interrupt = TRY(descriptor::makeInterrupt());
     descriptor::enlargePipe(output, kPipeBytes);
     LineOutput answers(output, interrupt);
+    return serveRpc(input, output, interrupt, answers, service);
+}
+
+Result<void> serveRpc(int input, int output, const UniqueFd& interrupt, LineSink& answers, const RpcService& service) {
     // Taken down from the last to the first: the server waits for its requests, then nothing is monitored any more, and
     // the client lets go of its enumerators.
     ProviderClient client(service.provider);
@@ -60,7 +71,7 @@ Result<void> serveRpc(int input, int output, const RpcService& service) {
                              [&](const TesselItemIdentifier& container) { answers.write(signalLine(container)); });
     JsonRpcServer server(makeHostMethods({client, monitor, service.paths, service.statusText}),
                          [&](std::string_view line) { answers.write(line); });
-    Receiver receiver(server);
+    Receiver receiver(server, answers);
     LineSplitter lines(receiver, kJsonRpcLineBytesMax);
 
     auto done = readAll(input, output, interrupt, lines);

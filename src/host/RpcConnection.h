@@ -4,9 +4,11 @@
 #include <memory>
 #include <string>
 
+#include "host/LineSink.h"
 #include "host/PresentedPaths.h"
 #include "host/SignalDispatcher.h"
 #include "platform/foundation/Result.h"
+#include "platform/foundation/UniqueFd.h"
 #include "platform/tessel/TesselExtension.h"
 
 namespace cindral {
@@ -25,5 +27,8 @@ struct RpcService {
 /// At the end of input what is under way is answered before this returns. A client that has stopped reading is no
 /// error; output that can't be written for another reason is.
 Result<void> serveRpc(int input, int output, const RpcService& service);
+/// The same with a place of its own for what the client is to read. `output` is looked at for whether anybody reads;
+/// `interrupt` ends the input.
+Result<void> serveRpc(int input, int output, const UniqueFd& interrupt, LineSink& answers, const RpcService& service);
 
 }  // namespace cindral

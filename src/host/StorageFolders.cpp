@@ -61,23 +61,6 @@ Result<std::string> makeFolder(std::string_view what, const std::string& path, m
     return real;
 }
 
-/// A folder that is the caller's and nobody else may enter, made where it is missing.
-Result<void> makePrivateFolder(const std::string& path) {
-    if (::mkdir(path.c_str(), kOwnerOnly) != 0 && errno != EEXIST) return KsError::errorWithPOSIXCode();
-    struct stat status {};
-    // Not through a link: in a folder that all may write to, somebody else may have been first.
-    if (::lstat(path.c_str(), &status) != 0) return KsError::errorWithPOSIXCode();
-    const bool isPrivate = S_ISDIR(status.st_mode) && status.st_uid == ::geteuid() && (status.st_mode & 0077) == 0;
-    return isPrivate ? Result<void>() : Result<void>(KsError::posix(EPERM));
-}
-
-/// A short name for the state folder, the same each time.
-std::uint64_t fingerprint(std::string_view text) {
-    std::uint64_t hash = 14'695'981'039'346'656'037U;  // FNV-1a.
-    for (const char c : text) hash = (hash ^ static_cast<std::uint8_t>(c)) * 1'099'511'628'211U;
-    return hash;
-}
-
 /// The folder that the link is to be in.
 Result<std::string> linkFolder(const std::string& realState, const HostEnvironment& environment) {
     if (!PresentedPaths::hasDocumentsComponent(realState)) return realState;
@@ -93,12 +76,6 @@ Result<std::string> linkFolder(const std::string& realState, const HostEnvironme
     return folder;
 }
 
-std::optional<std::string> targetOf(const std::string& link) {
-    std::error_code error;
-    const std::string target = std::filesystem::read_symlink(link, error).string();
-    return error ? std::nullopt : std::optional(target);
-}
-
 /// Points the link to the target, replacing an older link in one step.
 Result<void> pointLink(const std::string& link, const std::string& target) {
     if (targetOf(link) == target) return {};
@@ -106,15 +83,40 @@ Result<void> pointLink(const std::string& link, const std::string& target) {
     if (::lstat(link.c_str(), &status) == 0 && !S_ISLNK(status.st_mode)) {
         return hostFailure(fmt::format("{} is in the way: the link to the storage is to be there", terminalText(link)));
     }
-    const std::string temporary = link + ".new";
-    ::unlink(temporary.c_str());
-    if (::symlink(target.c_str(), temporary.c_str()) != 0 || ::rename(temporary.c_str(), link.c_str()) != 0) {
-        return failure("can't make the link", link, KsError::errorWithPOSIXCode());
-    }
+    if (auto made = replaceLink(link, target); !made.ok()) return failure("can't make the link", link, made.error());
     return {};
 }
 
 }  // namespace
+
+Result<void> makePrivateFolder(const std::string& path) {
+    if (::mkdir(path.c_str(), kOwnerOnly) != 0 && errno != EEXIST) return KsError::errorWithPOSIXCode();
+    struct stat status {};
+    // Not through a link: in a folder that all may write to, somebody else may have been first.
+    if (::lstat(path.c_str(), &status) != 0) return KsError::errorWithPOSIXCode();
+    const bool isPrivate = S_ISDIR(status.st_mode) && status.st_uid == ::geteuid() && (status.st_mode & 0077) == 0;
+    return isPrivate ? Result<void>() : Result<void>(KsError::posix(EPERM));
+}
+
+std::uint64_t fingerprint(std::string_view text) {
+    std::uint64_t hash = 14'695'981'039'346'656'037U;  // FNV-1a.
+    for (const char c : text) hash = (hash ^ static_cast<std::uint8_t>(c)) * 1'099'511'628'211U;
+    return hash;
+}
+
+std::optional<std::string> targetOf(const std::string& link) {
+    std::error_code error;
+    const std::string target = std::filesystem::read_symlink(link, error).string();
+    return error ? std::nullopt : std::optional(target);
+}
+
+Result<void> replaceLink(const std::string& link, const std::string& target) {
+    if (targetOf(link) == target) return {};
+    const std::string temporary = link + ".new";
+    ::unlink(temporary.c_str());
+    if (::symlink(target.c_str(), temporary.c_str()) == 0 && ::rename(temporary.c_str(), link.c_str()) == 0) return {};
+    return KsError::errorWithPOSIXCode();
+}
 
 Result<void> checkApart(const std::string& storage, const std::string& state) {
     if (!PresentedPaths::remainder(resolvedAsFarAsItExists(state), resolvedAsFarAsItExists(storage))) return {};

@@ -1,6 +1,9 @@
 #pragma once
 
+#include <cstdint>
+#include <optional>
 #include <string>
+#include <string_view>
 
 #include "host/HostEnvironment.h"
 #include "host/PresentedPaths.h"
@@ -28,6 +31,16 @@ Result<std::string> makeState(const std::string& path);
 /// state's lock.
 Result<PresentedPaths> present(const std::string& given, const std::string& real, const std::string& realState,
                                const HostEnvironment& environment);
+
+/// A folder that is the caller's and nobody else may enter, made where it is missing. POSIX errors; EPERM where it is
+/// somebody's else.
+Result<void> makePrivateFolder(const std::string& path);
+/// A short name for a state folder, the same each time.
+std::uint64_t fingerprint(std::string_view text);
+/// Points the link to the target, in one step, in place of whatever file was there. POSIX errors.
+Result<void> replaceLink(const std::string& link, const std::string& target);
+/// None for what is no link.
+std::optional<std::string> targetOf(const std::string& link);
 
 }  // namespace storage_folders
 

@@ -7,6 +7,8 @@ import json
 import os
 import queue
 import shutil
+import signal
+import socket
 import stat
 import subprocess
 import tempfile
@@ -32,41 +34,25 @@ class RpcError(Exception):
         self.domain_code = self.data.get("code")
 
 
-class Client:
-    """One process that speaks JSON-RPC on its standard input and output."""
+class Connection:
+    """One client's way to a host: what it sends, and what comes back."""
 
-    def __init__(self, arguments, environment, launcher=(), **popen):
-        self.process = subprocess.Popen(
-            [*launcher, PROGRAM, "rpc", *arguments], stdin=subprocess.PIPE, stdout=subprocess.PIPE, stderr=subprocess.PIPE,
-            env=environment, **popen)
+    def __init__(self):
         self._ids = itertools.count(1)
         self._answers = queue.Queue()
         self._early = {}
         self._notifications = collections.deque()
-        self._errors = []
-        self._readers = [threading.Thread(target=self._read_answers), threading.Thread(target=self._read_errors)]
-        for reader in self._readers:
-            reader.start()
 
     def __enter__(self):
         return self
 
-    def __exit__(self, *_):
-        if self.process.poll() is None:
-            self.finish()
-
-    def _read_answers(self):
-        for line in self.process.stdout:
-            self._answers.put(line)
+    def _read_answers(self, lines):
+        try:
+            for line in lines:
+                self._answers.put(line)
+        except OSError:
+            pass  # The other end is gone.
         self._answers.put(None)
-
-    def _read_errors(self):
-        for line in self.process.stderr:
-            self._errors.append(line.decode("utf-8", "backslashreplace"))
-
-    def send_bytes(self, data):
-        self.process.stdin.write(data)
-        self.process.stdin.flush()
 
     def send(self, method, **params):
         """Sends a request and answers its id."""
@@ -85,7 +71,7 @@ class Client:
         while request_id not in self._early:
             message = self.next_message()
             if message is None:
-                raise AssertionError("the process ended; it said: " + "".join(self._errors))
+                raise AssertionError(self.why_it_ended())
             self._keep(message)
         return self._early.pop(request_id)
 
@@ -104,7 +90,7 @@ class Client:
                     return message["params"]
             message = self.next_message()
             if message is None:
-                raise AssertionError("the process ended; it said: " + "".join(self._errors))
+                raise AssertionError(self.why_it_ended())
             self._keep(message)
 
     def call(self, method, **params):
@@ -134,6 +120,35 @@ class Client:
     def identifier(self, path):
         return self.call("identifierForItemAtURL", path=path)["identifier"]
 
+class Client(Connection):
+    """One process that speaks JSON-RPC on its standard input and output."""
+
+    def __init__(self, arguments, environment, launcher=(), **popen):
+        super().__init__()
+        self.process = subprocess.Popen(
+            [*launcher, PROGRAM, "rpc", *arguments], stdin=subprocess.PIPE, stdout=subprocess.PIPE, stderr=subprocess.PIPE,
+            env=environment, **popen)
+        self._errors = []
+        self._readers = [threading.Thread(target=self._read_answers, args=(self.process.stdout,)),
+                         threading.Thread(target=self._read_errors)]
+        for reader in self._readers:
+            reader.start()
+
+    def __exit__(self, *_):
+        if self.process.poll() is None:
+            self.finish()
+
+    def _read_errors(self):
+        for line in self.process.stderr:
+            self._errors.append(line.decode("utf-8", "backslashreplace"))
+
+    def send_bytes(self, data):
+        self.process.stdin.write(data)
+        self.process.stdin.flush()
+
+    def why_it_ended(self):
+        return "the process ended; it said: " + "".join(self._errors)
+
     def finish(self):
         """Ends the input, and answers the exit status."""
         try:
@@ -153,6 +168,90 @@ class Client:
 
     def error_text(self):
         return "".join(self._errors)
+
+
+class SocketClient(Connection):
+    """One connection to a daemon's socket. It reads all the time; `reads=False` makes it one that never does."""
+
+    def __init__(self, path, reads=True):
+        super().__init__()
+        self.socket = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
+        self.socket.settimeout(PATIENCE)
+        self.socket.connect(path)
+        self._reader = None
+        if reads:
+            self._file = self.socket.makefile("rb")
+            self._reader = threading.Thread(target=self._read_answers, args=(self._file,))
+            self._reader.start()
+
+    def __exit__(self, *_):
+        self.close()
+
+    def send_bytes(self, data):
+        self.socket.sendall(data)
+
+    def why_it_ended(self):
+        return "the connection ended"
+
+    def end_input(self):
+        self.socket.shutdown(socket.SHUT_WR)
+
+    def close(self):
+        try:
+            self.socket.shutdown(socket.SHUT_RDWR)
+        except OSError:
+            pass  # It is gone already.
+        if self._reader is not None:
+            self._reader.join()
+            self._file.close()
+        self.socket.close()
+
+
+class Daemon:
+    """A daemon of a state folder. Made, it serves; where it ends instead, `is_serving` is false."""
+
+    def __init__(self, words, environment, launcher=(), **popen):
+        self.process = subprocess.Popen(
+            [*launcher, PROGRAM, "serve", *words], env=environment, stdin=subprocess.DEVNULL, stdout=subprocess.DEVNULL,
+            stderr=subprocess.PIPE, **popen)
+        self.said = queue.Queue()
+        self._errors = []
+        self._reader = threading.Thread(target=self._read_errors)
+        self._reader.start()
+        self.is_serving = self.waits_for(" serving ")
+
+    def __exit__(self, *_):
+        if self.process.poll() is None:
+            self.process.kill()
+        self.status()
+
+    def _read_errors(self):
+        for line in self.process.stderr:
+            self._errors.append(line.decode("utf-8", "backslashreplace"))
+            self.said.put(self._errors[-1])
+        self.said.put(None)
+
+    def waits_for(self, text):
+        """Whether a line with the text comes, from what was not looked at before, ere the daemon ends."""
+        while (line := self.said.get(timeout=PATIENCE)) is not None:
+            if text in line:
+                return True
+        self.said.put(None)
+        return False
+
+    def error_text(self):
+        return "".join(self._errors)
+
+    def status(self):
+        """The exit status, which is waited for."""
+        status = self.process.wait(timeout=PATIENCE)
+        self._reader.join()
+        self.process.stderr.close()
+        return status
+
+    def stop(self, number=signal.SIGTERM):
+        self.process.send_signal(number)
+        return self.status()
 
 
 class SystemTest(unittest.TestCase):
@@ -186,6 +285,19 @@ class SystemTest(unittest.TestCase):
     def client(self, storage=None, state=None, **popen):
         client = Client(self.options(storage, state), self.environment, **popen)
         self.addCleanup(client.__exit__)
+        return client
+
+    def daemon(self, *words, storage=None, state=None, environment=None, **popen):
+        """A daemon that serves."""
+        daemon = Daemon([*self.options(storage, state), *words], environment or self.environment, **popen)
+        self.addCleanup(daemon.__exit__)
+        self.assertTrue(daemon.is_serving, daemon.error_text())
+        return daemon
+
+    def connect(self, state=None, **how):
+        """A client of the daemon's."""
+        client = SocketClient(os.path.join(state or self.state, "socket"), **how)
+        self.addCleanup(client.close)
         return client
 
     def run_program(self, *words, storage=None, state=None, **run):

@@ -1,0 +1,54 @@
+#pragma once
+
+#include <list>
+#include <memory>
+
+#include "host/DaemonListener.h"
+#include "host/DaemonSocket.h"
+#include "platform/foundation/Dispatch.h"
+#include "platform/foundation/Mutex.h"
+
+namespace cindral {
+
+/// Serves JSON-RPC to the clients of the daemon's socket: each on a thread of its own, which sleeps for as long as its
+/// client says nothing, and none of them held up by another.
+///
+/// Only the person whose daemon it is is served: others are told so, and sent away. So is one client more than
+/// kClientsMax.
+///
+/// Thread safety: as DaemonListener.
+class SocketListener final : public DaemonListener {
+public:
+    static constexpr std::size_t kClientsMax = 1000;
+
+    explicit SocketListener(DaemonSocket socket);
+    /// Stopped before, where it was started.
+    ~SocketListener() override;
+    SocketListener(const SocketListener&) = delete;
+    SocketListener& operator=(const SocketListener&) = delete;
+
+    Result<void> start(const HostProcess& host) override;
+    void stop() override;
+    void waitUntilStopped() override;
+
+private:
+    class Client;
+    void accept(const HostProcess& host);
+    bool acceptAll(const HostProcess& host);
+    void makeDoWithout();
+    void welcome(UniqueFd connection, const HostProcess& host);
+    const char* whyNot(int connection);
+    void serve(const std::shared_ptr<Client>& client, const HostProcess& host);
+
+    DaemonSocket socket_;
+    UniqueFd stop_;   ///< constant once started
+    UniqueFd spare_;  ///< the accepting thread's
+    DispatchGroup threads_;
+
+    Mutex mutex_;
+    Condition changed_;
+    std::list<std::shared_ptr<Client>> clients_ GUARDED_BY(mutex_);
+    bool isStopping_ GUARDED_BY(mutex_) = false;
+};
+
+}  // namespace cindral
