@@ -161,8 +161,24 @@ Result<std::shared_ptr<ProviderClient::Handle>> ProviderClient::enumerator(const
     return std::make_shared<Handle>(TRY(provider_->enumeratorForContainerItemIdentifier(container)), invalidations_);
 }
 
-Result<std::shared_ptr<ProviderClient::Use>> ProviderClient::use(const TesselItemIdentifier& container) {
-    return std::make_shared<Use>(TRY(isKept(container) ? keptEnumerator(container) : enumerator(container)));
+Result<std::shared_ptr<ProviderClient::Handle>> ProviderClient::anyEnumerator(const TesselItemIdentifier& container) {
+    return isKept(container) ? keptEnumerator(container) : enumerator(container);
+}
+
+/// What is monitored from now on is where the folder is now, and knows that the client has come: the next change is
+/// signalled again.
+Result<std::shared_ptr<ProviderClient::Handle>> ProviderClient::comingEnumerator(
+    const TesselItemIdentifier& container) {
+    auto made = TRY(anyEnumerator(container));
+    if (isKept(container)) return made;
+    std::shared_ptr<Handle> before;
+    {
+        const MutexLock lock(mutex_);
+        if (const auto monitored = monitored_.find(container); monitored != monitored_.end())
+            before = std::exchange(monitored->second, made);
+    }
+    if (before) made->enumerator().start();
+    return made;
 }
 
 Result<std::shared_ptr<ProviderClient::Handle>> ProviderClient::keptEnumerator(const TesselItemIdentifier& container) {
@@ -175,7 +191,7 @@ Result<std::shared_ptr<ProviderClient::Handle>> ProviderClient::keptEnumerator(c
 }
 
 Result<void> ProviderClient::startMonitoring(const TesselItemIdentifier& container) {
-    std::shared_ptr<Handle> handle = TRY(isKept(container) ? keptEnumerator(container) : enumerator(container));
+    std::shared_ptr<Handle> handle = TRY(anyEnumerator(container));
     handle->enumerator().start();
     if (isKept(container)) return {};
     const MutexLock lock(mutex_);
@@ -205,20 +221,10 @@ void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, con
 
 void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor,
                                       int attempts, ChangesCompletion completion) {
-    auto made = isKept(container) ? keptEnumerator(container) : enumerator(container);
+    auto made = comingEnumerator(container);
     if (!made.ok()) {
         completion(std::move(made).error());
         return;
-    }
-    if (!isKept(container)) {
-        std::shared_ptr<Handle> before;
-        {
-            const MutexLock lock(mutex_);
-            // What is monitored from now on is where the folder is now, and knows that the client has come.
-            if (const auto monitored = monitored_.find(container); monitored != monitored_.end())
-                before = std::exchange(monitored->second, *made);
-        }
-        if (before) (*made)->enumerator().start();
     }
     auto use = std::make_shared<Use>(*std::move(made));
     std::function<void(ChangesCompletion)> retry;
@@ -243,12 +249,14 @@ void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, con
 
 void ProviderClient::enumerateItems(const TesselItemIdentifier& container, const TesselPage& page,
                                     PageCompletion completion) {
-    auto used = use(container);
-    if (!used.ok()) {
-        completion(std::move(used).error());
+    // On the first page the client comes to see what there is; the others go on with that.
+    const bool isFirst = page == tesselInitialPageSortedByName() || page == tesselInitialPageSortedByDate();
+    auto made = isFirst ? comingEnumerator(container) : anyEnumerator(container);
+    if (!made.ok()) {
+        completion(std::move(made).error());
         return;
     }
-    std::shared_ptr<Use> use = *std::move(used);
+    auto use = std::make_shared<Use>(*std::move(made));
     use->enumerator().enumerateItemsForObserver(
         std::make_shared<PageCollector>([use, completion = std::move(completion)](Result<ItemsPage> result) mutable {
             Use::answered(use);
@@ -259,12 +267,12 @@ void ProviderClient::enumerateItems(const TesselItemIdentifier& container, const
 }
 
 void ProviderClient::currentSyncAnchor(const TesselItemIdentifier& container, AnchorCompletion completion) {
-    auto used = use(container);
-    if (!used.ok()) {
-        completion(std::move(used).error());
+    auto made = anyEnumerator(container);
+    if (!made.ok()) {
+        completion(std::move(made).error());
         return;
     }
-    std::shared_ptr<Use> use = *std::move(used);
+    auto use = std::make_shared<Use>(*std::move(made));
     use->enumerator().currentSyncAnchorWithCompletionHandler(
         [use, completion = std::move(completion)](std::optional<TesselSyncAnchor> anchor) mutable {
             Use::answered(use);

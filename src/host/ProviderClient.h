@@ -33,7 +33,8 @@ struct ChangesBatch {
 ///
 /// A container is looked up anew at each request, so that a folder that was renamed meanwhile goes on. The containers
 /// that stand for many folders (root, working set, all directories) keep their enumerator for as long as the client
-/// lives. So does a folder that is monitored: each request for its changes looks it up anew, and monitors what it found.
+/// lives. So does a folder that is monitored: each request for its changes or its first page looks it up anew, and
+/// monitors what it found.
 ///
 /// Thread safety: all operations, from any thread. Completions run on any thread, once.
 class ProviderClient {
@@ -68,9 +69,10 @@ public:
 private:
     class Handle;
     class Use;
-    Result<std::shared_ptr<Use>> use(const TesselItemIdentifier& container);
     Result<std::shared_ptr<Handle>> enumerator(const TesselItemIdentifier& container);
     Result<std::shared_ptr<Handle>> keptEnumerator(const TesselItemIdentifier& container);
+    Result<std::shared_ptr<Handle>> anyEnumerator(const TesselItemIdentifier& container);
+    Result<std::shared_ptr<Handle>> comingEnumerator(const TesselItemIdentifier& container);
     void enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor, int attempts,
                           ChangesCompletion completion);
 

@@ -147,6 +147,7 @@ TEST_F(ProviderClientTest, keepsAnEnumeratorStartedWhileItIsMonitored) {
 }
 
 TEST_F(ProviderClientTest, monitorsAFolderWhereItWasFoundLast) {
+    provider_->documents(4, "fid=2");
     provider_->changes["fid=2"] = {{{}, "next", false, std::nullopt}};
     {
         ProviderClient client(provider_);
@@ -154,8 +155,14 @@ TEST_F(ProviderClientTest, monitorsAFolderWhereItWasFoundLast) {
         for (int i = 0; i < 3; ++i) ASSERT_TRUE(client.changesSince("fid=2", {}).ok());
         EXPECT_EQ(provider_->enumeratorsMade, 4) << "each request looks the folder up";
         EXPECT_EQ(provider_->enumeratorsStarted, 4) << "and monitors what it found";
+        const auto first = client.itemsOnPage("fid=2", tesselInitialPageSortedByDate());
+        ASSERT_TRUE(first.ok());
+        EXPECT_EQ(provider_->enumeratorsStarted, 5) << "who lists it has come, too";
+        ASSERT_TRUE(first->nextPage);
+        ASSERT_TRUE(client.itemsOnPage("fid=2", *first->nextPage).ok());
+        EXPECT_EQ(provider_->enumeratorsStarted, 5) << "and goes on with the next page";
     }
-    EXPECT_EQ(provider_->enumeratorsInvalidated, 4);
+    EXPECT_EQ(provider_->enumeratorsInvalidated, provider_->enumeratorsMade);
 }
 
 }  // namespace

@@ -586,6 +586,19 @@ class WhatChangesMean:
             self.assertTrue(self.changes(view).log)
             self.call("stopMonitoring", container=container)
 
+    def test_who_lists_anew_is_signalled_again(self):
+        os.mkdir(self.path("folder"))
+        self.start()
+        folder = self.identifier("folder")
+        for container in (ROOT, folder):
+            self.call("startMonitoring", container=container)
+            for i in range(3):
+                self.make_file("folder" if container == folder else ".", f"{i}.txt")
+                while self.host.next_notification("signal")["container"] != container:
+                    pass
+                self.assertIn(f"{i}.txt", {item["filename"] for item in self.host.items(container)})
+            self.call("stopMonitoring", container=container)
+
     # Documents through saving.
 
     def _saved(self, save):
