@@ -147,21 +147,22 @@ private:
         FileID fileID{};
         std::string path;  // below the root
     };
+    struct BatchEntry;
     struct Batch;
     struct Comparison;
     class TreeWalk;
     class ReadAhead;
-    enum class GoesOn { no, below };  ///< whether the comparison comes to subfolders by itself
     Result<void> compareUnwatched();
     Result<void> scanPending();
     Result<void> scan(FileID folder);
     Result<void> compareWalk(TreeWalk& walk);
     void scanLater(FileID folder);
     Result<void> compareEntries(OpenFolder& folder, std::vector<Subfolder>* subfolders);
-    static void readEntries(Batch& batch);
-    static void addSubfolders(const Batch& batch, std::vector<Subfolder>& subfolders);
-    Result<void> compareBatch(Comparison& comparison, Batch& batch, GoesOn goesOn);
-    Result<void> seeCompared(OpenFolder& folder, const char* name, const FileStatus& status, GoesOn goesOn);
+    static void readNames(Batch& batch);
+    static void lookAtEntries(Batch& batch);
+    static bool lookAt(Batch& batch, BatchEntry& entry);
+    Result<void> compareBatch(Comparison& comparison, Batch& batch);
+    Result<void> seeCompared(OpenFolder& folder, const BatchEntry& entry);
     Result<void> findLost(OpenFolder& folder, std::vector<std::uint64_t>& seen);
     void watch(const OpenFolder& folder);
     Result<void> startWatching(const OpenFolder& folder) const EXCLUDES(sourcesMutex_);

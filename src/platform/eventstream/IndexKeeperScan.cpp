@@ -1,3 +1,4 @@
+#include <dirent.h>
 #include <fcntl.h>
 #include <linux/openat2.h>
 
@@ -15,6 +16,7 @@
 
 namespace cindral {
 
+using index_keeper::joined;
 using index_keeper::kindOf;
 using index_keeper::sizeOf;
 using index_keeper::stampOf;
@@ -33,14 +35,14 @@ constexpr std::size_t kFoldersBeforeReadingAhead = 16;
 // A folder that can't be reached so often keeps moving, or can't be opened for a reason of its own.
 constexpr int kScanAttemptsMax = 6;
 
-std::string joined(std::string_view folder, std::string_view name) {
+}  // namespace
+
+std::string index_keeper::joined(std::string_view folder, std::string_view name) {
     std::string path(folder);
     if (!path.empty()) path += '/';
     path += name;
     return path;
 }
-
-}  // namespace
 
 // MARK: Comparing
 
@@ -135,6 +137,7 @@ Result<void> IndexKeeper::compareWalk(TreeWalk& walk) {
         if (options_.isStopping()) return KsError::posix(ECANCELED);
         std::optional<Batch> batch = ahead ? ahead->next() : walk.next();
         if (!batch) return {};
+        if (!ahead && batch->folder) lookAtEntries(*batch);
         if (batch->isFirst && ++count % kFoldersBetweenHints == 0) TRY(takeHints());
         if (!batch->folder) {
             logDebug("can't read the folder {}; {}", batch->place.path, batch->error->description());
@@ -146,7 +149,7 @@ Result<void> IndexKeeper::compareWalk(TreeWalk& walk) {
             unreached_.erase(batch->folder->fileID);
             noteWatched(*batch->folder, batch->watched);
         }
-        TRY(compareBatch(comparison, *batch, GoesOn::below));
+        TRY(compareBatch(comparison, *batch));
         TRY(flushWhenFull());
         // What is small is done before a thread has started.
         if (!ahead && count == kFoldersBeforeReadingAhead) ahead.emplace(walk);
@@ -173,16 +176,20 @@ Result<void> IndexKeeper::compareEntries(OpenFolder& folder, std::vector<Subfold
     batch.isFirst = true;
     (void)::lseek(folder.fd.get(), 0, SEEK_SET);
     while (!batch.isLast) {
-        readEntries(batch);
-        TRY(compareBatch(comparison, batch, GoesOn::no));
-        if (subfolders != nullptr) addSubfolders(batch, *subfolders);
+        readNames(batch);
+        lookAtEntries(batch);
+        TRY(compareBatch(comparison, batch));
+        for (const BatchEntry& entry : batch.entries) {
+            if (subfolders != nullptr && entry.status.isDirectory())
+                subfolders->push_back({FileID{entry.status.fileID}, joined(folder.path, entry.name)});
+        }
         batch.isFirst = false;
     }
     return {};
 }
 
-/// The next entries of the batch's folder. Touches nothing of the keeper's.
-void IndexKeeper::readEntries(Batch& batch) {
+/// The names of the batch's folder that come next. Touches nothing of the keeper's.
+void IndexKeeper::readNames(Batch& batch) {
     const OpenFolder& folder = *batch.folder;
     batch.entries.clear();
     if (!batch.names) batch.names = std::make_unique_for_overwrite<std::byte[]>(kDirectoryBytes);
@@ -199,27 +206,31 @@ void IndexKeeper::readEntries(Batch& batch) {
         const auto* record = reinterpret_cast<const DirectoryRecord*>(batch.names.get() + at);
         at += record->length;
         if (record->isDots()) continue;
-        const Result<FileStatus> status = sys::statx(folder.fd.get(), record->name);
-        if (!status.ok()) {
-            if (status.error().isPosix(ENOENT)) continue;
-            logDebug("can't look at {}/{}; {}", folder.path, record->name, status.error().description());
-            // What can't be looked at is not gone.
-            batch.sawAll = false;
-            continue;
-        }
-        if (status->device != folder.root->directory->status.device) continue;
-        batch.entries.push_back({record->name, *status});
+        const bool mayBeFolder = record->type == DT_DIR || record->type == DT_UNKNOWN;
+        batch.entries.push_back({.name = record->name, .mayBeFolder = mayBeFolder});
     }
 }
 
-void IndexKeeper::addSubfolders(const Batch& batch, std::vector<Subfolder>& subfolders) {
-    for (const Batch::Entry& entry : batch.entries) {
-        if (!entry.status.isDirectory()) continue;
-        subfolders.push_back({FileID{entry.status.fileID}, joined(batch.folder->path, entry.name)});
-    }
+/// What is gone meanwhile, or of another device, is taken out. Touches nothing of the keeper's.
+void IndexKeeper::lookAtEntries(Batch& batch) {
+    std::erase_if(batch.entries, [&](BatchEntry& entry) { return !entry.isSeen && !lookAt(batch, entry); });
 }
 
-Result<void> IndexKeeper::compareBatch(Comparison& comparison, Batch& batch, GoesOn goesOn) {
+/// Whether it is there, and ours. Touches nothing of the keeper's.
+bool IndexKeeper::lookAt(Batch& batch, BatchEntry& entry) {
+    const OpenFolder& folder = *batch.folder;
+    const Result<FileStatus> status = sys::statx(folder.fd.get(), entry.name);
+    if (!status.ok() && !status.error().isPosix(ENOENT)) {
+        logDebug("can't look at {}/{}; {}", folder.path, entry.name, status.error().description());
+        // What can't be looked at is not gone.
+        batch.sawAll = false;
+    }
+    entry.isSeen = status.ok() && status->device == folder.root->directory->status.device;
+    if (entry.isSeen) entry.status = *status;
+    return entry.isSeen;
+}
+
+Result<void> IndexKeeper::compareBatch(Comparison& comparison, Batch& batch) {
     OpenFolder& folder = *batch.folder;
     if (batch.isFirst) {
         // What is counted and what is met are to be of one moment.
@@ -228,12 +239,12 @@ Result<void> IndexKeeper::compareBatch(Comparison& comparison, Batch& batch, Goe
     }
     comparison.sawAll = comparison.sawAll && batch.sawAll;
     comparison.fileIDs.clear();
-    for (const Batch::Entry& entry : batch.entries) {
+    for (const BatchEntry& entry : batch.entries) {
         comparison.fileIDs.push_back(FileID{entry.status.fileID});
         comparison.seen.push_back(entry.status.fileID);
     }
     TRY(store_.indexed(comparison.fileIDs, [&](std::size_t i, const IndexedObject* object) {
-        Batch::Entry& entry = batch.entries[i];
+        BatchEntry& entry = batch.entries[i];
         if (object == nullptr || object->parent != folder.fileID || object->name != entry.name ||
             object->birthTime != entry.status.birthStamp())
             return;
@@ -247,8 +258,8 @@ Result<void> IndexKeeper::compareBatch(Comparison& comparison, Batch& batch, Goe
                               object->kind == kindOf(entry.status, entry.name);
         }
     }));
-    for (const Batch::Entry& entry : batch.entries) {
-        if (!entry.isMatched) TRY(seeCompared(folder, entry.name, entry.status, goesOn));
+    for (const BatchEntry& entry : batch.entries) {
+        if (!entry.isMatched) TRY(seeCompared(folder, entry));
     }
     if (!batch.isLast) return {};
     if (batch.error) {
@@ -260,14 +271,13 @@ Result<void> IndexKeeper::compareBatch(Comparison& comparison, Batch& batch, Goe
     return findLost(folder, comparison.seen);
 }
 
-Result<void> IndexKeeper::seeCompared(OpenFolder& folder, const char* name, const FileStatus& status, GoesOn goesOn) {
+Result<void> IndexKeeper::seeCompared(OpenFolder& folder, const BatchEntry& entry) {
     const std::size_t before = toScan_.size();
-    TRY(see(folder, name, status, false));
-    watchNames(folder, name, status);
-    if (goesOn == GoesOn::below && status.isDirectory()) {
-        // The comparison comes to it by itself.
+    TRY(see(folder, entry.name, entry.status, false));
+    watchNames(folder, entry.name, entry.status);
+    if (entry.isEntered) {
         const auto added = toScan_.begin() + static_cast<std::ptrdiff_t>(before);
-        toScan_.erase(std::remove(added, toScan_.end(), FileID{status.fileID}), toScan_.end());
+        toScan_.erase(std::remove(added, toScan_.end(), FileID{entry.status.fileID}), toScan_.end());
     }
     return flushWhenFull();
 }

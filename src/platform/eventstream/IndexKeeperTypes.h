@@ -30,13 +30,17 @@ struct IndexKeeper::Known {
     bool isAt(FileID parent, std::string_view at) const { return object.parent == parent && name == at; }
 };
 
+struct IndexKeeper::BatchEntry {
+    const char* name = nullptr;  ///< in the batch's `names`
+    bool mayBeFolder = false;
+    bool isEntered = false;  ///< a folder that the walk comes to by itself
+    bool isMatched = false;  ///< the index has it as it is
+    bool isSeen = false;     ///< `status` is of it; else it is gone, or not ours to look at
+    FileStatus status = {};
+};
+
 /// Entries of a folder as they were just read, some of them or all.
 struct IndexKeeper::Batch {
-    struct Entry {
-        const char* name = nullptr;  ///< in `names`
-        FileStatus status;
-        bool isMatched = false;  ///< the index has it as it is
-    };
     std::shared_ptr<OpenFolder> folder;  ///< null when it can't be opened
     Subfolder place;                     ///< of a folder that can't be opened
     std::optional<KsError> error;        ///< why it can't be opened, or not read any further
@@ -44,7 +48,7 @@ struct IndexKeeper::Batch {
     bool isFirst = false;
     bool isLast = false;
     bool sawAll = true;  ///< false when an entry could not be looked at
-    std::vector<Entry> entries;
+    std::vector<BatchEntry> entries;
     std::unique_ptr<std::byte[]> names;
 };
 
@@ -95,6 +99,8 @@ inline std::uint64_t sizeOf(const FileStatus& status) {
     return status.isDirectory() ? 0 : status.size;
 }
 ObjectKind kindOf(const FileStatus& status, std::string_view name);
+/// A path below a root; the root's own is empty.
+std::string joined(std::string_view folder, std::string_view name);
 
 }  // namespace index_keeper
 

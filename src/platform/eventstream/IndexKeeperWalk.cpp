@@ -2,6 +2,7 @@
 
 #include <pthread.h>
 
+#include <algorithm>
 #include <utility>
 
 namespace cindral {
@@ -35,10 +36,19 @@ std::optional<IndexKeeper::Batch> IndexKeeper::TreeWalk::next() {
         batch.watched = keeper_.startWatching(*folder_);
     }
     batch.folder = folder_;
-    readEntries(batch);
-    addSubfolders(batch, stack_);
+    readNames(batch);
+    enter(batch);
     if (batch.isLast) folder_ = nullptr;
     return batch;
+}
+
+/// The walk needs to know which entries are folders; of the others it can be known later.
+void IndexKeeper::TreeWalk::enter(Batch& batch) {
+    for (BatchEntry& entry : batch.entries) {
+        if (!entry.mayBeFolder || !lookAt(batch, entry) || !entry.status.isDirectory()) continue;
+        entry.isEntered = true;
+        stack_.push_back({FileID{entry.status.fileID}, index_keeper::joined(batch.folder->path, entry.name)});
+    }
 }
 
 IndexKeeper::ReadAhead::ReadAhead(TreeWalk& walk) : walk_(walk), thread_([this] { run(); }) {
@@ -55,29 +65,83 @@ IndexKeeper::ReadAhead::~ReadAhead() {
 }
 
 void IndexKeeper::ReadAhead::run() {
-    while (true) {
+    while (waitForRoom()) {
         std::optional<Batch> batch = walk_.next();
         const MutexLock lock(mutex_);
-        while (ready_.size() >= kBatchesAheadMax && !isStopped_) changed_.wait(mutex_);
-        if (isStopped_) return;
         isDone_ = !batch;
-        if (batch) ready_.push_back(*std::move(batch));
-        // Several at once: a batch of a small folder is worth less than the wake-up.
-        if (ready_.size() == kBatchesAheadMax / 2 || isDone_) changed_.notifyOne();
-        if (isDone_) return;
+        if (batch) {
+            ++untaken_;
+            slots_.push_back({.batch = *std::move(batch)});
+        }
+        changed_.notifyOne();
+        if (isDone_) break;
+    }
+    while (lookAtOne()) {
     }
 }
 
-std::optional<IndexKeeper::Batch> IndexKeeper::ReadAhead::next() {
-    const MutexLock lock(mutex_);
-    if (ready_.empty()) {
-        while (ready_.size() < kBatchesAheadMax / 2 && !isDone_) changed_.wait(mutex_);
+/// Looks at entries meanwhile. False when the walk is no longer wanted.
+bool IndexKeeper::ReadAhead::waitForRoom() {
+    while (true) {
+        {
+            const MutexLock lock(mutex_);
+            if (isStopped_) return false;
+            if (slots_.size() < kBatchesAheadMax) return true;
+        }
+        if (lookAtOne()) continue;
+        const MutexLock lock(mutex_);
+        // Room for several: one batch is worth less than the wake-up.
+        while (slots_.size() > kBatchesAheadMax / 2 && !isStopped_) changed_.wait(mutex_);
     }
-    if (ready_.empty()) return std::nullopt;
-    std::optional<Batch> batch(std::move(ready_.front()));
-    ready_.pop_front();
-    if (ready_.size() == kBatchesAheadMax / 2) changed_.notifyOne();
-    return batch;
+}
+
+/// The first whose entries nobody looks at yet.
+IndexKeeper::ReadAhead::Slot* IndexKeeper::ReadAhead::take() {
+    if (untaken_ == 0) return nullptr;
+    --untaken_;
+    const auto slot = std::ranges::find(slots_, false, &Slot::isTaken);
+    slot->isTaken = true;
+    return &*slot;
+}
+
+/// False when there is none.
+bool IndexKeeper::ReadAhead::lookAtOne() {
+    Slot* slot = nullptr;
+    {
+        const MutexLock lock(mutex_);
+        slot = isStopped_ ? nullptr : take();
+    }
+    if (slot == nullptr) return false;
+    if (slot->batch.folder) lookAtEntries(slot->batch);
+    const MutexLock lock(mutex_);
+    slot->isDone = true;
+    // Somebody waits for the first only.
+    if (slot == &slots_.front()) changed_.notifyOne();
+    return true;
+}
+
+std::optional<IndexKeeper::Batch> IndexKeeper::ReadAhead::next() {
+    while (true) {
+        {
+            const MutexLock lock(mutex_);
+            if (slots_.empty() && isDone_) return std::nullopt;
+            if (!slots_.empty() && slots_.front().isDone) {
+                std::optional<Batch> batch(std::move(slots_.front().batch));
+                slots_.pop_front();
+                if (slots_.size() == kBatchesAheadMax / 2) changed_.notifyOne();
+                return batch;
+            }
+        }
+        if (lookAtOne()) continue;
+        const MutexLock lock(mutex_);
+        while (mustWait()) changed_.wait(mutex_);
+    }
+}
+
+/// Whether the other thread has all there is to do.
+bool IndexKeeper::ReadAhead::mustWait() const {
+    if (untaken_ > 0) return false;
+    return slots_.empty() ? !isDone_ : !slots_.front().isDone;
 }
 
 }  // namespace cindral
