@@ -93,6 +93,8 @@ protected:
     EventStreamTest() { EventHistory::setShared(history_); }
     ~EventStreamTest() override {
         if (stream_) stream_->invalidate();
+        // A call that was under way uses what goes now.
+        queue_->sync([] {});
         EventHistory::setShared(nullptr);
     }
 

@@ -32,7 +32,7 @@ void RecorderTest::start() {
     Recorder::Options options;
     options.choice = GetParam();
     options.recordsByItself = false;
-    options.now = [this] { return now_; };
+    options.now = [this] { return now_.load(); };
     recorder_ = Recorder::start(store_, {root_}, std::move(options));
     const Result<void> drained = recorder_->drain();
     ASSERT_TRUE(drained.ok()) << drained.error().description();

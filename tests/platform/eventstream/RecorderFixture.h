@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <chrono>
 #include <memory>
 #include <set>
 #include <string>
@@ -32,7 +34,7 @@ protected:
     void restartAll();
     Recorder& recorder() { return *recorder_; }
     VolumeStore& store() { return *store_; }
-    void letTimePass(std::chrono::milliseconds time) { now_ += time; }
+    void letTimePass(std::chrono::milliseconds time) { now_ = now_.load() + time; }
 
     // What programs do. Names are below the storage; those of `outside` beside it.
     std::string path(std::string_view name) const { return storage_ + "/" + std::string(name); }
@@ -75,7 +77,8 @@ protected:
     std::shared_ptr<VolumeStore> store_;
     std::shared_ptr<Recorder> recorder_;
     std::shared_ptr<const RootDirectory> root_;
-    std::chrono::steady_clock::time_point now_ = std::chrono::steady_clock::now();
+    /// Asked for by the recorder's thread.
+    std::atomic<std::chrono::steady_clock::time_point> now_ = std::chrono::steady_clock::now();
     std::uint64_t seenEvents_ = 0;
     std::uint64_t seenDocumentEvents_ = 0;
 };
