@@ -13,6 +13,7 @@
 #include <cerrno>
 #include <utility>
 
+#include "platform/foundation/FreeMemory.h"
 #include "platform/foundation/Log.h"
 #include "platform/foundation/Sys.h"
 #include "platform/foundation/ThreadPool.h"
@@ -99,6 +100,8 @@ std::shared_ptr<const Recorder::Roots> Recorder::roots() const {
 void Recorder::run() {
     while (!stopping_) {
         const Result<void> started = startUp();
+        // A first reading fills much that is empty now.
+        returnFreeMemory();
         finished(started);
         if (started.ok() || stopping_) break;
         logError("can't read the roots; {}", started.error().description());

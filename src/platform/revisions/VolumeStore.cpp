@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "platform/foundation/FreeMemory.h"
 #include "platform/foundation/Log.h"
 #include "platform/revisions/VolumeStoreImplementation.h"
 #include "platform/revisions/VolumeStoreReading.h"
@@ -472,8 +473,11 @@ bool VolumeStore::Implementation::waitUntilDue() {
 }
 
 void VolumeStore::Implementation::writeCheckpointsWhenDue() {
-    // A failure was logged, and is tried again later.
-    while (waitUntilDue()) (void)writeCheckpoint();
+    while (waitUntilDue()) {
+        // A failure was logged, and is tried again later.
+        (void)writeCheckpoint();
+        returnFreeMemory();
+    }
 }
 
 VolumeStore::Counts VolumeStore::Implementation::counts() const {
