@@ -4,7 +4,7 @@
 #include <unordered_map>
 
 #include "host/PresentedPaths.h"
-#include "host/ProviderClient.h"
+#include "host/ProviderAccess.h"
 #include "host/TextOutput.h"
 
 namespace cindral {

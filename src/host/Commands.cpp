@@ -258,7 +258,7 @@ Result<void> Commands::watch() {
 }
 
 Result<void> Commands::status() {
-    const std::string text = context_.statusText();
+    const std::string text = TRY(context_.statusText());
     if (context_.options.json) {
         output_.line(text);
         return {};

@@ -8,7 +8,7 @@
 #include "host/HostOptions.h"
 #include "host/ItemText.h"
 #include "host/PresentedPaths.h"
-#include "host/ProviderClient.h"
+#include "host/ProviderAccess.h"
 #include "host/SignalDispatcher.h"
 #include "host/TextOutput.h"
 
@@ -22,11 +22,11 @@ namespace cindral {
 class Commands {
 public:
     struct Context {
-        ProviderClient& client;
+        ProviderAccess& client;
         const PresentedPaths& paths;
         const HostOptions& options;
         const HostEnvironment& environment;
-        std::function<std::string()> statusText;  ///< as JSON
+        std::function<Result<std::string>()> statusText;  ///< as JSON
         SignalDispatcher& signals;
         /// From the call on, what asks a command that has no end to end makes the descriptor readable.
         std::function<Result<int>()> stopDescriptor;

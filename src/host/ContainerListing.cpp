@@ -17,7 +17,7 @@ bool isExpired(const KsError& error) {
 
 }  // namespace
 
-ContainerListing::ContainerListing(ProviderClient& client, TesselItemIdentifier container)
+ContainerListing::ContainerListing(ProviderAccess& client, TesselItemIdentifier container)
     : client_(client), container_(std::move(container)), nextPage_(tesselInitialPageSortedByName()) {}
 
 Result<std::shared_ptr<const TesselItem>> ContainerListing::next() {

@@ -5,7 +5,7 @@
 #include <optional>
 #include <vector>
 
-#include "host/ProviderClient.h"
+#include "host/ProviderAccess.h"
 
 namespace cindral {
 
@@ -23,7 +23,7 @@ public:
     static constexpr int kFruitlessRestartsMax = 20;
 
     /// `client` is borrowed for life.
-    ContainerListing(ProviderClient& client, TesselItemIdentifier container);
+    ContainerListing(ProviderAccess& client, TesselItemIdentifier container);
 
     const TesselItemIdentifier& container() const { return container_; }
     /// The next item; null at the end.
@@ -35,7 +35,7 @@ private:
     bool belongsHere(const TesselItem& item) const;
     bool isNew(const TesselItem& item) const;
 
-    ProviderClient& client_;
+    ProviderAccess& client_;
     const TesselItemIdentifier container_;
     std::optional<TesselPage> nextPage_;
     TesselItems items_;

@@ -4,7 +4,7 @@
 
 namespace cindral {
 
-ContainerMonitor::ContainerMonitor(ProviderClient& client, SignalDispatcher& signals, Tell tell)
+ContainerMonitor::ContainerMonitor(ProviderAccess& client, SignalDispatcher& signals, Tell tell)
     : client_(client), signals_(signals), tell_(std::move(tell)) {
     subscription_ = signals_.subscribe([this](const TesselItemIdentifier& container) { didSignal(container); });
 }

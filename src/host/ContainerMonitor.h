@@ -3,7 +3,7 @@
 #include <functional>
 #include <set>
 
-#include "host/ProviderClient.h"
+#include "host/ProviderAccess.h"
 #include "host/SignalDispatcher.h"
 #include "platform/foundation/Mutex.h"
 #include "platform/foundation/SerialQueue.h"
@@ -22,7 +22,7 @@ public:
     using Tell = std::function<void(const TesselItemIdentifier& container)>;
 
     /// `client` and `signals` are borrowed for life.
-    ContainerMonitor(ProviderClient& client, SignalDispatcher& signals, Tell tell);
+    ContainerMonitor(ProviderAccess& client, SignalDispatcher& signals, Tell tell);
     ~ContainerMonitor();
     ContainerMonitor(const ContainerMonitor&) = delete;
     ContainerMonitor& operator=(const ContainerMonitor&) = delete;
@@ -37,7 +37,7 @@ private:
     void tellPending();
     std::set<TesselItemIdentifier> takePending();
 
-    ProviderClient& client_;
+    ProviderAccess& client_;
     SignalDispatcher& signals_;
     const Tell tell_;
 

@@ -14,6 +14,7 @@
 #include "host/JsonText.h"
 #include "host/ProgressPace.h"
 #include "host/TerminalText.h"
+#include "host/Utf8.h"
 #include "platform/foundation/Dispatch.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/tessel/TesselErrors.h"
@@ -223,8 +224,9 @@ EditCommands::ItemResult EditCommands::reparent(const TesselItem& item, const Te
 }
 
 Result<EditCommands::Staging> EditCommands::makeStaging() const {
-    const auto root = RootDirectories::shared().rootHolding(context_.paths.presented());
-    if (root == nullptr) return hostFailure("the storage is not open");
+    auto root = RootDirectories::shared().rootHolding(context_.paths.presented());
+    // Open already, where the provider is in this process.
+    if (root == nullptr) root = TRY(RootDirectories::shared().add(context_.paths.presented(), RootPolicy::storage));
     auto folder = StagingFolder::make(root);
     if (!folder.ok()) return hostFailure(fmt::format("can't make a temporary folder: {}", messageOf(folder.error())));
     auto identifier = provider().persistentIdentifierForItemAtURL(KsURL::fileURL((*folder)->path()));
@@ -362,6 +364,8 @@ Result<void> EditCommands::emptyTrash() {
 // MARK: Metadata
 
 Result<void> EditCommands::changeTag(const std::string& word, const std::string& tag, bool isPutOn) {
+    if (!isUtf8(tag))
+        return hostFailure(fmt::format("{}: the tag {} is not UTF-8", terminalText(word), terminalText(tag)));
     const auto named = TRY(item(word));
     std::vector<std::string> labels = named->tags().value_or(std::vector<std::string>());
     const bool isThere = std::ranges::find(labels, tag) != labels.end();

@@ -83,7 +83,7 @@ void importDocument(const HostMethodsContext& context, const Json& params, const
 
 void createDirectory(const HostMethodsContext& context, const Json& params, const Reply& reply) {
     const RequestParams given(params, *reply);
-    const auto name = given.string("name");
+    const auto name = given.filename();
     const auto parent = name ? given.string("parent") : std::nullopt;
     if (!parent) return;
     context.client.provider().createDirectoryWithName(*name, *parent, itemCompletion(context, reply));
@@ -92,7 +92,7 @@ void createDirectory(const HostMethodsContext& context, const Json& params, cons
 void renameItem(const HostMethodsContext& context, const Json& params, const Reply& reply) {
     const RequestParams given(params, *reply);
     const auto identifier = given.string("identifier");
-    const auto name = identifier ? given.string("name") : std::nullopt;
+    const auto name = identifier ? given.filename() : std::nullopt;
     if (!name) return;
     context.client.provider().renameItemWithIdentifier(*identifier, *name, itemCompletion(context, reply));
 }
@@ -102,7 +102,7 @@ void reparentItem(const HostMethodsContext& context, const Json& params, const R
     const auto identifier = given.string("identifier");
     const auto parent = identifier ? given.string("parent") : std::nullopt;
     std::optional<std::string> name;
-    if (!parent || !given.optionalString("name", name)) return;
+    if (!parent || !given.optionalFilename(name)) return;
     follow(reply, itemCompletion(context, reply), [&](TesselExtension::ItemCompletion completion) {
         return context.client.provider().reparentItemWithIdentifier(*identifier, *parent, name, std::move(completion));
     });

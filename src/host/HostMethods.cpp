@@ -9,6 +9,7 @@
 #include "host/ItemWriter.h"
 #include "host/JsonText.h"
 #include "host/RequestParams.h"
+#include "host/Utf8.h"
 #include "platform/foundation/Base64.h"
 #include "platform/tessel/TesselErrors.h"
 
@@ -215,6 +216,12 @@ void status(const HostMethodsContext& context, const Json& /*params*/, const Rep
     reply->result([&](std::string& out) { out += context.statusText(); });
 }
 
+void hello(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const auto endsSoon = params.find("endsSoon");
+    const bool says = endsSoon != params.end() && endsSoon->is_boolean() && endsSoon->get<bool>();
+    reply->result([&](std::string& out) { out += context.hello(says); });
+}
+
 }  // namespace
 
 void answerWithError(JsonRpcReply& reply, const KsError& error, const PresentedPaths& paths) {
@@ -227,7 +234,12 @@ void answerWithError(JsonRpcReply& reply, const KsError& error, const PresentedP
         data += ',';
         appendJsonString(data, key);
         data += ':';
-        appendJsonString(data, key == "path" ? paths.realPath(value) : value);
+        const std::string shown = key == "path" ? paths.realPath(value) : value;
+        appendJsonString(data, shown);
+        if (key != "path" || isUtf8(shown)) continue;
+        data += R"(,"pathURL":"file://)";
+        appendPercentEncoded(data, shown);
+        data += '"';
     }
     if (const auto item = collidingItem(error)) {
         data += R"(,"item":)";
@@ -257,6 +269,7 @@ JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context) {
         {"defaultContainer", defaultContainer},
         {"fetchThumbnails", fetchThumbnails},
         {"status", status},
+        {"hello", hello},
     };
     JsonRpcServer::Methods methods = makeEditMethods(context);
     for (const auto& entry : kHandlers) {

@@ -16,6 +16,8 @@ struct HostMethodsContext {
     ContainerMonitor& monitor;
     const PresentedPaths& paths;
     std::function<std::string()> statusText;  ///< as JSON
+    /// What the host says of itself, as JSON; told whether the client ends soon, and by itself.
+    std::function<std::string(bool endsSoon)> hello;
 };
 
 /// The methods of the host interface, for one client.

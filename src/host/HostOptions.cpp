@@ -212,6 +212,8 @@ HostOptions optionsOf(const CLI::App& app, const Words& words, const HostEnviron
     }
     for (const std::string& folder : words.applications)
         options.applications.push_back(absolutePath(folder, environment));
+    options.said = {!words.storage.empty(), !words.applications.empty(), words.noFlatpak,
+                    app.get_option("--recorder")->count() > 0};
     options.flatpak = !words.noFlatpak;
     options.recorder = recorderOf(words.recorder);
     options.json = words.json;

@@ -49,6 +49,13 @@ struct HostOptions {
     EditOptions edit;           ///< edit
     std::string since;          ///< changes: an anchor, as printed
     std::string outputFile;     ///< thumbnail: absolute, or "-"
+    /// Which of them the call's words say; the others are defaults.
+    struct Said {
+        bool storage = false;
+        bool applications = false;
+        bool flatpak = false;
+        bool recorder = false;
+    } said;
 };
 
 /// Where applications are looked for: the environment's sources, and what the options say of them.

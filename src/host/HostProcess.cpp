@@ -1,6 +1,7 @@
 #include "host/HostProcess.h"
 
 #include <fmt/format.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -28,7 +29,8 @@ Result<std::shared_ptr<VolumeStore>> openStore(const std::string& state) {
     const auto holder = store.error().userInfo().find("holder");
     if (store.error().isPosix(EBUSY) && holder != store.error().userInfo().end()) {
         return hostFailure(
-            fmt::format("the state folder {} is in use by process {}", terminalText(state), holder->second));
+                   fmt::format("the state folder {} is in use by process {}", terminalText(state), holder->second))
+            .with("holder", holder->second);
     }
     return hostFailure(fmt::format("can't open the state folder {}: {}", terminalText(state), store.error().reason()));
 }
@@ -208,6 +210,21 @@ HostProcess::~HostProcess() {
 void HostProcess::waitForHistory() const {
     // What went wrong was logged.
     if (recorder_) (void)recorder_->drain();
+}
+
+std::string HostProcess::helloText() const {
+    const auto urlOf = [](const std::string& path) { return KsURL::fileURL(path).absoluteString(); };
+    std::vector<std::string> folders;
+    for (const std::string& folder : options_.applications) folders.push_back(urlOf(folder));
+    std::string out;
+    appendField(out, "version", jsonString(hostVersion()));
+    appendField(out, "process", fmt::to_string(::getpid()));
+    appendField(out, "storage", jsonString(urlOf(paths_.real())));
+    appendField(out, "storageOption", jsonString(urlOf(options_.storage)));
+    appendField(out, "recorderOption", jsonString(recorderChoiceName(options_.recorder)));
+    appendField(out, "applicationFolders", listText(folders));
+    appendField(out, "flatpak", options_.flatpak ? "true" : "false");
+    return out + "}";
 }
 
 void HostProcess::beginStop() const {

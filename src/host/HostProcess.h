@@ -26,7 +26,8 @@ public:
         std::function<Result<void>(const std::string& state)> stateIsThere;  ///< and may be another process's
         std::function<Result<void>(const std::string& state)> stateIsOurs;   ///< its store is locked
     };
-    /// Errors are the host's own, with a line for people.
+    /// Errors are the host's own, with a line for people. Where another process uses the state folder, "holder" in the user
+    /// info says which.
     static Result<std::unique_ptr<HostProcess>> start(HostOptions options, const HostEnvironment& environment,
                                                       TesselExtensionFactory makeProvider, const Steps& steps = {});
     ~HostProcess();
@@ -46,6 +47,8 @@ public:
     void waitForHistory() const;
     /// What `status` answers, as JSON text.
     std::string statusText() const;
+    /// What `hello` answers, as JSON text: what a command that finds the daemon has to know of it.
+    std::string helloText() const;
     /// The end is near: who waits for the first reading of the roots is told that it will not come to its end.
     void beginStop() const;
 

@@ -66,11 +66,9 @@ Result<UniqueFd> listenAt(const std::string& path) {
 }
 
 Result<UniqueFd> connectTo(const std::string& path) {
-    // Not to wait where nobody accepts; afterwards the connection is an ordinary one.
-    UniqueFd connected = TRY(makeSocket(SOCK_NONBLOCK));
+    UniqueFd connected = TRY(makeSocket(0));
     const Address address = TRY(addressOf(path));
     if (::connect(connected.get(), address.get(), sizeof address.address) != 0) return KsError::errorWithPOSIXCode();
-    if (::fcntl(connected.get(), F_SETFL, 0) != 0) return KsError::errorWithPOSIXCode();
     return connected;
 }
 

@@ -11,13 +11,13 @@
 /// Stream sockets of this machine, named by a path of any length. Errors are of the POSIX domain.
 namespace cindral::local_socket {
 
-/// Connections that wait to be accepted; one more is refused.
+/// Connections that wait to be accepted; one more waits for that.
 inline constexpr int kWaitingMax = 128;
 
 /// Listens at the path, in place of whatever socket or link was there, in one step: who connects finds the one or the
 /// other. For the owner alone.
 Result<UniqueFd> listenAt(const std::string& path);
-/// Follows links. Doesn't wait: EAGAIN where too many others do.
+/// Follows links. Waits where too many others are waiting to be accepted.
 Result<UniqueFd> connectTo(const std::string& path);
 
 /// The next connection; none where there is none yet. EINVAL where the socket takes none any more and all have been

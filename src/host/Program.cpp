@@ -8,13 +8,18 @@
 #include <vector>
 
 #include "host/AppsCommands.h"
+#include "host/CancelOnStop.h"
 #include "host/Commands.h"
 #include "host/Daemon.h"
+#include "host/DaemonBridge.h"
+#include "host/DaemonSearch.h"
 #include "host/DaemonSocket.h"
 #include "host/Descriptor.h"
 #include "host/HostError.h"
 #include "host/HostOptions.h"
 #include "host/HostProcess.h"
+#include "host/ProviderClient.h"
+#include "host/RemoteClient.h"
 #include "host/RpcConnection.h"
 #include "host/ServiceManager.h"
 #include "host/SocketListener.h"
@@ -45,8 +50,7 @@ int outputFailure(const KsError& error) {
 }
 
 int runRpc(const HostProcess& host) {
-    const auto served = serveRpc(STDIN_FILENO, STDOUT_FILENO,
-                                 {host.provider(), host.paths(), host.signals(), [&] { return host.statusText(); }});
+    const auto served = serveRpc(STDIN_FILENO, STDOUT_FILENO, serviceOf(host));
     if (!served.ok()) return failWith(hostFailure(fmt::format("the connection broke: {}", served.error().reason())));
     return kExitDone;
 }
@@ -110,16 +114,17 @@ int runServe(HostOptions options, const HostEnvironment& environment, TesselExte
     return served.ok() ? kExitDone : failWith(hostFailure(fmt::format("can't serve: {}", served.error().reason())));
 }
 
-/// Without a host of its own: there may be one that runs.
-int runApps(const HostOptions& options, const HostEnvironment& environment) {
+int runCommand(const Commands::Context& context) {
     TextOutput output(STDOUT_FILENO, ::isatty(STDOUT_FILENO) == 1);
-    const auto done = runAppsCommand(options, environment, output);
+    const auto done = Commands(context, output).run();
+    // What was found before something went wrong is shown before the line that says what.
     if (const auto error = output.finish()) return outputFailure(*error);
     return done.ok() ? kExitDone : failWith(done.error());
 }
 
-int runCommand(const HostProcess& host, const HostEnvironment& environment) {
-    TextOutput output(STDOUT_FILENO, ::isatty(STDOUT_FILENO) == 1);
+/// Alone: with a host of the command's own, for as long as it takes.
+int runAlone(const HostProcess& host, const HostEnvironment& environment) {
+    if (host.options().command == HostCommand::rpc) return runRpc(host);
     ProviderClient client(host.provider());
     const auto statusText = [&] {
         host.waitForHistory();
@@ -130,12 +135,65 @@ int runCommand(const HostProcess& host, const HostEnvironment& environment) {
         stopSignals = TRY(StopSignals::catchThem());
         return stopSignals->descriptor();
     };
-    Commands commands({client, host.paths(), host.options(), environment, statusText, host.signals(), stopDescriptor},
-                      output);
-    const auto done = commands.run();
-    // What was found before something went wrong is shown before the line that says what.
+    return runCommand({client, host.paths(), host.options(), environment, statusText, host.signals(), stopDescriptor});
+}
+
+/// By the daemon.
+int runRemotely(const HostOptions& options, const HostEnvironment& environment, FoundDaemon daemon) {
+    if (options.command == HostCommand::rpc) {
+        const auto bridged = bridgeToDaemon(STDIN_FILENO, STDOUT_FILENO, std::move(daemon.socket));
+        return bridged.ok() ? kExitDone : failWith(bridged.error());
+    }
+    // What crosses the socket are the paths that clients know.
+    const PresentedPaths paths(options.storage, daemon.storage, daemon.storage);
+    SignalDispatcher signals;
+    RemoteClient client(std::move(daemon.socket), signals);
+    std::unique_ptr<CancelOnStop> cancelling;
+    if (options.command == HostCommand::edit) {
+        auto started = CancelOnStop::start(client.connection());
+        if (!started.ok()) return failWith(hostFailure(started.error().reason()));
+        cancelling = *std::move(started);
+    }
+    std::unique_ptr<StopSignals> stopSignals;
+    const auto stopDescriptor = [&]() -> Result<int> {
+        stopSignals = TRY(StopSignals::catchThem());
+        return stopSignals->descriptor();
+    };
+    return runCommand(
+        {client, paths, options, environment, [&] { return client.statusText(); }, signals, stopDescriptor});
+}
+
+/// They look at the applications themselves, with a daemon's eyes where there is one.
+int runApps(const HostOptions& options, const HostEnvironment& environment) {
+    TextOutput output(STDOUT_FILENO, ::isatty(STDOUT_FILENO) == 1);
+    const auto done = runAppsCommand(options, environment, output);
     if (const auto error = output.finish()) return outputFailure(*error);
     return done.ok() ? kExitDone : failWith(done.error());
+}
+
+/// What the options say, by the daemon where there is one.
+int runByDaemonOrAlone(HostOptions options, const HostEnvironment& environment, TesselExtensionFactory makeProvider) {
+    while (true) {
+        auto found = findDaemon(options);
+        if (!found.ok()) return failWith(found.error());
+        if (found->daemon) {
+            auto agreed = agreeWithDaemon(std::move(options), *found->daemon);
+            if (!agreed.ok()) return failWith(agreed.error());
+            if (isAppsCommand(agreed->command)) return runApps(*agreed, environment);
+            return runRemotely(*agreed, environment, *std::move(found->daemon));
+        }
+        if (isAppsCommand(options.command)) return runApps(options, environment);
+        // Without a state folder nobody could be kept from becoming its daemon meanwhile.
+        const bool isSure = found->handover.has_value();
+        HostProcess::Steps steps;
+        steps.stateIsOurs = [&](const std::string&) -> Result<void> {
+            found->handover.reset();
+            return {};
+        };
+        const auto host = HostProcess::start(options, environment, makeProvider, steps);
+        if (host.ok()) return runAlone(**host, environment);
+        if (isSure || !host.error().userInfo().contains("holder")) return failWith(host.error());
+    }
 }
 
 }  // namespace
@@ -151,11 +209,8 @@ int runProgram(std::span<const std::string> words, const HostEnvironment& enviro
     // A person who looks at a listing has no use for the news of the machinery, unless they ask for it.
     if (!isRpc && !isServe && !environment.hasLogLevel) log::setLevel(LogLevel::error);
 
-    if (isAppsCommand(options.command)) return runApps(options, environment);
     if (isServe) return runServe(std::move(options), environment, makeProvider);
-    const auto host = HostProcess::start(std::move(options), environment, makeProvider);
-    if (!host.ok()) return failWith(host.error());
-    return isRpc ? runRpc(**host) : runCommand(**host, environment);
+    return runByDaemonOrAlone(std::move(options), environment, makeProvider);
 }
 
 }  // namespace cindral

@@ -5,29 +5,12 @@
 #include <memory>
 #include <optional>
 
+#include "host/ProviderAccess.h"
 #include "platform/foundation/Dispatch.h"
 #include "platform/foundation/Mutex.h"
 #include "platform/tessel/TesselExtension.h"
 
 namespace cindral {
-
-/// One page of a listing.
-struct ItemsPage {
-    TesselItems items;
-    std::optional<TesselPage> nextPage;  ///< none: the listing is over
-};
-
-/// What one enumeration of changes said.
-struct ChangesBatch {
-    struct Entry {
-        /// An update; null for a deletion.
-        std::shared_ptr<const TesselItem> item;
-        TesselItemIdentifier identifier;
-    };
-    std::vector<Entry> log;  ///< in the order in which the provider sent it
-    TesselSyncAnchor anchor;
-    bool moreComing = false;
-};
 
 /// One client's way to a provider: a connection's, or a command's.
 ///
@@ -37,15 +20,15 @@ struct ChangesBatch {
 /// monitors what it found.
 ///
 /// Thread safety: all operations, from any thread. Completions run on any thread, once.
-class ProviderClient {
+class ProviderClient final : public ProviderAccess {
 public:
     explicit ProviderClient(std::shared_ptr<TesselExtension> provider) : provider_(std::move(provider)) {}
     /// Invalidates the kept enumerators, and waits for those that are being let go of. No request may be under way.
-    ~ProviderClient();
+    ~ProviderClient() override;
     ProviderClient(const ProviderClient&) = delete;
     ProviderClient& operator=(const ProviderClient&) = delete;
 
-    TesselExtension& provider() const { return *provider_; }
+    TesselExtension& provider() const override { return *provider_; }
 
     using PageCompletion = std::function<void(Result<ItemsPage>)>;
     void enumerateItems(const TesselItemIdentifier& container, const TesselPage& page, PageCompletion completion);
@@ -58,13 +41,13 @@ public:
                           ChangesCompletion completion);
 
     /// Until stopMonitoring(), an enumerator of the container is kept that has it signalled. Twice is once.
-    Result<void> startMonitoring(const TesselItemIdentifier& container);
-    void stopMonitoring(const TesselItemIdentifier& container);
+    Result<void> startMonitoring(const TesselItemIdentifier& container) override;
+    void stopMonitoring(const TesselItemIdentifier& container) override;
 
-    /// The same for a caller that has nothing else to do.
-    Result<ItemsPage> itemsOnPage(const TesselItemIdentifier& container, const TesselPage& page);
-    Result<std::optional<TesselSyncAnchor>> anchor(const TesselItemIdentifier& container);
-    Result<ChangesBatch> changesSince(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor);
+    // The same for a caller that has nothing else to do.
+    Result<ItemsPage> itemsOnPage(const TesselItemIdentifier& container, const TesselPage& page) override;
+    Result<std::optional<TesselSyncAnchor>> anchor(const TesselItemIdentifier& container) override;
+    Result<ChangesBatch> changesSince(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor) override;
 
 private:
     class Handle;

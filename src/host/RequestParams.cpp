@@ -26,6 +26,22 @@ bool RequestParams::optionalString(const char* name, std::optional<std::string>&
     return value.has_value();
 }
 
+bool RequestParams::optionalFilename(std::optional<std::string>& value) const {
+    if (!has("encodedName")) return optionalString("name", value);
+    value = filename();
+    return value.has_value();
+}
+
+std::optional<std::string> RequestParams::filename() const {
+    if (!has("encodedName")) return string("name");
+    if (has("name")) return refuse("one of \"name\" and \"encodedName\" is needed");
+    const auto text = string("encodedName");
+    if (!text) return std::nullopt;
+    auto name = percentDecoded(*text);
+    if (!name) return refuse("\"encodedName\" is not percent-encoded");
+    return name;
+}
+
 std::optional<std::vector<std::string>> RequestParams::strings(const char* name) const {
     const auto found = params_.find(name);
     if (found == params_.end()) return refuse(fmt::format("\"{}\" is missing", name));

@@ -28,6 +28,8 @@ public:
 
     std::optional<std::string> string(const char* name) const;
     std::optional<std::vector<std::string>> strings(const char* name) const;
+    /// A file's name: "name", or "encodedName", percent-encoded, which holds any bytes.
+    std::optional<std::string> filename() const;
     std::optional<KsDate> date(const char* name) const;
     std::optional<std::int64_t> integer(const char* name) const;
     /// The bytes of a page or an anchor. What they say is the provider's to judge.
@@ -38,6 +40,7 @@ public:
 
     /// A value that may be absent or null. False when it is neither that nor what it should be.
     bool optionalString(const char* name, std::optional<std::string>& value) const;
+    bool optionalFilename(std::optional<std::string>& value) const;
 
 private:
     std::nullopt_t refuse(std::string_view message) const;

@@ -5,6 +5,7 @@
 #include "host/ContainerMonitor.h"
 #include "host/Descriptor.h"
 #include "host/HostMethods.h"
+#include "host/HostProcess.h"
 #include "host/JsonText.h"
 #include "host/LineOutput.h"
 #include "host/LineSplitter.h"
@@ -56,6 +57,11 @@ Result<void> readAll(int input, int output, const UniqueFd& interrupt, LineSplit
 
 }  // namespace
 
+RpcService serviceOf(const HostProcess& host) {
+    return {host.provider(), host.paths(), host.signals(), [&host] { return host.statusText(); },
+            [&host](bool) { return host.helloText(); }};
+}
+
 Result<void> serveRpc(int input, int output, const RpcService& service) {
     const UniqueFd interrupt = TRY(descriptor::makeInterrupt());
     descriptor::enlargePipe(output, kPipeBytes);
@@ -69,7 +75,7 @@ Result<void> serveRpc(int input, int output, const UniqueFd& interrupt, LineSink
     ProviderClient client(service.provider);
     ContainerMonitor monitor(client, service.signals,
                              [&](const TesselItemIdentifier& container) { answers.write(signalLine(container)); });
-    JsonRpcServer server(makeHostMethods({client, monitor, service.paths, service.statusText}),
+    JsonRpcServer server(makeHostMethods({client, monitor, service.paths, service.statusText, service.hello}),
                          [&](std::string_view line) { answers.write(line); });
     Receiver receiver(server, answers);
     LineSplitter lines(receiver, kJsonRpcLineBytesMax);

@@ -13,13 +13,18 @@
 
 namespace cindral {
 
+class HostProcess;
+
 /// What a connection is served from. Borrowed for the call.
 struct RpcService {
     const std::shared_ptr<TesselExtension>& provider;
     const PresentedPaths& paths;
     SignalDispatcher& signals;
     std::function<std::string()> statusText;
+    std::function<std::string(bool endsSoon)> hello = [](bool) { return std::string("{}"); };
 };
+/// All that a host has to offer.
+RpcService serviceOf(const HostProcess& host);
 
 /// Serves one client on a pair of descriptors until its input ends, or it no longer reads. What the client monitors is
 /// told on the same line as the answers, as notifications, until the end of its input.

@@ -22,6 +22,8 @@ namespace {
 
 // Where nothing can be had for another client, this long nobody is accepted.
 constexpr std::chrono::seconds kRespite{1};
+// How long a client that is about to end by itself may go on after the end has begun.
+constexpr std::chrono::seconds kGrace{5};
 
 }  // namespace
 
@@ -33,20 +35,36 @@ public:
     Result<void> serve(const HostProcess& host) {
         const UniqueFd never = TRY(descriptor::makeInterrupt());
         const int fd = connection_.get();
-        auto served = serveRpc(fd, fd, never, output_,
-                               {host.provider(), host.paths(), host.signals(), [&] { return host.statusText(); }});
+        RpcService service = serviceOf(host);
+        service.hello = [&](bool endsSoon) { return hello(host, endsSoon); };
+        auto served = serveRpc(fd, fd, never, output_, service);
         output_.finish();
         return served;
     }
-    /// What it has sent is still read; then its input is over.
-    void end() {
+
+    enum class Which { thoseThatGoOn, all };
+    /// What it has sent is still read; then its input is over. A client that ends soon may go on, unless all are meant.
+    void end(Which which) {
+        const MutexLock lock(mutex_);
+        if (which == Which::thoseThatGoOn && endsSoon_) return;
+        isEnded_ = true;
         ::shutdown(connection_.get(), SHUT_RD);
         output_.hurry();
     }
 
 private:
+    /// One that comes too late is told so, and looks elsewhere.
+    std::string hello(const HostProcess& host, bool endsSoon) {
+        const MutexLock lock(mutex_);
+        endsSoon_ = endsSoon;
+        return isEnded_ ? R"({"isEnding":true})" : host.helloText();
+    }
+
     const UniqueFd connection_;
     SocketOutput output_;
+    Mutex mutex_;
+    bool endsSoon_ GUARDED_BY(mutex_) = false;
+    bool isEnded_ GUARDED_BY(mutex_) = false;
 };
 
 SocketListener::SocketListener(DaemonSocket socket) : socket_(std::move(socket)) {}
@@ -75,10 +93,15 @@ void SocketListener::stop() {
     socket_.close();
     if (stop_) descriptor::interrupt(stop_);
     changed_.notifyAll();
-    for (const auto& client : clients_) client->end();
+    for (const auto& client : clients_) client->end(Client::Which::thoseThatGoOn);
 }
 
 void SocketListener::waitUntilStopped() {
+    if (threads_.wait(kGrace) == WaitResult::done) return;
+    {
+        const MutexLock lock(mutex_);
+        for (const auto& client : clients_) client->end(Client::Which::all);
+    }
     threads_.wait();
 }
 
@@ -142,7 +165,7 @@ void SocketListener::welcome(UniqueFd connection, const HostProcess& host) {
     {
         const MutexLock lock(mutex_);
         clients_.push_back(client);
-        if (isStopping_) client->end();
+        if (isStopping_) client->end(Client::Which::thoseThatGoOn);
     }
     threads_.enter();
     const int failure = startBackgroundThread([this, client = client, &host]() mutable {

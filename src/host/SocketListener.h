@@ -16,6 +16,9 @@ namespace cindral {
 /// Only the person whose daemon it is is served: others are told so, and sent away. So is one client more than
 /// kClientsMax.
 ///
+/// A client that has said that it ends soon, a command that somebody has typed, is served to its own end also when the
+/// listener stops, for a few seconds: no command fails because its daemon is stopped or replaced.
+///
 /// Thread safety: as DaemonListener.
 class SocketListener final : public DaemonListener {
 public:

@@ -15,8 +15,11 @@ namespace {
 // Where the handler writes to; -1 for nowhere. A handler can be given nothing of its own.
 std::atomic<int> stopDescriptor{-1};
 
-void noteStop(int /*signal*/) {
+std::atomic<int> lastSignal{0};
+
+void noteStop(int signal) {
     const int savedErrno = errno;
+    lastSignal.store(signal);
     const std::uint64_t one = 1;
     [[maybe_unused]] const ssize_t put = ::write(stopDescriptor.load(), &one, sizeof one);
     errno = savedErrno;
@@ -39,9 +42,14 @@ Result<std::unique_ptr<StopSignals>> StopSignals::catchThem() {
 }
 
 StopSignals::StopSignals(UniqueFd descriptor) : descriptor_(std::move(descriptor)) {
+    lastSignal.store(0);
     stopDescriptor.store(descriptor_.get());
     catchSignal(SIGINT, interruptBefore_);
     catchSignal(SIGTERM, terminateBefore_);
+}
+
+int StopSignals::signal() const {
+    return lastSignal.load();
 }
 
 StopSignals::~StopSignals() {

@@ -22,6 +22,8 @@ public:
 
     /// Stays readable once a signal has come.
     int descriptor() const { return descriptor_.get(); }
+    /// The one that came last; 0 while none has.
+    int signal() const;
 
 private:
     explicit StopSignals(UniqueFd descriptor);

@@ -17,7 +17,7 @@ std::string counted(std::uint64_t count, std::string_view one, std::string_view 
 
 }  // namespace
 
-TreePrinter::TreePrinter(ProviderClient& client, const PresentedPaths& paths, const ItemText& text, TextOutput& output,
+TreePrinter::TreePrinter(ProviderAccess& client, const PresentedPaths& paths, const ItemText& text, TextOutput& output,
                          Options options)
     : client_(client), paths_(paths), text_(text), output_(output), options_(std::move(options)) {}
 

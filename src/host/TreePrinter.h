@@ -26,7 +26,7 @@ public:
     };
 
     /// All borrowed for life.
-    TreePrinter(ProviderClient& client, const PresentedPaths& paths, const ItemText& text, TextOutput& output,
+    TreePrinter(ProviderAccess& client, const PresentedPaths& paths, const ItemText& text, TextOutput& output,
                 Options options);
 
     /// Errors of the container itself, as the provider says them.
@@ -36,7 +36,7 @@ public:
 
 private:
     struct Level {
-        Level(ProviderClient& client, const TesselItemIdentifier& container) : listing(client, container) {}
+        Level(ProviderAccess& client, const TesselItemIdentifier& container) : listing(client, container) {}
         ContainerListing listing;
         std::shared_ptr<const TesselItem>
             upcoming;                  ///< null: nothing left; drawn differently, so it is known one ahead
@@ -52,7 +52,7 @@ private:
     std::unique_ptr<Level> open(const TesselItem& item, ItemKind kind, std::string& remark);
     void note(const TesselItem& item, const KsError& error);
 
-    ProviderClient& client_;
+    ProviderAccess& client_;
     const PresentedPaths& paths_;
     const ItemText& text_;
     TextOutput& output_;

@@ -16,6 +16,7 @@
 #include "host/Descriptor.h"
 #include "host/FakeProvider.h"
 #include "host/HostError.h"
+#include "host/ProviderClient.h"
 #include "platform/foundation/Base64.h"
 #include "support/TemporaryFolder.h"
 

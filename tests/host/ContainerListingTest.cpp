@@ -6,6 +6,7 @@
 #include <cerrno>
 
 #include "host/FakeProvider.h"
+#include "host/ProviderClient.h"
 
 namespace cindral {
 namespace {

@@ -30,24 +30,6 @@ int hexValue(char c) {
     return -1;
 }
 
-std::optional<std::string> percentDecoded(std::string_view text) {
-    std::string out;
-    out.reserve(text.size());
-    for (std::size_t i = 0; i < text.size(); ++i) {
-        if (text[i] != '%') {
-            out += text[i];
-            continue;
-        }
-        if (text.size() - i < 3) return std::nullopt;
-        const int high = hexValue(text[i + 1]);
-        const int low = hexValue(text[i + 2]);
-        if (high < 0 || low < 0) return std::nullopt;
-        out += static_cast<char>(high * 16 + low);
-        i += 2;
-    }
-    return out;
-}
-
 constexpr std::array<bool, 256> kKeptInURLs = [] {
     std::array<bool, 256> kept{};
     for (char c = 'a'; c <= 'z'; ++c) kept[static_cast<unsigned char>(c)] = true;
@@ -78,6 +60,24 @@ std::uint32_t storedDocumentIdentifier(const FileStatus& status) {
 }
 
 }  // namespace
+
+std::optional<std::string> percentDecoded(std::string_view text) {
+    std::string out;
+    out.reserve(text.size());
+    for (std::size_t i = 0; i < text.size(); ++i) {
+        if (text[i] != '%') {
+            out += text[i];
+            continue;
+        }
+        if (text.size() - i < 3) return std::nullopt;
+        const int high = hexValue(text[i + 1]);
+        const int low = hexValue(text[i + 2]);
+        if (high < 0 || low < 0) return std::nullopt;
+        out += static_cast<char>(high * 16 + low);
+        i += 2;
+    }
+    return out;
+}
 
 std::string_view resourceKeyName(ResourceKey key) {
     switch (key) {

@@ -35,6 +35,9 @@ using ResourceValue = std::variant<bool, std::uint64_t, KsDate, std::string, Byt
 /// Name of the class that the value is of: "KsNumber" (also of a bool), "KsDate", "KsString", "KsData".
 std::string_view resourceValueClass(const ResourceValue& value);
 
+/// The bytes that a percent-encoded text stands for; none where a "%" is not followed by two hexadecimal digits.
+std::optional<std::string> percentDecoded(std::string_view text);
+
 /// The name of a file, with what has been read about it.
 ///
 /// A file URL holds an absolute path as bytes, without trailing slashes; "." and ".." stay as they are. Anything else

@@ -45,6 +45,14 @@ void TesselProgress::advance(std::uint64_t bytes, std::uint64_t items) {
     tell();
 }
 
+void TesselProgress::setCounts(const Counts& counts) {
+    {
+        const MutexLock lock(mutex_);
+        counts_ = counts;
+    }
+    tell();
+}
+
 void TesselProgress::tell() {
     if (!isObserved_.load()) return;
     std::shared_ptr<const Observer> observer;

@@ -39,6 +39,8 @@ public:
     Result<void> check() const;
     void setTotal(std::uint64_t bytes, std::uint64_t items);
     void advance(std::uint64_t bytes, std::uint64_t items);
+    /// For an operation that is counted elsewhere.
+    void setCounts(const Counts& counts);
 
 private:
     void tell();
