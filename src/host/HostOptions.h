@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <span>
 #include <string>
@@ -24,6 +25,12 @@ enum class HostCommand {
     rpc,
     edit,
     thumbnail,
+    find,
+    recents,
+    tagged,
+    favorites,
+    trashed,  ///< trash without items
+    allTags,  ///< tags without items
     apps,
     appsEnable,
     appsDisable
@@ -44,10 +51,12 @@ struct HostOptions {
     bool flatpak = true;
     RecorderChoice recorder = RecorderChoice::automatic;
     bool json = false;
-    bool intoPackages = false;  ///< tree
-    EditOptions edit;           ///< edit
-    std::string since;          ///< changes: an anchor, as printed
-    std::string outputFile;     ///< thumbnail: absolute, or "-"
+    bool intoPackages = false;         ///< tree
+    EditOptions edit;                  ///< edit
+    std::string since;                 ///< changes: an anchor, as printed
+    std::string outputFile;            ///< thumbnail: absolute, or "-"
+    std::string text;                  ///< find: what is looked for; tagged: the tag
+    std::uint64_t limit = UINT64_MAX;  ///< of the items that a search prints
 };
 
 /// Where applications are looked for: the environment's sources, and what the options say of them.

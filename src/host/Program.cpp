@@ -36,8 +36,9 @@ int outputFailure(const KsError& error) {
 }
 
 int runRpc(const HostProcess& host) {
-    const auto served = serveRpc(STDIN_FILENO, STDOUT_FILENO,
-                                 {host.provider(), host.paths(), host.signals(), [&] { return host.statusText(); }});
+    const auto served =
+        serveRpc(STDIN_FILENO, STDOUT_FILENO,
+                 {host.provider(), host.paths(), host.signals(), [&] { return host.statusText(); }, host.search()});
     if (!served.ok()) return failWith(hostFailure(fmt::format("the connection broke: {}", served.error().reason())));
     return kExitDone;
 }
@@ -66,8 +67,9 @@ int runCommand(const HostProcess& host, const HostEnvironment& environment) {
         stopSignals = TRY(StopSignals::catchThem());
         return stopSignals->descriptor();
     };
-    Commands commands({client, host.paths(), host.options(), environment, statusText, host.signals(), stopDescriptor},
-                      output);
+    Commands commands(
+        {client, host.paths(), host.options(), environment, statusText, host.signals(), stopDescriptor, host.search()},
+        output);
     const auto done = commands.run();
     // What was found before something went wrong is shown before the line that says what.
     if (const auto error = output.finish()) return outputFailure(*error);

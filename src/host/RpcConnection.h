@@ -5,6 +5,7 @@
 #include <string>
 
 #include "host/PresentedPaths.h"
+#include "host/SearchQueries.h"
 #include "host/SignalDispatcher.h"
 #include "platform/foundation/Result.h"
 #include "platform/tessel/TesselExtension.h"
@@ -17,6 +18,7 @@ struct RpcService {
     const PresentedPaths& paths;
     SignalDispatcher& signals;
     std::function<std::string()> statusText;
+    SearchQueries& search;
 };
 
 /// Serves one client on a pair of descriptors until its input ends, or it no longer reads. What the client monitors is
