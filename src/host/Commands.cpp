@@ -11,6 +11,7 @@
 #include "host/HostError.h"
 #include "host/ItemWriter.h"
 #include "host/JsonText.h"
+#include "host/SearchCommands.h"
 #include "host/TerminalText.h"
 #include "host/TreePrinter.h"
 #include "platform/foundation/Base64.h"
@@ -56,6 +57,12 @@ Result<void> Commands::run() {
         case HostCommand::status: return status();
         case HostCommand::edit: return EditCommands(context_, EditTerminal::ofProcess(), output_).run();
         case HostCommand::thumbnail: return thumbnail();
+        case HostCommand::find: return search({SearchQuery::Kind::names, context_.options.text});
+        case HostCommand::recents: return search({SearchQuery::Kind::recents, ""});
+        case HostCommand::tagged: return search({SearchQuery::Kind::tagged, context_.options.text});
+        case HostCommand::favorites: return search({SearchQuery::Kind::favorites, ""});
+        case HostCommand::trashed: return search({SearchQuery::Kind::trashed, ""});
+        case HostCommand::allTags: return SearchCommands(context_, output_).allTags();
         case HostCommand::apps:
         case HostCommand::appsEnable:
         case HostCommand::appsDisable:
@@ -269,6 +276,10 @@ Result<void> Commands::status() {
         output_.line(fmt::format("{:<19} {}", key, terminalText(shown)));
     }
     return {};
+}
+
+Result<void> Commands::search(const SearchQuery& query) {
+    return SearchCommands(context_, output_).find(query);
 }
 
 Result<void> Commands::thumbnail() {

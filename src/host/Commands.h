@@ -9,6 +9,7 @@
 #include "host/ItemText.h"
 #include "host/PresentedPaths.h"
 #include "host/ProviderAccess.h"
+#include "host/SearchQueries.h"
 #include "host/SignalDispatcher.h"
 #include "host/TextOutput.h"
 
@@ -30,6 +31,7 @@ public:
         SignalDispatcher& signals;
         /// From the call on, what asks a command that has no end to end makes the descriptor readable.
         std::function<Result<int>()> stopDescriptor;
+        SearchQueries& search;
     };
 
     /// All borrowed for life.
@@ -57,6 +59,7 @@ private:
     Result<void> watch();
     Result<void> status();
     Result<void> thumbnail();
+    Result<void> search(const SearchQuery& query);
 
     /// The item that was named; the root container where none was.
     Result<TesselItemIdentifier> identifier() const;

@@ -27,12 +27,13 @@ constexpr EditDescription kEdits[] = {
     {EditCommand::rename, "rename", "Give an item another name.", "ITEM NAME", 2, 2},
     {EditCommand::mv, "mv", "Move items into a folder, the last item named.", "ITEM", 2, kAnyNumber},
     {EditCommand::rm, "rm", "Delete items for good.", "ITEM", 1, kAnyNumber},
-    {EditCommand::trash, "trash", "Move items to the trash.", "ITEM", 1, kAnyNumber},
+    {EditCommand::trash, "trash", "Move items to the trash; without items, show what is in it.", "ITEM", 0, kAnyNumber},
     {EditCommand::restore, "restore", "Take items out of the trash, back to where they were.", "ITEM", 1, kAnyNumber},
     {EditCommand::emptyTrash, "empty-trash", "Delete for good what is in the trash.", nullptr, 0, 0},
     {EditCommand::tag, "tag", "Put a tag on items.", "TAG ITEM", 2, kAnyNumber},
     {EditCommand::untag, "untag", "Take a tag off items.", "TAG ITEM", 2, kAnyNumber},
-    {EditCommand::tags, "tags", "Print the tags of items, one a line.", "ITEM", 1, kAnyNumber},
+    {EditCommand::tags, "tags", "Print the tags of items, one a line; without items, all tags and how many bear them.",
+     "ITEM", 0, kAnyNumber},
     {EditCommand::favorite, "favorite", "Make items favorites.", "ITEM", 1, kAnyNumber},
     {EditCommand::unfavorite, "unfavorite", "Make items favorites no longer.", "ITEM", 1, kAnyNumber},
     {EditCommand::touchUsed, "touch-used", "Note that items were used.", "ITEM", 1, kAnyNumber},
@@ -110,7 +111,7 @@ void addEditCommands(CLI::App& app, EditOptions& options) {
         if (edit.words != nullptr) {
             command->add_option(edit.words, options.words, kWordsHelp)
                 ->type_name("")
-                ->required()
+                ->required(edit.wordsMin > 0)
                 ->expected(edit.wordsMin, edit.wordsMax);
         }
         addOptionsOf(*command, edit.command, options);

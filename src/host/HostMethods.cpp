@@ -9,6 +9,7 @@
 #include "host/ItemWriter.h"
 #include "host/JsonText.h"
 #include "host/RequestParams.h"
+#include "host/SearchMethods.h"
 #include "host/Utf8.h"
 #include "platform/foundation/Base64.h"
 #include "platform/tessel/TesselErrors.h"
@@ -272,6 +273,7 @@ JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context) {
         {"hello", hello},
     };
     JsonRpcServer::Methods methods = makeEditMethods(context);
+    methods.merge(makeSearchMethods(context));
     for (const auto& entry : kHandlers) {
         methods.emplace(entry.first, [context, handler = entry.second](const Json& params, const Reply& reply) {
             handler(context, params, reply);

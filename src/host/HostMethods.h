@@ -7,6 +7,7 @@
 #include "host/JsonRpcServer.h"
 #include "host/PresentedPaths.h"
 #include "host/ProviderClient.h"
+#include "host/QueryWatches.h"
 
 namespace cindral {
 
@@ -16,6 +17,8 @@ struct HostMethodsContext {
     ContainerMonitor& monitor;
     const PresentedPaths& paths;
     std::function<std::string()> statusText;  ///< as JSON
+    SearchQueries& search;
+    QueryWatches& watches;
     /// What the host says of itself, as JSON; told whether the client ends soon, and by itself.
     std::function<std::string(bool endsSoon)> hello;
 };

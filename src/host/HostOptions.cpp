@@ -36,11 +36,13 @@ struct Words {
     bool intoPackages = false;
     std::string since;
     std::string outputFile;
+    std::string text;
+    std::uint64_t limit = UINT64_MAX;
     std::string item;
     EditOptions edit;
 };
 
-enum class Argument { none, optionalItem, item, path, application };
+enum class Argument { none, optionalItem, item, path, application, text, tag };
 
 struct CommandDescription {
     const char* name;
@@ -62,6 +64,11 @@ constexpr CommandDescription kCommands[] = {
     {"watch", "Print what changes in a container, a line each, until it is interrupted.", HostCommand::watch,
      Argument::optionalItem},
     {"thumbnail", "Write the thumbnail of an item into a file, as PNG.", HostCommand::thumbnail, Argument::item},
+    {"find", "Find items by their names: by how they begin, how a word in them begins, or any part of them.",
+     HostCommand::find, Argument::text},
+    {"recents", "Show documents, those first that were used or changed last.", HostCommand::recents, Argument::none},
+    {"tagged", "Show the items that bear a tag.", HostCommand::tagged, Argument::tag},
+    {"favorites", "Show the favorites, by their rank.", HostCommand::favorites, Argument::none},
     {"apps", "Show which applications are installed, and whose documents are published.", HostCommand::apps,
      Argument::none},
     {"status", "Show where the host works and what it knows.", HostCommand::status, Argument::none},
@@ -126,7 +133,21 @@ void addArgument(CLI::App& command, Argument argument, Words& words) {
                 ->type_name("")
                 ->required();
             return;
+        case Argument::text:
+            command
+                .add_option(
+                    "TEXT", words.text,
+                    "A part of the name. Case and accents make no difference. What begins with - goes after --.")
+                ->type_name("")
+                ->required();
+            return;
+        case Argument::tag: command.add_option("TAG", words.text, "The tag.")->type_name("")->required(); return;
     }
+}
+
+bool isSearch(HostCommand command) {
+    return command == HostCommand::find || command == HostCommand::recents || command == HostCommand::tagged ||
+           command == HostCommand::favorites;
 }
 
 void addCommands(CLI::App& app, Words& words) {
@@ -135,6 +156,11 @@ void addCommands(CLI::App& app, Words& words) {
         command->fallthrough();
         addArgument(*command, description.argument, words);
         if (description.command == HostCommand::ls) command->footer(kColumnsHelp);
+        if (isSearch(description.command)) {
+            command->add_option("--limit", words.limit, "Print so many at most. Default: all.")
+                ->type_name("NUMBER")
+                ->check(CLI::PositiveNumber);
+        }
         if (description.command == HostCommand::tree) {
             command->add_flag("--packages", words.intoPackages, "Also show what is in packages.");
         }
@@ -181,6 +207,8 @@ const char* nameOf(Argument argument) {
         case Argument::item: return "ITEM";
         case Argument::path: return "PATH";
         case Argument::application: return "ID";
+        case Argument::text: return "TEXT";
+        case Argument::tag: return "TAG";
     }
     return "";
 }
@@ -193,11 +221,19 @@ void readCommand(const CLI::App& app, const Words& words, HostOptions& options) 
         options.command = HostCommand::edit;
         options.edit = words.edit;
         options.edit.command = editCommandNamed(chosen.get_name()).value_or(EditCommand::tags);
+        // Without items, these two show what there is.
+        if (options.edit.words.empty() && options.edit.command == EditCommand::trash)
+            options.command = HostCommand::trashed;
+        if (options.edit.words.empty() && options.edit.command == EditCommand::tags)
+            options.command = HostCommand::allTags;
         return;
     }
     options.command = description->command;
-    const bool hasItem = description->argument != Argument::none &&
-                         chosen.get_option_no_throw(nameOf(description->argument))->count() > 0;
+    options.text = words.text;
+    options.limit = words.limit;
+    const bool namesNone = description->argument == Argument::none || description->argument == Argument::text ||
+                           description->argument == Argument::tag;
+    const bool hasItem = !namesNone && chosen.get_option_no_throw(nameOf(description->argument))->count() > 0;
     if (hasItem) options.item = words.item;
 }
 

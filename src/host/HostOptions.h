@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <span>
 #include <string>
@@ -25,6 +26,12 @@ enum class HostCommand {
     serve,
     edit,
     thumbnail,
+    find,
+    recents,
+    tagged,
+    favorites,
+    trashed,  ///< trash without items
+    allTags,  ///< tags without items
     apps,
     appsEnable,
     appsDisable
@@ -45,10 +52,12 @@ struct HostOptions {
     bool flatpak = true;
     RecorderChoice recorder = RecorderChoice::automatic;
     bool json = false;
-    bool intoPackages = false;  ///< tree
-    EditOptions edit;           ///< edit
-    std::string since;          ///< changes: an anchor, as printed
-    std::string outputFile;     ///< thumbnail: absolute, or "-"
+    bool intoPackages = false;         ///< tree
+    EditOptions edit;                  ///< edit
+    std::string since;                 ///< changes: an anchor, as printed
+    std::string outputFile;            ///< thumbnail: absolute, or "-"
+    std::string text;                  ///< find: what is looked for; tagged: the tag
+    std::uint64_t limit = UINT64_MAX;  ///< of the items that a search prints
     /// Which of them the call's words say; the others are defaults.
     struct Said {
         bool storage = false;

@@ -81,6 +81,12 @@ bool records(HostCommand command) {
         case HostCommand::changes:
         case HostCommand::watch:
         case HostCommand::status:
+        case HostCommand::find:
+        case HostCommand::recents:
+        case HostCommand::tagged:
+        case HostCommand::favorites:
+        case HostCommand::trashed:
+        case HostCommand::allTags:
         case HostCommand::rpc:
         case HostCommand::serve: return true;
         case HostCommand::ls:
@@ -141,6 +147,8 @@ Result<std::unique_ptr<HostProcess>> HostProcess::start(HostOptions options, con
     TRY(host->connect());
     RoApplicationWorkspace::defaultWorkspace().start(rosterSources(host->options_, environment));
     host->provider_ = makeProvider();
+    host->search_ = std::make_shared<SearchIndex>(host->provider_, *host->signals_, host->state_ + "/search-index");
+    host->signals_->setSearchableItems(host->search_);
     host->provider_->waitUntilReady();
     if (records(host->options_.command)) host->startRecorder();
     return host;
@@ -155,7 +163,6 @@ Result<void> HostProcess::connect() {
     RoApplicationWorkspace::defaultWorkspace().setOwnRecord(ownRecord(paths_));
     TesselManager::defaultManager().setDocumentStorageURL(KsURL::fileURL(paths_.presented()));
     TesselManager::defaultManager().setApplicationSupportURL(KsURL::fileURL(state_ + "/Application Support"));
-    signals_->setSearchableItems(std::make_shared<SearchableItemsInMemory>());
     TesselManager::defaultManager().setHost(signals_);
     return {};
 }
@@ -192,6 +199,9 @@ HostProcess::~HostProcess() {
     // Who waits for the history is let go of first.
     if (recorder_) recorder_->stop();
     RoApplicationWorkspace::defaultWorkspace().stop();
+    signals_->setSearchableItems(nullptr);
+    if (search_) search_->stop();
+    search_.reset();
     provider_.reset();
     // A provider that goes leaves its last work to the main queue.
     SerialQueue::main().sync([] {});

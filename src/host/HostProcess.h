@@ -7,6 +7,7 @@
 #include "host/HostOptions.h"
 #include "host/PresentedPaths.h"
 #include "host/SignalDispatcher.h"
+#include "host/search/SearchIndex.h"
 #include "platform/eventstream/Recorder.h"
 #include "platform/foundation/Result.h"
 #include "platform/revisions/VolumeStore.h"
@@ -42,6 +43,7 @@ public:
 
     /// Where the provider's signals arrive.
     SignalDispatcher& signals() const { return *signals_; }
+    SearchIndex& search() const { return *search_; }
 
     /// Returns when the roots have been read or compared.
     void waitForHistory() const;
@@ -64,6 +66,7 @@ private:
     std::shared_ptr<VolumeStore> store_;
     std::shared_ptr<Recorder> recorder_;  // Null for commands that don't ask for changes.
     std::shared_ptr<TesselExtension> provider_;
+    std::shared_ptr<SearchIndex> search_;
 };
 
 }  // namespace cindral

@@ -109,20 +109,20 @@ bool isContainer(ItemKind kind) {
     return kind == ItemKind::folder || kind == ItemKind::package;
 }
 
-void ItemText::appendName(std::string& out, const TesselItem& item, ItemKind kind) const {
+void ItemText::appendName(std::string& out, std::string_view name, ItemKind kind) const {
     const std::string_view color = wantsColor_ ? colorOf(kind) : std::string_view();
     out += color;
-    appendTerminalText(out, item.filename());
+    appendTerminalText(out, name);
     if (!color.empty()) out += kNoColor;
 }
 
-void ItemText::appendLine(std::string& out, const TesselItem& item) const {
+void ItemText::appendLine(std::string& out, const TesselItem& item, std::string_view name) const {
     const ItemKind kind = kindOf(item);
     out += letterOf(kind);
     for (const Capability& each : kCapabilities) out += item.capabilities() & each.bit ? each.letter : '-';
     const auto date = item.contentModificationDate();
     fmt::format_to(std::back_inserter(out), " {:>12}  {:<16}  ", sizeText(item), date ? humanMinute(*date) : "");
-    appendName(out, item, kind);
+    appendName(out, name, kind);
 }
 
 std::string ItemText::allFields(const TesselItem& item, const std::string& realURL) const {

@@ -22,9 +22,14 @@ public:
     explicit ItemText(bool wantsColor) : wantsColor_(wantsColor) {}
 
     /// The name, escaped, in the colour of its kind.
-    void appendName(std::string& out, const TesselItem& item, ItemKind kind) const;
+    void appendName(std::string& out, const TesselItem& item, ItemKind kind) const {
+        appendName(out, item.filename(), kind);
+    }
+    void appendName(std::string& out, std::string_view name, ItemKind kind) const;
     /// "drwmntd      3 items  2026-11-20 09:52  Projects"
-    void appendLine(std::string& out, const TesselItem& item) const;
+    void appendLine(std::string& out, const TesselItem& item) const { appendLine(out, item, item.filename()); }
+    /// The same with another text for the name.
+    void appendLine(std::string& out, const TesselItem& item, std::string_view name) const;
     /// Every field that has a value, one a line.
     std::string allFields(const TesselItem& item, const std::string& realURL) const;
 

@@ -135,7 +135,8 @@ int runAlone(const HostProcess& host, const HostEnvironment& environment) {
         stopSignals = TRY(StopSignals::catchThem());
         return stopSignals->descriptor();
     };
-    return runCommand({client, host.paths(), host.options(), environment, statusText, host.signals(), stopDescriptor});
+    return runCommand(
+        {client, host.paths(), host.options(), environment, statusText, host.signals(), stopDescriptor, host.search()});
 }
 
 /// By the daemon.
@@ -159,8 +160,8 @@ int runRemotely(const HostOptions& options, const HostEnvironment& environment, 
         stopSignals = TRY(StopSignals::catchThem());
         return stopSignals->descriptor();
     };
-    return runCommand(
-        {client, paths, options, environment, [&] { return client.statusText(); }, signals, stopDescriptor});
+    return runCommand({client, paths, options, environment, [&] { return client.statusText(); }, signals,
+                       stopDescriptor, client.search()});
 }
 
 /// They look at the applications themselves, with a daemon's eyes where there is one.

@@ -20,16 +20,6 @@ Params pageParams(const TesselItemIdentifier& container, const TesselPage& page)
     return params.add("page", base64Encode(page));
 }
 
-/// Bytes that may be null.
-Result<std::optional<Bytes>> bytesIn(const Json& answer, const char* key) {
-    const auto found = answer.find(key);
-    if (found == answer.end()) return unreadableAnswer();
-    if (found->is_null()) return std::optional<Bytes>();
-    auto bytes = found->is_string() ? base64Decode(found->get_ref<const std::string&>()) : std::nullopt;
-    if (!bytes) return unreadableAnswer();
-    return bytes;
-}
-
 const Json* listIn(const Json& answer, const char* key) {
     const auto found = answer.find(key);
     return found != answer.end() && found->is_array() ? &*found : nullptr;
@@ -54,18 +44,11 @@ void RemoteClient::didLoseDaemon() {
 }
 
 Result<ItemsPage> RemoteClient::itemsOnPage(const TesselItemIdentifier& container, const TesselPage& page) {
-    const Json answer = TRY(connection_.call("enumerateItems", pageParams(container, page)));
-    const Json* items = listIn(answer, "items");
-    if (items == nullptr) return unreadableAnswer();
-    ItemsPage result;
-    result.items.reserve(items->size());
-    for (const Json& item : *items) result.items.push_back(TRY(itemFromJson(item)));
-    result.nextPage = TRY(bytesIn(answer, "nextPage"));
-    return result;
+    return itemsPageFromJson(TRY(connection_.call("enumerateItems", pageParams(container, page))));
 }
 
 Result<std::optional<TesselSyncAnchor>> RemoteClient::anchor(const TesselItemIdentifier& container) {
-    return bytesIn(TRY(connection_.call("currentSyncAnchor", Params().add("container", container))), "anchor");
+    return bytesFromJson(TRY(connection_.call("currentSyncAnchor", Params().add("container", container))), "anchor");
 }
 
 Result<ChangesBatch> RemoteClient::changesSince(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor) {
@@ -73,7 +56,7 @@ Result<ChangesBatch> RemoteClient::changesSince(const TesselItemIdentifier& cont
         connection_.call("enumerateChanges", Params().add("container", container).add("anchor", base64Encode(anchor))));
     const Json* updated = listIn(answer, "updated");
     const Json* log = listIn(answer, "log");
-    auto next = TRY(bytesIn(answer, "anchor"));
+    auto next = TRY(bytesFromJson(answer, "anchor"));
     if (updated == nullptr || log == nullptr || !next) return unreadableAnswer();
     ChangesBatch batch;
     batch.anchor = *std::move(next);

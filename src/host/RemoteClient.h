@@ -6,6 +6,7 @@
 #include "host/DaemonConnection.h"
 #include "host/ProviderAccess.h"
 #include "host/RemoteProvider.h"
+#include "host/RemoteSearch.h"
 #include "platform/foundation/Mutex.h"
 
 namespace cindral {
@@ -23,6 +24,7 @@ public:
     DaemonConnection& connection() { return connection_; }
 
     TesselExtension& provider() const override { return provider_; }
+    SearchQueries& search() { return search_; }
     Result<ItemsPage> itemsOnPage(const TesselItemIdentifier& container, const TesselPage& page) override;
     Result<std::optional<TesselSyncAnchor>> anchor(const TesselItemIdentifier& container) override;
     Result<ChangesBatch> changesSince(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor) override;
@@ -40,6 +42,7 @@ private:
     std::set<TesselItemIdentifier> monitored_ GUARDED_BY(mutex_);
     DaemonConnection connection_;  // Ends first: its thread uses what is above.
     mutable RemoteProvider provider_{connection_};
+    RemoteSearch search_{connection_};
 };
 
 }  // namespace cindral

@@ -148,4 +148,29 @@ Result<std::shared_ptr<const TesselItem>> itemFromJson(const Json& json) {
     return std::make_shared<const RemoteItem>(json);
 }
 
+Result<TesselItems> itemsFromJson(const Json& answer) {
+    const auto found = answer.find("items");
+    if (found == answer.end() || !found->is_array()) return unreadableAnswer();
+    TesselItems items;
+    items.reserve(found->size());
+    for (const Json& item : *found) items.push_back(TRY(itemFromJson(item)));
+    return items;
+}
+
+Result<std::optional<Bytes>> bytesFromJson(const Json& answer, const char* key) {
+    const auto found = answer.find(key);
+    if (found == answer.end()) return unreadableAnswer();
+    if (found->is_null()) return std::optional<Bytes>();
+    auto bytes = found->is_string() ? base64Decode(found->get_ref<const std::string&>()) : std::nullopt;
+    if (!bytes) return unreadableAnswer();
+    return bytes;
+}
+
+Result<ItemsPage> itemsPageFromJson(const Json& answer) {
+    ItemsPage page;
+    page.items = TRY(itemsFromJson(answer));
+    page.nextPage = TRY(bytesFromJson(answer, "nextPage"));
+    return page;
+}
+
 }  // namespace cindral

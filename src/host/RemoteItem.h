@@ -1,8 +1,10 @@
 #pragma once
 
 #include <memory>
+#include <optional>
 
 #include "host/JsonRpcMessage.h"
+#include "host/ProviderAccess.h"
 #include "platform/foundation/Result.h"
 #include "platform/tessel/TesselItem.h"
 
@@ -14,5 +16,11 @@ namespace cindral {
 ///
 /// Errors are the host's own: what was read is no item.
 Result<std::shared_ptr<const TesselItem>> itemFromJson(const Json& json);
+/// The "items" of an answer.
+Result<TesselItems> itemsFromJson(const Json& answer);
+/// The same with its "nextPage".
+Result<ItemsPage> itemsPageFromJson(const Json& answer);
+/// Base64 that may be null.
+Result<std::optional<Bytes>> bytesFromJson(const Json& answer, const char* key);
 
 }  // namespace cindral

@@ -42,6 +42,17 @@ std::optional<std::string> RequestParams::filename() const {
     return name;
 }
 
+bool RequestParams::optionalBoolean(const char* name, bool& value) const {
+    if (!has(name) || isNull(name)) return true;
+    const Json& given = params_.at(name);
+    if (!given.is_boolean()) {
+        refuse(fmt::format("\"{}\" is neither true nor false", name));
+        return false;
+    }
+    value = given.get<bool>();
+    return true;
+}
+
 std::optional<std::vector<std::string>> RequestParams::strings(const char* name) const {
     const auto found = params_.find(name);
     if (found == params_.end()) return refuse(fmt::format("\"{}\" is missing", name));

@@ -41,6 +41,7 @@ public:
     /// A value that may be absent or null. False when it is neither that nor what it should be.
     bool optionalString(const char* name, std::optional<std::string>& value) const;
     bool optionalFilename(std::optional<std::string>& value) const;
+    bool optionalBoolean(const char* name, bool& value) const;
 
 private:
     std::nullopt_t refuse(std::string_view message) const;

@@ -41,6 +41,13 @@ std::string signalLine(const TesselItemIdentifier& container) {
     return line + "}}\n";
 }
 
+/// The notification that a watched query's answer may be another.
+std::string queryLine(std::uint64_t watch) {
+    std::string line = R"({"jsonrpc":"2.0","method":"queryChanged","params":{"watch":)";
+    appendJsonNumber(line, watch);
+    return line + "}}\n";
+}
+
 /// Reads until the end of input, or until nobody reads the answers.
 Result<void> readAll(int input, int output, const UniqueFd& interrupt, LineSplitter& lines) {
     std::vector<char> buffer(kReadBytes);
@@ -58,8 +65,9 @@ Result<void> readAll(int input, int output, const UniqueFd& interrupt, LineSplit
 }  // namespace
 
 RpcService serviceOf(const HostProcess& host) {
-    return {host.provider(), host.paths(), host.signals(), [&host] { return host.statusText(); },
-            [&host](bool) { return host.helloText(); }};
+    return {host.provider(), host.paths(),
+            host.signals(),  [&host] { return host.statusText(); },
+            host.search(),   [&host](bool) { return host.helloText(); }};
 }
 
 Result<void> serveRpc(int input, int output, const RpcService& service) {
@@ -70,13 +78,15 @@ Result<void> serveRpc(int input, int output, const RpcService& service) {
 }
 
 Result<void> serveRpc(int input, int output, const UniqueFd& interrupt, LineSink& answers, const RpcService& service) {
-    // Taken down from the last to the first: the server waits for its requests, then nothing is monitored any more, and
-    // the client lets go of its enumerators.
+    // Taken down from the last to the first: the server waits for its requests, then nothing is watched or monitored any
+    // more, and the client lets go of its enumerators.
     ProviderClient client(service.provider);
     ContainerMonitor monitor(client, service.signals,
                              [&](const TesselItemIdentifier& container) { answers.write(signalLine(container)); });
-    JsonRpcServer server(makeHostMethods({client, monitor, service.paths, service.statusText, service.hello}),
-                         [&](std::string_view line) { answers.write(line); });
+    QueryWatches watches(service.search, [&](std::uint64_t watch) { answers.write(queryLine(watch)); });
+    JsonRpcServer server(
+        makeHostMethods({client, monitor, service.paths, service.statusText, service.search, watches, service.hello}),
+        [&](std::string_view line) { answers.write(line); });
     Receiver receiver(server, answers);
     LineSplitter lines(receiver, kJsonRpcLineBytesMax);
 

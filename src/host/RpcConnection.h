@@ -6,6 +6,7 @@
 
 #include "host/LineSink.h"
 #include "host/PresentedPaths.h"
+#include "host/SearchQueries.h"
 #include "host/SignalDispatcher.h"
 #include "platform/foundation/Result.h"
 #include "platform/foundation/UniqueFd.h"
@@ -21,6 +22,7 @@ struct RpcService {
     const PresentedPaths& paths;
     SignalDispatcher& signals;
     std::function<std::string()> statusText;
+    SearchQueries& search;
     std::function<std::string(bool endsSoon)> hello = [](bool) { return std::string("{}"); };
 };
 /// All that a host has to offer.

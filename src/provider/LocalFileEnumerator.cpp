@@ -1,5 +1,6 @@
 #include "provider/LocalFileEnumerator.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstdlib>
@@ -38,6 +39,10 @@ EnumeratorOptions pageOptions(const TesselItemIdentifier& container, const std::
     }
     return options;
 }
+
+// How far the pages of a follower's listing overlap: so many entries may go while one is read.
+constexpr std::uint64_t kFollowerOverlap = 16;
+constexpr std::size_t kEventsBatchMax = 1'000;
 
 /// The event history, where it can tell what happened since the event without a wait for the first look at the roots.
 std::shared_ptr<EventHistory> historyAfter(std::uint64_t eventID) {
@@ -99,6 +104,9 @@ void LocalFileEnumerator::enumerateItemsForObserver(std::shared_ptr<TesselEnumer
         pageName = "initialPageSortedByDate";
     } else if (page == tesselInitialPageSortedByName()) {
         pageName = "initialPageSortedByName";
+    } else if (page == tesselInitialPageForFollowers()) {
+        pageName = "initialPageForFollowers";
+        token.isForFollower = true;
     } else {
         const std::optional<FSChangeToken> decoded = FSChangeToken::decode(page);
         if (!decoded) {
@@ -123,11 +131,22 @@ void LocalFileEnumerator::gather(TesselEnumerationObserver& observer, FSChangeTo
     const std::uint64_t reached = gathered->reached;
     const bool isFull = gathered->isFull;
 
-    const Result<void> witnessed = witness(*token, *gathered);
-    if (!witnessed.ok()) return observer.finishEnumeratingWithError(witnessed.error());
+    const bool goesBack = canGoBack(*token);
+    std::optional<FSChangeToken> following;
+    if (goesBack) {
+        const Result<std::optional<FSChangeToken>> next = followingPage(*token, *gathered);
+        if (!next.ok()) return observer.finishEnumeratingWithError(next.error());
+        following = *next;
+    } else {
+        const Result<void> witnessed = witness(*token, *gathered);
+        if (!witnessed.ok()) return observer.finishEnumeratingWithError(witnessed.error());
+    }
     Result<TesselItems> items = itemsOf(*std::move(gathered));
     if (!items.ok()) return observer.finishEnumeratingWithError(items.error());
     observer.didEnumerateItems(std::move(*items));
+    if (goesBack) {
+        return observer.finishEnumeratingUpToPage(following ? std::optional(following->encode()) : std::nullopt);
+    }
 
     if (reached < token->offset) {
         logInfo("enumerator returned an offset ({}) smaller than the initial offset {}", reached, token->offset);
@@ -181,6 +200,40 @@ Result<void> LocalFileEnumerator::witness(FSChangeToken& token, const Gathered& 
     return {};
 }
 
+bool LocalFileEnumerator::canGoBack(const FSChangeToken& token) const {
+    // A folder that moves within a deep listing takes along more than its one event tells.
+    return token.isForFollower && !container_contents::isDeep(container_) &&
+           historyAfter(token.streamEventID) != nullptr;
+}
+
+/// Entries that went before the page, or while it was read, moved those behind them up, at most as far as so many went.
+/// Up to the overlap, the page before has read what may have slipped by; beyond it, this page is read once more.
+Result<std::optional<FSChangeToken>> LocalFileEnumerator::followingPage(const FSChangeToken& token,
+                                                                        const Gathered& gathered) const {
+    const auto history = historyAfter(token.streamEventID);
+    if (!history || !drain(*history)) return tesselErrorForExpiredPage();
+    FSChangeToken following = token;
+    std::uint64_t gone = 0;
+    for (bool isLast = false; !isLast;) {
+        const EventHistory::Batch batch = TRY(history->pathEvents(following.streamEventID, kEventsBatchMax));
+        for (const Event& event : batch.events) {
+            if ((event.flags & EventFlags::removed) && container_contents::covers(container_, urls_, event.path))
+                ++gone;
+        }
+        following.streamEventID = batch.upTo;
+        isLast = batch.isLast;
+    }
+    const auto back = [](std::uint64_t from, std::uint64_t by) { return from - std::min(from, by); };
+    if (token.offset > 0 && gone > kFollowerOverlap) {
+        following.offset = back(token.offset, gone);
+    } else if (!gathered.isFull) {
+        return std::optional<FSChangeToken>();
+    } else {
+        following.offset = back(gathered.reached, gone + kFollowerOverlap);
+    }
+    return std::optional(following);
+}
+
 std::optional<FSChangeToken> LocalFileEnumerator::gatherToken(TesselEnumerationObserver& observer,
                                                               FSChangeToken token) {
     const std::optional<KsUUID> volume = EventStream::volumeUUID(urls_.front());
@@ -193,7 +246,7 @@ std::optional<FSChangeToken> LocalFileEnumerator::gatherToken(TesselEnumerationO
         logInfo("device UUID changed ({} -> {})", token.deviceUUID.string(), volume->string());
         token.offset = 0;
     } else if (token.offset > 0) {
-        if (!mayResume(observer, token)) return std::nullopt;
+        if (!canGoBack(token) && !mayResume(observer, token)) return std::nullopt;
         return token;
     } else {
         logDebug("start gather phase");

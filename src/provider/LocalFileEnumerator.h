@@ -25,7 +25,8 @@ inline constexpr std::uint64_t kGatherPageEntriesMax = 200;
 ///
 /// A page is consumed in directory order, also where the host asks for another: both initial pages list alike. A page
 /// that follows is served only while it is proven that nothing was deleted since the first; otherwise the listing
-/// expires, and the host begins again. A listing waits for nothing that is not yet recorded, except that the first page
+/// expires, and the host begins again. Where the client follows the changes anyway (tesselInitialPageForFollowers), a
+/// listing of direct children goes on: it goes back by as many entries as went. A listing waits for nothing that is not yet recorded, except that the first page
 /// of several waits until what happened before it is; an anchor and changes wait for all that was complete before they
 /// were asked for.
 ///
@@ -71,6 +72,10 @@ private:
     Result<Gathered> gatherEntries(const FSChangeToken& token) const;
     bool settle(FSChangeToken& token) const;
     Result<void> witness(FSChangeToken& token, const Gathered& gathered) const;
+    /// Whether what is deleted meanwhile makes the listing go back instead of expire.
+    bool canGoBack(const FSChangeToken& token) const;
+    /// Where the listing goes on, and since when deletions count; none: it is over.
+    Result<std::optional<FSChangeToken>> followingPage(const FSChangeToken& token, const Gathered& gathered) const;
     Result<TesselItems> itemsOf(Gathered gathered) const;
 
     // Constant after construction.

@@ -26,7 +26,8 @@ constexpr std::size_t kDeparturesBatchMax = 1000;
 constexpr int kContentsScansMax = 100;
 
 bool isInitialPage(const TesselPage& page) {
-    return page == tesselInitialPageSortedByName() || page == tesselInitialPageSortedByDate();
+    return page == tesselInitialPageSortedByName() || page == tesselInitialPageSortedByDate() ||
+           page == tesselInitialPageForFollowers();
 }
 
 bool isBelowAny(std::string_view path, const std::vector<KsURL>& roots) {

@@ -15,6 +15,7 @@
 
 #include "host/Descriptor.h"
 #include "host/FakeProvider.h"
+#include "host/FakeSearch.h"
 #include "host/HostError.h"
 #include "host/ProviderClient.h"
 #include "platform/foundation/Base64.h"
@@ -61,7 +62,7 @@ protected:
         ProviderClient client(provider_);
         const auto done = Commands({client, paths_, options_, environment_,
                                     [] { return std::string(R"({"version":"1","events":0})"); }, signals_,
-                                    [this]() -> Result<int> { return stop_.get(); }},
+                                    [this]() -> Result<int> { return stop_.get(); }, search_},
                                    output)
                               .run();
         failure_ = done.ok() ? "" : messageOf(done.error());
@@ -113,6 +114,7 @@ protected:
     HostEnvironment environment_;
     HostOptions options_;
     SignalDispatcher signals_;
+    test::FakeSearch search_;
     const UniqueFd stop_ = *descriptor::makeInterrupt();
     std::string failure_;
 };

@@ -218,7 +218,8 @@ public:
 
 private:
     void list(TesselEnumerationObserver& observer, const TesselPage& page) {
-        const bool isFirst = page == tesselInitialPageSortedByName() || page == tesselInitialPageSortedByDate();
+        const bool isFirst = page == tesselInitialPageSortedByName() || page == tesselInitialPageSortedByDate() ||
+                             page == tesselInitialPageForFollowers();
         const std::size_t offset = isFirst ? 0 : std::stoul(std::string(textOf(page)));
         if (provider_->beforePage) provider_->beforePage(container_, offset);
         if (const auto error = provider_->listingErrors.find(container_); error != provider_->listingErrors.end()) {

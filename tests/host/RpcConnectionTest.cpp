@@ -12,6 +12,7 @@
 
 #include "host/Descriptor.h"
 #include "host/FakeProvider.h"
+#include "host/FakeSearch.h"
 #include "host/JsonRpcMessage.h"
 #include "platform/foundation/Base64.h"
 #include "support/TemporaryFolder.h"
@@ -91,7 +92,7 @@ protected:
         return text;
     }
     RpcService service() {
-        return {provider_, paths_, signals_, [] { return std::string(R"({"version":"x"})"); }};
+        return {provider_, paths_, signals_, [] { return std::string(R"({"version":"x"})"); }, search_};
     }
     Json answer(const std::string& method, const Json& params) {
         const Json request{{"jsonrpc", "2.0"}, {"id", 1}, {"method", method}, {"params", params}};
@@ -111,6 +112,7 @@ protected:
     const std::shared_ptr<test::FakeProvider> fake_ = std::make_shared<test::FakeProvider>();
     const std::shared_ptr<TesselExtension> provider_ = fake_;
     SignalDispatcher signals_;
+    test::FakeSearch search_;
     Result<void> served_;
 };
 

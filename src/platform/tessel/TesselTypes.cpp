@@ -22,4 +22,9 @@ const TesselPage& tesselInitialPageSortedByDate() {
     return page;
 }
 
+const TesselPage& tesselInitialPageForFollowers() {
+    static const TesselPage& page = *pageOfText("TesselInitialPageForFollowers");
+    return page;
+}
+
 }  // namespace cindral

@@ -22,9 +22,13 @@ inline const TesselItemIdentifier kTesselTemporaryLocalFolderItemIdentifier =
 using TesselPage = Bytes;
 using TesselSyncAnchor = Bytes;
 
-/// The two pages that a listing may begin with. They can't be mistaken for an encoded position.
+/// The two pages that any listing may begin with. They can't be mistaken for an encoded position.
 const TesselPage& tesselInitialPageSortedByName();
 const TesselPage& tesselInitialPageSortedByDate();
+/// The page that a listing may begin with where the client took an anchor before, and applies the changes since then
+/// afterwards. Where it can, such a listing goes on also after something was deleted, and may then repeat items; it
+/// never leaves out what there is from its beginning to its end.
+const TesselPage& tesselInitialPageForFollowers();
 
 /// What the host may do with an item. Part of the host interface: add bits, never change one.
 enum class TesselItemCapabilities : std::uint32_t {

@@ -18,6 +18,7 @@ constexpr const char* kDeviceUUIDKey = "deviceUUID";
 constexpr const char* kStreamEventIDKey = "streamEventID";
 constexpr const char* kOffsetKey = "offset";
 constexpr const char* kAppLibraryVersionTokenKey = "appLibraryVersionToken";
+constexpr const char* kIsForFollowerKey = "isForFollower";
 
 KsError undecodable(std::string message) {
     return {kKsPOSIXErrorDomain, EINVAL, {{"message", std::move(message)}}};
@@ -48,6 +49,7 @@ Result<FSChangeToken> tokenFrom(ByteView bytes) {
         .streamEventID = TRY(integer(list, kStreamEventIDKey)),
         .offset = TRY(integer(list, kOffsetKey)),
         .appLibraryVersionToken = TRY(integer(list, kAppLibraryVersionTokenKey)),
+        .isForFollower = list.find(kIsForFollowerKey) != nullptr,
     };
     return token;
 }
@@ -61,14 +63,15 @@ std::string textOf(const KsError& error) {
 }  // namespace
 
 Bytes FSChangeToken::encode() const {
-    return PropertyList(PropertyList::Dictionary{
-                            {kVersionKey, version},
-                            {kDeviceUUIDKey, deviceUUID.string()},
-                            {kStreamEventIDKey, streamEventID},
-                            {kOffsetKey, offset},
-                            {kAppLibraryVersionTokenKey, appLibraryVersionToken},
-                        })
-        .encodeBinary();
+    PropertyList::Dictionary fields{
+        {kVersionKey, version},
+        {kDeviceUUIDKey, deviceUUID.string()},
+        {kStreamEventIDKey, streamEventID},
+        {kOffsetKey, offset},
+        {kAppLibraryVersionTokenKey, appLibraryVersionToken},
+    };
+    if (isForFollower) fields.emplace(kIsForFollowerKey, std::uint64_t{1});
+    return PropertyList(std::move(fields)).encodeBinary();
 }
 
 std::optional<FSChangeToken> FSChangeToken::decode(ByteView bytes) {

@@ -30,6 +30,7 @@ struct FSChangeToken {
     std::uint64_t streamEventID = 0;           ///< changes after this event are still to be read
     std::uint64_t offset = 0;                  ///< directory entries consumed by the gather phase
     std::uint64_t appLibraryVersionToken = 0;  ///< app-library list that was reported; 0 where none takes part
+    bool isForFollower = false;                ///< of a listing that began with tesselInitialPageForFollowers()
 
     /// Never fails.
     Bytes encode() const;
@@ -37,7 +38,7 @@ struct FSChangeToken {
     ///
     /// Returns none, after one error line, when the bytes are no property list, lack a key, hold a value of another
     /// type or a text that is no UUID, are more than kEncodedSizeMax, or are a token of another version. Keys beyond
-    /// the five are ignored.
+    /// these are ignored.
     static std::optional<FSChangeToken> decode(ByteView bytes);
 
     /// All fields, for log lines.
