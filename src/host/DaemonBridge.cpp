@@ -15,7 +15,7 @@
 namespace cindral {
 namespace {
 
-constexpr std::size_t kReadBytes = 256 << 10;
+constexpr std::size_t kReadBytes = 64 << 10;
 
 /// What the thread that passes the input on has, also when nobody waits for it any more.
 struct Way {

@@ -18,7 +18,7 @@
 namespace cindral {
 namespace {
 
-constexpr std::size_t kReadBytes = 256 << 10;
+constexpr std::size_t kReadBytes = 64 << 10;
 // The answer to one request may be a batch of thumbnails; a daemon is trusted, its user's own.
 constexpr std::size_t kAnswerBytesMax = std::size_t{1} << 30;
 

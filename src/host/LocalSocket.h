@@ -12,7 +12,7 @@
 namespace cindral::local_socket {
 
 /// Connections that wait to be accepted; one more waits for that.
-inline constexpr int kWaitingMax = 128;
+inline constexpr int kWaitingMax = 4096;
 
 /// Listens at the path, in place of whatever socket or link was there, in one step: who connects finds the one or the
 /// other. For the owner alone.

@@ -67,7 +67,7 @@ private:
     bool isEnded_ GUARDED_BY(mutex_) = false;
 };
 
-SocketListener::SocketListener(DaemonSocket socket) : socket_(std::move(socket)) {}
+SocketListener::SocketListener(DaemonSocket socket, Limits limits) : socket_(std::move(socket)), limits_(limits) {}
 
 SocketListener::~SocketListener() {
     stop();
@@ -150,9 +150,9 @@ void SocketListener::makeDoWithout() {
 /// Why a client is not served; null where it is.
 const char* SocketListener::whyNot(int connection) {
     const auto peer = local_socket::peerOf(connection);
-    if (!peer.ok() || peer->user != ::geteuid()) return "This daemon serves nobody but the person who started it";
+    if (!peer.ok() || peer->user != limits_.user) return "This daemon serves nobody but the person who started it";
     const MutexLock lock(mutex_);
-    return clients_.size() < kClientsMax ? nullptr : "There are too many clients";
+    return clients_.size() < limits_.clientsMax ? nullptr : "There are too many clients";
 }
 
 void SocketListener::welcome(UniqueFd connection, const HostProcess& host) {

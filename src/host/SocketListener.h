@@ -1,7 +1,11 @@
 #pragma once
 
+#include <sys/types.h>
+#include <unistd.h>
+
 #include <list>
 #include <memory>
+#include <utility>
 
 #include "host/DaemonListener.h"
 #include "host/DaemonSocket.h"
@@ -24,7 +28,12 @@ class SocketListener final : public DaemonListener {
 public:
     static constexpr std::size_t kClientsMax = 1000;
 
-    explicit SocketListener(DaemonSocket socket);
+    struct Limits {
+        uid_t user = ::geteuid();  ///< who is served
+        std::size_t clientsMax = kClientsMax;
+    };
+    explicit SocketListener(DaemonSocket socket) : SocketListener(std::move(socket), Limits()) {}
+    SocketListener(DaemonSocket socket, Limits limits);
     /// Stopped before, where it was started.
     ~SocketListener() override;
     SocketListener(const SocketListener&) = delete;
@@ -44,6 +53,7 @@ private:
     void serve(const std::shared_ptr<Client>& client, const HostProcess& host);
 
     DaemonSocket socket_;
+    const Limits limits_;
     UniqueFd stop_;   ///< constant once started
     UniqueFd spare_;  ///< the accepting thread's
     DispatchGroup threads_;

@@ -11,6 +11,7 @@
 #include <cstring>
 
 #include "platform/foundation/Fatal.h"
+#include "platform/foundation/Sys.h"
 #include "platform/revisions/Checksum.h"
 #include "platform/revisions/ObjectTablesKeys.h"
 
@@ -70,6 +71,16 @@ Result<TablesHead> decodeHead(ByteView bytes) {
     return head;
 }
 
+/// The library's own lock file, anew: only the holder of the store's lock comes here, and readers that a crash left in it
+/// are nobody. With all its blocks: the library writes to it through a map, where a full disk would be a bus error.
+Result<void> makeLockFile(const std::string& path) {
+    constexpr off_t kLockBytes = 32'768;  // Of as many readers as there is room for; the library makes do with it.
+    ::unlink(path.c_str());
+    const UniqueFd file = TRY(sys::open(path.c_str(), O_RDWR | O_CREAT | O_EXCL | O_NOFOLLOW, 0600));
+    const int code = ::posix_fallocate(file.get(), 0, kLockBytes);
+    return code == 0 ? Result<void>() : Result<void>(KsError::posix(code, path));
+}
+
 }  // namespace
 
 // MARK: Opening
@@ -106,9 +117,7 @@ Result<std::unique_ptr<ObjectTables>> ObjectTables::open(const std::string& path
 }
 
 Result<void> ObjectTables::openEnvironment(const std::string& path, std::size_t mapBytes) {
-    // Only the holder of the store's lock comes here: readers that a crash left in the library's own lock file are
-    // nobody.
-    ::unlink((path + "-lock").c_str());
+    TRY(makeLockFile(path + "-lock"));
     while (true) {
         if (const int code = mdb_env_create(&environment_); code != 0) return errorOf(code);
         mdb_env_set_maxdbs(environment_, kTablesMax);
