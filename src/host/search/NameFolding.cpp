@@ -114,6 +114,10 @@ struct Characters {
     }
 };
 
+bool isFoundBy(std::string_view gram, std::size_t characters) {
+    return characters >= 3 || !isAscii(gram);
+}
+
 bool beginsWord(std::string_view name, std::size_t at) {
     const auto length = static_cast<int32_t>(name.size());
     auto i = static_cast<int32_t>(at);
@@ -164,7 +168,8 @@ bool name_grams::forEach(std::string_view folded, const Receiver& receiver) {
     for (std::size_t i = 0; i < count; ++i) {
         const std::size_t lengthMax = std::min<std::size_t>(3, count - i);
         for (std::size_t length = 1; length <= lengthMax; ++length) {
-            if (!receiver(characters.slice(folded, i, length))) return false;
+            const std::string_view gram = characters.slice(folded, i, length);
+            if (isFoundBy(gram, length) && !receiver(gram)) return false;
         }
         if (i > 0 && !characters.beginWords[i]) continue;
         for (std::size_t length = 1; length <= std::min<std::size_t>(2, lengthMax); ++length) {
@@ -192,7 +197,7 @@ std::vector<std::string> name_grams::required(std::string_view text, NameMatch m
         case NameMatch::substring: break;
     }
     if (count < 3) {
-        if (match == NameMatch::substring) grams.emplace_back(text);
+        if (match == NameMatch::substring && isFoundBy(text, count)) grams.emplace_back(text);
         return grams;
     }
     // Spread over the text: neighbours say almost the same.

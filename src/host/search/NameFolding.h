@@ -30,8 +30,9 @@ enum class NameMatch : std::uint8_t { prefix = 0, word = 1, substring = 2 };
 /// else.
 std::optional<NameMatch> nameMatchOf(std::string_view name, std::string_view text);
 
-/// What a name is found by: each character, each two and each three that follow one another; with a "/" before them, the
-/// first one and two of the name; with a "/" behind them, the first one and two of each later word.
+/// What a name is found by: each three characters that follow one another; with a "/" before them, the first one and two
+/// of the name; with a "/" behind them, the first one and two of each later word. One and two characters by themselves
+/// only where one is not ASCII: there are scripts in which that is a word, while letters of this one are in most names.
 namespace name_grams {
 
 using Receiver = std::function<bool(std::string_view gram)>;
@@ -39,7 +40,7 @@ using Receiver = std::function<bool(std::string_view gram)>;
 bool forEach(std::string_view folded, const Receiver& receiver);
 
 /// What every name holds that matches the text in this way; not every name that holds them matches. For a text that is
-/// not empty.
+/// not empty. Nothing for a part of a name that is too short to be found by.
 std::vector<std::string> required(std::string_view text, NameMatch match);
 
 }  // namespace name_grams

@@ -12,7 +12,7 @@ namespace cindral {
 namespace {
 
 // Put in together: a transaction costs more than an item.
-constexpr std::size_t kItemsAtOnceMax = 4'000;
+constexpr std::size_t kItemsAtOnceMax = 10'000;
 constexpr std::size_t kContainersAtOnceMax = 256;
 
 bool isExpired(const KsError& error) {

@@ -39,7 +39,7 @@ void orderByDate(TesselItems& items, const std::vector<SearchStore::Hit>& hits) 
 
 SearchIndex::SearchIndex(std::shared_ptr<TesselExtension> provider, SignalDispatcher& signals, std::string file,
                          std::string locale)
-    : file_(std::move(file)), collation_(locale), client_(std::move(provider)), signals_(signals) {}
+    : file_(std::move(file)), locale_(std::move(locale)), client_(std::move(provider)), signals_(signals) {}
 
 SearchIndex::~SearchIndex() {
     stop();
@@ -67,7 +67,8 @@ void SearchIndex::stop() {
 Result<std::shared_ptr<SearchStore>> SearchIndex::store() {
     const MutexLock lock(storeMutex_);
     if (!store_) {
-        store_ = TRY(SearchStore::open(file_, collation_));
+        if (!collation_) collation_ = std::make_unique<NameCollation>(locale_);
+        store_ = TRY(SearchStore::open(file_, *collation_));
         store_->setWitness([this](const IndexedItem& item) { witness(item); });
     }
     return store_;

@@ -94,13 +94,14 @@ private:
 
     // Constant after construction.
     const std::string file_;
-    const NameCollation collation_;
+    const std::string locale_;
     ProviderClient client_;
     SignalDispatcher& signals_;
     SearchFollower follower_{client_};
 
     Mutex storeMutex_;
-    std::shared_ptr<SearchStore> store_ GUARDED_BY(storeMutex_);  ///< null until it is opened
+    std::unique_ptr<NameCollation> collation_ GUARDED_BY(storeMutex_);  ///< null until there has been a store
+    std::shared_ptr<SearchStore> store_ GUARDED_BY(storeMutex_);        ///< null until it is opened
 
     Mutex mutex_;
     Condition reachedChanged_;

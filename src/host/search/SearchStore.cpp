@@ -8,7 +8,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <limits>
-#include <map>
 #include <utility>
 
 #include "host/search/NameFolding.h"
@@ -31,6 +30,9 @@ constexpr std::int64_t kPlaceMin = std::int64_t{1} << 20;
 constexpr std::int64_t kPlaceMax = (std::int64_t{1} << 47) - 1;
 
 constexpr std::size_t kViewsMax = 8;
+// Matches that are read all together, and put in order then.
+constexpr std::uint64_t kFoundAtOnceMax = 4'000;
+constexpr std::uint64_t kChangesOfSampleMax = 10'000;
 // Small files are looked at in whole when they are opened; of others, damage shows where it is come upon.
 constexpr std::int64_t kCheckedPagesMax = 1'024;
 
@@ -42,7 +44,7 @@ constexpr const char* kSchema = R"(
         flags INTEGER NOT NULL, gather INTEGER NOT NULL, domain INTEGER, size INTEGER, modified INTEGER, used INTEGER,
         rank INTEGER);
     CREATE UNIQUE INDEX items_identifier ON items(identifier);
-    CREATE INDEX items_parent ON items(parent, name_key(name));
+    CREATE INDEX items_parent ON items(parent, name_key(name), modified, size, type, flags);
     CREATE INDEX items_trashed ON items(place) WHERE flags & 2;
     CREATE INDEX items_rank ON items(rank, place) WHERE rank IS NOT NULL;
     CREATE TABLE tags(tag TEXT NOT NULL, place INTEGER NOT NULL, PRIMARY KEY(tag, place)) WITHOUT ROWID;
@@ -62,6 +64,21 @@ std::int64_t placeWanted(const IndexedItem& item) {
     // Rounded down also before 1970.
     const std::int64_t milliseconds = *recency / 1'000'000 - (*recency % 1'000'000 < 0 ? 1 : 0);
     return std::clamp(milliseconds + kPlaceOfEpoch, kPlaceMin, kPlaceMax);
+}
+
+/// What is asked of the table of names: all of the grams.
+std::string matchOf(const std::vector<std::string>& grams) {
+    std::string wanted;
+    for (const std::string& gram : grams) {
+        if (!wanted.empty()) wanted += " AND ";
+        wanted += '"';
+        for (const char c : gram) {
+            wanted += c;
+            if (c == '"') wanted += '"';
+        }
+        wanted += '"';
+    }
+    return wanted;
 }
 
 Result<void> configure(SqliteDatabase& database) {
@@ -155,16 +172,25 @@ struct SearchStore::Writer {
     Result<std::string> word(std::int64_t id);
     Result<std::vector<TesselItemIdentifier>> below(const TesselItemIdentifier& identifier);
     Result<void> passOn(const IndexedItem& folder);
+    Result<void> writeNames();
     void see(const IndexedItem& item) const {
         if (witness) witness(item);
     }
 
     SqliteDatabase database;
     Witness witness;
+    std::int64_t count = 0;   ///< of items
     std::int64_t gather = 0;  ///< number of the gather that is under way, or was the last
     bool isGathering = false;
     std::unordered_map<std::string, std::int64_t> wordIDs;
     std::unordered_map<std::int64_t, std::string> words;
+    /// What is still to be said to the table of names in the transaction.
+    struct NameChange {
+        std::int64_t place;
+        bool isIn;
+        std::string folded;
+    };
+    std::vector<NameChange> nameChanges;
 
     SqliteStatement setFact, selectFact, selectItem, selectTags, isTaken, insertItem, updateItem, deleteItem,
         insertName, deleteName, insertTag, deleteTags, selectWord, selectWordID, insertWord, selectBelow,
@@ -207,6 +233,7 @@ Result<void> SearchStore::Writer::prepare() {
     TRY(make(selectStale, "SELECT identifier FROM items WHERE gather != ?"));
     TRY(make(selectDomain, "SELECT identifier FROM items WHERE domain = ?"));
 
+    count = TRY(database.integer("SELECT value FROM facts WHERE name = 'items'")).value_or(0);
     gather = TRY(database.integer("SELECT value FROM facts WHERE name = 'gather'")).value_or(0);
     isGathering = TRY(database.integer("SELECT value FROM facts WHERE name = 'isGathering'")).value_or(0) != 0;
     return {};
@@ -284,17 +311,28 @@ Result<void> SearchStore::Writer::insert(const IndexedItem& item, std::int64_t p
     const std::int64_t type = TRY(wordID(item.type));
     std::optional<std::int64_t> domain;
     if (!item.domain.empty()) domain = TRY(wordID(item.domain));
+    ++count;
     TRY(insertItem.run(place, std::string_view(item.identifier), std::string_view(item.parent), bytesOf(item.name),
                        type, item.flags, gather, domain, item.size, item.modified, item.used, item.rank));
-    if (!item.isTrashed()) TRY(insertName.run(place, std::string_view(name_folding::fold(item.name))));
+    if (!item.isTrashed()) nameChanges.push_back({place, true, name_folding::fold(item.name)});
     for (const std::string& tag : item.tags) TRY(insertTag.run(std::string_view(tag), place));
     return {};
 }
 
 Result<void> SearchStore::Writer::erase(const Row& row) {
+    --count;
     TRY(deleteItem.run(row.place));
-    if (!row.item.isTrashed()) TRY(deleteName.run(row.place, std::string_view(name_folding::fold(row.item.name))));
+    if (!row.item.isTrashed()) nameChanges.push_back({row.place, false, name_folding::fold(row.item.name)});
     if (!row.item.tags.empty()) TRY(deleteTags.run(row.place));
+    return {};
+}
+
+/// In the order of places: the table of names writes what it holds to the disk whenever a place comes before the last.
+Result<void> SearchStore::Writer::writeNames() {
+    std::ranges::stable_sort(nameChanges, {}, &NameChange::place);
+    for (const NameChange& change : nameChanges)
+        TRY((change.isIn ? insertName : deleteName).run(change.place, std::string_view(change.folded)));
+    nameChanges.clear();
     return {};
 }
 
@@ -371,6 +409,12 @@ struct SearchStore::Reader {
         TRY(make(names,
                  "SELECT items.place, items.identifier, items.name FROM names CROSS JOIN items ON items.place = "
                  "names.rowid WHERE names MATCH ?1 AND names.rowid < ?2 ORDER BY names.rowid DESC"));
+        TRY(make(
+            allNames,
+            "SELECT place, identifier, name FROM items WHERE ?1 = '' AND place < ?2 AND NOT flags & 2 ORDER BY place "
+            "DESC"));
+        TRY(make(someNames, "SELECT name FROM items WHERE place >= ? ORDER BY place LIMIT ?"));
+        TRY(make(itemCount, "SELECT value FROM facts WHERE name = 'items'"));
         TRY(make(recents,
                  "SELECT place, identifier, 0 FROM items WHERE place < ?1 AND flags & 3 = 1 ORDER BY place DESC"));
         TRY(make(tagged,
@@ -383,11 +427,12 @@ struct SearchStore::Reader {
             trashed,
             "SELECT place, identifier, 0 FROM items INDEXED BY items_trashed WHERE flags & 2 AND place < ?1 AND NOT "
             "EXISTS (SELECT 1 FROM items AS holder WHERE holder.identifier = items.parent) ORDER BY place DESC"));
-        TRY(make(children,
+        // In the order of the index, which is that of names. To ask for the order would be to ask for the names, too,
+        // and for every row of the table.
+        TRY(make(children, "SELECT place FROM items INDEXED BY items_parent WHERE parent = ?1"));
+        TRY(make(values,
                  "SELECT place, CASE ?2 WHEN 1 THEN modified WHEN 2 THEN size WHEN 3 THEN type END, flags FROM items "
-                 "INDEXED BY items_parent WHERE parent = ?1 ORDER BY name_key(name), place"));
-        TRY(make(childrenByName,
-                 "SELECT place FROM items INDEXED BY items_parent WHERE parent = ?1 ORDER BY name_key(name), place"));
+                 "INDEXED BY items_parent WHERE parent = ?1"));
         TRY(make(identifier, "SELECT identifier FROM items WHERE place = ?"));
         TRY(make(
             tags,
@@ -397,7 +442,8 @@ struct SearchStore::Reader {
     }
 
     SqliteDatabase database;
-    SqliteStatement names, recents, tagged, favorites, trashed, children, childrenByName, identifier, tags;
+    SqliteStatement names, allNames, someNames, itemCount, recents, tagged, favorites, trashed, children, values,
+        identifier, tags;
 };
 
 // MARK: The store
@@ -450,19 +496,24 @@ void SearchStore::setWitness(Witness witness) {
 template <typename Work>
 Result<void> SearchStore::write(const Work& work) {
     Writer& writer = *writer_;
+    const std::int64_t count = writer.count;
     const std::int64_t gather = writer.gather;
     const bool isGathering = writer.isGathering;
     const auto done = [&]() -> Result<void> {
         SqliteTransaction transaction = TRY(SqliteTransaction::begin(writer.database));
         TRY(work(writer));
+        TRY(writer.writeNames());
+        if (writer.count != count) TRY(writer.setFact.run(std::string_view("items"), writer.count));
         return transaction.commit();
     }();
     if (!done.ok()) {
         // What was taken back is not remembered as done.
+        writer.count = count;
         writer.gather = gather;
         writer.isGathering = isGathering;
         writer.wordIDs.clear();
         writer.words.clear();
+        writer.nameChanges.clear();
     }
     ++changes_;
     return done;
@@ -598,9 +649,7 @@ Result<SearchStore::Hits> SearchStore::find(const SearchQuery& query, const std:
     SqliteTransaction transaction = TRY(SqliteTransaction::begin(reader_->database));
     SqliteStatement* rows = nullptr;
     switch (query.kind) {
-        case SearchQuery::Kind::names:
-            hits.hasMore = TRY(appendNames(name_folding::fold(query.text), from, limit, hits));
-            return hits;
+        case SearchQuery::Kind::names: TRY(findNames(name_folding::fold(query.text), from, limit, hits)); return hits;
         case SearchQuery::Kind::recents: rows = &reader_->recents.bind(from.place); break;
         case SearchQuery::Kind::tagged: rows = &reader_->tagged.bind(from.place, std::string_view(query.text)); break;
         case SearchQuery::Kind::favorites: rows = &reader_->favorites.bind(from.place, from.rank); break;
@@ -620,30 +669,61 @@ Result<SearchStore::Hits> SearchStore::find(const SearchQuery& query, const std:
     return hits;
 }
 
-/// One kind of match after the other, each from the newest item to the oldest. What holds the grams is looked at until
-/// the page is full, so that a text that nearly every name holds costs no more than a page.
-Result<bool> SearchStore::appendNames(const std::string& text, const QueryPage& from, std::size_t limit, Hits& hits) {
-    if (from.stage > static_cast<std::uint8_t>(NameMatch::substring)) return false;
+/// Many matches are read one kind after the other, each from the newest item to the oldest, until the page is full, so
+/// that a text that nearly every name holds costs no more than a page. Few are read at once: each list is read to its
+/// end then, but only one time.
+Result<void> SearchStore::findNames(const std::string& text, const QueryPage& from, std::size_t limit, Hits& hits) {
     // No name holds a NUL, and what is asked of the table ends with one.
-    if (text.empty() || text.find('\0') != std::string::npos) return false;
-    for (std::uint8_t stage = from.stage; stage <= static_cast<std::uint8_t>(NameMatch::substring); ++stage) {
-        std::string wanted;
-        for (const std::string& gram : name_grams::required(text, NameMatch{stage})) {
-            if (!wanted.empty()) wanted += " AND ";
-            wanted += '"';
-            for (const char c : gram) {
-                wanted += c;
-                if (c == '"') wanted += '"';
-            }
-            wanted += '"';
+    if (text.empty() || text.find('\0') != std::string::npos) return {};
+    TRY(refreshSample());
+    const bool isFindable = !name_grams::required(text, NameMatch::substring).empty();
+    if (isFindable && sample_.estimate(text) <= kFoundAtOnceMax && TRY(findAtOnce(text, from, limit, hits))) return {};
+    return findOneByOne(text, from, limit, hits);
+}
+
+/// False where there turn out to be many.
+Result<bool> SearchStore::findAtOnce(const std::string& text, const QueryPage& from, std::size_t limit, Hits& hits) {
+    std::vector<Hit> all;
+    SqliteStatement& rows = reader_->names;
+    const std::string wanted = matchOf(sample_.bestGrams(text, NameMatch::substring));
+    rows.bind(std::string_view(wanted), std::numeric_limits<std::int64_t>::max());
+    while (TRY(rows.step())) {
+        const auto match = nameMatchOf(name_folding::fold(rows.text(2)), text);
+        if (!match) continue;
+        QueryPage place = from;
+        place.stage = static_cast<std::uint8_t>(*match);
+        place.place = rows.integer(0);
+        if (place.stage < from.stage || (place.stage == from.stage && place.place >= from.place)) continue;
+        if (all.size() == kFoundAtOnceMax * 2) {
+            rows.reset();
+            return false;
         }
+        all.push_back({TesselItemIdentifier(rows.text(1)), place});
+    }
+    rows.reset();
+    const std::size_t count = std::min(all.size(), limit);
+    std::ranges::partial_sort(all, all.begin() + static_cast<std::ptrdiff_t>(count), {},
+                              [](const Hit& hit) { return std::pair(hit.place.stage, -hit.place.place); });
+    hits.hasMore = all.size() > count;
+    all.resize(count);
+    hits.hits = std::move(all);
+    return true;
+}
+
+Result<void> SearchStore::findOneByOne(const std::string& text, const QueryPage& from, std::size_t limit, Hits& hits) {
+    constexpr auto kLast = static_cast<std::uint8_t>(NameMatch::substring);
+    for (std::uint8_t stage = from.stage; stage <= kLast; ++stage) {
+        const std::string wanted = matchOf(sample_.bestGrams(text, NameMatch{stage}));
         const std::int64_t below = stage == from.stage ? from.place : std::numeric_limits<std::int64_t>::max();
-        SqliteStatement& rows = reader_->names.bind(std::string_view(wanted), below);
+        // What is too short to be found by is looked for in every name.
+        SqliteStatement& rows = wanted.empty() ? reader_->allNames : reader_->names;
+        rows.bind(std::string_view(wanted), below);
         while (TRY(rows.step())) {
             if (nameMatchOf(name_folding::fold(rows.text(2)), text) != NameMatch{stage}) continue;
             if (hits.hits.size() == limit) {
+                hits.hasMore = true;
                 rows.reset();
-                return true;
+                return {};
             }
             QueryPage place = from;
             place.stage = stage;
@@ -652,7 +732,62 @@ Result<bool> SearchStore::appendNames(const std::string& text, const QueryPage& 
         }
         rows.reset();
     }
-    return false;
+    return {};
+}
+
+/// A sample is as good as another until the index is quite another.
+Result<void> SearchStore::refreshSample() {
+    const std::uint64_t change = changes_;
+    SqliteStatement& count = reader_->itemCount;
+    const std::uint64_t total = TRY(count.bind().step()) ? static_cast<std::uint64_t>(count.integer(0)) : 0;
+    count.reset();
+    const bool isAlike = total <= sample_.total() * 3 / 2 && sample_.total() <= total * 3 / 2;
+    if (isAlike && change - sampledAt_ < kChangesOfSampleMax && sampledAt_ != 0) return {};
+    std::vector<std::string> names;
+    const auto take = [&](std::int64_t from, std::int64_t rows) -> Result<void> {
+        SqliteStatement& some = reader_->someNames.bind(from, rows);
+        while (TRY(some.step())) names.push_back(name_folding::fold(some.text(0)));
+        some.reset();
+        return {};
+    };
+    if (total <= NameSample::kNamesMax) {
+        TRY(take(std::numeric_limits<std::int64_t>::min(), NameSample::kNamesMax));
+    } else {
+        // From places all over the years; each a few, because to get to a place costs more than to go on from it.
+        const std::int64_t first = TRY(reader_->database.integer("SELECT min(place) FROM items")).value_or(0);
+        const std::int64_t last = TRY(reader_->database.integer("SELECT max(place) FROM items")).value_or(0);
+        constexpr std::int64_t kStretches = 128;
+        for (std::int64_t i = 0; i < kStretches; ++i)
+            TRY(take(first + (last - first) / kStretches * i, NameSample::kNamesMax / kStretches));
+    }
+    sample_ = NameSample(std::move(names), total);
+    sampledAt_ = std::max<std::uint64_t>(change, 1);
+    return {};
+}
+
+/// In the order of a value; where it is the same, in that of names.
+Result<void> SearchStore::appendByValue(const SortedQuery& query, std::vector<std::int64_t>& places) {
+    constexpr std::int64_t kNone = std::numeric_limits<std::int64_t>::min();
+    std::vector<std::pair<std::int64_t, std::int64_t>> entries;
+    SqliteStatement& rows =
+        reader_->values.bind(std::string_view(query.container), static_cast<std::int64_t>(query.order));
+    const bool isByKind = query.order == SortedQuery::Order::kind;
+    while (TRY(rows.step())) {
+        // Folders are the first kind.
+        const bool isFirst = isByKind && (rows.integer(2) & IndexedItem::kFolder) != 0;
+        entries.emplace_back(isFirst ? kNone : rows.optionalInteger(1).value_or(kNone), rows.integer(0));
+    }
+    rows.reset();
+    if (isByKind) {
+        std::unordered_map<std::int64_t, std::int64_t> ranks{{kNone, -1}};
+        SqliteStatement words = TRY(reader_->database.prepare("SELECT id FROM words ORDER BY word"));
+        for (std::int64_t rank = 0; TRY(words.step()); ++rank) ranks.emplace(words.integer(0), rank);
+        for (auto& [value, place] : entries) value = ranks[value];
+    }
+    std::ranges::stable_sort(entries, {}, &std::pair<std::int64_t, std::int64_t>::first);
+    places.reserve(entries.size());
+    for (const auto& [value, place] : entries) places.push_back(place);
+    return {};
 }
 
 Result<const SearchStore::View*> SearchStore::view(const SortedQuery& query) {
@@ -666,30 +801,11 @@ Result<const SearchStore::View*> SearchStore::view(const SortedQuery& query) {
     }
     View view{query.container, query.order, change, {}};
     if (query.order == SortedQuery::Order::name) {
-        SqliteStatement& rows = reader_->childrenByName.bind(std::string_view(query.container));
+        SqliteStatement& rows = reader_->children.bind(std::string_view(query.container));
         while (TRY(rows.step())) view.places.push_back(rows.integer(0));
         rows.reset();
     } else {
-        // In the order of names, which stays where the values are equal.
-        std::vector<std::pair<std::int64_t, std::int64_t>> values;
-        SqliteStatement& rows =
-            reader_->children.bind(std::string_view(query.container), static_cast<std::int64_t>(query.order));
-        while (TRY(rows.step())) {
-            const bool isFolder = (rows.integer(2) & IndexedItem::kFolder) != 0;
-            const std::int64_t none = std::numeric_limits<std::int64_t>::min();
-            const bool isFirst = query.order == SortedQuery::Order::kind && isFolder;
-            values.emplace_back(isFirst ? none : rows.optionalInteger(1).value_or(none), rows.integer(0));
-        }
-        rows.reset();
-        if (query.order == SortedQuery::Order::kind) {
-            std::map<std::int64_t, std::int64_t> ranks{{std::numeric_limits<std::int64_t>::min(), -1}};
-            SqliteStatement words = TRY(reader_->database.prepare("SELECT id FROM words ORDER BY word"));
-            for (std::int64_t rank = 0; TRY(words.step()); ++rank) ranks.emplace(words.integer(0), rank);
-            for (auto& [value, place] : values) value = ranks[value];
-        }
-        std::ranges::stable_sort(values, {}, &std::pair<std::int64_t, std::int64_t>::first);
-        view.places.reserve(values.size());
-        for (const auto& [value, place] : values) view.places.push_back(place);
+        TRY(appendByValue(query, view.places));
     }
     views_.push_front(std::move(view));
     if (views_.size() > kViewsMax) views_.pop_back();
@@ -731,7 +847,8 @@ Result<std::vector<TagCount>> SearchStore::tags() {
 Result<SearchStore::Counts> SearchStore::counts() {
     const MutexLock lock(readerMutex_);
     Counts counts;
-    counts.items = static_cast<std::uint64_t>(TRY(reader_->database.integer("SELECT count(*) FROM items")).value_or(0));
+    const auto items = TRY(reader_->database.integer("SELECT value FROM facts WHERE name = 'items'"));
+    counts.items = static_cast<std::uint64_t>(items.value_or(0));
     const auto pages = TRY(reader_->database.integer("PRAGMA page_count")).value_or(0);
     const auto pageSize = TRY(reader_->database.integer("PRAGMA page_size")).value_or(0);
     counts.bytes = static_cast<std::uint64_t>(pages * pageSize);

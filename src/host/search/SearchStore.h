@@ -13,6 +13,7 @@
 
 #include "host/search/IndexedItem.h"
 #include "host/search/NameCollation.h"
+#include "host/search/NameSample.h"
 #include "host/search/QueryPage.h"
 #include "host/search/Sqlite.h"
 #include "platform/foundation/Mutex.h"
@@ -110,8 +111,14 @@ private:
     template <typename Work>
     Result<void> write(const Work& work) REQUIRES(writerMutex_);
     Result<const View*> view(const SortedQuery& query) REQUIRES(readerMutex_);
-    Result<bool> appendNames(const std::string& text, const QueryPage& from, std::size_t limit, Hits& hits)
+    Result<void> findNames(const std::string& text, const QueryPage& from, std::size_t limit, Hits& hits)
         REQUIRES(readerMutex_);
+    Result<void> findOneByOne(const std::string& text, const QueryPage& from, std::size_t limit, Hits& hits)
+        REQUIRES(readerMutex_);
+    Result<bool> findAtOnce(const std::string& text, const QueryPage& from, std::size_t limit, Hits& hits)
+        REQUIRES(readerMutex_);
+    Result<void> refreshSample() REQUIRES(readerMutex_);
+    Result<void> appendByValue(const SortedQuery& query, std::vector<std::int64_t>& places) REQUIRES(readerMutex_);
 
     // Constant after construction.
     const std::string path_;
@@ -127,6 +134,8 @@ private:
     Mutex readerMutex_;
     std::unique_ptr<Reader> reader_ GUARDED_BY(readerMutex_);
     std::list<View> views_ GUARDED_BY(readerMutex_);  ///< newest first
+    NameSample sample_ GUARDED_BY(readerMutex_);
+    std::uint64_t sampledAt_ GUARDED_BY(readerMutex_) = 0;  ///< change after which the sample was taken
 };
 
 }  // namespace cindral

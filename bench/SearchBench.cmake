@@ -1,0 +1,2 @@
+add_executable(search_bench SearchBench.cpp)
+target_link_libraries(search_bench PRIVATE cindral_host)
