@@ -10,6 +10,7 @@
 #include "host/Awaited.h"
 #include "host/Descriptor.h"
 #include "host/HostError.h"
+#include "host/ImportStaging.h"
 #include "host/ItemWriter.h"
 #include "host/JsonText.h"
 #include "host/ProgressPace.h"
@@ -75,12 +76,6 @@ EditTerminal EditTerminal::ofProcess() {
     }
     return terminal;
 }
-
-/// A folder of this command's own in the temporary folder, as the provider knows it.
-struct EditCommands::Staging {
-    std::unique_ptr<StagingFolder> folder;
-    TesselItemIdentifier identifier;
-};
 
 EditCommands::EditCommands(const Commands::Context& context, EditTerminal terminal, TextOutput& output)
     : context_(context), options_(context.options.edit), terminal_(std::move(terminal)), output_(output) {}
@@ -223,17 +218,6 @@ EditCommands::ItemResult EditCommands::reparent(const TesselItem& item, const Te
     });
 }
 
-Result<EditCommands::Staging> EditCommands::makeStaging() const {
-    auto root = RootDirectories::shared().rootHolding(context_.paths.presented());
-    // Open already, where the provider is in this process.
-    if (root == nullptr) root = TRY(RootDirectories::shared().add(context_.paths.presented(), RootPolicy::storage));
-    auto folder = StagingFolder::make(root);
-    if (!folder.ok()) return hostFailure(fmt::format("can't make a temporary folder: {}", messageOf(folder.error())));
-    auto identifier = provider().persistentIdentifierForItemAtURL(KsURL::fileURL((*folder)->path()));
-    if (!identifier) return hostFailure("the temporary folder can't be found");
-    return Staging{*std::move(folder), *std::move(identifier)};
-}
-
 Result<void> EditCommands::importFile(const std::string& file, const TesselItemIdentifier& folder) {
     if (file.empty()) return hostFailure("no such file: the path is empty");
     const std::string absolute = TRY(Commands::absolutePath(context_, file));
@@ -244,7 +228,7 @@ Result<void> EditCommands::importFile(const std::string& file, const TesselItemI
         });
     };
     if (folder != kTesselRootContainerItemIdentifier && !options_.keepsBoth) return print(file, importInto(folder));
-    const Staging staging = TRY(makeStaging());
+    const ImportStaging staging = TRY(ImportStaging::make(provider(), context_.paths));
     const ItemResult built = importInto(staging.identifier);
     if (!built.ok()) return failure(file, built.error());
     return print(file, reparent(**built, folder, file));
@@ -270,7 +254,7 @@ Result<void> EditCommands::makeFolder(const std::string& word) {
         return print(word,
                      withFreeName(name, NameKind::folder, [&](const auto& given) { return makeIn(parent, given); }));
     }
-    const Staging staging = TRY(makeStaging());
+    const ImportStaging staging = TRY(ImportStaging::make(provider(), context_.paths));
     const ItemResult built = makeIn(staging.identifier, name);
     if (!built.ok()) return failure(word, built.error());
     return print(word, reparent(**built, parent, word));

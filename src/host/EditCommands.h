@@ -10,7 +10,6 @@
 #include "host/EditOptions.h"
 #include "host/TextOutput.h"
 #include "platform/tessel/FreeName.h"
-#include "platform/tessel/StagingFolder.h"
 
 namespace cindral {
 
@@ -71,8 +70,6 @@ private:
     ItemResult withFreeName(const std::string& name, NameKind kind,
                             const std::function<ItemResult(const std::string& name)>& attempt) const;
     ItemResult reparent(const TesselItem& item, const TesselItemIdentifier& folder, const std::string& subject);
-    struct Staging;
-    Result<Staging> makeStaging() const;
 
     ItemResult await(const std::string& subject, const Start& start) const;
     std::optional<KsError> awaitEnd(

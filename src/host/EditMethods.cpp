@@ -1,5 +1,6 @@
 #include "host/EditMethods.h"
 
+#include <cerrno>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -7,6 +8,7 @@
 #include <utility>
 #include <vector>
 
+#include "host/ImportStaging.h"
 #include "host/ProgressNotifier.h"
 #include "host/RequestParams.h"
 #include "platform/foundation/Mutex.h"
@@ -16,6 +18,7 @@ namespace cindral {
 namespace {
 
 using Reply = std::shared_ptr<JsonRpcReply>;
+using ItemResult = Result<std::shared_ptr<const TesselItem>>;
 
 TesselExtension::ItemCompletion itemCompletion(const HostMethodsContext& context, const Reply& reply) {
     return [reply, &paths = context.paths](const Result<std::shared_ptr<const TesselItem>>& item) {
@@ -28,6 +31,12 @@ TesselExtension::Completion completion(const HostMethodsContext& context, const 
         if (error) return answerWithError(*reply, *error, paths);
         reply->result([](std::string& out) { out += "{}"; });
     };
+}
+
+/// The completion, with something that lives until it has been called.
+TesselExtension::ItemCompletion keepingUntilAnswered(TesselExtension::ItemCompletion completion,
+                                                     std::shared_ptr<const ImportStaging> kept) {
+    return [completion = std::move(completion), kept = std::move(kept)](const ItemResult& item) { completion(item); };
 }
 
 /// Keeps the answer of an operation that is quicker than whoever is to follow it, so that much work is always told of.
@@ -78,6 +87,37 @@ void importDocument(const HostMethodsContext& context, const Json& params, const
     follow(reply, itemCompletion(context, reply), [&](TesselExtension::ItemCompletion completion) {
         return context.client.provider().importDocumentAtURL(context.paths.presentedURL(*url), *parent,
                                                              std::move(completion));
+    });
+}
+
+/// The copy is built where it does not show, then moved to its place under its name: that is taken last, and nothing is
+/// to be taken back where somebody else has it.
+void copyItem(const HostMethodsContext& context, const Json& params, const Reply& reply) {
+    const RequestParams given(params, *reply);
+    const auto identifier = given.string("identifier");
+    const auto parent = identifier ? given.string("parent") : std::nullopt;
+    std::optional<std::string> name;
+    if (!parent || !given.optionalString("name", name)) return;
+    auto& provider = context.client.provider();
+    const auto source = provider.itemForIdentifier(*identifier);
+    if (!source.ok()) return answerWithError(*reply, source.error(), context.paths);
+    const KsURL* url = (*source)->fileURL();
+    if (url == nullptr) return answerWithError(*reply, KsError::posix(ENOTSUP), context.paths);
+    auto made = ImportStaging::make(provider, context.paths);
+    if (!made.ok()) return answerWithError(*reply, made.error(), context.paths);
+    const auto staging = std::make_shared<const ImportStaging>(*std::move(made));
+
+    const auto move = [&context, reply, staging, parent = *parent,
+                       name = name.value_or((*source)->filename())](const ItemResult& built) {
+        if (!built.ok()) return answerWithError(*reply, built.error(), context.paths);
+        follow(reply, keepingUntilAnswered(itemCompletion(context, reply), staging),
+               [&](TesselExtension::ItemCompletion completion) {
+                   return context.client.provider().reparentItemWithIdentifier((*built)->itemIdentifier(), parent, name,
+                                                                               std::move(completion));
+               });
+    };
+    follow(reply, std::function<void(ItemResult)>(move), [&](TesselExtension::ItemCompletion completion) {
+        return provider.importDocumentAtURL(*url, staging->identifier, std::move(completion));
     });
 }
 
@@ -170,11 +210,17 @@ void setFavoriteRank(const HostMethodsContext& context, const Json& params, cons
 JsonRpcServer::Methods makeEditMethods(const HostMethodsContext& context) {
     using Handler = void (*)(const HostMethodsContext&, const Json&, const Reply&);
     constexpr std::pair<const char*, Handler> kHandlers[] = {
-        {"importDocument", importDocument},   {"createDirectory", createDirectory},
-        {"renameItem", renameItem},           {"reparentItem", reparentItem},
-        {"deleteItem", deleteItem},           {"trashItem", trashItem},
-        {"untrashItem", untrashItem},         {"removeTrashedItemsOlderThan", removeTrashedItemsOlderThan},
-        {"setLastUsedDate", setLastUsedDate}, {"setTags", setTags},
+        {"importDocument", importDocument},
+        {"copyItem", copyItem},
+        {"createDirectory", createDirectory},
+        {"renameItem", renameItem},
+        {"reparentItem", reparentItem},
+        {"deleteItem", deleteItem},
+        {"trashItem", trashItem},
+        {"untrashItem", untrashItem},
+        {"removeTrashedItemsOlderThan", removeTrashedItemsOlderThan},
+        {"setLastUsedDate", setLastUsedDate},
+        {"setTags", setTags},
         {"setFavoriteRank", setFavoriteRank},
     };
     JsonRpcServer::Methods methods;

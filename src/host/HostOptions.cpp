@@ -39,6 +39,9 @@ struct Words {
     std::string text;
     std::uint64_t limit = UINT64_MAX;
     std::string item;
+    bool http = false;
+    std::uint16_t httpPort = 0;
+    std::uint64_t uploadBytesMax = HostOptions{}.uploadBytesMax;
     EditOptions edit;
 };
 
@@ -150,6 +153,17 @@ bool isSearch(HostCommand command) {
            command == HostCommand::favorites;
 }
 
+void addHttpOptions(CLI::App& command, Words& words) {
+    command.add_flag("--http", words.http,
+                     "Serve the document browser to the browsers of this machine too; prints a link that lets one in.");
+    command.add_option("--http-port", words.httpPort, "Its port; without it, or 0, any that is free. Means --http.")
+        ->type_name("PORT");
+    command
+        .add_option("--http-upload-max", words.uploadBytesMax,
+                    "Bytes of a document that a browser may send. Default: 64 GiB.")
+        ->type_name("BYTES");
+}
+
 void addCommands(CLI::App& app, Words& words) {
     for (const CommandDescription& description : kCommands) {
         CLI::App* command = app.add_subcommand(description.name, description.description);
@@ -172,6 +186,7 @@ void addCommands(CLI::App& app, Words& words) {
                 ->type_name("FILE")
                 ->required();
         }
+        if (description.command == HostCommand::serve) addHttpOptions(*command, words);
         if (description.command == HostCommand::apps) {
             for (const CommandDescription& each : kAppsCommands) {
                 CLI::App* inner = command->add_subcommand(each.name, each.description);
@@ -255,6 +270,8 @@ HostOptions optionsOf(const CLI::App& app, const Words& words, const HostEnviron
     options.json = words.json;
     options.intoPackages = words.intoPackages;
     options.since = words.since;
+    if (words.http || words.httpPort != 0) options.httpPort = words.httpPort;
+    options.uploadBytesMax = words.uploadBytesMax;
     options.outputFile = words.outputFile == "-" ? "-" : absolutePath(words.outputFile, environment);
     return options;
 }

@@ -52,12 +52,14 @@ struct HostOptions {
     bool flatpak = true;
     RecorderChoice recorder = RecorderChoice::automatic;
     bool json = false;
-    bool intoPackages = false;         ///< tree
-    EditOptions edit;                  ///< edit
-    std::string since;                 ///< changes: an anchor, as printed
-    std::string outputFile;            ///< thumbnail: absolute, or "-"
-    std::string text;                  ///< find: what is looked for; tagged: the tag
-    std::uint64_t limit = UINT64_MAX;  ///< of the items that a search prints
+    bool intoPackages = false;                   ///< tree
+    EditOptions edit;                            ///< edit
+    std::string since;                           ///< changes: an anchor, as printed
+    std::string outputFile;                      ///< thumbnail: absolute, or "-"
+    std::string text;                            ///< find: what is looked for; tagged: the tag
+    std::uint64_t limit = UINT64_MAX;            ///< of the items that a search prints
+    std::optional<std::uint16_t> httpPort;       ///< serve: also to browsers; 0 for any that is free
+    std::uint64_t uploadBytesMax = 64ULL << 30;  ///< serve: of one document that a browser sends
     /// Which of them the call's words say; the others are defaults.
     struct Said {
         bool storage = false;

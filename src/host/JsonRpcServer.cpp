@@ -26,20 +26,20 @@ public:
 
 class JsonRpcServer::SingleAnswer final : public Answers {
 public:
-    explicit SingleAnswer(const Sink& sink) : sink_(sink) {}
+    explicit SingleAnswer(Sink sink) : sink_(std::move(sink)) {}
     void add(std::string answer, const std::string& /*id*/) override {
         answer += '\n';
         sink_(answer);
     }
 
 private:
-    const Sink& sink_;
+    const Sink sink_;
 };
 
 /// Collects until the last of its references is gone: that is when every request of the batch has been answered.
 class JsonRpcServer::BatchAnswers final : public Answers {
 public:
-    explicit BatchAnswers(const Sink& sink) : sink_(sink) {}
+    explicit BatchAnswers(Sink sink) : sink_(std::move(sink)) {}
     ~BatchAnswers() override {
         if (line_.empty()) return;  // Nothing but notifications: no answer at all.
         line_ += "]\n";
@@ -56,7 +56,7 @@ public:
     }
 
 private:
-    const Sink& sink_;
+    const Sink sink_;
     Mutex mutex_;
     std::string line_ GUARDED_BY(mutex_);
 };
@@ -144,12 +144,16 @@ JsonRpcServer::~JsonRpcServer() {
 }
 
 void JsonRpcServer::receiveLine(std::string_view line) {
+    receiveLine(line, sink_);
+}
+
+void JsonRpcServer::receiveLine(std::string_view line, const Sink& sink) {
     JsonRpcLine decoded = decodeJsonRpcLine(line);
     std::shared_ptr<Answers> answers;
     if (decoded.isBatch) {
-        answers = std::make_shared<BatchAnswers>(sink_);
+        answers = std::make_shared<BatchAnswers>(sink);
     } else {
-        answers = std::make_shared<SingleAnswer>(sink_);
+        answers = std::make_shared<SingleAnswer>(sink);
     }
     for (JsonRpcEntry& entry : decoded.entries) receive(std::move(entry), answers);
 }

@@ -60,6 +60,9 @@ public:
     JsonRpcServer& operator=(const JsonRpcServer&) = delete;
 
     void receiveLine(std::string_view line);
+    /// The same with a place of its own for the line's answers; what is told of its requests meanwhile goes where the
+    /// rest goes. `answers` is let go of when everything in the line is answered, whether or not anything was written.
+    void receiveLine(std::string_view line, const Sink& answers);
     /// A line was longer than kJsonRpcLineBytesMax.
     void receiveLongLine();
     /// Returns when everything received is answered.

@@ -18,6 +18,7 @@
 #include "host/HostError.h"
 #include "host/HostOptions.h"
 #include "host/HostProcess.h"
+#include "host/JsonText.h"
 #include "host/ProviderClient.h"
 #include "host/RemoteClient.h"
 #include "host/RpcConnection.h"
@@ -27,6 +28,7 @@
 #include "host/StopSignals.h"
 #include "host/TerminalText.h"
 #include "host/TextOutput.h"
+#include "host/http/HttpListener.h"
 #include "platform/foundation/Log.h"
 
 namespace cindral {
@@ -77,6 +79,21 @@ void raiseDescriptorLimit() {
     ::setrlimit(RLIMIT_NOFILE, &limit);
 }
 
+/// Lets browsers in too, where that is asked for. The link goes to standard output, and nowhere else.
+Result<void> addHttp(Daemon& daemon, const HostOptions& options) {
+    if (!options.httpPort) return {};
+    auto listener = HttpListener::make(*options.httpPort, options.uploadBytesMax);
+    if (!listener.ok())
+        return hostFailure(fmt::format("can't listen at port {}: {}", *options.httpPort, listener.error().reason()));
+    const std::string link = (*listener)->makeLink();
+    daemon.add(*std::move(listener));
+    const std::string line = options.json ? fmt::format("{{\"url\":{}}}\n", jsonString(link))
+                                          : fmt::format("Your documents, once: {}\n", link);
+    const auto written = descriptor::writeAll(STDOUT_FILENO, line);
+    if (!written.ok()) return hostFailure(fmt::format("can't write to standard output: {}", written.error().reason()));
+    return {};
+}
+
 int runServe(HostOptions options, const HostEnvironment& environment, TesselExtensionFactory makeProvider) {
     auto stopSignals = StopSignals::catchThem();
     if (!stopSignals.ok()) return failWith(stopSignals.error());
@@ -107,6 +124,7 @@ int runServe(HostOptions options, const HostEnvironment& environment, TesselExte
     logInfo("serving {} at {}", (*host)->paths().real(), DaemonSocket::linkIn((*host)->state()));
     Daemon daemon(**host, manager);
     for (DaemonSocket& each : sockets) daemon.add(std::make_unique<SocketListener>(std::move(each)));
+    if (const auto added = addHttp(daemon, (*host)->options()); !added.ok()) return failWith(added.error());
     const auto served = daemon.run((*stopSignals)->descriptor(), [&] { (void)takeOver((*host)->state()); });
     // Held until the store is closed: until then, nobody else could use it.
     host->reset();

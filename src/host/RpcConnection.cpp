@@ -2,13 +2,11 @@
 
 #include <vector>
 
-#include "host/ContainerMonitor.h"
 #include "host/Descriptor.h"
-#include "host/HostMethods.h"
 #include "host/HostProcess.h"
-#include "host/JsonText.h"
 #include "host/LineOutput.h"
 #include "host/LineSplitter.h"
+#include "host/ServedClient.h"
 
 namespace cindral {
 namespace {
@@ -33,20 +31,6 @@ private:
     JsonRpcServer& server_;
     LineSink& answers_;
 };
-
-/// The notification that something in a container has changed.
-std::string signalLine(const TesselItemIdentifier& container) {
-    std::string line = R"({"jsonrpc":"2.0","method":"signal","params":{"container":)";
-    appendJsonString(line, container);
-    return line + "}}\n";
-}
-
-/// The notification that a watched query's answer may be another.
-std::string queryLine(std::uint64_t watch) {
-    std::string line = R"({"jsonrpc":"2.0","method":"queryChanged","params":{"watch":)";
-    appendJsonNumber(line, watch);
-    return line + "}}\n";
-}
 
 /// Reads until the end of input, or until nobody reads the answers.
 Result<void> readAll(int input, int output, const UniqueFd& interrupt, LineSplitter& lines) {
@@ -78,15 +62,8 @@ Result<void> serveRpc(int input, int output, const RpcService& service) {
 }
 
 Result<void> serveRpc(int input, int output, const UniqueFd& interrupt, LineSink& answers, const RpcService& service) {
-    // Taken down from the last to the first: the server waits for its requests, then nothing is watched or monitored any
-    // more, and the client lets go of its enumerators.
-    ProviderClient client(service.provider);
-    ContainerMonitor monitor(client, service.signals,
-                             [&](const TesselItemIdentifier& container) { answers.write(signalLine(container)); });
-    QueryWatches watches(service.search, [&](std::uint64_t watch) { answers.write(queryLine(watch)); });
-    JsonRpcServer server(
-        makeHostMethods({client, monitor, service.paths, service.statusText, service.search, watches, service.hello}),
-        [&](std::string_view line) { answers.write(line); });
+    ServedClient client(service, [&](std::string_view line) { answers.write(line); });
+    JsonRpcServer& server = client.server();
     Receiver receiver(server, answers);
     LineSplitter lines(receiver, kJsonRpcLineBytesMax);
 

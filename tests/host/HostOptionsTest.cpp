@@ -50,6 +50,16 @@ void expectUsageFailure(const std::vector<std::string>& words) {
     EXPECT_EQ(std::ranges::count(refused.text, '\n'), 1) << refused.text;
 }
 
+TEST(HostOptions, letBrowsersInOnlyWhenAskedTo) {
+    EXPECT_EQ(options({"serve"}).httpPort, std::nullopt);
+    EXPECT_EQ(options({"serve", "--http"}).httpPort, 0);
+    EXPECT_EQ(options({"serve", "--http-port", "8080"}).httpPort, 8080);
+    EXPECT_EQ(options({"serve", "--http-upload-max", "5"}).uploadBytesMax, 5U);
+    expectUsageFailure({"serve", "--http-port", "65536"});
+    expectUsageFailure({"serve", "--http-port", "-1"});
+    expectUsageFailure({"tree", "--http"});
+}
+
 TEST(HostOptions, haveDefaults) {
     const HostOptions plain = options({"tree"});
     EXPECT_EQ(plain.command, HostCommand::tree);

@@ -210,9 +210,9 @@ class SocketClient(Connection):
 class Daemon:
     """A daemon of a state folder. Made, it serves; where it ends instead, `is_serving` is false."""
 
-    def __init__(self, words, environment, launcher=(), **popen):
+    def __init__(self, words, environment, launcher=(), stdout=subprocess.DEVNULL, **popen):
         self.process = subprocess.Popen(
-            [*launcher, PROGRAM, "serve", *words], env=environment, stdin=subprocess.DEVNULL, stdout=subprocess.DEVNULL,
+            [*launcher, PROGRAM, "serve", *words], env=environment, stdin=subprocess.DEVNULL, stdout=stdout,
             stderr=subprocess.PIPE, **popen)
         self.said = queue.Queue()
         self._errors = []
