@@ -231,11 +231,13 @@ std::uint64_t fileIDOfDocument(std::int64_t documentID, std::uint32_t device) {
     }
 }
 
-}  // namespace
+/// A file number, and the device that it is of.
+struct NumberOnDevice {
+    std::uint64_t fileID;
+    std::uint32_t device;
+};
 
-std::optional<KsURL> fileURLWithItemIdentifier(const TesselItemIdentifier& identifier) {
-    if (identifier == kTesselRootContainerItemIdentifier) return TesselManager::defaultManager().documentStorageURL();
-
+std::optional<NumberOnDevice> numberWithItemIdentifier(const TesselItemIdentifier& identifier) {
     const auto components = static_cast<std::size_t>(std::ranges::count(identifier, '=')) + 1;
     if (components != 2) {
         logPlain(LogLevel::error, "invalid identifier; identifier should have 2 components, not {}", components);
@@ -253,7 +255,20 @@ std::optional<KsURL> fileURLWithItemIdentifier(const TesselItemIdentifier& ident
     const std::uint64_t fileID =
         host == kFileHost ? static_cast<std::uint64_t>(number) : fileIDOfDocument(number, device);
     if (host == kDocumentHost && fileID == 0) return std::nullopt;
-    return fileURLWithFileIdentifierOnDevice(fileID, device);
+    return NumberOnDevice{fileID, device};
+}
+
+}  // namespace
+
+std::optional<KsURL> fileURLWithItemIdentifier(const TesselItemIdentifier& identifier) {
+    if (identifier == kTesselRootContainerItemIdentifier) return TesselManager::defaultManager().documentStorageURL();
+    const std::optional<NumberOnDevice> number = numberWithItemIdentifier(identifier);
+    return number ? fileURLWithFileIdentifierOnDevice(number->fileID, number->device) : std::nullopt;
+}
+
+std::optional<std::uint64_t> fileIDWithItemIdentifier(const TesselItemIdentifier& identifier) {
+    const std::optional<NumberOnDevice> number = numberWithItemIdentifier(identifier);
+    return number ? std::optional(number->fileID) : std::nullopt;
 }
 
 std::optional<KsURL> fileURLWithFileIdentifier(std::uint64_t fileID) {

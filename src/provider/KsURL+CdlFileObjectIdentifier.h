@@ -36,6 +36,9 @@ std::optional<TesselItemIdentifier> itemIdentifier(KsURL& url);
 /// Where the object of an identifier is now; none, after a log line, when there is none, also for app libraries'
 /// identifiers.
 std::optional<KsURL> fileURLWithItemIdentifier(const TesselItemIdentifier& identifier);
+/// The file ID of the object of an identifier; none, after a log line, when there is none. Not for identifiers that are
+/// made from no number.
+std::optional<std::uint64_t> fileIDWithItemIdentifier(const TesselItemIdentifier& identifier);
 /// Where the object with that file number is on the storage's device.
 std::optional<KsURL> fileURLWithFileIdentifier(std::uint64_t fileID);
 std::optional<KsURL> fileURLWithFileIdentifierOnDevice(std::uint64_t fileID, std::uint32_t device);

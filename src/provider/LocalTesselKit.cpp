@@ -32,6 +32,8 @@ namespace {
 
 constexpr std::chrono::milliseconds kAppRefreshIntervalMin{500};
 constexpr std::string_view kDocumentsName = "Documents";
+// Looks for an item that others move meanwhile.
+constexpr int kLooksMax = 3;
 
 NotificationCenter& requiredDistributedCenter() {
     NotificationCenter* center = NotificationCenter::distributedCenter();
@@ -133,12 +135,25 @@ std::shared_ptr<const LocalItem> LocalTesselKit::resolveItem(const TesselItemIde
     return url ? LocalItem::initWithURL(*std::move(url), std::move(customs)) : nullptr;
 }
 
-Result<KsURL> LocalTesselKit::urlForItem(const TesselItemIdentifier& identifier) {
+/// Where an item is, and which object it is there.
+Result<MeantFile> LocalTesselKit::lookUp(const TesselItemIdentifier& identifier) {
     LocalItem::Customs customs;
     customs.isOnlyLookedUp = true;
-    const auto item = resolveItem(identifier, std::move(customs));
-    if (!item) return tesselErrorForNonExistentItemWithIdentifier(identifier);
-    return *item->fileURL();
+    // Between the look at where it is and the look at what is there, others may have moved it and taken its place.
+    for (int looks = 0; looks < kLooksMax; ++looks) {
+        const auto item = resolveItem(identifier, customs);
+        if (!item) break;
+        const Result<FileStatus> status = item->fileURL()->status();
+        const bool isNumbered = identifier.find('=') != std::string::npos;
+        const bool isMeant = item->itemIdentifier() == identifier || !isNumbered ||
+                             (status.ok() && fileIDWithItemIdentifier(identifier) == status->fileID);
+        if (isMeant && status.ok()) return MeantFile(*item->fileURL(), status->identity());
+    }
+    return tesselErrorForNonExistentItemWithIdentifier(identifier);
+}
+
+Result<KsURL> LocalTesselKit::urlForItem(const TesselItemIdentifier& identifier) {
+    return TRY(lookUp(identifier)).url;
 }
 
 void LocalTesselKit::waitUntilReady() {
@@ -150,18 +165,29 @@ std::optional<KsURL> LocalTesselKit::URLForItemWithPersistentIdentifier(const Te
 }
 
 std::optional<KsURL> LocalTesselKit::urlForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier) {
+    const Result<MeantFile> file = find(identifier, Lookup::lenient);
+    return file.ok() ? std::optional(file->url) : std::nullopt;
+}
+
+KsError LocalTesselKit::missingItem(const TesselItemIdentifier& identifier, Lookup lookup) {
+    return lookup == Lookup::strict ? tesselErrorForNonExistentItemWithIdentifier(identifier)
+                                    : tsItemNotFoundError(identifier);
+}
+
+Result<MeantFile> LocalTesselKit::find(const TesselItemIdentifier& identifier, Lookup lookup) {
+    if (lookup == Lookup::strict) return lookUp(identifier);
     const LogSection section("fetching URL for \"{}\"", identifier);
-    Result<KsURL> url = urlForItem(identifier);
-    if (url.ok()) {
-        logDebug("found {}", url->description());
-        return *std::move(url);
+    Result<MeantFile> file = lookUp(identifier);
+    if (file.ok()) {
+        logDebug("found {}", file->url.description());
+        return file;
     }
-    if (url.error().code() == static_cast<std::int64_t>(LocalTesselKitError::itemNotFound)) {
-        logDebug("can't find URL matching identifier {}; {}", identifier, url.error().description());
+    if (file.error().code() == static_cast<std::int64_t>(LocalTesselKitError::itemNotFound)) {
+        logDebug("can't find URL matching identifier {}; {}", identifier, file.error().description());
     } else {
-        logError("can't find URL matching identifier {}; {}", identifier, url.error().description());
+        logError("can't find URL matching identifier {}; {}", identifier, file.error().description());
     }
-    return std::nullopt;
+    return missingItem(identifier, lookup);
 }
 
 std::optional<TesselItemIdentifier> LocalTesselKit::persistentIdentifierForItemAtURL(const KsURL& url) {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -7,6 +8,7 @@
 
 #include "platform/foundation/Mutex.h"
 #include "platform/foundation/SerialQueue.h"
+#include "platform/tessel/FileOperations.h"
 #include "platform/tessel/TSPacer.h"
 #include "platform/tessel/TesselExtension.h"
 #include "provider/LocalItem.h"
@@ -91,6 +93,7 @@ private:
     LocalTesselKit();
     static void notificationCallback(const void* observer, std::string_view name);
     static std::optional<KsURL> urlForItemWithPersistentIdentifier(const TesselItemIdentifier& identifier);
+    static Result<MeantFile> lookUp(const TesselItemIdentifier& identifier);
     static std::optional<TesselItemIdentifier> persistentIdentifierForItemAt(const KsURL& url);
     static std::shared_ptr<const LocalItem> resolveItem(const TesselItemIdentifier& identifier,
                                                         LocalItem::Customs customs = LocalItem::Customs());
@@ -98,20 +101,32 @@ private:
     static Result<KsURL> urlForItem(const TesselItemIdentifier& identifier);
 
     // What edits share. Static: what answers them may outlast the provider.
+
+    /// How an item is looked for: what is not there is the host's no-such-item error; or it is logged, and is the host's
+    /// item-not-found error.
+    enum class Lookup { strict, lenient };
+    /// Where an item is, and which object it is there.
+    static Result<MeantFile> find(const TesselItemIdentifier& identifier, Lookup lookup);
+    static KsError missingItem(const TesselItemIdentifier& identifier, Lookup lookup);
+    /// Begins an edit once more, from the look for its item. False, and nothing is done, the second time.
+    using Again = std::function<bool()>;
+    /// Calls `edit`, and again where it asks for that.
+    static void attempt(std::function<void(const Again&)> edit);
+    /// Whether an edit failed because what it is about, or what holds that, was not where it was found any more.
+    static bool hasGone(const KsError& error, const MeantFile& file);
     static Result<std::shared_ptr<const LocalItem>> fetchItem(const TesselItemIdentifier& identifier);
     /// What there is at a URL after an edit.
     static Result<std::shared_ptr<const TesselItem>> itemAtURL(const KsURL& url);
     /// An edit's error as the host knows it: of a name that is taken, with the item that has it.
     static KsError translated(const KsError& error);
     static Result<std::shared_ptr<const TesselItem>> converted(const Result<KsURL>& result);
-    static void putBack(const TesselItemIdentifier& identifier, const std::optional<TesselItemIdentifier>& parent,
-                        const ItemCompletion& completion);
+    static Result<std::shared_ptr<const TesselItem>> withoutTrashDate(const KsURL& restored);
     static std::optional<KsURL> destinationOfUntrash(const LocalItem& item,
                                                      const std::optional<TesselItemIdentifier>& parent);
-    static Result<std::shared_ptr<const TesselItem>> withAttribute(const KsURL& url,
-                                                                   const TesselItemIdentifier& identifier,
-                                                                   std::string_view name,
+    static Result<std::shared_ptr<const TesselItem>> withAttribute(const TesselItemIdentifier& identifier,
+                                                                   Lookup lookup, std::string_view name,
                                                                    const std::optional<Bytes>& value);
+    static KsError notTagged(const TesselItemIdentifier& identifier);
 
     const std::shared_ptr<FirstRefresh> firstRefresh_;
     SerialQueue appRefreshQueue_{"cindral.app-refresh.queue"};

@@ -17,6 +17,9 @@ namespace cindral {
 
 namespace {
 
+// What moves away between the look for it and the write is looked for once more.
+constexpr int kAttemptsMax = 2;
+
 /// As they are kept: an array of strings; none at all where there are none.
 std::optional<Bytes> archivedTags(const std::vector<TSTag>& tags) {
     if (tags.empty()) return std::nullopt;
@@ -25,22 +28,28 @@ std::optional<Bytes> archivedTags(const std::vector<TSTag>& tags) {
     return keyed_archive::archive(std::move(labels));
 }
 
+Result<void> setAttribute(const MeantFile& file, std::string_view name, const std::optional<Bytes>& value) {
+    return ts_withReadWriteAccess(file, [&](int fd) -> Result<void> {
+        if (auto error = setXattr(fd, value, name)) return error->with("path", file.url.path());
+        return {};
+    });
+}
+
 }  // namespace
 
 /// The item with the attribute written, or taken away.
-Result<std::shared_ptr<const TesselItem>> LocalTesselKit::withAttribute(const KsURL& url,
-                                                                        const TesselItemIdentifier& identifier,
-                                                                        std::string_view name,
+Result<std::shared_ptr<const TesselItem>> LocalTesselKit::withAttribute(const TesselItemIdentifier& identifier,
+                                                                        Lookup lookup, std::string_view name,
                                                                         const std::optional<Bytes>& value) {
-    const Result<void> written = ts_withReadWriteAccess(url, [&](int fd) -> Result<void> {
-        if (auto error = setXattr(fd, value, name)) return error->with("path", url.path());
-        return {};
-    });
-    if (!written.ok()) {
+    for (int attempts = 0; attempts < kAttemptsMax; ++attempts) {
+        const MeantFile file = TRY(find(identifier, lookup));
+        const Result<void> written = setAttribute(file, name, value);
+        if (written.ok()) return std::shared_ptr<const TesselItem>(TRY(fetchItem(identifier)));
+        if (hasGone(written.error(), file)) continue;
         logError("can't set xattr {}; {}", name, written.error().description());
         return written.error();
     }
-    return std::shared_ptr<const TesselItem>(TRY(fetchItem(identifier)));
+    return missingItem(identifier, lookup);
 }
 
 void LocalTesselKit::setLastUsedDate(const std::optional<KsDate>& date, const TesselItemIdentifier& identifier,
@@ -52,33 +61,32 @@ void LocalTesselKit::setLastUsedDate(const std::optional<KsDate>& date, const Te
         const auto item = fetchItem(identifier);
         return completion(item.ok() ? Result<std::shared_ptr<const TesselItem>>(*item) : item.error());
     }
-    const Result<KsURL> url = urlForItem(identifier);
-    if (!url.ok()) return completion(url.error());
     const auto value = date ? std::optional(keyed_archive::archive(*date)) : std::nullopt;
-    completion(withAttribute(*url, identifier, kXattrLastUsedDateName, value));
+    completion(withAttribute(identifier, Lookup::strict, kXattrLastUsedDateName, value));
 }
 
 void LocalTesselKit::setTagData(const std::optional<Bytes>& tagData, const TesselItemIdentifier& identifier,
                                 ItemCompletion completion) {
     const LogSection section("set tag data to item \"{}\"", identifier);
-    const std::optional<KsURL> url = urlForItemWithPersistentIdentifier(identifier);
-    if (!url) {
-        logError("can't find URL for item; {}", identifier);
-        return completion(tsItemNotFoundError(identifier));
-    }
     const auto tags = tagData ? tsGetTagsFromTagsData(*tagData) : std::vector<TSTag>();
-    // Bytes that are no tags are no wish to have none.
-    if (!tags) return completion(tsInvalidParameterError("tagData", identifier));
-    completion(withAttribute(*url, identifier, kXattrTagDataName, archivedTags(*tags)));
+    auto tagged = tags ? withAttribute(identifier, Lookup::lenient, kXattrTagDataName, archivedTags(*tags))
+                       : notTagged(identifier);
+    if (!tagged.ok() && tagged.error().is(kTSErrorDomain, static_cast<std::int64_t>(TSErrorCode::itemNotFound)))
+        logError("can't find URL for item; {}", identifier);
+    completion(std::move(tagged));
+}
+
+/// Bytes that are no tags are no wish to have none.
+KsError LocalTesselKit::notTagged(const TesselItemIdentifier& identifier) {
+    const Result<MeantFile> file = find(identifier, Lookup::lenient);
+    return file.ok() ? tsInvalidParameterError("tagData", identifier) : file.error();
 }
 
 void LocalTesselKit::setFavoriteRank(std::optional<std::int64_t> rank, const TesselItemIdentifier& identifier,
                                      ItemCompletion completion) {
     const LogSection section("set favorite rank \"{}\" {}", rank ? fmt::to_string(*rank) : "none", identifier);
-    const Result<KsURL> url = urlForItem(identifier);
-    if (!url.ok()) return completion(url.error());
     const auto value = rank ? std::optional(keyed_archive::archive(*rank)) : std::nullopt;
-    completion(withAttribute(*url, identifier, kXattrFavoriteRankName, value));
+    completion(withAttribute(identifier, Lookup::strict, kXattrFavoriteRankName, value));
 }
 
 }  // namespace cindral

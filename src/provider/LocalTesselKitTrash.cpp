@@ -109,49 +109,61 @@ bool isReachableFolder(const KsURL& url) {
 
 void LocalTesselKit::trashItemWithIdentifier(const TesselItemIdentifier& identifier, ItemCompletion completion) {
     const LogSection section("trash item \"{}\"", identifier);
-    const std::optional<KsURL> url = urlForItemWithPersistentIdentifier(identifier);
-    if (!url) return completion(tsItemNotFoundError(identifier));
-    const Result<KsURL> trash = trashURL(*url);
-    if (!trash.ok()) return completion(trash.error());
-    // Nothing to be done, and where it came from is not to be forgotten.
-    if (url->deletingLastPathComponent() == *trash) return completion(itemAtURL(*url));
-    const Result<void> made = file_operations::makeFolderUnlessThere(*trash);
-    if (!made.ok()) return completion(made.error());
-    ts_trashUnderFolder(*url, *trash,
-                        [former = *url, completion = std::move(completion)](const Result<KsURL>& trashed) {
-                            if (!trashed.ok()) return completion(translated(trashed.error()));
-                            (void)setTrashDate(*trashed, KsDate::now());
-                            setPutBack(former, *trashed);
-                            completion(itemAtURL(*trashed));
-                        });
+    attempt([identifier, completion = std::move(completion)](const Again& again) {
+        const Result<MeantFile> file = find(identifier, Lookup::lenient);
+        if (!file.ok()) return completion(file.error());
+        const Result<KsURL> trash = trashURL(file->url);
+        if (!trash.ok()) return completion(trash.error());
+        // Nothing to be done, and where it came from is not to be forgotten.
+        if (file->url.deletingLastPathComponent() == *trash) return completion(itemAtURL(file->url));
+        const Result<void> made = file_operations::makeFolderUnlessThere(*trash);
+        if (!made.ok()) return completion(made.error());
+        ts_trashUnderFolder(*file, *trash, [identifier, file = *file, again, completion](const Result<KsURL>& trashed) {
+            if (trashed.ok()) {
+                (void)setTrashDate(*trashed, KsDate::now());
+                setPutBack(file.url, *trashed);
+                return completion(itemAtURL(*trashed));
+            }
+            if (!hasGone(trashed.error(), file)) return completion(translated(trashed.error()));
+            if (!again()) completion(missingItem(identifier, Lookup::lenient));
+        });
+    });
 }
 
 void LocalTesselKit::untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
                                                const std::optional<TesselItemIdentifier>& parent,
                                                ItemCompletion completion) {
     const LogSection section("untrash item \"{}\"", identifier);
-    const std::optional<KsURL> url = urlForItemWithPersistentIdentifier(identifier);
-    if (!url) return completion(tsItemNotFoundError(identifier));
-    const auto item = fetchItem(identifier);
-    if (!item.ok()) return completion(item.error());
-    if (!(*item)->isTrashed()) {
-        logDebug("item is not in trash");
-        return completion(tsInvalidParameterError("identifier", identifier));
-    }
-    const std::optional<KsURL> folder = destinationOfUntrash(**item, parent);
-    if (!folder) {
-        logDebug("can't compute valid parent URL for {}", url->description());
-        return completion(tsInvalidParameterError("parent", parent.value_or("")));
-    }
-    ts_reparentUnderFolder(*url, *folder, Bouncing::isAllowed,
-                           [completion = std::move(completion)](const Result<KsURL>& restored) {
-                               if (!restored.ok()) return completion(translated(restored.error()));
-                               logDebug("removing trash date xattr");
-                               if (const auto error = writeAttribute(*restored, kXattrTrashDateName, std::nullopt))
-                                   logError("can't remove {} of {}; {}", kXattrTrashDateName, restored->description(),
-                                            error->description());
-                               completion(itemAtURL(*restored));
-                           });
+    attempt([identifier, parent, completion = std::move(completion)](const Again& again) {
+        const Result<MeantFile> file = find(identifier, Lookup::lenient);
+        if (!file.ok()) return completion(file.error());
+        const auto item = fetchItem(identifier);
+        if (!item.ok()) return completion(item.error());
+        if (!(*item)->isTrashed()) {
+            logDebug("item is not in trash");
+            return completion(tsInvalidParameterError("identifier", identifier));
+        }
+        const std::optional<KsURL> folder = destinationOfUntrash(**item, parent);
+        if (!folder) {
+            logDebug("can't compute valid parent URL for {}", file->url.description());
+            return completion(tsInvalidParameterError("parent", parent.value_or("")));
+        }
+        ts_reparentUnderFolder(*file, *folder, Bouncing::isAllowed,
+                               [identifier, file = *file, again, completion](const Result<KsURL>& restored) {
+                                   if (restored.ok()) return completion(withoutTrashDate(*restored));
+                                   if (!hasGone(restored.error(), file))
+                                       return completion(translated(restored.error()));
+                                   if (!again()) completion(missingItem(identifier, Lookup::lenient));
+                               });
+    });
+}
+
+/// What was put back, as it is now.
+Result<std::shared_ptr<const TesselItem>> LocalTesselKit::withoutTrashDate(const KsURL& restored) {
+    logDebug("removing trash date xattr");
+    if (const auto error = writeAttribute(restored, kXattrTrashDateName, std::nullopt))
+        logError("can't remove {} of {}; {}", kXattrTrashDateName, restored.description(), error->description());
+    return itemAtURL(restored);
 }
 
 std::optional<KsURL> LocalTesselKit::destinationOfUntrash(const LocalItem& item,
@@ -222,9 +234,10 @@ private:
         logDebug("{} was trashed before reference date, let's remove it", url.description());
         slots_.wait();
         deletions_.enter();
-        // Only the very object that was looked at: somebody may put it back meanwhile, and trash another of its name.
+        // Only the very object that was looked at: somebody may put it back meanwhile, and trash another of its name. And
+        // nobody asked for just this one to be deleted: with certainty.
         ts_deleteWithCompletionHandler(
-            url,
+            MeantFile(url, status->identity()),
             [self = shared_from_this(), identifier = *identifier](const std::optional<KsError>& error) {
                 if (error) {
                     logError("can't remove item {}; {}", identifier, error->description());
@@ -233,7 +246,7 @@ private:
                 self->slots_.signal();
                 self->deletions_.leave();
             },
-            status->fileID);
+            std::make_shared<TesselProgress>(), Certainty::isWanted);
     }
 
     /// None where there was none, and one was given now.

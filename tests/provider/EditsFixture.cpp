@@ -2,18 +2,46 @@
 
 #include <sys/xattr.h>
 
+#include <algorithm>
 #include <array>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
+#include <latch>
+#include <thread>
 
+#include "platform/foundation/ThreadPool.h"
 #include "platform/tessel/TesselTags.h"
 
 namespace cindral::test {
 
 EditsTest::EditsTest() : provider_(LocalTesselKit::init()) {}
 
-EditsTest::ItemResult EditsTest::awaitItem(const std::function<void(TesselExtension::ItemCompletion)>& call) {
+struct HeldPool::State {
+    explicit State(std::ptrdiff_t threads) : held(threads) {}
+    std::latch held;
+    std::latch released{1};
+};
+
+HeldPool::HeldPool()
+    : state_(std::make_shared<State>(std::max<std::ptrdiff_t>(2, std::thread::hardware_concurrency()))) {
+    const std::ptrdiff_t threads = std::max<std::ptrdiff_t>(2, std::thread::hardware_concurrency());
+    for (std::ptrdiff_t i = 0; i < threads; ++i) {
+        // Not told to the pool, which would let another run instead.
+        ThreadPool::shared().submit([state = state_] {
+            state->held.count_down();
+            state->released.wait();
+        });
+    }
+    state_->held.wait();
+}
+
+HeldPool::~HeldPool() {
+    state_->released.count_down();
+}
+
+EditsTest::ItemResult EditsTest::awaitItem(const std::function<void(TesselExtension::ItemCompletion)>& call,
+                                           const std::function<void()>& meanwhile) {
     struct Answer {
         DispatchSemaphore given{0};
         std::optional<ItemResult> result;
@@ -25,12 +53,35 @@ EditsTest::ItemResult EditsTest::awaitItem(const std::function<void(TesselExtens
         answer->result = std::move(result);
         answer->given.signal();
     });
+    if (meanwhile) meanwhile();
     answer->given.wait();
     EXPECT_EQ(answer->times, 1);
     return *answer->result;
 }
 
-std::optional<KsError> EditsTest::awaitEnd(const std::function<void(TesselExtension::Completion)>& call) {
+EditsTest::ItemResult EditsTest::overtaken(const std::function<void(TesselExtension::ItemCompletion)>& edit,
+                                           const std::function<void()>& changes) {
+    provider_->waitUntilReady();
+    std::optional<HeldPool> pool(std::in_place);
+    return awaitItem(edit, [&] {
+        changes();
+        pool.reset();
+    });
+}
+
+std::optional<KsError> EditsTest::deletionOvertaken(const TesselItemIdentifier& identifier,
+                                                    const std::function<void()>& changes) {
+    provider_->waitUntilReady();
+    std::optional<HeldPool> pool(std::in_place);
+    return awaitEnd([&](auto completion) { provider_->deleteItemWithIdentifier(identifier, std::move(completion)); },
+                    [&] {
+                        changes();
+                        pool.reset();
+                    });
+}
+
+std::optional<KsError> EditsTest::awaitEnd(const std::function<void(TesselExtension::Completion)>& call,
+                                           const std::function<void()>& meanwhile) {
     struct Answer {
         DispatchSemaphore given{0};
         std::optional<KsError> error;
@@ -40,6 +91,7 @@ std::optional<KsError> EditsTest::awaitEnd(const std::function<void(TesselExtens
         answer->error = std::move(error);
         answer->given.signal();
     });
+    if (meanwhile) meanwhile();
     answer->given.wait();
     return answer->error;
 }

@@ -46,9 +46,31 @@ protected:
 
     std::shared_ptr<LocalTesselKit> provider_;
 
+    /// The answer of an edit that found its item, and then others made changes before it was done.
+    ItemResult overtaken(const std::function<void(TesselExtension::ItemCompletion)>& edit,
+                         const std::function<void()>& changes);
+    std::optional<KsError> deletionOvertaken(const TesselItemIdentifier& identifier,
+                                             const std::function<void()>& changes);
+
 private:
-    ItemResult awaitItem(const std::function<void(TesselExtension::ItemCompletion)>& call);
-    std::optional<KsError> awaitEnd(const std::function<void(TesselExtension::Completion)>& call);
+    static ItemResult awaitItem(const std::function<void(TesselExtension::ItemCompletion)>& call,
+                                const std::function<void()>& meanwhile = nullptr);
+    static std::optional<KsError> awaitEnd(const std::function<void(TesselExtension::Completion)>& call,
+                                           const std::function<void()>& meanwhile = nullptr);
+};
+
+/// Occupies the threads of the pool while it lives: what an edit has put there, having found its item, is done only then.
+class HeldPool {
+public:
+    HeldPool();
+    /// Lets the pool go on.
+    ~HeldPool();
+    HeldPool(const HeldPool&) = delete;
+    HeldPool& operator=(const HeldPool&) = delete;
+
+private:
+    struct State;
+    const std::shared_ptr<State> state_;
 };
 
 inline constexpr const char* kNoSuchItem = "TesselErrorDomain -1001";

@@ -1,14 +1,30 @@
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <filesystem>
+#include <string>
 
+#include "platform/foundation/KeyedArchive.h"
+#include "platform/revisions/VolumeIndex.h"
 #include "provider/AppLibraryFixture.h"
 #include "provider/EditsFixture.h"
+#include "provider/Utilities.h"
 
 namespace cindral::test {
 namespace {
 
-class LocalTesselKitOperations : public EditsTest {};
+class LocalTesselKitOperations : public EditsTest {
+protected:
+    /// Has the file at the name take the document over, as a save does.
+    void handOver(const TesselItemIdentifier& document, std::string_view name) {
+        (void)identifier(name);  // Records it.
+        struct stat status {};
+        ASSERT_EQ(::stat((storage_ / name).c_str(), &status), 0);
+        IndexChanges changes;
+        changes.handOver(DocumentID{static_cast<std::uint32_t>(std::stoul(document.substr(4)))}, FileID{status.st_ino});
+        ASSERT_TRUE(store_->apply(changes, {}).ok());
+    }
+};
 
 TEST_F(LocalTesselKitOperations, importsIntoAFolder) {
     const TemporaryFolder outside;
@@ -185,6 +201,150 @@ TEST_F(LocalTesselKitOperations, aProviderMayGoWhileItsEditsAreUnderWay) {
     provider_.reset();
     answered.wait();
     EXPECT_FALSE(exists("tree"));
+}
+
+// --- Requests that don't wait for each other -------------------------------------------------------------------------------
+
+TEST_F(LocalTesselKitOperations, anEditIsOfTheItemWhereverThatHasGoneMeanwhile) {
+    using std::filesystem::rename;
+    storage_.folder("Letters");
+    storage_.file("x", "X");
+    const auto overtake = [this] {
+        rename(storage_ / "a", storage_ / "b");
+        rename(storage_ / "x", storage_ / "a");
+    };
+    const auto prepare = [this] {
+        if (exists("a")) rename(storage_ / "a", storage_ / "x");
+        storage_.file("a", "A");
+        return identifier("a");
+    };
+    TesselItemIdentifier document = prepare();
+    EXPECT_EQ(errorOf(deletionOvertaken(document, overtake)), "");
+    EXPECT_EQ(contents("a"), "X");
+    EXPECT_FALSE(exists("b"));
+
+    document = prepare();
+    auto answer = overtaken(
+        [&](auto completion) { provider_->renameItemWithIdentifier(document, "c", std::move(completion)); }, overtake);
+    ASSERT_EQ(errorOf(answer), "");
+    EXPECT_EQ((*answer)->itemIdentifier(), document);
+    EXPECT_EQ(contents("a") + contents("c"), "XA");
+
+    document = prepare();
+    answer = overtaken(
+        [&, parent = identifier("Letters")](auto completion) {
+            provider_->reparentItemWithIdentifier(document, parent, "moved", std::move(completion));
+        },
+        overtake);
+    ASSERT_EQ(errorOf(answer), "");
+    EXPECT_EQ((*answer)->itemIdentifier(), document);
+    EXPECT_EQ(contents("a") + contents("Letters/moved"), "XA");
+
+    document = prepare();
+    answer = overtaken([&](auto completion) { provider_->trashItemWithIdentifier(document, std::move(completion)); },
+                       overtake);
+    ASSERT_EQ(errorOf(answer), "");
+    EXPECT_EQ((*answer)->itemIdentifier(), document);
+    EXPECT_EQ(contents("a") + contents(".Trash/b"), "XA");
+    // To the place that it had when it was moved.
+    EXPECT_EQ(keyed_archive::unarchiveString(*attribute(".Trash/b", kXattrTrashPutBackName)), "b");
+
+    answer = overtaken(
+        [&](auto completion) { provider_->untrashItemWithIdentifier(document, std::nullopt, std::move(completion)); },
+        [&] {
+            rename(storage_ / ".Trash/b", storage_ / ".Trash/d");
+            storage_.file(".Trash/b", "B");
+        });
+    ASSERT_EQ(errorOf(answer), "");
+    EXPECT_EQ((*answer)->itemIdentifier(), document);
+    EXPECT_EQ(contents(".Trash/b") + contents("d"), "BA");
+}
+
+TEST_F(LocalTesselKitOperations, whatIsMadeInAFolderIsMadeWhereverThatHasGoneMeanwhile) {
+    using std::filesystem::rename;
+    const TemporaryFolder outside;
+    outside.file("imported");
+    storage_.folder("Letters");
+    storage_.folder("Other");
+    storage_.file("a");
+    const TesselItemIdentifier folder = identifier("Letters");
+    const auto overtake = [this, turn = 0]() mutable {
+        const std::string now = turn == 0 ? "Letters" : "Moved " + std::to_string(turn);
+        rename(storage_ / now, storage_ / ("Moved " + std::to_string(turn + 1)));
+        storage_.folder(now);
+        ++turn;
+    };
+    auto next = overtake;
+    const auto swap = [&next] { next(); };
+    const KsURL imported = KsURL::fileURL(outside / "imported");
+    EXPECT_EQ(
+        errorOf(overtaken([&](auto done) { provider_->importDocumentAtURL(imported, folder, std::move(done)); }, swap)),
+        "");
+    EXPECT_EQ(errorOf(overtaken([&](auto done) { provider_->createDirectoryWithName("new", folder, std::move(done)); },
+                                swap)),
+              "");
+    EXPECT_EQ(errorOf(overtaken(
+                  [&, document = identifier("a")](auto done) {
+                      provider_->reparentItemWithIdentifier(document, folder, std::nullopt, std::move(done));
+                  },
+                  swap)),
+              "");
+    for (const char* name : {"imported", "new", "a"}) EXPECT_TRUE(exists(std::string("Moved 3/") + name)) << name;
+}
+
+TEST_F(LocalTesselKitOperations, whatIsGoneForGoodMeanwhileIsSaidToBeSo) {
+    using std::filesystem::rename;
+    storage_.folder("Letters");
+    storage_.file("x", "X");
+    const auto overtake = [this] { rename(storage_ / "x", storage_ / "a"); };
+    const auto prepare = [this] {
+        if (exists("a")) rename(storage_ / "a", storage_ / "x");
+        storage_.file("a", "A");
+        return identifier("a");
+    };
+    TesselItemIdentifier document = prepare();
+    EXPECT_EQ(errorOf(deletionOvertaken(document, overtake)), kItemNotFound);
+    document = prepare();
+    EXPECT_EQ(errorOf(overtaken([&](auto done) { provider_->renameItemWithIdentifier(document, "c", std::move(done)); },
+                                overtake)),
+              kNoSuchItem);
+    document = prepare();
+    EXPECT_EQ(
+        errorOf(overtaken([&](auto done) { provider_->trashItemWithIdentifier(document, std::move(done)); }, overtake)),
+        kItemNotFound);
+    document = prepare();
+    const auto moved = overtaken(
+        [&, parent = identifier("Letters")](auto done) {
+            provider_->reparentItemWithIdentifier(document, parent, std::nullopt, std::move(done));
+        },
+        overtake);
+    EXPECT_EQ(errorOf(moved), kItemNotFound);
+    EXPECT_EQ(moved.error().userInfo().at("identifier"), document);
+    EXPECT_EQ(contents("a"), "X");
+
+    // The folder that was to take something.
+    document = identifier("a");
+    const TesselItemIdentifier folder = identifier("Letters");
+    const auto refused = overtaken(
+        [&](auto done) { provider_->reparentItemWithIdentifier(document, folder, std::nullopt, std::move(done)); },
+        [&] { std::filesystem::remove(storage_ / "Letters"); });
+    EXPECT_EQ(errorOf(refused), kItemNotFound);
+    EXPECT_EQ(refused.error().userInfo().at("identifier"), folder);
+    EXPECT_EQ(contents("a"), "X");
+}
+
+// A save gives the document's number to another file, in the same place.
+TEST_F(LocalTesselKitOperations, anEditIsOfTheDocumentThatWasSavedMeanwhile) {
+    storage_.file("a", "before");
+    const TesselItemIdentifier document = identifier("a");
+    EXPECT_EQ(errorOf(deletionOvertaken(document,
+                                        [&] {
+                                            storage_.file("saved", "after");
+                                            std::filesystem::rename(storage_ / "saved", storage_ / "a");
+                                            handOver(document, "a");
+                                        })),
+              "");
+    EXPECT_FALSE(exists("a"));
 }
 
 // What took the name can't be told as an item: that is the answer then.

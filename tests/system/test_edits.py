@@ -478,6 +478,49 @@ class EditsTest(EditsFixture):
                     contents.append(int(file.read()))
         self.assertEqual(sorted(contents), list(range(20)))
 
+    def test_requests_that_do_not_wait_for_each_other_are_of_the_items_that_they_name(self):
+        """A document is renamed, something moved to where it was, and the document deleted, trashed, renamed once more or tagged."""
+        rounds = 300
+        for turn in range(rounds):
+            self.make_file("Letters", f"a{turn}", contents=b"named %d" % turn)
+            # A folder: a file would be taken for the document's new version where it is deleted first.
+            self.make_file("Other", f"x{turn}", "inside", contents=b"bystander %d" % turn)
+        client = self.client()
+        letters = client.identifier(self.path("Letters"))
+        named, bystanders = client.named(letters), client.named(client.identifier(self.path("Other")))
+        last = [("deleteItem", {}), ("trashItem", {}), ("renameItem", {"name": None}), ("setTags", {"tags": ["named"]})]
+        requests = []
+        for turn in range(rounds):
+            document, bystander = named[f"a{turn}"]["identifier"], bystanders[f"x{turn}"]["identifier"]
+            method, params = last[turn % len(last)]
+            if "name" in params:
+                params = {"name": f"c{turn}"}
+            requests.append((client.send("renameItem", identifier=document, name=f"b{turn}"),
+                             client.send("reparentItem", identifier=bystander, parent=letters, name=f"a{turn}"),
+                             client.send(method, identifier=document, **params)))
+        for turn, (_, _, request) in enumerate(requests):
+            # It moves once while it is looked for: that is no reason not to find it.
+            self.assertIn("result", client.answer(request), turn)
+        client.finish()
+        found = {}
+        for path, _, files in os.walk(self.storage):
+            for name in files:
+                place = os.path.join(path, name)
+                with open(place, "rb") as file:
+                    found[file.read()] = place
+        for turn in range(rounds):
+            bystander = os.path.dirname(found[b"bystander %d" % turn])
+            self.assertNotIn("Trash", bystander)
+            self.assertIn(os.path.basename(bystander), (f"a{turn}", f"x{turn}"))
+            self.assertNotIn(TAGS, os.listxattr(bystander))
+            method, _ = last[turn % len(last)]
+            document = found.get(b"named %d" % turn)
+            self.assertEqual(document is None, method == "deleteItem", turn)
+            if method == "trashItem":
+                self.assertIn("Trash", document)
+            elif method == "setTags":
+                self.assertIn(TAGS, os.listxattr(document))
+
     def test_no_link_leads_an_edit_outside(self):
         victim = self.outside_file("victim/a", b"untouched")
         os.symlink(os.path.dirname(victim), self.path("way"))

@@ -18,6 +18,15 @@
 
 namespace cindral {
 
+/// Which object a status is of. Its number alone is given again to another object as soon as it is gone.
+struct ObjectIdentity {
+    std::uint64_t fileID = 0;
+    std::uint64_t device = 0;     ///< st_dev; valid until the next boot only
+    std::int64_t birthStamp = 0;  ///< 0 where the file system has none
+
+    friend bool operator==(const ObjectIdentity&, const ObjectIdentity&) = default;
+};
+
 /// What one statx says of an object. Never of what a link points to.
 struct FileStatus {
     std::uint64_t fileID = 0;
@@ -40,6 +49,7 @@ struct FileStatus {
     std::uint32_t deviceID() const;
     /// Birth time as one number, ns since 1970; 0 where the file system has none.
     std::int64_t birthStamp() const;
+    ObjectIdentity identity() const { return {fileID, device, birthStamp()}; }
 };
 
 /// One record of getdents64, as the kernel writes it. `name` ends with a NUL.

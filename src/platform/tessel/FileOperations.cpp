@@ -6,11 +6,13 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <utility>
 #include <vector>
 
 #include "platform/foundation/Log.h"
+#include "platform/foundation/Mutex.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/foundation/SerialQueue.h"
 #include "platform/foundation/Sys.h"
@@ -46,6 +48,8 @@ struct Folder {
 struct Place {
     Folder folder;
     std::string name;
+    /// The entry itself, without its contents: for as long as it is held, no other object is given its number.
+    UniqueFd handle;
     FileStatus status;  ///< of the entry itself
 
     std::string path() const { return folder.pathOf(name); }
@@ -69,24 +73,32 @@ KsError collision(const std::string& path) {
             {{"path", path}, {"collidingURL", KsURL::fileURL(path).absoluteString()}}};
 }
 
+/// For objects of which one is held open: numbers of others are compared with the time of birth (ObjectIdentity).
 bool isSameObject(const FileStatus& a, const FileStatus& b) {
     return a.fileID == b.fileID && a.device == b.device;
+}
+
+/// ESTALE when it is not the object that is meant.
+Result<void> checkIsMeant(const MeantFile& meant, const FileStatus& status) {
+    if (meant.object && *meant.object != status.identity()) return KsError::posix(ESTALE, meant.url.path());
+    return {};
 }
 
 NameKind nameKindOf(const KsURL& url) {
     return url.ts_isFolder() ? NameKind::folder : NameKind::document;
 }
 
-Result<Folder> openFolder(const KsURL& url) {
+Result<Folder> openFolder(const MeantFile& meant) {
     Folder folder;
-    folder.path = url.path();
+    folder.path = meant.url.path();
     folder.root = RootDirectories::shared().rootHolding(folder.path);
-    if (!folder.root || !url.isFileURL()) return refusal(folder.path);
+    if (!folder.root || !meant.url.isFileURL()) return refusal(folder.path);
     auto fd = RootDirectories::open(folder.path, O_PATH | O_DIRECTORY);
     if (!fd.ok()) return failure(fd.error(), folder.path);
     folder.fd = std::move(*fd);
     auto status = sys::statx(folder.fd.get(), "");
     if (!status.ok()) return failure(status.error(), folder.path);
+    TRY(checkIsMeant(meant, *status));
     folder.status = *status;
     return folder;
 }
@@ -108,15 +120,43 @@ bool isRootObject(const FileStatus& status) {
 }
 
 /// Where something is that is to be moved away, renamed or deleted.
-Result<Place> openPlace(const KsURL& url) {
+Result<Place> openPlace(const MeantFile& meant) {
+    const KsURL& url = meant.url;
     const std::optional<KsURL> parent = url.deletingLastPathComponent();
     if (!parent || isFixed(url)) return refusal(url.path());
-    Place place{TRY(openFolder(*parent)), std::string(url.lastPathComponent()), {}};
-    const Result<FileStatus> status = sys::statx(place.folder.fd.get(), place.name.c_str());
+    Place place{TRY(openFolder(*parent)), std::string(url.lastPathComponent()), {}, {}};
+    Result<UniqueFd> handle = sys::openat(place.folder.fd.get(), place.name.c_str(), O_PATH | O_NOFOLLOW);
+    if (!handle.ok()) return failure(handle.error(), url.path());
+    place.handle = *std::move(handle);
+    const Result<FileStatus> status = sys::statx(place.handle.get(), "");
     if (!status.ok()) return failure(status.error(), url.path());
+    TRY(checkIsMeant(meant, *status));
     place.status = *status;
     if (isRootObject(place.status)) return refusal(url.path());
     return place;
+}
+
+/// What takes something out of a folder holds off the process's others that would: nobody can put another object under
+/// its name without taking it away first.
+Mutex& departuresFrom(const Folder& folder) {
+    // A few for all folders: two that share one wait for each other, over a rename.
+    static std::array<Mutex, 64>& mutexes = *new std::array<Mutex, 64>;
+    return mutexes[folder.status.fileID % mutexes.size()];
+}
+
+/// ESTALE when the entry of the folder is not the object that is held.
+Result<void> checkIsHeld(int folder, const char* name, int handle) {
+    // Both as of now: layered file systems give an object that is changed another number, also through the handle.
+    if (isSameObject(TRY(sys::statx(folder, name)), TRY(sys::statx(handle, "")))) return {};
+    return KsError::posix(ESTALE);
+}
+
+/// Calls `take`, which takes the entry out of the folder, if it is the object that is held; ESTALE otherwise.
+template <typename Take>
+Result<void> takeOut(const Folder& folder, const std::string& name, const UniqueFd& handle, Take take) {
+    const MutexLock lock(departuresFrom(folder));
+    TRY(checkIsHeld(folder.fd.get(), name.c_str(), handle.get()));
+    return take();
 }
 
 /// Whether the folder is in the other or is it, going up from it.
@@ -164,12 +204,12 @@ Result<std::unique_ptr<StagingFolder>> stagingFor(const Folder& folder,
 /// Calls `move` for the staging folder; once more with one on the folder's own root where the first was on another
 /// mount. (Mounts of one device can't be told by its number.)
 template <typename Move>
-Result<void> withStagingFor(const Folder& folder, Move move) {
-    const auto staging = stagingFor(folder);
+Result<void> withStagingFor(const Folder& folder, StagingFolder::Contents contents, Move move) {
+    const auto staging = stagingFor(folder, contents);
     if (!staging.ok()) return staging.error();
     const Result<void> moved = move(**staging);
     if (moved.ok() || !moved.error().isPosix(EXDEV)) return moved;
-    return move(*TRY(StagingFolder::make(folder.root)));
+    return move(*TRY(StagingFolder::make(folder.root, contents)));
 }
 
 /// Gives what was built in the temporary folder its place.
@@ -243,7 +283,7 @@ Result<void> importFile(const Source& source, const Folder& folder, const std::s
 Result<void> importByStaging(const Source& source, const Folder& folder, const std::string& path,
                              TesselProgress& progress) {
     if (source.status.isDirectory() && TRY(isWithin(folder.fd.get(), source.status))) return KsError::posix(EINVAL);
-    return withStagingFor(folder, [&](StagingFolder& staging) -> Result<void> {
+    return withStagingFor(folder, StagingFolder::Contents::mayGo, [&](StagingFolder& staging) -> Result<void> {
         TRY(measureTree(source.folder.get(), source.name.c_str(), path, &staging.status(), progress));
         TreeCopy copy(progress, path, {.attributeLoss = AttributeLoss::isLogged, .excluded = &staging.status()});
         TRY(copy.copy(source.folder.get(), source.name.c_str(), staging.fd(), StagingFolder::kItemName));
@@ -269,18 +309,21 @@ void putBack(StagingFolder& staging, const Folder& folder, const std::string& na
         back = renameWithoutReplacing(staging.fd(), StagingFolder::kItemName, folder.fd.get(), other.c_str());
     }
     if (back.ok()) return;
-    staging.keep();
     logError("{} was left in {}; {}", folder.pathOf(name), staging.path(), back.error().description());
 }
 
-/// Takes an entry out of its folder, if it is the object that is meant.
-Result<void> takeAway(const Folder& folder, const std::string& name, const FileStatus& meant, StagingFolder& staging) {
-    TRY(sys::renameat2(folder.fd.get(), name.c_str(), staging.fd(), StagingFolder::kItemName, 0));
+/// Takes the entry out of its folder, if it is the object that is held. The staging folder is one whose contents are
+/// kept: what was taken may be something else, until that was looked at.
+Result<void> takeAway(const Folder& folder, const std::string& name, const UniqueFd& handle, StagingFolder& staging) {
+    TRY(takeOut(folder, name, handle, [&] {
+        return sys::renameat2(folder.fd.get(), name.c_str(), staging.fd(), StagingFolder::kItemName, 0);
+    }));
+    const Result<void> held = checkIsHeld(staging.fd(), StagingFolder::kItemName, handle.get());
+    if (held.ok()) return {};
+    // Another program has put something else there since it was looked at.
     const Result<FileStatus> taken = sys::statx(staging.fd(), StagingFolder::kItemName);
-    if (taken.ok() && isSameObject(*taken, meant)) return {};
-    // Something else has taken the name since it was looked at.
-    putBack(staging, folder, name, taken.ok() ? *taken : meant);
-    return taken.ok() ? KsError::posix(ESTALE) : taken.error();
+    putBack(staging, folder, name, taken.ok() ? *taken : FileStatus());
+    return held;
 }
 
 /// Takes the source of a finished copy away, unless it is not what was copied any more.
@@ -288,7 +331,7 @@ Result<void> removeCopied(const Place& place, const Folder& target, const std::s
     // Kept until it is certain that the copy is all there is: who writes to the source meanwhile writes to what was
     // copied before.
     const auto kept = TRY(stagingFor(place.folder, StagingFolder::Contents::areKept));
-    TRY(takeAway(place.folder, place.name, place.status, *kept));
+    TRY(takeAway(place.folder, place.name, place.handle, *kept));
     const Result<void> same = compareTrees(kept->fd(), StagingFolder::kItemName, target.fd.get(), name.c_str(),
                                            place.path(), Thoroughness::stamps, nullptr);
     if (!same.ok()) {
@@ -298,6 +341,13 @@ Result<void> removeCopied(const Place& place, const Folder& target, const std::s
     const Result<void> released = kept->letGo();
     if (!released.ok()) putBack(*kept, place.folder, place.name, place.status);
     return released;
+}
+
+/// Removes a copy that was put in place.
+Result<void> takeCopyAway(const Folder& folder, const std::string& name, const UniqueFd& copy) {
+    const auto kept = TRY(stagingFor(folder, StagingFolder::Contents::areKept));
+    TRY(takeAway(folder, name, copy, *kept));
+    return kept->letGo();
 }
 
 Result<void> moveToOtherDevice(const Place& place, const Folder& folder, const std::string& name,
@@ -313,40 +363,90 @@ Result<void> moveToOtherDevice(const Place& place, const Folder& folder, const s
     TRY(compareTrees(place.folder.fd.get(), place.name.c_str(), staging->fd(), StagingFolder::kItemName, path,
                      Thoroughness::contents, &progress));
     TRY(progress.check());
-    const FileStatus built = TRY(sys::statx(staging->fd(), StagingFolder::kItemName));
+    const UniqueFd built = TRY(sys::openat(staging->fd(), StagingFolder::kItemName, O_PATH | O_NOFOLLOW));
     TRY(putInPlace(staging->fd(), StagingFolder::kItemName, folder, name));
     const Result<void> removed = removeCopied(place, folder, name);
     if (removed.ok()) return {};
     // The source is where it was: the copy goes again.
-    const Result<void> undone = takeAway(folder, name, built, *staging);
+    const Result<void> undone = takeCopyAway(folder, name, built);
     if (!undone.ok()) logError("{} was left as a copy; {}", folder.pathOf(name), undone.error().description());
     return removed;
 }
 
 Result<void> moveOnce(const Place& place, const Folder& folder, const std::string& name, TesselProgress& progress) {
     const int from = place.folder.fd.get();
-    const Result<void> moved = isTemporary(place)
-                                   ? putInPlace(from, place.name.c_str(), folder, name)
-                                   : renameWithoutReplacing(from, place.name.c_str(), folder.fd.get(), name.c_str());
+    const Result<void> moved = takeOut(place.folder, place.name, place.handle, [&] {
+        return isTemporary(place) ? putInPlace(from, place.name.c_str(), folder, name)
+                                  : renameWithoutReplacing(from, place.name.c_str(), folder.fd.get(), name.c_str());
+    });
     if (moved.ok() || !moved.error().isPosix(EXDEV)) return moved;
     return moveToOtherDevice(place, folder, name, progress);
 }
 
 /// Takes the entry out of sight, and then removes it. Once it is out of sight, it is deleted.
 Result<void> removeByStaging(const Place& place, TesselProgress* progress) {
-    return withStagingFor(place.folder, [&](StagingFolder& staging) -> Result<void> {
-        TRY(takeAway(place.folder, place.name, place.status, staging));
+    return withStagingFor(place.folder, StagingFolder::Contents::areKept, [&](StagingFolder& staging) -> Result<void> {
+        TRY(takeAway(place.folder, place.name, place.handle, staging));
+        const Result<void> released = staging.letGo();
+        if (!released.ok()) {
+            putBack(staging, place.folder, place.name, place.status);
+            return released;
+        }
         const Result<void> removed = removeTree(staging.fd(), StagingFolder::kItemName, place.path(), progress);
         if (!removed.ok()) logError("can't remove all of {}; {}", place.path(), removed.error().description());
         return {};
     });
 }
 
+Result<void> unlink(const Place& place, int flags) {
+    return takeOut(place.folder, place.name, place.handle,
+                   [&] { return sys::unlinkat(place.folder.fd.get(), place.name.c_str(), flags); });
+}
+
+Result<void> removeFile(const Place& place, Certainty certainty, TesselProgress& progress) {
+    progress.setTotal(0, 1);
+    if (certainty == Certainty::isWanted && removeByStaging(place, nullptr).ok()) return {};
+    // Nothing has happened. A disk may be full, or the storage read-only, and its files can be deleted all the same.
+    return unlink(place, 0);
+}
+
+Result<void> removeFolder(const Place& place, TesselProgress& progress) {
+    TRY(progress.check());
+    // An empty folder goes at once, whatever its own mode; of any other, this tells first what the file system refuses.
+    const Result<void> removed = unlink(place, AT_REMOVEDIR);
+    const bool isFull = !removed.ok() && (removed.error().isPosix(ENOTEMPTY) || removed.error().isPosix(EEXIST));
+    if (!isFull) return removed;
+    TRY(checkTreeIsRemovable(place.folder.fd.get(), place.name.c_str(), place.path(), progress));
+    TRY(progress.check());
+    return removeByStaging(place, &progress);
+}
+
+/// Where something is that may get another name.
+Result<Place> openRenamed(const MeantFile& file, const std::optional<std::string>& newName) {
+    if (newName) TRY(ts_checkName(*newName));
+    return openPlace(file);
+}
+
+Result<KsURL> move(const Place& place, const Folder& target, const std::string& name, Bouncing bouncing,
+                   TesselProgress& progress) {
+    if (isSameObject(place.folder.status, target.status) && name == place.name) return KsURL::fileURL(place.path());
+    Result<void> moved = moveOnce(place, target, name, progress);
+    std::string given = name;
+    const NameKind kind =
+        bouncing == Bouncing::isAllowed ? nameKindOf(KsURL::fileURL(place.path())) : NameKind::document;
+    for (std::uint64_t number = 2; bouncing == Bouncing::isAllowed && !moved.ok() && moved.error().isPosix(EEXIST);
+         ++number) {
+        given = alternativeName(name, kind, number);
+        moved = moveOnce(place, target, given, progress);
+    }
+    return answer(moved, target, given, place.path());
+}
+
 }  // namespace
 
 namespace file_operations {
 
-Result<KsURL> importUnderFolder(const KsURL& source, const KsURL& folder, TesselProgress& progress) {
+Result<KsURL> importUnderFolder(const KsURL& source, const MeantFile& folder, TesselProgress& progress) {
     const Folder target = TRY(openFolder(folder));
     const Source opened = TRY(openSource(source));
     const std::string& path = source.path();
@@ -357,67 +457,40 @@ Result<KsURL> importUnderFolder(const KsURL& source, const KsURL& folder, Tessel
     return answer(importByStaging(opened, target, path, progress), target, opened.name, path);
 }
 
-Result<KsURL> createSubFolder(const KsURL& folder, const std::string& name) {
+Result<KsURL> createSubFolder(const MeantFile& folder, const std::string& name) {
     TRY(ts_checkName(name));
     const Folder target = TRY(openFolder(folder));
     return answer(sys::mkdirat(target.fd.get(), name.c_str(), kAsTheUmaskSays), target, name, target.pathOf(name));
 }
 
-Result<KsURL> rename(const KsURL& url, const std::string& newName) {
-    const std::optional<KsURL> parent = url.deletingLastPathComponent();
-    if (!parent) return refusal(url.path());
+Result<KsURL> rename(const MeantFile& file, const std::string& newName) {
+    const Place place = TRY(openRenamed(file, newName));
     TesselProgress progress;
-    return reparent(url, *parent, newName, Bouncing::isRefused, progress);
+    return move(place, place.folder, newName, Bouncing::isRefused, progress);
 }
 
-Result<KsURL> reparent(const KsURL& url, const KsURL& folder, const std::optional<std::string>& newName,
+Result<KsURL> reparent(const MeantFile& file, const MeantFile& folder, const std::optional<std::string>& newName,
                        Bouncing bouncing, TesselProgress& progress) {
-    if (newName) TRY(ts_checkName(*newName));
-    const Place place = TRY(openPlace(url));
+    const Place place = TRY(openRenamed(file, newName));
     const Folder target = TRY(openFolder(folder));
-    const std::string name = newName.value_or(place.name);
-    if (isSameObject(place.folder.status, target.status) && name == place.name) return KsURL::fileURL(place.path());
-    Result<void> moved = moveOnce(place, target, name, progress);
-    std::string given = name;
-    const NameKind kind = bouncing == Bouncing::isAllowed ? nameKindOf(url) : NameKind::document;
-    for (std::uint64_t number = 2; bouncing == Bouncing::isAllowed && !moved.ok() && moved.error().isPosix(EEXIST);
-         ++number) {
-        given = alternativeName(name, kind, number);
-        moved = moveOnce(place, target, given, progress);
-    }
-    return answer(moved, target, given, url.path());
+    return move(place, target, newName.value_or(place.name), bouncing, progress);
 }
 
-Result<KsURL> trash(const KsURL& url, const KsURL& trashFolder) {
-    const Place place = TRY(openPlace(url));
+Result<KsURL> trash(const MeantFile& file, const KsURL& trashFolder) {
+    const Place place = TRY(openPlace(file));
     const Folder target = TRY(openFolder(trashFolder));
-    const Result<void> moved =
-        renameWithoutReplacing(place.folder.fd.get(), place.name.c_str(), target.fd.get(), place.name.c_str());
-    return answer(moved, target, place.name, url.path());
+    const char* name = place.name.c_str();
+    const Result<void> moved = takeOut(place.folder, place.name, place.handle, [&] {
+        return renameWithoutReplacing(place.folder.fd.get(), name, target.fd.get(), name);
+    });
+    return answer(moved, target, place.name, place.path());
 }
 
-Result<void> remove(const KsURL& url, TesselProgress& progress, std::optional<std::uint64_t> fileID) {
-    const Place place = TRY(openPlace(url));
-    const int folder = place.folder.fd.get();
-    const char* name = place.name.c_str();
-    if (fileID && *fileID != place.status.fileID) return failure(KsError::posix(ESTALE), url.path());
-    Result<void> removed;
-    if (!place.status.isDirectory() && !fileID) {
-        progress.setTotal(0, 1);
-        removed = sys::unlinkat(folder, name);
-    } else if (!place.status.isDirectory()) {
-        removed = removeByStaging(place, nullptr);
-    } else {
-        removed = progress.check();
-        // An empty folder goes at once, whatever its own mode; of any other, this tells first what the file system refuses.
-        if (removed.ok()) removed = sys::unlinkat(folder, name, AT_REMOVEDIR);
-        if (!removed.ok() && (removed.error().isPosix(ENOTEMPTY) || removed.error().isPosix(EEXIST))) {
-            removed = checkTreeIsRemovable(folder, name, url.path(), progress);
-            if (removed.ok()) removed = progress.check();
-            if (removed.ok()) removed = removeByStaging(place, &progress);
-        }
-    }
-    if (!removed.ok()) return failure(removed.error(), url.path());
+Result<void> remove(const MeantFile& file, TesselProgress& progress, Certainty certainty) {
+    const Place place = TRY(openPlace(file));
+    const Result<void> removed =
+        place.status.isDirectory() ? removeFolder(place, progress) : removeFile(place, certainty, progress);
+    if (!removed.ok()) return failure(removed.error(), place.path());
     return {};
 }
 
@@ -449,9 +522,10 @@ std::optional<KsURL> ts_collidingURL(const KsError& error) {
     return url != error.userInfo().end() ? KsURL::parse(url->second) : std::nullopt;
 }
 
-Result<void> ts_withReadWriteAccess(const KsURL& url, const std::function<Result<void>(int fd)>& body) {
-    const Result<UniqueFd> fd = url.open(O_PATH | O_NOFOLLOW);
-    if (!fd.ok()) return failure(fd.error(), url.path());
+Result<void> ts_withReadWriteAccess(const MeantFile& file, const std::function<Result<void>(int fd)>& body) {
+    const Result<UniqueFd> fd = file.url.open(O_PATH | O_NOFOLLOW);
+    if (!fd.ok()) return failure(fd.error(), file.url.path());
+    if (file.object) TRY(checkIsMeant(file, TRY(sys::statx(fd->get(), ""))));
     return body(fd->get());
 }
 
@@ -471,63 +545,66 @@ auto blocking(Work work) {
 
 }  // namespace
 
-std::shared_ptr<TesselProgress> ts_importUnderFolder(const KsURL& source, const KsURL& folder,
-                                                     FileOperationCompletion completion) {
-    auto progress = std::make_shared<TesselProgress>();
+std::shared_ptr<TesselProgress> ts_importUnderFolder(const KsURL& source, const MeantFile& folder,
+                                                     FileOperationCompletion completion,
+                                                     std::shared_ptr<TesselProgress> progress) {
     inBackground([source, folder, progress, completion = std::move(completion)] {
         completion(blocking([&] { return file_operations::importUnderFolder(source, folder, *progress); }));
     });
     return progress;
 }
 
-void ts_createSubFolder(const KsURL& folder, std::string name, FileOperationCompletion completion) {
+void ts_createSubFolder(const MeantFile& folder, std::string name, FileOperationCompletion completion) {
     inBackground([folder, name = std::move(name), completion = std::move(completion)] {
         completion(blocking([&] { return file_operations::createSubFolder(folder, name); }));
     });
 }
 
-void ts_renameWithNewName(const KsURL& url, std::string newName, FileOperationCompletion completion) {
-    inBackground([url, newName = std::move(newName), completion = std::move(completion)] {
-        completion(blocking([&] { return file_operations::rename(url, newName); }));
+void ts_renameWithNewName(const MeantFile& file, std::string newName, FileOperationCompletion completion) {
+    inBackground([file, newName = std::move(newName), completion = std::move(completion)] {
+        completion(blocking([&] { return file_operations::rename(file, newName); }));
     });
 }
 
 namespace {
 
-std::shared_ptr<TesselProgress> reparentInBackground(const KsURL& url, const KsURL& folder,
-                                                     std::optional<std::string> newName, Bouncing bouncing,
-                                                     FileOperationCompletion completion) {
-    auto progress = std::make_shared<TesselProgress>();
-    inBackground([url, folder, newName = std::move(newName), bouncing, progress, completion = std::move(completion)] {
-        completion(blocking([&] { return file_operations::reparent(url, folder, newName, bouncing, *progress); }));
+void reparentInBackground(const MeantFile& file, const MeantFile& folder, std::optional<std::string> newName,
+                          Bouncing bouncing, FileOperationCompletion completion,
+                          std::shared_ptr<TesselProgress> progress) {
+    inBackground([file, folder, newName = std::move(newName), bouncing, progress = std::move(progress),
+                  completion = std::move(completion)] {
+        completion(blocking([&] { return file_operations::reparent(file, folder, newName, bouncing, *progress); }));
     });
-    return progress;
 }
 
 }  // namespace
 
-std::shared_ptr<TesselProgress> ts_reparentUnderFolder(const KsURL& url, const KsURL& folder,
+std::shared_ptr<TesselProgress> ts_reparentUnderFolder(const MeantFile& file, const MeantFile& folder,
                                                        std::optional<std::string> newName,
-                                                       FileOperationCompletion completion) {
-    return reparentInBackground(url, folder, std::move(newName), Bouncing::isRefused, std::move(completion));
+                                                       FileOperationCompletion completion,
+                                                       std::shared_ptr<TesselProgress> progress) {
+    reparentInBackground(file, folder, std::move(newName), Bouncing::isRefused, std::move(completion), progress);
+    return progress;
 }
 
-std::shared_ptr<TesselProgress> ts_reparentUnderFolder(const KsURL& url, const KsURL& folder, Bouncing bouncing,
-                                                       FileOperationCompletion completion) {
-    return reparentInBackground(url, folder, std::nullopt, bouncing, std::move(completion));
+std::shared_ptr<TesselProgress> ts_reparentUnderFolder(const MeantFile& file, const MeantFile& folder,
+                                                       Bouncing bouncing, FileOperationCompletion completion,
+                                                       std::shared_ptr<TesselProgress> progress) {
+    reparentInBackground(file, folder, std::nullopt, bouncing, std::move(completion), progress);
+    return progress;
 }
 
-void ts_trashUnderFolder(const KsURL& url, const KsURL& trashFolder, FileOperationCompletion completion) {
-    inBackground([url, trashFolder, completion = std::move(completion)] {
-        completion(blocking([&] { return file_operations::trash(url, trashFolder); }));
+void ts_trashUnderFolder(const MeantFile& file, const KsURL& trashFolder, FileOperationCompletion completion) {
+    inBackground([file, trashFolder, completion = std::move(completion)] {
+        completion(blocking([&] { return file_operations::trash(file, trashFolder); }));
     });
 }
 
-std::shared_ptr<TesselProgress> ts_deleteWithCompletionHandler(const KsURL& url, FileDeletionCompletion completion,
-                                                               std::optional<std::uint64_t> fileID) {
-    auto progress = std::make_shared<TesselProgress>();
-    inBackground([url, fileID, progress, completion = std::move(completion)] {
-        const Result<void> removed = blocking([&] { return file_operations::remove(url, *progress, fileID); });
+std::shared_ptr<TesselProgress> ts_deleteWithCompletionHandler(const MeantFile& file, FileDeletionCompletion completion,
+                                                               std::shared_ptr<TesselProgress> progress,
+                                                               Certainty certainty) {
+    inBackground([file, progress, certainty, completion = std::move(completion)] {
+        const Result<void> removed = blocking([&] { return file_operations::remove(file, *progress, certainty); });
         completion(removed.ok() ? std::nullopt : std::optional(removed.error()));
     });
     return progress;

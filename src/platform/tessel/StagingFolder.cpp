@@ -125,13 +125,6 @@ Result<void> StagingFolder::letGo() {
     return {};
 }
 
-void StagingFolder::keep() {
-    if (contents_ == Contents::areKept) return;
-    contents_ = Contents::areKept;
-    const Result<void> renamed = rename(kKeptPrefix);
-    if (!renamed.ok()) logError("can't rename temporary directory {}; {}", path(), renamed.error().description());
-}
-
 void StagingFolder::removeAbandoned(const RootDirectory& root) {
     const std::string folder(kTemporaryLocalFolderName);
     const Result<UniqueFd> temporary = sys::openDirectoryForReading(root.fd.get(), folder.c_str(), O_NOFOLLOW);

@@ -17,7 +17,8 @@ inline constexpr std::string_view kTemporaryLocalFolderName = ".TemporaryLocalFo
 ///
 /// Named ".staging-", the process and a number, and locked (flock) for as long as it lives: a folder of that name
 /// without a lock was left behind by a process that ended, and is nobody's any more. One that is kept is named
-/// "kept-…" instead: what was moved there is not yet known to be somewhere else.
+/// "kept-…" instead: what was moved there is not yet known to be somewhere else, or to be what was to be removed. It
+/// outlasts its process when there is something in it, for people to look after.
 ///
 /// Thread safety: for one thread at a time.
 class StagingFolder {
@@ -42,8 +43,6 @@ public:
 
     /// What is in it is no longer kept.
     Result<void> letGo();
-    /// What is in it is kept from now on, for people to look after: putting it back has failed.
-    void keep();
 
     /// Removes the folders that processes left behind which ended in the middle of their work.
     static void removeAbandoned(const RootDirectory& root);

@@ -11,6 +11,7 @@
 #include <iterator>
 
 #include "platform/foundation/RootDirectories.h"
+#include "platform/foundation/SysFaults.h"
 #include "platform/tessel/StagingFolder.h"
 #include "platform/tessel/TesselManager.h"
 
@@ -60,6 +61,14 @@ std::vector<std::string> FileOperationsTest::leftovers() const {
     for (const auto& entry : std::filesystem::directory_iterator(path(kTemporaryLocalFolderName), missing))
         names.push_back(entry.path().filename());
     return names;
+}
+
+ObjectIdentity FileOperationsTest::identityOf(std::string_view name) const {
+    // No fault of a test's is in the way of looking.
+    const sys::FaultInjection none([](const char* /*call*/) { return 0; });
+    Result<FileStatus> status = sys::statx(AT_FDCWD, path(name).c_str());
+    EXPECT_TRUE(status.ok()) << name;
+    return std::move(status).valueOr(FileStatus()).identity();
 }
 
 std::string FileOperationsTest::contentsOf(const std::string& path) {

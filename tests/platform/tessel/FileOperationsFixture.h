@@ -37,6 +37,9 @@ protected:
     /// Entries of the storage's temporary folder.
     std::vector<std::string> leftovers() const;
 
+    /// Of what is at the name now.
+    ObjectIdentity identityOf(std::string_view name) const;
+
     static std::string contentsOf(const std::string& path);
     static void setAttribute(const std::string& path, const char* name, std::string_view value);
     static std::optional<std::string> attribute(const std::string& path, const char* name);

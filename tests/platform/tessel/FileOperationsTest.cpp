@@ -14,6 +14,7 @@
 #include <cerrno>
 #include <filesystem>
 #include <fstream>
+#include <optional>
 #include <thread>
 
 #include "platform/foundation/Dispatch.h"
@@ -61,6 +62,7 @@ struct Scenario {
     const char* name;
     std::function<Result<void>()> run;
     bool isOnAnotherDevice = false;
+    bool keeps = isOnAnotherDevice;  ///< a kill may leave what was taken away to where it is kept
 };
 
 class FaultTest : public FileOperationsTest {
@@ -89,11 +91,9 @@ protected:
             TesselProgress progress;
             return done(importUnderFolder(urlOf(outside(from)), url("target"), progress));
         };
-        const auto deletion = [this](const std::string& name, bool meant) {
+        const auto deletion = [this](const std::string& name, Certainty certainty) {
             TesselProgress progress;
-            struct stat status {};
-            ::lstat(path(name).c_str(), &status);
-            return remove(url(name), progress, meant ? std::optional<std::uint64_t>(status.st_ino) : std::nullopt);
+            return remove({url(name), identityOf(name)}, progress, certainty);
         };
         return {
             {"createSubFolder", [=, this] { return done(createSubFolder(url("target"), "new")); }},
@@ -101,9 +101,9 @@ protected:
             {"move", [=] { return move("tree", std::nullopt, Bouncing::isRefused); }},
             {"bounce", [=] { return move("a.txt", "taken", Bouncing::isRefused); }},
             {"trash", [=, this] { return done(trash(url("a.txt"), url("target"))); }},
-            {"deleteFile", [=] { return deletion("a.txt", false); }},
-            {"deleteMeant", [=] { return deletion("a.txt", true); }},
-            {"deleteFolder", [=] { return deletion("tree", false); }},
+            {"deleteFile", [=] { return deletion("a.txt", Certainty::isNotWanted); }},
+            {"deleteWithCertainty", [=] { return deletion("a.txt", Certainty::isWanted); }, false, true},
+            {"deleteFolder", [=] { return deletion("tree", Certainty::isNotWanted); }, false, true},
             {"importFile", [=] { return import("source/file"); }},
             {"importFolder", [=] { return import("source"); }},
             {"importLink", [=] { return import("source/link"); }},
@@ -617,30 +617,106 @@ TEST_F(FileOperationsTest, aDeletionIsCancelledWhollyOrNotAtAll) {
 
 TEST_F(FileOperationsTest, onlyTheObjectThatIsMeantIsDeleted) {
     file("a", "old");
-    struct stat status {};
-    ASSERT_EQ(::stat(path("a").c_str(), &status), 0);
-    const std::uint64_t old = status.st_ino;
+    const ObjectIdentity old = identityOf("a");
     file("b", "new");
     fs::rename(path("b"), path("a"));
-    EXPECT_EQ(errorOf(remove(url("a"), progress_, old)), posix(ESTALE));
+    EXPECT_EQ(errorOf(remove({url("a"), old}, progress_)), posix(ESTALE));
     // Swapped between the look and the deed.
-    ASSERT_EQ(::stat(path("a").c_str(), &status), 0);
+    const ObjectIdentity meant = identityOf("a");
     const sys::FaultInjection faults([&](const char* call) {
         if (std::string_view(call) != "renameat2" || contentsOf(path("a")) != "new") return 0;
         file("c", "newer");
         fs::rename(path("c"), path("a"));
         return 0;
     });
-    EXPECT_EQ(errorOf(remove(url("a"), progress_, status.st_ino)), posix(ESTALE));
+    EXPECT_EQ(errorOf(remove({url("a"), meant}, progress_, Certainty::isWanted)), posix(ESTALE));
     EXPECT_EQ(contentsOf(path("a")), "newer");
     EXPECT_THAT(leftovers(), IsEmpty());
+}
+
+// The place was looked up, and whoever was there has left it to another since.
+TEST_F(FileOperationsTest, whoHasTakenThePlaceOfWhatIsMeantIsLeftAlone) {
+    file("a", "new");
+    folder("Letters");
+    file("b", "B");
+    // Another number, or the same one, given again to an object that was born later.
+    ObjectIdentity gone = identityOf("b");
+    for (int born = 0; born < 2; ++born) {
+        const MeantFile file(url("a"), gone);
+        const MeantFile parent(url("Letters"), gone);
+        const TreeSnapshot before = snapshot();
+        EXPECT_EQ(errorOf(rename(file, "c")), posix(ESTALE));
+        EXPECT_EQ(errorOf(reparent(file, url("target"), std::nullopt, Bouncing::isAllowed, progress_)), posix(ESTALE));
+        EXPECT_EQ(errorOf(reparent(url("a"), parent, std::nullopt, Bouncing::isRefused, progress_)), posix(ESTALE));
+        EXPECT_EQ(errorOf(trash(file, url("target"))), posix(ESTALE));
+        EXPECT_EQ(errorOf(remove(file, progress_)), posix(ESTALE));
+        EXPECT_EQ(errorOf(remove(parent, progress_)), posix(ESTALE));
+        EXPECT_EQ(errorOf(importUnderFolder(url("b"), parent, progress_)), posix(ESTALE));
+        EXPECT_EQ(errorOf(createSubFolder(parent, "new")), posix(ESTALE));
+        EXPECT_EQ(errorOf(ts_withReadWriteAccess(file, [](int /*fd*/) { return Result<void>(); })), posix(ESTALE));
+        EXPECT_EQ(snapshot(), before);
+        gone = identityOf("a");
+        gone.birthStamp -= 1;
+        if (born == 0) continue;
+        EXPECT_EQ(rename(file, "c").error().userInfo().at("path"), path("a"));
+    }
+}
+
+TEST_F(FileOperationsTest, whatIsMeantIsFoundByItsIdentity) {
+    file("a", "A");
+    folder("Letters");
+    const ObjectIdentity meant = identityOf("a");
+    const MeantFile letters(url("Letters"), identityOf("Letters"));
+    EXPECT_EQ(errorOf(reparent({url("a"), meant}, letters, std::nullopt, Bouncing::isRefused, progress_)), "");
+    EXPECT_EQ(errorOf(rename({url("Letters/a"), meant}, "b")), "");
+    EXPECT_EQ(errorOf(trash({url("Letters/b"), meant}, url("target"))), "");
+    EXPECT_EQ(errorOf(remove({url("target/b"), meant}, progress_)), "");
+    EXPECT_EQ(errorOf(createSubFolder(letters, "new")), "");
+    EXPECT_EQ(errorOf(remove(letters, progress_)), "");
+    EXPECT_THAT(leftovers(), IsEmpty());
+}
+
+// Another program puts its file in the place of what is deleted, before any of the system calls that takes.
+TEST_F(FileOperationsTest, whatIsSwappedInIsNeverDeleted) {
+    bool isReached = true;
+    for (int n = 1; isReached; ++n) {
+        for (const auto& entry : fs::directory_iterator(storage_)) fs::remove_all(entry.path());
+        file("a", "meant");
+        file("b", "not meant");
+        const ObjectIdentity meant = identityOf("a");
+        int calls = 0;
+        Result<void> removed;
+        {
+            const sys::FaultInjection faults([&](const char* /*call*/) {
+                if (++calls == n) fs::rename(path("b"), path("a"));
+                return 0;
+            });
+            removed = remove({url("a"), meant}, progress_, Certainty::isWanted);
+        }
+        isReached = calls >= n;
+        ASSERT_TRUE(fs::exists(path(isReached ? "a" : "b"))) << n;
+        ASSERT_EQ(contentsOf(path(isReached ? "a" : "b")), "not meant") << n;
+        ASSERT_THAT(leftovers(), IsEmpty()) << n;
+    }
+}
+
+TEST_F(FileOperationsTest, aFileIsDeletedAlsoWhereNothingCanBeTakenOutOfSight) {
+    for (const int reason : {ENOSPC, EDQUOT, EROFS, EACCES, EXDEV}) {
+        file("a");
+        const MeantFile meant(url("a"), identityOf("a"));
+        const sys::FaultInjection faults([&](const char* call) {
+            const std::string_view made(call);
+            return made == "mkdirat" || made == "renameat2" ? reason : 0;
+        });
+        EXPECT_EQ(errorOf(remove(meant, progress_, Certainty::isWanted)), "") << reason;
+        EXPECT_FALSE(fs::exists(path("a"))) << reason;
+    }
 }
 
 // Somebody takes the name while another's file is on its way back to it.
 TEST_F(FileOperationsTest, whatCannotGoBackToItsNameGoesBesideIt) {
     file("a.txt", "meant");
-    struct stat status {};
-    ASSERT_EQ(::stat(path("a.txt").c_str(), &status), 0);
+    const ObjectIdentity meant = identityOf("a.txt");
     int renames = 0;
     const sys::FaultInjection faults([&](const char* call) {
         if (std::string_view(call) != "renameat2") return 0;
@@ -652,7 +728,7 @@ TEST_F(FileOperationsTest, whatCannotGoBackToItsNameGoesBesideIt) {
         }
         return 0;
     });
-    EXPECT_EQ(errorOf(remove(url("a.txt"), progress_, status.st_ino)), posix(ESTALE));
+    EXPECT_EQ(errorOf(remove({url("a.txt"), meant}, progress_, Certainty::isWanted)), posix(ESTALE));
     EXPECT_EQ(contentsOf(path("a.txt")), "newest");
     EXPECT_EQ(contentsOf(path("a 2.txt")), "not meant");
 }
@@ -874,8 +950,8 @@ TEST_F(FaultTest, everyKillLeavesAllOrNothing) {
             const bool isAllowed = found == before || found == after || (scenario.isOnAnotherDevice && found == both);
             ASSERT_TRUE(isAllowed) << scenario.name << " killed at " << n << ": " << ::testing::PrintToString(found);
             std::vector<std::string> left = leftovers();
-            // What was taken away to be compared once more is kept for people.
-            if (scenario.isOnAnotherDevice) std::erase_if(left, [](auto& name) { return name.starts_with("kept-"); });
+            // What was taken away to be looked at once more is kept for people.
+            std::erase_if(left, [&](auto& name) { return scenario.keeps && name.starts_with("kept-"); });
             ASSERT_THAT(left, IsEmpty()) << scenario.name << " killed at " << n;
         }
     }
@@ -1018,6 +1094,35 @@ TEST_F(FileOperationsTest, twoThatWantTheSameNamesOverwriteNothing) {
     }
     EXPECT_EQ(found, made[0] + made[1]);
     EXPECT_GT(found, 0);
+}
+
+// At the very call that deletes a file, another edit is asked to move it away and to put something else in its place.
+TEST_F(FaultTest, editsOfOneProcessKeepOutOfEachOthersWay) {
+    for (int round = 0; round < 20; ++round) {
+        for (const auto& entry : fs::directory_iterator(storage_)) fs::remove_all(entry.path());
+        file("a", "meant");
+        file("x", "not meant");
+        const MeantFile meant(url("a"), identityOf("a"));
+        std::optional<std::thread> other;
+        std::atomic<bool> isOver = false;
+        const sys::FaultInjection faults([&](const char* call) {
+            if (std::string_view(call) != "unlinkat" || other) return 0;
+            other.emplace([&] {
+                (void)rename(url("a"), "b");
+                (void)rename(url("x"), "a");
+                isOver = true;
+            });
+            // As long as the other would need, had it not to wait.
+            for (int i = 0; i < 20'000 && !isOver; ++i) std::this_thread::yield();
+            return 0;
+        });
+        TesselProgress progress;
+        EXPECT_EQ(errorOf(remove(meant, progress)), "");
+        ASSERT_TRUE(other.has_value());
+        other->join();
+        ASSERT_EQ(contentsOf(path("a")), "not meant");
+        ASSERT_FALSE(fs::exists(path("b")));
+    }
 }
 
 // Somebody swaps a folder for a link to elsewhere, and back, all the time.
