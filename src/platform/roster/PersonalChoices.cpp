@@ -11,7 +11,7 @@
 
 #include "platform/foundation/Files.h"
 #include "platform/foundation/Sys.h"
-#include "platform/roster/RosterFiles.h"
+#include "platform/roster/KeyFile.h"
 
 namespace cindral {
 namespace {
@@ -20,6 +20,9 @@ namespace {
 constexpr std::string_view kGroup = "Applications";
 constexpr std::string_view kEnabled = "enabled";
 constexpr std::string_view kDisabled = "disabled";
+
+constexpr std::string_view kRosterErrorDomain = "CindralRosterErrorDomain";
+constexpr std::int64_t kNoKeyFile = 1;
 
 bool isPlain(char byte) {
     return (byte >= 'a' && byte <= 'z') || (byte >= 'A' && byte <= 'Z') || (byte >= '0' && byte <= '9') ||
@@ -75,18 +78,28 @@ std::string_view choiceName(PersonalChoices::Choice choice) {
     return choice == PersonalChoices::Choice::enabled ? kEnabled : kDisabled;
 }
 
-PersonalChoices PersonalChoices::read(const std::string& path) {
-    PersonalChoices choices;
-    const auto file = roster_files::readKeyFile(AT_FDCWD, path, roster_files::Links::anywhere);
-    if (!file) return choices;
-    for (const std::string& key : file->keys(kGroup)) {
+PersonalChoices::PersonalChoices(const KeyFile& file) {
+    for (const std::string& key : file.keys(kGroup)) {
         const auto identifier = identifierOf(key);
-        const std::string& value = *file->value(kGroup, key);
+        const std::string& value = *file.value(kGroup, key);
         if (!identifier) continue;
-        if (value == kEnabled) choices.choices_[*identifier] = Choice::enabled;
-        if (value == kDisabled) choices.choices_[*identifier] = Choice::disabled;
+        if (value == kEnabled) choices_[*identifier] = Choice::enabled;
+        if (value == kDisabled) choices_[*identifier] = Choice::disabled;
     }
-    return choices;
+}
+
+Result<PersonalChoices> PersonalChoices::load(const std::string& path) {
+    const Result<Bytes> bytes = files::readAll(path, KeyFile::kBytesMax);
+    if (!bytes.ok() && bytes.error().isPosix(ENOENT)) return PersonalChoices();
+    if (!bytes.ok()) return bytes.error().with("path", path);
+    const std::optional<KeyFile> file = KeyFile::parse(textOf(*bytes));
+    if (file) return PersonalChoices(*file);
+    return KsError(kRosterErrorDomain, kNoKeyFile,
+                   {{"message", "It holds lines that can't be read; mend it or take it away"}, {"path", path}});
+}
+
+PersonalChoices PersonalChoices::read(const std::string& path) {
+    return load(path).valueOr(PersonalChoices());
 }
 
 std::optional<PersonalChoices::Choice> PersonalChoices::of(const std::string& identifier) const {
@@ -106,7 +119,7 @@ Result<void> PersonalChoices::write(const std::string& path, const std::string& 
     const std::string folder = path.substr(0, path.rfind('/'));
     TRY(files::makeFolders(folder));
     const UniqueFd lock = TRY(lockFolder(folder));
-    PersonalChoices choices = read(path);
+    PersonalChoices choices = TRY(load(path));
     choices.choices_[identifier] = choice;
     return files::replace(path, bytesOf(choices.text()));
 }

@@ -8,6 +8,8 @@
 
 namespace cindral {
 
+class KeyFile;
+
 /// Whether a person lets an application's documents be published, where they said so. Counts like the application's own
 /// keys, and before them.
 ///
@@ -19,15 +21,22 @@ class PersonalChoices {
 public:
     enum class Choice { enabled, disabled };
 
+    PersonalChoices() = default;
+
     /// What the file says. A missing file says nothing, and neither does one that is no key file.
     static PersonalChoices read(const std::string& path);
     /// Writes one choice into the file, for its owner alone, keeping the others; the folders that lead to it are made.
     /// Two writers wait for each other, and a reader sees the file before or after, never between.
+    ///
+    /// A file that can't be read, or is no key file, is left as it is: the choices in it would be lost. The error has
+    /// its "path".
     static Result<void> write(const std::string& path, const std::string& identifier, Choice choice);
 
     std::optional<Choice> of(const std::string& identifier) const;
 
 private:
+    explicit PersonalChoices(const KeyFile& file);
+    static Result<PersonalChoices> load(const std::string& path);
     std::string text() const;
 
     std::map<std::string, Choice> choices_;

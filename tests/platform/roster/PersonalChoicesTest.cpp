@@ -3,11 +3,13 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <cerrno>
 #include <fstream>
 #include <iterator>
 #include <thread>
 #include <vector>
 
+#include "platform/foundation/SysFaults.h"
 #include "support/TemporaryFolder.h"
 
 namespace cindral::test {
@@ -82,6 +84,41 @@ TEST_F(PersonalChoicesTest, writersDoNotLoseEachOthersChoices) {
     for (auto& writer : writers) writer.join();
     for (int i = 0; i < 8; ++i)
         EXPECT_EQ(choice("app" + std::to_string(i)), i % 2 == 0 ? Choice::enabled : Choice::disabled);
+}
+
+// What can't be read may hold choices, which a new file would not have.
+TEST_F(PersonalChoicesTest, whatCannotBeReadIsNotReplaced) {
+    const auto refused = [this] {
+        const auto written = PersonalChoices::write(path_, "b", Choice::enabled);
+        EXPECT_FALSE(written.ok());
+        if (written.ok()) return std::string();
+        EXPECT_EQ(written.error().userInfo().at("path"), path_);
+        return written.error().reason();
+    };
+    const std::string partly = "[Applications]\na=enabled\nhalf a li";
+    folder_.file("config/cindral/applications.conf", partly);
+    EXPECT_EQ(refused(), "It holds lines that can't be read; mend it or take it away");
+    EXPECT_EQ(contents(), partly);
+
+    const std::string large = "[Applications]\na=enabled\n#" + std::string(1 << 20, '.');
+    folder_.file("config/cindral/applications.conf", large);
+    EXPECT_EQ(refused(), "File too large");
+    EXPECT_EQ(contents(), large);
+
+    const std::string whole = "[Applications]\na=enabled\n";
+    folder_.file("config/cindral/applications.conf", whole);
+    for (const int reason : {EIO, EACCES, EMFILE}) {
+        {
+            const sys::FaultInjection faults([&, opens = 0](const char* call) mutable {
+                // The folder's lock comes first.
+                return std::string_view(call) == "openat" && ++opens == 2 ? reason : 0;
+            });
+            EXPECT_EQ(refused(), KsError::posix(reason).reason());
+        }
+        EXPECT_EQ(contents(), whole);
+    }
+    choose("b", Choice::enabled);
+    EXPECT_EQ(choice("a"), Choice::enabled);
 }
 
 TEST_F(PersonalChoicesTest, aFolderInTheWayIsAnError) {
