@@ -365,7 +365,10 @@ Result<void> moveToOtherDevice(const Place& place, const Folder& folder, const s
     TRY(progress.check());
     const UniqueFd built = TRY(sys::openat(staging->fd(), StagingFolder::kItemName, O_PATH | O_NOFOLLOW));
     TRY(putInPlace(staging->fd(), StagingFolder::kItemName, folder, name));
-    const Result<void> removed = removeCopied(place, folder, name);
+    // Also that it is there is to last, before the source goes. (By way of the staging folder, which lies on the same
+    // file system: a handle alone can't be asked for that.)
+    const Result<void> lasts = sys::syncfs(staging->fd());
+    const Result<void> removed = lasts.ok() ? removeCopied(place, folder, name) : lasts;
     if (removed.ok()) return {};
     // The source is where it was: the copy goes again.
     const Result<void> undone = takeCopyAway(folder, name, built);

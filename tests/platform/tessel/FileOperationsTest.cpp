@@ -16,6 +16,7 @@
 #include <fstream>
 #include <optional>
 #include <thread>
+#include <vector>
 
 #include "platform/foundation/Dispatch.h"
 #include "platform/foundation/RootDirectories.h"
@@ -813,6 +814,34 @@ TEST_F(FileOperationsTest, aMoveToAnotherDeviceThatClashesLeavesTheSource) {
     const TreeSnapshot before = snapshot();
     const sys::FaultInjection faults(onAnotherDevice());
     EXPECT_EQ(errorOf(reparent(url("tree"), url("target"), std::nullopt, Bouncing::isRefused, progress_)), kFileExists);
+    EXPECT_EQ(snapshot(), before);
+    EXPECT_THAT(leftovers(), IsEmpty());
+}
+
+// When the power fails, the copy is where it belongs before the source is gone.
+TEST_F(FileOperationsTest, aMoveToAnotherDeviceLastsBeforeTheSourceGoes) {
+    makeTree(path("tree"));
+    const TreeSnapshot before = snapshot();
+    auto other = onAnotherDevice();
+    std::vector<std::string> calls;
+    {
+        const sys::FaultInjection faults([&](const char* call) {
+            const std::string_view made(call);
+            if (made == "renameat2" || made == "syncfs") calls.emplace_back(made);
+            return other(call);
+        });
+        ASSERT_EQ(errorOf(reparent(url("tree"), url("target"), std::nullopt, Bouncing::isRefused, progress_)), "");
+    }
+    // The attempt; the copy's data, its place, its name; the source, and what is no longer kept.
+    EXPECT_THAT(calls, ::testing::ElementsAre("renameat2", "syncfs", "renameat2", "syncfs", "renameat2", "renameat2"));
+    ASSERT_EQ(errorOf(reparent(url("target/tree"), url(""), std::nullopt, Bouncing::isRefused, progress_)), "");
+    ASSERT_EQ(snapshot(), before);
+    // A disk that can't promise it keeps the source.
+    other = onAnotherDevice();
+    const sys::FaultInjection faults([&, syncs = 0](const char* call) mutable {
+        return std::string_view(call) == "syncfs" && ++syncs == 2 ? EIO : other(call);
+    });
+    EXPECT_EQ(errorOf(reparent(url("tree"), url("target"), std::nullopt, Bouncing::isRefused, progress_)), posix(EIO));
     EXPECT_EQ(snapshot(), before);
     EXPECT_THAT(leftovers(), IsEmpty());
 }
