@@ -60,20 +60,26 @@ Result<KsURL> trashURL(const KsURL& url) {
     return trash;
 }
 
-std::optional<KsError> writeAttribute(const KsURL& url, std::string_view name, const std::optional<Bytes>& value) {
-    const Result<void> written = ts_withReadWriteAccess(url, [&](int fd) -> Result<void> {
+std::optional<KsError> writeAttribute(const MeantFile& file, std::string_view name, const std::optional<Bytes>& value) {
+    const Result<void> written = ts_withReadWriteAccess(file, [&](int fd) -> Result<void> {
         if (auto error = setXattr(fd, value, name)) return *std::move(error);
         return {};
     });
     return written.ok() ? std::nullopt : std::optional(written.error());
 }
 
-/// False, after an error line, when it can't be set.
-bool setTrashDate(const KsURL& url, const KsDate& date) {
-    logDebug("setting trash date on {}", url.description());
-    const auto error = writeAttribute(url, kXattrTrashDateName, keyed_archive::archive(date));
-    if (error) logError("can't set {} of {}; {}", kXattrTrashDateName, url.description(), error->description());
-    return !error;
+/// The error, after an error line, when it can't be set.
+std::optional<KsError> setTrashDate(const MeantFile& file, const KsDate& date) {
+    const std::string url = file.url.description();
+    logDebug("setting trash date on {}", url);
+    auto error = writeAttribute(file, kXattrTrashDateName, keyed_archive::archive(date));
+    if (error) logError("can't set {} of {}; {}", kXattrTrashDateName, url, error->description());
+    return error;
+}
+
+/// Whether nobody could ever give it an attribute, of those that this process is: not that there is no room just now.
+bool isRefusedForGood(const KsError& error) {
+    return error.isPosix(EACCES) || error.isPosix(EPERM) || error.isPosix(ENOTSUP);
 }
 
 /// The root of the app library that holds the URL, the storage among them.
@@ -252,6 +258,7 @@ private:
     /// None where there was none, and one was given now.
     static std::optional<KsDate> trashDate(const KsURL& url, const FileStatus& status) {
         // What can't bear attributes, or may not be given any, would never go: being trashed was the last that changed it.
+        // Anything else is kept until it can be given a date.
         if (!status.isRegular() && !status.isDirectory()) return status.changeTime;
         const auto value = initWithValueOfXattr(kXattrTrashDateName, url);
         const auto date = value ? keyed_archive::unarchiveDate(*value) : std::nullopt;
@@ -261,8 +268,8 @@ private:
         } else {
             logDebug("can't find trash date for URL \"{}\"; set current date", url.description());
         }
-        if (setTrashDate(url, KsDate::now())) return std::nullopt;
-        return status.changeTime;
+        const auto error = setTrashDate(MeantFile(url, status.identity()), KsDate::now());
+        return error && isRefusedForGood(*error) ? std::optional(status.changeTime) : std::nullopt;
     }
 
     void fail(const KsError& error) {

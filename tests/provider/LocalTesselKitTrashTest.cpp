@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
+#include <sys/xattr.h>
 
 #include <filesystem>
 
@@ -368,6 +369,20 @@ TEST_F(LocalTesselKitTrash, whatCannotBeGivenADateGoesByWhenItLastChanged) {
     EXPECT_EQ(sweep({KsDate::now().seconds + 3600, 0}), std::nullopt);
     EXPECT_FALSE(exists(".Trash/a"));
     EXPECT_TRUE(exists(".Trash/dated"));
+}
+
+// The disk, or what a file may bear of attributes, is full: that says nothing of when it was trashed.
+TEST_F(LocalTesselKitTrash, whatHasNoRoomForADateIsKept) {
+    const std::string path = storage_.file(".Trash/full");
+    // A file system that takes them all has room for the date, too, and the file is kept for having it.
+    for (const std::size_t size : {2000U, 500U, 100U, 20U, 5U, 1U}) {
+        for (int i = 0; i < 100; ++i) {
+            const std::string name = "user.fill." + std::to_string(size) + "." + std::to_string(i);
+            if (::setxattr(path.c_str(), name.c_str(), std::string(size, 'x').data(), size, 0) != 0) break;
+        }
+    }
+    EXPECT_EQ(sweep({KsDate::now().seconds + 3600, 0}), std::nullopt);
+    EXPECT_TRUE(exists(".Trash/full"));
 }
 
 TEST_F(LocalTesselKitTrash, aSweepOfNothingIsDone) {
