@@ -13,6 +13,7 @@
 
 #include "host/Descriptor.h"
 #include "host/FakeProvider.h"
+#include "host/FakeSearch.h"
 #include "host/HostError.h"
 #include "host/ItemWriter.h"
 #include "host/RemoteError.h"
@@ -88,8 +89,9 @@ protected:
         if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0) std::abort();
         daemonEnd_ = fds[1];
         serving_ = std::thread([this, fd = UniqueFd(fds[1])] {
-            (void)serveRpc(fd.get(), fd.get(),
-                           {provider_, kPaths, daemonSignals_, [] { return std::string("{\"b\":1,\"a\":2}"); }});
+            (void)serveRpc(
+                fd.get(), fd.get(),
+                {provider_, kPaths, daemonSignals_, [] { return std::string("{\"b\":1,\"a\":2}"); }, search_});
         });
         client_.emplace(UniqueFd(fds[0]), signals_);
     }
@@ -103,6 +105,7 @@ protected:
     const std::shared_ptr<TesselExtension> provider_ = fake_;
     SignalDispatcher daemonSignals_;
     SignalDispatcher signals_;
+    test::FakeSearch search_;
     std::thread serving_;
     int daemonEnd_ = -1;
     std::optional<RemoteClient> client_;
@@ -118,6 +121,55 @@ TEST_F(RemoteClientTest, listsPageByPage) {
     ASSERT_TRUE(second.ok());
     EXPECT_EQ(second->items.size(), 1U);
     EXPECT_EQ(second->nextPage, std::nullopt);
+}
+
+TEST_F(RemoteClientTest, searchesAcrossFolders) {
+    using Kind = SearchQuery::Kind;
+    const auto item = std::make_shared<FakeItem>();
+    item->identifier = "did=7";
+    item->name = "report.txt";
+    search_.pages = {{{item}, Bytes{std::byte{0xFF}, std::byte{0}}}, {{}, std::nullopt}};
+    const auto first = client_->search().find({Kind::names, "rep"}, std::nullopt, 5);
+    ASSERT_TRUE(first.ok());
+    ASSERT_EQ(first->items.size(), 1U);
+    EXPECT_EQ(first->items[0]->itemIdentifier(), "did=7");
+    const auto second = client_->search().find({Kind::names, "rep"}, first->nextPage, 5);
+    ASSERT_TRUE(second.ok());
+    EXPECT_EQ(second->nextPage, std::nullopt);
+    for (const Kind kind : {Kind::recents, Kind::favorites, Kind::trashed})
+        EXPECT_TRUE(client_->search().find({kind, ""}, std::nullopt, 200).ok());
+    EXPECT_TRUE(client_->search().find({Kind::tagged, "red"}, std::nullopt, 200).ok());
+    using Asked = test::FakeSearch::Asked;
+    EXPECT_EQ(search_.asked, (std::vector<Asked>{{Kind::names, "rep", "", 5},
+                                                 {Kind::names, "rep", std::string("\xFF\0", 2), 5},
+                                                 {Kind::recents, "", "", 200},
+                                                 {Kind::favorites, "", "", 200},
+                                                 {Kind::trashed, "", "", 200},
+                                                 {Kind::tagged, "red", "", 200}}));
+    EXPECT_TRUE(client_->search().find({Kind::children, "fid=2"}, std::nullopt, 5).error().isPosix(ENOTSUP));
+}
+
+TEST_F(RemoteClientTest, asksForOrdersAndTags) {
+    search_.sortedPage = {{std::make_shared<FakeItem>()}, 18'446'744'073'709'551'615U};
+    const auto sorted = client_->search().sorted({"fid=2", SortedQuery::Order::size, true, 40, 20});
+    ASSERT_TRUE(sorted.ok());
+    EXPECT_EQ(sorted->items.size(), 1U);
+    EXPECT_EQ(sorted->total, 18'446'744'073'709'551'615U);
+    ASSERT_EQ(search_.askedSorted.size(), 1U);
+    EXPECT_EQ(search_.askedSorted[0].container, "fid=2");
+    EXPECT_EQ(search_.askedSorted[0].order, SortedQuery::Order::size);
+    EXPECT_TRUE(search_.askedSorted[0].isDescending);
+    EXPECT_EQ(search_.askedSorted[0].offset, 40U);
+    EXPECT_EQ(search_.askedSorted[0].limit, 20U);
+
+    search_.tagCounts = {{"red", 2}, {"\u00e9", 1}};
+    const auto tags = client_->search().tags();
+    ASSERT_TRUE(tags.ok());
+    ASSERT_EQ(tags->size(), 2U);
+    EXPECT_EQ((*tags)[1].tag, "\u00e9");
+    EXPECT_EQ((*tags)[0].count, 2U);
+    search_.error = KsError::posix(EIO);
+    EXPECT_TRUE(client_->search().tags().error().isPosix(EIO));
 }
 
 TEST_F(RemoteClientTest, handsErrorsOn) {
