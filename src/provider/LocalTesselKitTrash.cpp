@@ -104,7 +104,7 @@ void setPutBack(const KsURL& former, const KsURL& url) {
     const std::string text = path.substr(base.size() + 1);
     logDebug("setting putback '{}' on {}", text, url.description());
     if (const auto error = writeAttribute(url, kXattrTrashPutBackName, keyed_archive::archive(text)))
-        logError("couldn't set putback xattr ({}", error->description());
+        logError("couldn't set putback xattr ({})", error->description());
 }
 
 bool isReachableFolder(const KsURL& url) {

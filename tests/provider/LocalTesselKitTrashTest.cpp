@@ -2,6 +2,7 @@
 #include <sys/stat.h>
 #include <sys/xattr.h>
 
+#include <cerrno>
 #include <filesystem>
 
 #include "platform/foundation/KeyedArchive.h"
@@ -297,7 +298,8 @@ TEST_F(LocalTesselKitTrash, whatCannotBearAttributesIsTrashedAllTheSame) {
     ASSERT_EQ(errorOf(trashed), "");
     EXPECT_TRUE((*trashed)->isTrashed());
     EXPECT_TRUE(log.containsPart(LogLevel::error, "com.vemra.trash.time#PS"));
-    EXPECT_TRUE(log.containsPart(LogLevel::error, "couldn't set putback xattr ("));
+    EXPECT_TRUE(log.contains(LogLevel::error,
+                             "[ERROR] couldn't set putback xattr (" + KsError::posix(EPERM).description() + ")"));
     EXPECT_EQ(errorOf(untrash((*trashed)->itemIdentifier())), "");
     EXPECT_TRUE(exists("link"));
 }
