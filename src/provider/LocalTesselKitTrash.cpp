@@ -198,7 +198,9 @@ namespace {
 class Sweep : public std::enable_shared_from_this<Sweep> {
 public:
     Sweep(const KsDate& reference, TesselExtension::Completion completion)
-        : reference_(reference), completion_(std::move(completion)) {}
+        : section_(new LogSection("remove trashed items older than {}", reference.rfc3339())),
+          reference_(reference),
+          completion_(std::move(completion)) {}
 
     void run() {
         std::vector<KsURL> roots{TesselManager::defaultManager().documentStorageURL()};
@@ -283,9 +285,11 @@ private:
             const MutexLock lock(mutex_);
             error = error_;
         }
+        section_.reset();
         completion_(error);
     }
 
+    std::unique_ptr<LogSection> section_;  ///< until all deletions have answered
     const KsDate reference_;
     const TesselExtension::Completion completion_;
     DispatchSemaphore slots_{kSweepDeletionsMax};
@@ -297,7 +301,6 @@ private:
 }  // namespace
 
 void LocalTesselKit::removeTrashedItemsOlderThanDate(const KsDate& date, Completion completion) {
-    const LogSection section("remove trashed items older than {}", date.rfc3339());
     dispatchAsync([sweep = std::make_shared<Sweep>(date, std::move(completion))] { sweep->run(); });
 }
 

@@ -2,6 +2,7 @@
 #include <sys/stat.h>
 #include <sys/xattr.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <filesystem>
 
@@ -330,6 +331,31 @@ TEST_F(LocalTesselKitTrash, theSweepTakesWhatIsOlderThanTheDate) {
     EXPECT_TRUE(log.contains(LogLevel::debug, "[DEBUG] wait until all deletions are complete"));
     EXPECT_TRUE(log.contains(LogLevel::debug, "[DEBUG] " + url(".Trash/old").description() +
                                                   " was trashed before reference date, let's remove it"));
+}
+
+// The section holds all that the sweep has to say, and is closed when it answers.
+TEST_F(LocalTesselKitTrash, theSweepIsOneSectionOfTheLog) {
+    storage_.file(".Trash/old");
+    setTrashDate(".Trash/old", kThen);
+    const LogCapture log;
+    EXPECT_EQ(sweep(kLater), std::nullopt);
+    std::vector<std::string> lines;
+    for (auto& [level, line] : log.lines()) lines.push_back(std::move(line));
+    const auto opening = std::ranges::find_if(lines, [](const auto& line) {
+        return line.ends_with(" remove trashed items older than 2001-09-09T01:46:41Z");
+    });
+    ASSERT_NE(opening, lines.end());
+    const std::string mark = "[DEBUG] ┏";
+    ASSERT_TRUE(opening->starts_with(mark));
+    const std::string number = opening->substr(mark.size(), opening->find(' ', mark.size()) - mark.size());
+    const auto closing = std::ranges::find(lines, "[DEBUG] ┗" + number);
+    ASSERT_NE(closing, lines.end());
+    const auto deletion = std::ranges::find(
+        lines, "[DEBUG] " + url(".Trash/old").description() + " was trashed before reference date, let's remove it");
+    const auto wait = std::ranges::find(lines, "[DEBUG] wait until all deletions are complete");
+    EXPECT_LT(opening, deletion);
+    EXPECT_LT(deletion, wait);
+    EXPECT_LT(wait, closing);
 }
 
 TEST_F(LocalTesselKitTrash, whatHasNoDateIsGivenOneAndSurvives) {
