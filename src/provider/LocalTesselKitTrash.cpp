@@ -194,6 +194,11 @@ std::optional<KsURL> LocalTesselKit::destinationOfUntrash(const LocalItem& item,
 
 namespace {
 
+/// Whether an item was put back or deleted by somebody else: then there is nothing to be done any more.
+bool isGone(const KsError& error) {
+    return error.isPosix(ESTALE) || error.is(kKsGeneralErrorDomain, kKsFileNoSuchFileError);
+}
+
 /// One run over the trash folders. Kept by its deletions until the last has answered.
 class Sweep : public std::enable_shared_from_this<Sweep> {
 public:
@@ -247,7 +252,7 @@ private:
         ts_deleteWithCompletionHandler(
             MeantFile(url, status->identity()),
             [self = shared_from_this(), identifier = *identifier](const std::optional<KsError>& error) {
-                if (error) {
+                if (error && !isGone(*error)) {
                     logError("can't remove item {}; {}", identifier, error->description());
                     self->fail(*error);
                 }

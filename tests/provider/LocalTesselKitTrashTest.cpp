@@ -3,6 +3,7 @@
 #include <sys/xattr.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <filesystem>
 
@@ -441,6 +442,35 @@ TEST_F(LocalTesselKitTrash, theSweepAnswersOnItsQueueWhenAllIsGone) {
     answered.wait();
     EXPECT_EQ(left, 0U);
     EXPECT_EQ(thread, std::string("cindral.auto-delete.notifier").substr(0, 15));
+}
+
+// What one has deleted is gone when the other comes to it, and somebody takes things out of the trash meanwhile.
+TEST_F(LocalTesselKitTrash, sweepsAtTheSameTimeAreAllDone) {
+    constexpr int kFiles = 300;
+    for (int i = 0; i < kFiles; ++i) {
+        const std::string name = ".Trash/" + std::to_string(i);
+        storage_.file(name);
+        setTrashDate(name, kThen);
+    }
+    constexpr int kSweeps = 3;
+    const LogCapture log;
+    DispatchGroup sweeps;
+    std::atomic<int> failed = 0;
+    for (int i = 0; i < kSweeps; ++i) {
+        sweeps.enter();
+        provider_->removeTrashedItemsOlderThanDate(kLater, [&](const std::optional<KsError>& error) {
+            failed += error ? 1 : 0;
+            sweeps.leave();
+        });
+    }
+    for (int i = 0; i < kFiles; i += 7) {
+        const std::string name = std::to_string(i);
+        (void)::rename((storage_ / (".Trash/" + name)).c_str(), (storage_ / name).c_str());
+    }
+    sweeps.wait();
+    EXPECT_EQ(failed, 0);
+    EXPECT_EQ(log.count("[ERROR] can't remove item"), 0U);
+    EXPECT_TRUE(std::filesystem::is_empty(storage_ / ".Trash"));
 }
 
 TEST_F(LocalTesselKitTrash, whatCannotBeRemovedIsTold) {
