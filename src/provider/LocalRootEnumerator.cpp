@@ -233,7 +233,7 @@ bool LocalRootEnumerator::sendContents(TesselChangeObserver& observer, const std
     }
     if (scanned.ok()) return true;
     logError("can't list the app libraries that came; {}", scanned.error().description());
-    observer.finishEnumeratingWithError(scanned.error());
+    observer.finishEnumeratingWithError(tesselErrorForExpiredPage());
     return false;
 }
 
@@ -265,7 +265,7 @@ bool LocalRootEnumerator::sendDepartures(TesselChangeObserver& observer, const s
     }
     if (read.ok()) return true;
     logError("can't tell what was in the app libraries that went; {}", read.error().description());
-    observer.finishEnumeratingWithError(read.error());
+    observer.finishEnumeratingWithError(tesselErrorForExpiredPage());
     return false;
 }
 

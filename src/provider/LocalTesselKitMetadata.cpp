@@ -28,6 +28,12 @@ std::optional<Bytes> archivedTags(const std::vector<TSTag>& tags) {
     return keyed_archive::archive(std::move(labels));
 }
 
+void logUnwritten(std::string_view name, const KsError& error) {
+    // The date is set by whatever is opened, and its line is no longer than it has to be.
+    if (name == kXattrLastUsedDateName) return logError("can't set xattr {}", name);
+    logError("can't set xattr {}; {}", name, error.description());
+}
+
 Result<void> setAttribute(const MeantFile& file, std::string_view name, const std::optional<Bytes>& value) {
     return ts_withReadWriteAccess(file, [&](int fd) -> Result<void> {
         if (auto error = setXattr(fd, value, name)) return error->with("path", file.url.path());
@@ -46,7 +52,7 @@ Result<std::shared_ptr<const TesselItem>> LocalTesselKit::withAttribute(const Te
         const Result<void> written = setAttribute(file, name, value);
         if (written.ok()) return std::shared_ptr<const TesselItem>(TRY(fetchItem(identifier)));
         if (hasGone(written.error(), file)) continue;
-        logError("can't set xattr {}; {}", name, written.error().description());
+        logUnwritten(name, written.error());
         return written.error();
     }
     return missingItem(identifier, lookup);

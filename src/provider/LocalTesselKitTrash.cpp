@@ -104,7 +104,7 @@ void setPutBack(const KsURL& former, const KsURL& url) {
     const std::string text = path.substr(base.size() + 1);
     logDebug("setting putback '{}' on {}", text, url.description());
     if (const auto error = writeAttribute(url, kXattrTrashPutBackName, keyed_archive::archive(text)))
-        logError("couldn't set putback xattr ({}", error->description());
+        logError("couldn't set putback xattr ({})", error->description());
 }
 
 bool isReachableFolder(const KsURL& url) {
@@ -194,11 +194,18 @@ std::optional<KsURL> LocalTesselKit::destinationOfUntrash(const LocalItem& item,
 
 namespace {
 
+/// Whether an item was put back or deleted by somebody else: then there is nothing to be done any more.
+bool isGone(const KsError& error) {
+    return error.isPosix(ESTALE) || error.is(kKsGeneralErrorDomain, kKsFileNoSuchFileError);
+}
+
 /// One run over the trash folders. Kept by its deletions until the last has answered.
 class Sweep : public std::enable_shared_from_this<Sweep> {
 public:
     Sweep(const KsDate& reference, TesselExtension::Completion completion)
-        : reference_(reference), completion_(std::move(completion)) {}
+        : section_(new LogSection("remove trashed items older than {}", reference.rfc3339())),
+          reference_(reference),
+          completion_(std::move(completion)) {}
 
     void run() {
         std::vector<KsURL> roots{TesselManager::defaultManager().documentStorageURL()};
@@ -245,7 +252,7 @@ private:
         ts_deleteWithCompletionHandler(
             MeantFile(url, status->identity()),
             [self = shared_from_this(), identifier = *identifier](const std::optional<KsError>& error) {
-                if (error) {
+                if (error && !isGone(*error)) {
                     logError("can't remove item {}; {}", identifier, error->description());
                     self->fail(*error);
                 }
@@ -283,9 +290,11 @@ private:
             const MutexLock lock(mutex_);
             error = error_;
         }
+        section_.reset();
         completion_(error);
     }
 
+    std::unique_ptr<LogSection> section_;  ///< until all deletions have answered
     const KsDate reference_;
     const TesselExtension::Completion completion_;
     DispatchSemaphore slots_{kSweepDeletionsMax};
@@ -297,7 +306,6 @@ private:
 }  // namespace
 
 void LocalTesselKit::removeTrashedItemsOlderThanDate(const KsDate& date, Completion completion) {
-    const LogSection section("remove trashed items older than {}", date.rfc3339());
     dispatchAsync([sweep = std::make_shared<Sweep>(date, std::move(completion))] { sweep->run(); });
 }
 

@@ -3,6 +3,7 @@
 #include <fcntl.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <filesystem>
 
 #include "platform/foundation/Sys.h"
@@ -448,6 +449,34 @@ TEST_F(LocalRootEnumeratorTest, aClientHearsThatWhatWasInTheTrashOfALibraryIsGon
     departed(documents("a") + "/.Trash/other.txt", 110, 11);
     uninstallAndPublish("a");
     EXPECT_EQ(changesFrom(*shallow, known)->log, Names{"d #a"}) << "what is in a trash is not listed here";
+}
+
+// What can't be told is told anew from the beginning, whatever the reason.
+TEST_F(LocalRootEnumeratorTest, libraryContentsThatCannotBeListedExpireTheAnchor) {
+    const auto all = workingSet();
+    const auto before = anchorOf(*all);
+    install("a");
+    put("a", "file.txt");
+    publish();
+    RvStorageManager::defaultManager().setStore(nullptr);
+    const auto given = changesFrom(*all, before);
+    RvStorageManager::defaultManager().setStore(store_);
+    EXPECT_TRUE(hasExpired(given->error));
+    EXPECT_FALSE(given->anchor);
+    EXPECT_TRUE(log_.containsPart(LogLevel::error, "[ERROR] can't list the app libraries that came; "));
+}
+
+TEST_F(LocalRootEnumeratorTest, departuresThatCannotBeReadExpireTheAnchor) {
+    installAndPublish("a");
+    const auto all = workingSet();
+    changesFrom(*all, anchorOf(*all));
+    const auto before = anchorOf(*all);
+    uninstallAndPublish("a");
+    history_->onDrain([] { return Result<void>(KsError::posix(EIO)); });
+    const auto given = changesFrom(*all, before);
+    EXPECT_TRUE(hasExpired(given->error));
+    EXPECT_FALSE(given->anchor);
+    EXPECT_TRUE(log_.containsPart(LogLevel::error, "[ERROR] can't tell what was in the app libraries that went; "));
 }
 
 // Monitoring

@@ -2,7 +2,11 @@
 #include <sys/stat.h>
 
 #include <cerrno>
+#include <functional>
 #include <limits>
+#include <string>
+#include <utility>
+#include <vector>
 
 #include "platform/foundation/KeyedArchive.h"
 #include "platform/foundation/SysFaults.h"
@@ -115,10 +119,36 @@ TEST_F(LocalTesselKitMetadata, whatTheFileSystemRefusesIsTheAnswer) {
         EXPECT_EQ(errorOf(setTags(item, {})), expected);
         EXPECT_EQ(errorOf(setFavoriteRank(item, 1)), expected);
         EXPECT_EQ(errorOf(setLastUsedDate(item, kDate)), expected);
-        EXPECT_TRUE(log.containsPart(LogLevel::error, "can't set xattr com.vemra.metadata:_kMDItemUserTags; "));
-        EXPECT_TRUE(log.containsPart(LogLevel::error, "can't set xattr com.vemra.favorite-rank.number#PS; "));
-        EXPECT_TRUE(log.containsPart(LogLevel::error, "can't set xattr com.vemra.lastuseddate#PS"));
+        const std::string why = "; " + KsError::posix(reason).description();
+        EXPECT_TRUE(log.contains(LogLevel::error, "[ERROR] can't set xattr com.vemra.metadata:_kMDItemUserTags" + why));
+        EXPECT_TRUE(log.contains(LogLevel::error, "[ERROR] can't set xattr com.vemra.favorite-rank.number#PS" + why));
+        EXPECT_TRUE(log.contains(LogLevel::error, "[ERROR] can't set xattr com.vemra.lastuseddate#PS"));
         EXPECT_EQ(attribute("a", kXattrTagDataName), before);
+    }
+}
+
+// From any call on, the item is gone.
+TEST_F(LocalTesselKitMetadata, whatVanishesBeforeItsWriteIsAnUnknownItem) {
+    const TesselItemIdentifier item = identifier("a");
+    const std::vector<std::pair<std::string, std::function<ItemResult()>>> writes{
+        {kNoSuchItem, [&] { return setFavoriteRank(item, 1); }},
+        {kNoSuchItem, [&] { return setLastUsedDate(item, kDate); }},
+        {kItemNotFound, [&] { return setTags(item, {"green"}); }},
+    };
+    for (const auto& [unknown, write] : writes) {
+        bool isReached = true;
+        bool isSaid = false;
+        for (int n = 1; isReached; ++n) {
+            isReached = false;
+            const sys::FaultInjection faults([&, calls = 0](const char* /*call*/) mutable {
+                isReached |= ++calls >= n;
+                return calls >= n ? ENOENT : 0;
+            });
+            const std::string error = errorOf(write());
+            EXPECT_NE(error, kNoSuchFile) << n;
+            isSaid = isSaid || error == unknown;
+        }
+        EXPECT_TRUE(isSaid);
     }
 }
 

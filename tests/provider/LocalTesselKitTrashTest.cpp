@@ -2,6 +2,9 @@
 #include <sys/stat.h>
 #include <sys/xattr.h>
 
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
 #include <filesystem>
 
 #include "platform/foundation/KeyedArchive.h"
@@ -297,7 +300,8 @@ TEST_F(LocalTesselKitTrash, whatCannotBearAttributesIsTrashedAllTheSame) {
     ASSERT_EQ(errorOf(trashed), "");
     EXPECT_TRUE((*trashed)->isTrashed());
     EXPECT_TRUE(log.containsPart(LogLevel::error, "com.vemra.trash.time#PS"));
-    EXPECT_TRUE(log.containsPart(LogLevel::error, "couldn't set putback xattr ("));
+    EXPECT_TRUE(log.contains(LogLevel::error,
+                             "[ERROR] couldn't set putback xattr (" + KsError::posix(EPERM).description() + ")"));
     EXPECT_EQ(errorOf(untrash((*trashed)->itemIdentifier())), "");
     EXPECT_TRUE(exists("link"));
 }
@@ -328,6 +332,31 @@ TEST_F(LocalTesselKitTrash, theSweepTakesWhatIsOlderThanTheDate) {
     EXPECT_TRUE(log.contains(LogLevel::debug, "[DEBUG] wait until all deletions are complete"));
     EXPECT_TRUE(log.contains(LogLevel::debug, "[DEBUG] " + url(".Trash/old").description() +
                                                   " was trashed before reference date, let's remove it"));
+}
+
+// The section holds all that the sweep has to say, and is closed when it answers.
+TEST_F(LocalTesselKitTrash, theSweepIsOneSectionOfTheLog) {
+    storage_.file(".Trash/old");
+    setTrashDate(".Trash/old", kThen);
+    const LogCapture log;
+    EXPECT_EQ(sweep(kLater), std::nullopt);
+    std::vector<std::string> lines;
+    for (auto& [level, line] : log.lines()) lines.push_back(std::move(line));
+    const auto opening = std::ranges::find_if(lines, [](const auto& line) {
+        return line.ends_with(" remove trashed items older than 2001-09-09T01:46:41Z");
+    });
+    ASSERT_NE(opening, lines.end());
+    const std::string mark = "[DEBUG] ┏";
+    ASSERT_TRUE(opening->starts_with(mark));
+    const std::string number = opening->substr(mark.size(), opening->find(' ', mark.size()) - mark.size());
+    const auto closing = std::ranges::find(lines, "[DEBUG] ┗" + number);
+    ASSERT_NE(closing, lines.end());
+    const auto deletion = std::ranges::find(
+        lines, "[DEBUG] " + url(".Trash/old").description() + " was trashed before reference date, let's remove it");
+    const auto wait = std::ranges::find(lines, "[DEBUG] wait until all deletions are complete");
+    EXPECT_LT(opening, deletion);
+    EXPECT_LT(deletion, wait);
+    EXPECT_LT(wait, closing);
 }
 
 TEST_F(LocalTesselKitTrash, whatHasNoDateIsGivenOneAndSurvives) {
@@ -413,6 +442,35 @@ TEST_F(LocalTesselKitTrash, theSweepAnswersOnItsQueueWhenAllIsGone) {
     answered.wait();
     EXPECT_EQ(left, 0U);
     EXPECT_EQ(thread, std::string("cindral.auto-delete.notifier").substr(0, 15));
+}
+
+// What one has deleted is gone when the other comes to it, and somebody takes things out of the trash meanwhile.
+TEST_F(LocalTesselKitTrash, sweepsAtTheSameTimeAreAllDone) {
+    constexpr int kFiles = 300;
+    for (int i = 0; i < kFiles; ++i) {
+        const std::string name = ".Trash/" + std::to_string(i);
+        storage_.file(name);
+        setTrashDate(name, kThen);
+    }
+    constexpr int kSweeps = 3;
+    const LogCapture log;
+    DispatchGroup sweeps;
+    std::atomic<int> failed = 0;
+    for (int i = 0; i < kSweeps; ++i) {
+        sweeps.enter();
+        provider_->removeTrashedItemsOlderThanDate(kLater, [&](const std::optional<KsError>& error) {
+            failed += error ? 1 : 0;
+            sweeps.leave();
+        });
+    }
+    for (int i = 0; i < kFiles; i += 7) {
+        const std::string name = std::to_string(i);
+        (void)::rename((storage_ / (".Trash/" + name)).c_str(), (storage_ / name).c_str());
+    }
+    sweeps.wait();
+    EXPECT_EQ(failed, 0);
+    EXPECT_EQ(log.count("[ERROR] can't remove item"), 0U);
+    EXPECT_TRUE(std::filesystem::is_empty(storage_ / ".Trash"));
 }
 
 TEST_F(LocalTesselKitTrash, whatCannotBeRemovedIsTold) {
