@@ -37,7 +37,7 @@ const path = h('nav', { class: 'path', 'aria-label': 'Path' });
 const search = h('input', { type: 'search', id: 'search', placeholder: 'Search', 'aria-label': 'Search all documents', autocomplete: 'off' });
 const toolbar = h('div', { class: 'toolbar', role: 'toolbar', 'aria-label': 'Works' });
 const state = h('div', { class: 'state' });
-const information = h('aside', { class: 'information', 'aria-label': 'Information', hidden: true, tabIndex: 0 });
+const information = h('aside', { class: 'details', 'aria-label': 'Information', hidden: true, tabIndex: 0 });
 const messages = h('div', { class: 'messages' });
 const works = h('div', { class: 'works', role: 'region', 'aria-label': 'Works under way', hidden: true });
 const files = h('input', { type: 'file', multiple: true, hidden: true, 'aria-label': 'Documents to upload', id: 'files' });
@@ -636,8 +636,7 @@ async function begin() {
   }
   hasSession = true;
   app.replaceChildren(
-    h('a', { class: 'skip', href: '#', onclick: (event) => { event.preventDefault(); rows.scroller.focus(); } }, 'To the documents'),
-    h('header', {}, placesButton, path, search, button('Keys', () => dialogs.keys(), { class: 'quiet keys' }), button('Sign out', async () => { await signOut(); showSignedOut(); }, { class: 'quiet' })),
+    h('header', {}, h('a', { class: 'skip', href: '#', onclick: (event) => { event.preventDefault(); rows.scroller.focus(); } }, 'To the documents'), placesButton, path, search, button('Keys', () => dialogs.keys(), { class: 'quiet keys' }), button('Sign out', async () => { await signOut(); showSignedOut(); }, { class: 'quiet' })),
     h('div', { class: 'columns-of-page' }, places, h('main', {}, toolbar, h('div', { class: 'shown' }, rows.element, state)), information),
     works, messages, status, files, folders);
   const placesChanged = paced(500, () => readPlaces().catch(failed));

@@ -46,7 +46,7 @@ export function kind(item) {
   const [family, rest] = item.typeIdentifier.split('/');
   if (!rest) return 'Package';
   const what = { image: 'picture', audio: 'sound', video: 'film', text: 'text' }[family] ?? 'document';
-  return `${rest.replace(/^(x-|vnd\.)/, '').split(/[.+]/).pop().toUpperCase()} ${what}`;
+  return `${rest.replace(/^(x-|vnd\.)/, '').split('+')[0].split('.').pop().toUpperCase()} ${what}`;
 }
 
 // What a folder shows in place of a size.

@@ -12,7 +12,7 @@ const { chromium } = require('playwright-core');
 const axe = fs.readFileSync(require.resolve('axe-core/axe.min.js'), 'utf8');
 
 // A test that waits this long has failed; nothing is measured by it.
-export const PATIENCE = 60_000;
+export const PATIENCE = Number(process.env.CINDRAL_PATIENCE ?? 60_000);
 
 export class Storage {
   constructor() {
