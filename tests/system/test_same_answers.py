@@ -87,6 +87,8 @@ class SameAnswersTest(OutsideTest):
             ["id", notes], ["id", self.storage], ["id", "did=1"], ["id", "sub/../notes.txt"], ["url", "./did=1"],
             ["anchor"], ["anchor", self.path("sub")],
             ["tags", notes], ["apps"],
+            ["find", "notes"], ["find", "o"], ["find", "nothing of the kind"], ["find", "line", "--limit", "3"], ["recents"], ["favorites"],
+            ["tags"], ["tagged", "no such tag"], ["trash"],
             # And what fails.
             ["ls", "nothing"], ["ls", "nothing/\udcff"], ["info", "did=4294967295"], ["info", "did=\udcff"], ["url", "fid=1"],
             ["id", ""], ["id", "/etc"], ["anchor", "fid=1"], ["anchor", notes], ["changes", "--since", "!"], ["changes", "--since", "AAAA"],
