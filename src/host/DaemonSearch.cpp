@@ -57,6 +57,7 @@ std::optional<FoundDaemon> daemonOf(const Json& hello) {
     daemon.storageOption = pathOf(hello.value("storageOption", Json()));
     daemon.recorderOption = hello.value("recorderOption", "");
     daemon.flatpak = hello.value("flatpak", true);
+    daemon.desktopTags = hello.value("desktopTags", false);
     for (const Json& folder : hello.value("applicationFolders", Json::array()))
         daemon.applications.push_back(pathOf(folder));
     return daemon.storage.empty() ? std::nullopt : std::optional(std::move(daemon));
@@ -144,12 +145,15 @@ Result<HostOptions> agreeWithDaemon(HostOptions options, const FoundDaemon& daem
                                                 listOf(options.applications)));
     }
     if (options.said.flatpak && daemon.flatpak) return disagreement(daemon, "reads Flatpak's applications");
+    if (options.said.desktopTags && !daemon.desktopTags)
+        return disagreement(daemon, "does not share the desktop's tags");
     if (options.said.recorder && recorderChoiceName(options.recorder) != daemon.recorderOption) {
         return disagreement(daemon, fmt::format("has the recorder {}, not {}", terminalText(daemon.recorderOption),
                                                 recorderChoiceName(options.recorder)));
     }
     options.applications = daemon.applications;
     options.flatpak = daemon.flatpak;
+    options.desktopTags = daemon.desktopTags;
     return options;
 }
 

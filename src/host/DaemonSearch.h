@@ -21,6 +21,7 @@ struct FoundDaemon {
     std::string recorderOption;
     std::vector<std::string> applications;
     bool flatpak = true;
+    bool desktopTags = false;
 };
 
 /// Either there is a daemon for the state folder; or there is none, and there won't be while the handover is held: until

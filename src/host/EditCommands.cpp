@@ -15,9 +15,9 @@
 #include "host/JsonText.h"
 #include "host/ProgressPace.h"
 #include "host/TerminalText.h"
-#include "host/Utf8.h"
 #include "platform/foundation/Dispatch.h"
 #include "platform/foundation/RootDirectories.h"
+#include "platform/foundation/Utf8.h"
 #include "platform/tessel/TesselErrors.h"
 #include "platform/tessel/TesselTags.h"
 

@@ -10,8 +10,8 @@
 #include "host/JsonText.h"
 #include "host/RequestParams.h"
 #include "host/SearchMethods.h"
-#include "host/Utf8.h"
 #include "platform/foundation/Base64.h"
+#include "platform/foundation/Utf8.h"
 #include "platform/tessel/TesselErrors.h"
 
 namespace cindral {

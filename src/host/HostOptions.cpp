@@ -32,6 +32,7 @@ struct Words {
     std::vector<std::string> applications;
     std::string recorder = "auto";
     bool noFlatpak = false;
+    bool desktopTags = false;
     bool json = false;
     bool intoPackages = false;
     std::string since;
@@ -117,6 +118,7 @@ void addOptions(CLI::App& app, Words& words) {
         ->expected(1)
         ->take_all();
     app.add_flag("--no-flatpak", words.noFlatpak, "Leave Flatpak's applications out.");
+    app.add_flag("--desktop-tags", words.desktopTags, "Share tags with file managers that keep them in user.xdg.tags.");
     app.add_option("--recorder", words.recorder, "How events are recorded: inotify, fanotify or auto (the default).")
         ->type_name("HOW")
         ->check(CLI::IsMember({"inotify", "fanotify", "auto"}));
@@ -264,7 +266,8 @@ HostOptions optionsOf(const CLI::App& app, const Words& words, const HostEnviron
     for (const std::string& folder : words.applications)
         options.applications.push_back(absolutePath(folder, environment));
     options.said = {!words.storage.empty(), !words.applications.empty(), words.noFlatpak,
-                    app.get_option("--recorder")->count() > 0};
+                    app.get_option("--recorder")->count() > 0, words.desktopTags};
+    options.desktopTags = words.desktopTags;
     options.flatpak = !words.noFlatpak;
     options.recorder = recorderOf(words.recorder);
     options.json = words.json;

@@ -50,6 +50,7 @@ struct HostOptions {
     std::string state;                      ///< the same
     std::vector<std::string> applications;  ///< absolute
     bool flatpak = true;
+    bool desktopTags = false;
     RecorderChoice recorder = RecorderChoice::automatic;
     bool json = false;
     bool intoPackages = false;                   ///< tree
@@ -66,6 +67,7 @@ struct HostOptions {
         bool applications = false;
         bool flatpak = false;
         bool recorder = false;
+        bool desktopTags = false;
     } said;
 };
 

@@ -151,6 +151,8 @@ Result<std::unique_ptr<HostProcess>> HostProcess::start(HostOptions options, con
     host->signals_->setSearchableItems(host->search_);
     host->provider_->waitUntilReady();
     if (records(host->options_.command)) host->startRecorder();
+    // Who asks the daemon finds the answer there.
+    if (host->options_.command == HostCommand::serve) host->search_->follow();
     return host;
 }
 
@@ -163,6 +165,7 @@ Result<void> HostProcess::connect() {
     RoApplicationWorkspace::defaultWorkspace().setOwnRecord(ownRecord(paths_));
     TesselManager::defaultManager().setDocumentStorageURL(KsURL::fileURL(paths_.presented()));
     TesselManager::defaultManager().setApplicationSupportURL(KsURL::fileURL(state_ + "/Application Support"));
+    TesselManager::defaultManager().setSharesDesktopTags(options_.desktopTags);
     TesselManager::defaultManager().setHost(signals_);
     return {};
 }
@@ -234,6 +237,7 @@ std::string HostProcess::helloText() const {
     appendField(out, "recorderOption", jsonString(recorderChoiceName(options_.recorder)));
     appendField(out, "applicationFolders", listText(folders));
     appendField(out, "flatpak", options_.flatpak ? "true" : "false");
+    appendField(out, "desktopTags", options_.desktopTags ? "true" : "false");
     return out + "}";
 }
 
@@ -255,6 +259,7 @@ std::string HostProcess::statusText() const {
     appendField(out, "recorderOption", jsonString(recorderChoiceName(options_.recorder)));
     appendField(out, "applicationFolders", listText(options_.applications));
     appendField(out, "flatpak", options_.flatpak ? "true" : "false");
+    appendField(out, "desktopTags", options_.desktopTags ? "true" : "false");
     appendField(out, "roots", listText(roots));
     appendField(out, "objects", fmt::to_string(counts.objects));
     appendField(out, "documents", fmt::to_string(counts.documents));

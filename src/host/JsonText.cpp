@@ -4,7 +4,7 @@
 
 #include <array>
 
-#include "host/Utf8.h"
+#include "platform/foundation/Utf8.h"
 
 namespace cindral {
 namespace {

@@ -8,8 +8,8 @@
 #include "host/JsonText.h"
 #include "host/RemoteError.h"
 #include "host/RemoteItem.h"
-#include "host/Utf8.h"
 #include "platform/foundation/Base64.h"
+#include "platform/foundation/Utf8.h"
 #include "platform/tessel/TesselTags.h"
 
 namespace cindral {

@@ -5,7 +5,7 @@
 #include <array>
 #include <ctime>
 
-#include "host/Utf8.h"
+#include "platform/foundation/Utf8.h"
 
 namespace cindral {
 namespace {

@@ -12,6 +12,8 @@
 #include "platform/foundation/TypeDatabase.h"
 #include "platform/roster/Roster.h"
 #include "platform/tessel/FileOperations.h"
+#include "platform/tessel/TesselManager.h"
+#include "provider/DesktopTags.h"
 #include "provider/KsURL+CdlFileObjectIdentifier.h"
 #include "provider/Utilities.h"
 
@@ -151,8 +153,12 @@ void LocalItem::readUserMetadata() {
     fileURL_.loadAttributeNames();
     if (const auto bytes = initWithValueOfXattr(kXattrLastUsedDateName, fileURL_))
         lastUsedDate_ = keyed_archive::unarchiveDate(*bytes);
-    if (const auto bytes = initWithValueOfXattr(kXattrTagDataName, fileURL_))
+    if (const auto bytes = initWithValueOfXattr(kXattrTagDataName, fileURL_)) {
         tags_ = keyed_archive::unarchiveStrings(*bytes);
+    } else if (TesselManager::defaultManager().sharesDesktopTags()) {
+        if (const auto shared = initWithValueOfXattr(desktop_tags::kXattrName, fileURL_))
+            tags_ = desktop_tags::decode(*shared);
+    }
     if (const auto bytes = initWithValueOfXattr(kXattrFavoriteRankName, fileURL_))
         favoriteRank_ = keyed_archive::unarchiveInteger(*bytes);
 }

@@ -11,6 +11,7 @@
 #include "platform/tessel/FileOperations.h"
 #include "platform/tessel/TSPacer.h"
 #include "platform/tessel/TesselExtension.h"
+#include "platform/tessel/TesselTags.h"
 #include "provider/LocalItem.h"
 
 namespace cindral {
@@ -123,9 +124,16 @@ private:
     static Result<std::shared_ptr<const TesselItem>> withoutTrashDate(const KsURL& restored);
     static std::optional<KsURL> destinationOfUntrash(const LocalItem& item,
                                                      const std::optional<TesselItemIdentifier>& parent);
-    static Result<std::shared_ptr<const TesselItem>> withAttribute(const TesselItemIdentifier& identifier,
-                                                                   Lookup lookup, std::string_view name,
-                                                                   const std::optional<Bytes>& value);
+    struct Attribute {
+        std::string_view name;
+        std::optional<Bytes> value;
+    };
+    static Result<std::shared_ptr<const TesselItem>> withAttributes(const TesselItemIdentifier& identifier,
+                                                                    Lookup lookup,
+                                                                    const std::vector<Attribute>& attributes);
+    static std::vector<Attribute> attributesFor(const std::vector<TSTag>& tags);
+    static Result<void> setAttributes(const MeantFile& file, const std::vector<Attribute>& attributes,
+                                      std::string_view& failing);
     static KsError notTagged(const TesselItemIdentifier& identifier);
 
     const std::shared_ptr<FirstRefresh> firstRefresh_;

@@ -9,7 +9,9 @@
 #include "platform/foundation/Log.h"
 #include "platform/tessel/FileOperations.h"
 #include "platform/tessel/TesselErrors.h"
+#include "platform/tessel/TesselManager.h"
 #include "platform/tessel/TesselTags.h"
+#include "provider/DesktopTags.h"
 #include "provider/LocalTesselKit.h"
 #include "provider/Utilities.h"
 
@@ -34,25 +36,48 @@ void logUnwritten(std::string_view name, const KsError& error) {
     logError("can't set xattr {}; {}", name, error.description());
 }
 
-Result<void> setAttribute(const MeantFile& file, std::string_view name, const std::optional<Bytes>& value) {
+}  // namespace
+
+std::vector<LocalTesselKit::Attribute> LocalTesselKit::attributesFor(const std::vector<TSTag>& tags) {
+    std::vector<Attribute> attributes;
+    if (TesselManager::defaultManager().sharesDesktopTags()) {
+        std::vector<std::string> labels;
+        for (const TSTag& tag : tags) labels.push_back(tag.label);
+        attributes.push_back({desktop_tags::kXattrName, desktop_tags::encode(labels)});
+    }
+    attributes.push_back({kXattrTagDataName, archivedTags(tags)});
+    return attributes;
+}
+
+/// All of them, or none.
+Result<void> LocalTesselKit::setAttributes(const MeantFile& file, const std::vector<Attribute>& attributes,
+                                           std::string_view& failing) {
     return ts_withReadWriteAccess(file, [&](int fd) -> Result<void> {
-        if (auto error = setXattr(fd, value, name)) return error->with("path", file.url.path());
+        std::vector<Attribute> before;
+        for (const auto& [name, value] : attributes) {
+            failing = name;
+            // One alone is never to be put back.
+            if (attributes.size() > 1) before.push_back({name, initWithValueOfXattr(name, file.url)});
+            const auto error = setXattr(fd, value, name);
+            if (!error) continue;
+            for (const Attribute& former : before) (void)setXattr(fd, former.value, former.name);
+            return error->with("path", file.url.path());
+        }
         return {};
     });
 }
 
-}  // namespace
-
-/// The item with the attribute written, or taken away.
-Result<std::shared_ptr<const TesselItem>> LocalTesselKit::withAttribute(const TesselItemIdentifier& identifier,
-                                                                        Lookup lookup, std::string_view name,
-                                                                        const std::optional<Bytes>& value) {
+/// The item with the attributes written, or taken away.
+Result<std::shared_ptr<const TesselItem>> LocalTesselKit::withAttributes(const TesselItemIdentifier& identifier,
+                                                                         Lookup lookup,
+                                                                         const std::vector<Attribute>& attributes) {
     for (int attempts = 0; attempts < kAttemptsMax; ++attempts) {
         const MeantFile file = TRY(find(identifier, lookup));
-        const Result<void> written = setAttribute(file, name, value);
+        std::string_view failing = attributes.front().name;
+        const Result<void> written = setAttributes(file, attributes, failing);
         if (written.ok()) return std::shared_ptr<const TesselItem>(TRY(fetchItem(identifier)));
         if (hasGone(written.error(), file)) continue;
-        logUnwritten(name, written.error());
+        logUnwritten(failing, written.error());
         return written.error();
     }
     return missingItem(identifier, lookup);
@@ -68,15 +93,14 @@ void LocalTesselKit::setLastUsedDate(const std::optional<KsDate>& date, const Te
         return completion(item.ok() ? Result<std::shared_ptr<const TesselItem>>(*item) : item.error());
     }
     const auto value = date ? std::optional(keyed_archive::archive(*date)) : std::nullopt;
-    completion(withAttribute(identifier, Lookup::strict, kXattrLastUsedDateName, value));
+    completion(withAttributes(identifier, Lookup::strict, {{kXattrLastUsedDateName, value}}));
 }
 
 void LocalTesselKit::setTagData(const std::optional<Bytes>& tagData, const TesselItemIdentifier& identifier,
                                 ItemCompletion completion) {
     const LogSection section("set tag data to item \"{}\"", identifier);
     const auto tags = tagData ? tsGetTagsFromTagsData(*tagData) : std::vector<TSTag>();
-    auto tagged = tags ? withAttribute(identifier, Lookup::lenient, kXattrTagDataName, archivedTags(*tags))
-                       : notTagged(identifier);
+    auto tagged = tags ? withAttributes(identifier, Lookup::lenient, attributesFor(*tags)) : notTagged(identifier);
     if (!tagged.ok() && tagged.error().is(kTSErrorDomain, static_cast<std::int64_t>(TSErrorCode::itemNotFound)))
         logError("can't find URL for item; {}", identifier);
     completion(std::move(tagged));
@@ -92,7 +116,7 @@ void LocalTesselKit::setFavoriteRank(std::optional<std::int64_t> rank, const Tes
                                      ItemCompletion completion) {
     const LogSection section("set favorite rank \"{}\" {}", rank ? fmt::to_string(*rank) : "none", identifier);
     const auto value = rank ? std::optional(keyed_archive::archive(*rank)) : std::nullopt;
-    completion(withAttribute(identifier, Lookup::strict, kXattrFavoriteRankName, value));
+    completion(withAttributes(identifier, Lookup::strict, {{kXattrFavoriteRankName, value}}));
 }
 
 }  // namespace cindral

@@ -5,8 +5,8 @@
 #include <limits>
 #include <nlohmann/json.hpp>
 
-#include "host/Utf8.h"
 #include "platform/foundation/KsURL.h"
+#include "platform/foundation/Utf8.h"
 
 namespace cindral {
 namespace {

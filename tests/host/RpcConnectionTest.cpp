@@ -336,6 +336,43 @@ TEST_F(RpcConnectionTest, saysWhatTheProviderDoesNotOffer) {
     EXPECT_EQ(refused["data"], (Json{{"domain", "KsPOSIXErrorDomain"}, {"code", ENOTSUP}}));
 }
 
+TEST_F(RpcConnectionTest, takesNamesOfAnyBytes) {
+    for (const char* method : {"createDirectory", "renameItem", "reparentItem"}) {
+        const Json params{{"identifier", "did=3"}, {"parent", "fid=2"}};
+        const auto with = [&](const Json& more) {
+            Json all = params;
+            all.update(more);
+            return error(method, all)["code"];
+        };
+        EXPECT_EQ(with({{"encodedName", "a%FF"}}), -32000) << method << ": what the provider doesn't offer";
+        EXPECT_EQ(with({{"encodedName", "a"}, {"name", "a"}}), -32602) << method;
+        for (const Json& wrong : {Json("%"), Json("%f"), Json("%0g"), Json(7), Json()})
+            EXPECT_EQ(with({{"encodedName", wrong}}), -32602) << method << wrong;
+    }
+}
+
+TEST_F(RpcConnectionTest, tellsPathsOfAnyBytes) {
+    fake_->listingErrors.emplace("fid=2", KsError::posix(EACCES, presented_ + "/\xFF"));
+    const auto data = error("enumerateItems", {{"container", "fid=2"}})["data"];
+    EXPECT_EQ(data["path"], real_ + "/\uFFFD");
+    EXPECT_EQ(data["pathURL"], "file://" + real_ + "/%FF");
+    fake_->listingErrors.clear();
+    fake_->listingErrors.emplace("fid=2", KsError::posix(EACCES, presented_ + "/a"));
+    EXPECT_FALSE(error("enumerateItems", {{"container", "fid=2"}})["data"].contains("pathURL"));
+}
+
+TEST_F(RpcConnectionTest, isGreetedByWhoEndsSoonAndWhoDoesNot) {
+    std::vector<bool> told;
+    greeting_ = [&](bool endsSoon) {
+        told.push_back(endsSoon);
+        return std::string(R"({"process":1})");
+    };
+    for (const Json& params :
+         {Json::object(), Json{{"endsSoon", true}}, Json{{"endsSoon", false}}, Json{{"endsSoon", 1}}})
+        EXPECT_EQ(result("hello", params), (Json{{"process", 1}}));
+    EXPECT_THAT(told, ElementsAre(false, true, false, false));
+}
+
 TEST_F(RpcConnectionTest, answersThumbnailsInTheOrderOfTheIdentifiers) {
     const auto none = [](const char* identifier) { return Json{{"identifier", identifier}, {"png", nullptr}}; };
     EXPECT_EQ(result("fetchThumbnails", {{"identifiers", {"did=2", "#a", "did=1"}}, {"size", 64}}),

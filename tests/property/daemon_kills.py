@@ -24,6 +24,7 @@ from container_view import ALL_DIRECTORIES, ContainerView, is_expired, listed  #
 
 CONTAINERS = [ROOT, WORKING_SET, ALL_DIRECTORIES]
 LINES = 500
+DOCUMENTS = 60
 # What edits are told that want what another one of the same client took.
 EXPECTED = {("TesselErrorDomain", -1003), ("TesselErrorDomain", -1001), ("CindralProvider.LocalTesselKitError", 0)}
 
@@ -76,7 +77,10 @@ class Editor:
             did_end()
 
     def edit(self, client):
-        self.random.choices([self.import_document, self.delete, self.rename, self.move, self.make_folder], [5, 2, 4, 4, 1])[0](client)
+        # About so many documents at any time, however long it goes on.
+        deletions = 2 if len(self.must) < DOCUMENTS else 6
+        edits = [self.import_document, self.delete, self.rename, self.move, self.make_folder]
+        self.random.choices(edits, [5, deletions, 4, 4, 1])[0](client)
 
     def documents(self):
         return [os.path.join(folder, name) for folder in self.folders for name in os.listdir(folder)

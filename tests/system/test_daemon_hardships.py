@@ -77,7 +77,8 @@ class HostileClientsTest(SystemTest):
                     self.assertEqual(len(self.bystander.items(self.many)), 300)
         self.assertIn(raised.exception.errno, (errno.EPIPE, errno.ECONNRESET))
         self.assertTrue(self.served.waits_for("a client that does not read is dropped"))
-        self.assertLess(peak_memory(self.served.process) - before, 200 << 20)
+        # Of nine gigabytes that it has asked for; a sanitizer's share included.
+        self.assertLess(peak_memory(self.served.process) - before, 600 << 20)
 
     def test_who_reads_slowly_gets_everything(self):
         slow = self.connect(reads=False)

@@ -9,7 +9,7 @@ import unittest
 
 sys.path.insert(0, os.path.dirname(__file__))
 
-from cindral_rpc import ROOT, SystemTest, WORKING_SET  # noqa: E402
+from cindral_rpc import ROOT, Client, RpcError, SystemTest, WORKING_SET  # noqa: E402
 
 
 def names(items):
@@ -226,6 +226,65 @@ class SearchTest(SystemTest):
         client = self.client()
         for text in ("bytes\ufffd", "A\nB", "文名", "字", "\"QUOTED\"", "%", "t_"):
             self.assertEqual(len(self.found(client, text=text)), 1, text)
+
+
+class DesktopTagsTest(SystemTest):
+    def desktop_tags(self, path):
+        try:
+            return os.getxattr(path, "user.xdg.tags").decode()
+        except OSError:
+            return None
+
+    def sharing_client(self):
+        client = Client([*self.options(), "--desktop-tags"], self.environment)
+        self.addCleanup(client.__exit__)
+        return client
+
+    def test_are_left_alone_unless_asked_for(self):
+        path = self.make_file("a.txt")
+        os.setxattr(path, "user.xdg.tags", b"desktop")
+        client = self.client()
+        identifier = client.identifier(path)
+        self.assertNotIn("tags", client.call("itemForIdentifier", identifier=identifier))
+        client.call("setTags", identifier=identifier, tags=["own"])
+        self.assertEqual(self.desktop_tags(path), "desktop")
+
+    def test_are_read_and_written_with_ours(self):
+        path = self.make_file("a.txt")
+        os.setxattr(path, "user.xdg.tags", "work, zu Hause".encode())
+        client = self.sharing_client()
+        self.assertTrue(client.call("status")["desktopTags"])
+        identifier = client.identifier(path)
+        self.assertEqual(client.call("itemForIdentifier", identifier=identifier)["tags"], ["work", "zu Hause"])
+        self.assertEqual(names(client.call("taggedItems", tag="work")["items"]), ["a.txt"])
+
+        item = client.call("setTags", identifier=identifier, tags=["own", "with, comma"])
+        self.assertEqual(item["tags"], ["own", "with, comma"])
+        self.assertEqual(self.desktop_tags(path), "own")
+        os.setxattr(path, "user.xdg.tags", b"later")
+        self.assertEqual(client.call("itemForIdentifier", identifier=identifier)["tags"], ["own", "with, comma"])
+
+        self.assertNotIn("tags", client.call("setTags", identifier=identifier, tags=[]))
+        self.assertIsNone(self.desktop_tags(path))
+        os.setxattr(path, "user.xdg.tags", b"again")
+        self.assertEqual(names(client.call("taggedItems", tag="again")["items"]), ["a.txt"])
+
+    def test_are_both_as_they_were_where_one_cannot_be_written(self):
+        path = self.make_file("a.txt")
+        os.setxattr(path, "user.xdg.tags", b"before")
+        client = self.sharing_client()
+        identifier = client.identifier(path)
+        # The second is written, or taken away, when the first has been.
+        for label in ("x" * 70000, "x," * 35000):
+            error = self.assert_fails(client, "setTags", identifier=identifier, tags=[label])
+            self.assertEqual(error.domain, "KsPOSIXErrorDomain")
+            self.assertEqual(self.desktop_tags(path), "before")
+        self.assertEqual(client.call("itemForIdentifier", identifier=identifier)["tags"], ["before"])
+
+    def assert_fails(self, client, method, **params):
+        with self.assertRaises(RpcError) as raised:
+            client.call(method, **params)
+        return raised.exception
 
 
 class SearchCommandsTest(SystemTest):

@@ -173,18 +173,31 @@ Result<bool> isWithin(int folder, const FileStatus& outer) {
     return true;
 }
 
+/// Gives an entry a second name, and takes the first away. Of what another program puts under the first name meanwhile,
+/// nothing is lost, unless in the microsecond between the last look and the call.
+Result<void> linkAndUnlink(int from, const char* name, int to, const char* newName) {
+    TRY(sys::linkat(from, name, to, newName));
+    const auto undone = [&](const KsError& error) {
+        (void)sys::unlinkat(to, newName);
+        return error;
+    };
+    const Result<FileStatus> linked = sys::statx(to, newName);
+    if (!linked.ok()) return undone(linked.error());
+    const Result<FileStatus> left = sys::statx(from, name);
+    if (!left.ok() && !left.error().isPosix(ENOENT)) return undone(left.error());
+    // It has the new name alone: another took its old one over, or took that away.
+    if (!left.ok() || !isSameObject(*linked, *left)) return {};
+    const Result<void> unlinked = sys::unlinkat(from, name);
+    return unlinked.ok() ? unlinked : undone(unlinked.error());
+}
+
 /// renameat2 with RENAME_NOREPLACE, by other means where the file system doesn't know it: a folder takes the place of an
 /// empty one made for it, anything else gets a second name and loses the first.
 Result<void> renameWithoutReplacing(int from, const char* name, int to, const char* newName) {
     const Result<void> renamed = sys::renameat2(from, name, to, newName, RENAME_NOREPLACE);
     if (renamed.ok() || !renamed.error().isPosix(EINVAL)) return renamed;
     const FileStatus status = TRY(sys::statx(from, name));
-    if (!status.isDirectory()) {
-        TRY(sys::linkat(from, name, to, newName));
-        const Result<void> unlinked = sys::unlinkat(from, name);
-        if (!unlinked.ok()) (void)sys::unlinkat(to, newName);
-        return unlinked;
-    }
+    if (!status.isDirectory()) return linkAndUnlink(from, name, to, newName);
     if (TRY(isWithin(to, status))) return KsError::posix(EINVAL);
     TRY(sys::mkdirat(to, newName, kOwnerOnly));
     const Result<void> moved = sys::renameat2(from, name, to, newName, 0);

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <atomic>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -41,6 +42,9 @@ public:
     /// The folder in which a provider may keep what it knows. Aborts when the host has not set it.
     KsURL applicationSupportURL() const;
     void setApplicationSupportURL(KsURL url);
+    /// Whether tags are shared with the file managers of the desktop. Off unless the host says otherwise.
+    bool sharesDesktopTags() const { return sharesDesktopTags_.load(std::memory_order_relaxed); }
+    void setSharesDesktopTags(bool shares) { sharesDesktopTags_ = shares; }
     /// Null takes the host away: signals are then answered without an error and go nowhere.
     void setHost(std::shared_ptr<Host> host);
 
@@ -50,6 +54,8 @@ public:
 
 private:
     std::shared_ptr<Host> host() const;
+
+    std::atomic<bool> sharesDesktopTags_ = false;
 
     mutable Mutex mutex_;
     std::shared_ptr<const KsURL> documentStorageURL_ GUARDED_BY(mutex_);

@@ -898,6 +898,25 @@ TEST_F(FileOperationsTest, renamesWithoutReplacingEverywhere) {
     EXPECT_FALSE(fs::exists(path("tree")));
 }
 
+// The file gets its new name, and before the old one is taken away, another program saves a new file under that.
+TEST_F(FileOperationsTest, whatIsSavedDuringARenameWithoutFlagsStays) {
+    for (const int when : {1, 2}) {
+        for (const auto& entry : fs::directory_iterator(storage_)) fs::remove_all(entry.path());
+        file("a", "old");
+        file("saved", "new");
+        const sys::FaultInjection faults([&, renames = 0, looks = 0, isLinked = false](const char* call) mutable {
+            const std::string_view made(call);
+            if (made == "renameat2" && ++renames == 1) return EINVAL;
+            isLinked = isLinked || made == "linkat";
+            if (isLinked && made == "statx" && ++looks == when) fs::rename(path("saved"), path("a"));
+            return 0;
+        });
+        EXPECT_EQ(errorOf(rename(url("a"), "b")), "") << when;
+        EXPECT_EQ(contentsOf(path("a")), "new") << when;
+        EXPECT_EQ(contentsOf(path("b")), "old") << when;
+    }
+}
+
 // --- Faults --------------------------------------------------------------------------------------------------------------
 
 // The n-th system call fails, for every n: an error leaves everything as it was, success leaves it as it should be.

@@ -1,4 +1,4 @@
-#include "host/Utf8.h"
+#include "platform/foundation/Utf8.h"
 
 #include <gtest/gtest.h>
 

@@ -1,0 +1,3 @@
+if(TARGET cindral_provider)
+  cindral_fuzz_target(DesktopTagsFuzz DEPENDS cindral_provider)
+endif()

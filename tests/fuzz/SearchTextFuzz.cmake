@@ -1,0 +1,1 @@
+cindral_fuzz_target(SearchTextFuzz DEPENDS cindral_host)
