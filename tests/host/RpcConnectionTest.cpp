@@ -92,7 +92,7 @@ protected:
         return text;
     }
     RpcService service() {
-        return {provider_, paths_, signals_, [] { return std::string(R"({"version":"x"})"); }, search_};
+        return {provider_, paths_, signals_, [] { return std::string(R"({"version":"x"})"); }, search_, greeting_};
     }
     Json answer(const std::string& method, const Json& params) {
         const Json request{{"jsonrpc", "2.0"}, {"id", 1}, {"method", method}, {"params", params}};
@@ -113,6 +113,7 @@ protected:
     const std::shared_ptr<TesselExtension> provider_ = fake_;
     SignalDispatcher signals_;
     test::FakeSearch search_;
+    std::function<std::string(bool endsSoon)> greeting_ = [](bool) { return std::string("{}"); };
     Result<void> served_;
 };
 

@@ -129,6 +129,7 @@ class Client(Connection):
             [*launcher, PROGRAM, "rpc", *arguments], stdin=subprocess.PIPE, stdout=subprocess.PIPE, stderr=subprocess.PIPE,
             env=environment, **popen)
         self._errors = []
+        self._said = threading.Condition()
         self._readers = [threading.Thread(target=self._read_answers, args=(self.process.stdout,)),
                          threading.Thread(target=self._read_errors)]
         for reader in self._readers:
@@ -140,7 +141,15 @@ class Client(Connection):
 
     def _read_errors(self):
         for line in self.process.stderr:
-            self._errors.append(line.decode("utf-8", "backslashreplace"))
+            with self._said:
+                self._errors.append(line.decode("utf-8", "backslashreplace"))
+                self._said.notify_all()
+
+    def wait_for_error(self, is_meant):
+        """Returns once there is such a line; what is said before an answer is not read before it."""
+        with self._said:
+            if not self._said.wait_for(lambda: any(is_meant(line) for line in self._errors), timeout=PATIENCE):
+                raise AssertionError("not said: " + "".join(self._errors))
 
     def send_bytes(self, data):
         self.process.stdin.write(data)

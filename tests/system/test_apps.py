@@ -112,6 +112,9 @@ class AppsTest(SystemTest):
     def lines(self, level, text):
         return [line for line in self.host.error_text().splitlines() if re.search(rf" {level} (\[\w+\] )?{text}", line)]
 
+    def assert_said(self, level, text):
+        self.host.wait_for_error(lambda line: re.search(rf" {level} (\[\w+\] )?{text}", line))
+
 
 class EntriesTest(AppsTest):
     def test_an_application_appears_and_goes(self):
@@ -453,8 +456,8 @@ class ThumbnailsTest(AppsTest):
             self.assertEqual((side_of(of_png), side_of(of_svg)), (side, side))
             self.assertEqual((of_none, of_document, of_unknown), (None, None, None))
             self.finish()
-            self.assertTrue(self.lines("debug", "#org.unknown: can't get app proxy for org.unknown"))
-            self.assertTrue(self.lines("debug", "#org.none: can't get primary icon data; "))
+            self.assert_said("debug", "#org.unknown: can't get app proxy for org.unknown")
+            self.assert_said("debug", "#org.none: can't get primary icon data; ")
 
     def test_a_coarser_icon_does_where_there_is_no_finer(self):
         self.deploy("org.a", s96=png(96, 96, (9, 9, 9, 255)))
@@ -652,12 +655,12 @@ class CachesTest(AppsTest):
         with self.assertRaises(RpcError) as raised:
             views[0].catch_up()
         self.assertTrue(is_expired(raised.exception))
-        self.assertTrue(self.lines("info", "app-library version is greater than local version"))
+        self.assert_said("info", "app-library version is greater than local version")
         [again] = self.views(ROOT)
         self.wait_for_libraries(again, "org.a", "org.b")
         # The working set's list is newer than the main one's, which wins.
         self.wait_for_libraries(views[1], "org.a", "org.b")
-        self.assertTrue(self.lines("error", "version token shouldn't be greater than the main's cache version"))
+        self.assert_said("error", "version token shouldn't be greater than the main's cache version")
 
     def unprivileged(self):
         if os.geteuid() != 0:
@@ -680,8 +683,8 @@ class CachesTest(AppsTest):
         self.assertEqual(self.libraries(root), ["#org.a"])
         # It is told all the same; only the next process won't know.
         self.wait_for_libraries(everything, "org.a")
-        self.assertTrue(self.lines("error", "can't refresh app libraries; .*Permission denied"))
-        self.assertTrue(self.lines("error", "can't save working-set cache to disk; .*Permission denied"))
+        self.assert_said("error", "can't refresh app libraries; .*Permission denied")
+        self.assert_said("error", "can't save working-set cache to disk; .*Permission denied")
         os.chmod(os.path.dirname(self.main), 0o700)
         self.install("org.c")
         self.wait_for_libraries(root, "org.a", "org.b", "org.c")
@@ -701,8 +704,8 @@ class CachesTest(AppsTest):
         root, everything = self.views(ROOT, WORKING_SET)
         self.assertEqual(self.libraries(root), ["#org.a"])
         self.wait_for_libraries(everything, "org.a")
-        self.assertTrue(self.lines("error", "can't refresh app libraries; .*No space left on device"))
-        self.assertTrue(self.lines("error", "can't save working-set cache to disk; .*No space left on device"))
+        self.assert_said("error", "can't refresh app libraries; .*No space left on device")
+        self.assert_said("error", "can't save working-set cache to disk; .*No space left on device")
         self.finish()
         self.start()
         self.wait_for_libraries(self.views(ROOT)[0], "org.a", "org.b")
