@@ -124,7 +124,11 @@ int runServe(HostOptions options, const HostEnvironment& environment, TesselExte
     logInfo("serving {} at {}", (*host)->paths().real(), DaemonSocket::linkIn((*host)->state()));
     Daemon daemon(**host, manager);
     for (DaemonSocket& each : sockets) daemon.add(std::make_unique<SocketListener>(std::move(each)));
-    if (const auto added = addHttp(daemon, (*host)->options()); !added.ok()) return failWith(added.error());
+    if (const auto added = addHttp(daemon, (*host)->options()); !added.ok()) {
+        // Who has connected already looks again when the store is closed.
+        (void)takeOver((*host)->state());
+        return failWith(added.error());
+    }
     const auto served = daemon.run((*stopSignals)->descriptor(), [&] { (void)takeOver((*host)->state()); });
     // Held until the store is closed: until then, nobody else could use it.
     host->reset();

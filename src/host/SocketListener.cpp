@@ -20,7 +20,7 @@
 namespace cindral {
 namespace {
 
-// Where nothing can be had for another client, this long nobody is accepted.
+// Where nothing can be had for another client, nobody is accepted for so long, unless one of those that there are goes.
 constexpr std::chrono::seconds kRespite{1};
 // How long a client that is about to end by itself may go on after the end has begun.
 constexpr std::chrono::seconds kGrace{5};
@@ -143,8 +143,7 @@ void SocketListener::makeDoWithout() {
     if (turnedAway.ok()) return;
     const auto deadline = std::chrono::steady_clock::now() + kRespite;
     const MutexLock lock(mutex_);
-    while (!isStopping_ && changed_.waitUntil(mutex_, deadline)) {
-    }
+    if (!isStopping_) (void)changed_.waitUntil(mutex_, deadline);
 }
 
 /// Why a client is not served; null where it is.

@@ -121,6 +121,30 @@ class HostileClientsTest(SystemTest):
             self.assertEqual(client.next_notification("signal"), {"container": self.many})
         os.unlink(self.path("many", "new.txt"))
 
+    def test_where_descriptors_run_out_those_that_there_are_go_on(self):
+        other = os.path.join(self.folder, "other")
+        served = self.daemon(state=other, launcher=["sh", "-c", 'ulimit -n 64 && exec "$@"', "sh"])
+
+        def asked(client):
+            """Whether it is served: one that is turned away is not answered."""
+            try:
+                client.send("status")
+                return client.next_message() is not None
+            except OSError:
+                return False
+        clients = [self.connect(state=other)]
+        while asked(clients[-1]):
+            self.assertLess(len(clients), 64)
+            clients.append(self.connect(state=other))
+        self.assertGreater(len(clients), 10)
+        self.assertTrue(all(asked(client) for client in clients[:-1]))
+        for client in clients[-5:]:
+            client.close()
+        # As soon as the daemon has noticed.
+        while not asked(self.connect(state=other)):
+            self.assertTrue(asked(clients[0]))
+        self.assertEqual(served.stop(), 0)
+
     def test_nobody_else_is_let_in(self):
         path = os.path.join(self.state, "socket")
         self.assertEqual(stat.S_IMODE(os.stat(path).st_mode), 0o600)
