@@ -363,8 +363,29 @@ Result<void> takeCopyAway(const Folder& folder, const std::string& name, const U
     return kept->letGo();
 }
 
-Result<void> moveToOtherDevice(const Place& place, const Folder& folder, const std::string& name,
-                               TesselProgress& progress) {
+/// The name that something is to get; with bouncing, a free one where that is taken.
+struct WantedName {
+    std::string name;
+    NameKind kind = NameKind::document;
+    Bouncing bouncing = Bouncing::isRefused;
+};
+
+/// Calls `put` with the name, and with others while they are taken and that is no reason to refuse. The name that it got.
+template <typename Put>
+Result<std::string> putUnder(const WantedName& wanted, Put put) {
+    std::string name = wanted.name;
+    Result<void> done = put(name);
+    for (std::uint64_t number = 2; wanted.bouncing == Bouncing::isAllowed && !done.ok() && done.error().isPosix(EEXIST);
+         ++number) {
+        name = alternativeName(wanted.name, wanted.kind, number);
+        done = put(name);
+    }
+    if (!done.ok()) return done.error();
+    return name;
+}
+
+Result<std::string> moveToOtherDevice(const Place& place, const Folder& folder, const WantedName& wanted,
+                                      TesselProgress& progress) {
     const std::string path = place.path();
     if (place.status.isDirectory())
         TRY(checkTreeIsRemovable(place.folder.fd.get(), place.name.c_str(), path, progress));
@@ -377,26 +398,32 @@ Result<void> moveToOtherDevice(const Place& place, const Folder& folder, const s
                      Thoroughness::contents, &progress));
     TRY(progress.check());
     const UniqueFd built = TRY(sys::openat(staging->fd(), StagingFolder::kItemName, O_PATH | O_NOFOLLOW));
-    TRY(putInPlace(staging->fd(), StagingFolder::kItemName, folder, name));
+    std::string name = TRY(putUnder(wanted, [&](const std::string& one) {
+        return putInPlace(staging->fd(), StagingFolder::kItemName, folder, one);
+    }));
     // Also that it is there is to last, before the source goes. (By way of the staging folder, which lies on the same
     // file system: a handle alone can't be asked for that.)
     const Result<void> lasts = sys::syncfs(staging->fd());
     const Result<void> removed = lasts.ok() ? removeCopied(place, folder, name) : lasts;
-    if (removed.ok()) return {};
+    if (removed.ok()) return name;
     // The source is where it was: the copy goes again.
     const Result<void> undone = takeCopyAway(folder, name, built);
     if (!undone.ok()) logError("{} was left as a copy; {}", folder.pathOf(name), undone.error().description());
-    return removed;
+    return removed.error();
 }
 
-Result<void> moveOnce(const Place& place, const Folder& folder, const std::string& name, TesselProgress& progress) {
+/// The name that it got.
+Result<std::string> moveUnder(const WantedName& wanted, const Place& place, const Folder& folder,
+                              TesselProgress& progress) {
     const int from = place.folder.fd.get();
-    const Result<void> moved = takeOut(place.folder, place.name, place.handle, [&] {
-        return isTemporary(place) ? putInPlace(from, place.name.c_str(), folder, name)
-                                  : renameWithoutReplacing(from, place.name.c_str(), folder.fd.get(), name.c_str());
+    Result<std::string> moved = putUnder(wanted, [&](const std::string& name) {
+        return takeOut(place.folder, place.name, place.handle, [&] {
+            return isTemporary(place) ? putInPlace(from, place.name.c_str(), folder, name)
+                                      : renameWithoutReplacing(from, place.name.c_str(), folder.fd.get(), name.c_str());
+        });
     });
     if (moved.ok() || !moved.error().isPosix(EXDEV)) return moved;
-    return moveToOtherDevice(place, folder, name, progress);
+    return moveToOtherDevice(place, folder, wanted, progress);
 }
 
 /// Takes the entry out of sight, and then removes it. Once it is out of sight, it is deleted.
@@ -446,16 +473,11 @@ Result<Place> openRenamed(const MeantFile& file, const std::optional<std::string
 Result<KsURL> move(const Place& place, const Folder& target, const std::string& name, Bouncing bouncing,
                    TesselProgress& progress) {
     if (isSameObject(place.folder.status, target.status) && name == place.name) return KsURL::fileURL(place.path());
-    Result<void> moved = moveOnce(place, target, name, progress);
-    std::string given = name;
-    const NameKind kind =
-        bouncing == Bouncing::isAllowed ? nameKindOf(KsURL::fileURL(place.path())) : NameKind::document;
-    for (std::uint64_t number = 2; bouncing == Bouncing::isAllowed && !moved.ok() && moved.error().isPosix(EEXIST);
-         ++number) {
-        given = alternativeName(name, kind, number);
-        moved = moveOnce(place, target, given, progress);
-    }
-    return answer(moved, target, given, place.path());
+    const KsURL url = KsURL::fileURL(place.path());
+    const WantedName wanted{name, bouncing == Bouncing::isAllowed ? nameKindOf(url) : NameKind::document, bouncing};
+    const Result<std::string> moved = moveUnder(wanted, place, target, progress);
+    if (!moved.ok()) return answer(moved.error(), target, name, place.path());
+    return KsURL::fileURL(target.pathOf(*moved));
 }
 
 }  // namespace

@@ -16,6 +16,7 @@
 #include <fstream>
 #include <optional>
 #include <thread>
+#include <utility>
 #include <vector>
 
 #include "platform/foundation/Dispatch.h"
@@ -34,6 +35,7 @@ namespace {
 namespace fs = std::filesystem;
 using file_operations::createSubFolder;
 using file_operations::importUnderFolder;
+using file_operations::makeFolderUnlessThere;
 using file_operations::remove;
 using file_operations::rename;
 using file_operations::reparent;
@@ -73,6 +75,7 @@ protected:
     void prepare() {
         for (const auto& entry : fs::directory_iterator(storage_)) fs::remove_all(entry.path());
         folder("target");
+        folder("empty");
         makeTree(path("tree"));
         const timespec then[2] = {{1, 2}, {3, 4}};
         for (const auto& [name, contents] : {std::pair("a.txt", "A"), std::pair("target/taken", "T")})
@@ -97,18 +100,23 @@ protected:
             return remove({url(name), identityOf(name)}, progress, certainty);
         };
         return {
+            {"makeFolderUnlessThere", [=, this] { return makeFolderUnlessThere(url("target/.Trash")); }},
+            {"leaveFolderThatIsThere", [=, this] { return makeFolderUnlessThere(url("target")); }},
             {"createSubFolder", [=, this] { return done(createSubFolder(url("target"), "new")); }},
             {"rename", [=, this] { return done(rename(url("a.txt"), "b.txt")); }},
             {"move", [=] { return move("tree", std::nullopt, Bouncing::isRefused); }},
-            {"bounce", [=] { return move("a.txt", "taken", Bouncing::isRefused); }},
+            {"collide", [=] { return move("a.txt", "taken", Bouncing::isRefused); }},
+            {"bounce", [=] { return move("a.txt", "taken", Bouncing::isAllowed); }},
             {"trash", [=, this] { return done(trash(url("a.txt"), url("target"))); }},
             {"deleteFile", [=] { return deletion("a.txt", Certainty::isNotWanted); }},
             {"deleteWithCertainty", [=] { return deletion("a.txt", Certainty::isWanted); }, false, true},
+            {"deleteEmptyFolder", [=] { return deletion("empty", Certainty::isNotWanted); }},
             {"deleteFolder", [=] { return deletion("tree", Certainty::isNotWanted); }, false, true},
             {"importFile", [=] { return import("source/file"); }},
             {"importFolder", [=] { return import("source"); }},
             {"importLink", [=] { return import("source/link"); }},
             {"moveFileToOtherDevice", [=] { return move("a.txt", std::nullopt, Bouncing::isRefused); }, true},
+            {"bounceOnOtherDevice", [=] { return move("a.txt", "taken", Bouncing::isAllowed); }, true},
             {"moveFolderToOtherDevice", [=] { return move("tree", std::nullopt, Bouncing::isRefused); }, true},
         };
     }
@@ -301,8 +309,8 @@ TEST_F(FileOperationsTest, noLinkLeadsOutside) {
         EXPECT_NE(errorOf(rename(url(way + "/a"), "b")), "");
         EXPECT_NE(errorOf(remove(url(way + "/a"), progress_)), "");
         EXPECT_NE(errorOf(trash(url(way + "/a"), url("target"))), "");
-        EXPECT_NE(errorOf(file_operations::makeFolderUnlessThere(url(way))), "");
-        EXPECT_NE(errorOf(file_operations::makeFolderUnlessThere(url(way + "/.Trash"))), "");
+        EXPECT_NE(errorOf(makeFolderUnlessThere(url(way))), "");
+        EXPECT_NE(errorOf(makeFolderUnlessThere(url(way + "/.Trash"))), "");
     }
     EXPECT_EQ(snapshot(), before);
     // The link itself can be renamed and deleted: it is an item.
@@ -818,6 +826,32 @@ TEST_F(FileOperationsTest, aMoveToAnotherDeviceThatClashesLeavesTheSource) {
     EXPECT_THAT(leftovers(), IsEmpty());
 }
 
+// However many names are taken, it is copied once.
+TEST_F(FileOperationsTest, bouncesOnAnotherDeviceWithoutCopyingAnew) {
+    for (const bool isFolder : {true, false}) {
+        makeTree(path("tree"));
+        const std::string subject = isFolder ? "tree" : "tree/file";
+        const std::string name = isFolder ? "tree" : "file";
+        const TreeSnapshot source = snapshotOf(path("tree"));
+        for (const char* number : {"", " 2", " 3"}) folder("target/" + name + number);
+        TesselProgress progress;
+        {
+            const sys::FaultInjection faults(onAnotherDevice());
+            ASSERT_EQ(*reparent(url(subject), url("target"), std::nullopt, Bouncing::isAllowed, progress),
+                      url("target/" + name + " 4"));
+        }
+        const auto counts = progress.counts();
+        EXPECT_EQ(counts.completedBytes, counts.totalBytes);
+        EXPECT_EQ(counts.completedItems, counts.totalItems);
+        if (isFolder) {
+            EXPECT_EQ(snapshotOf(path("target/tree 4")), source);
+        }
+        EXPECT_FALSE(fs::exists(path(subject)));
+        EXPECT_THAT(leftovers(), IsEmpty());
+        fs::remove_all(path("tree"));
+    }
+}
+
 // When the power fails, the copy is where it belongs before the source is gone.
 TEST_F(FileOperationsTest, aMoveToAnotherDeviceLastsBeforeTheSourceGoes) {
     makeTree(path("tree"));
@@ -1005,6 +1039,37 @@ TEST_F(FaultTest, everyKillLeavesAllOrNothing) {
     }
 }
 
+// Another program puts its file in the place of what is deleted, and then the process is killed.
+TEST_F(FaultTest, aKillNeverLosesWhatWasSwappedIn) {
+    bool isReached = true;
+    for (int n = 1; isReached; ++n) {
+        prepare();
+        file("swapped", "not meant");
+        const MeantFile meant(url("a.txt"), identityOf("a.txt"));
+        const pid_t child = ::fork();
+        if (child == 0) {
+            const sys::FaultInjection faults([&, calls = 0, isSwapped = false](const char* call) mutable {
+                // At the last moment: after the last look, before the rename that takes it out of sight.
+                if (std::string_view(call) == "renameat2" && !std::exchange(isSwapped, true))
+                    fs::rename(path("swapped"), path("a.txt"));
+                if (++calls == n) ::kill(::getpid(), SIGKILL);
+                return 0;
+            });
+            TesselProgress progress;
+            (void)remove(meant, progress, Certainty::isWanted);
+            ::_exit(0);
+        }
+        int status = 0;
+        ASSERT_EQ(::waitpid(child, &status, 0), child);
+        isReached = WIFSIGNALED(status);
+        removeAbandoned();
+        int found = 0;
+        for (const auto& entry : fs::recursive_directory_iterator(storage_))
+            found += entry.is_regular_file() && contentsOf(entry.path()) == "not meant" ? 1 : 0;
+        ASSERT_EQ(found, 1) << n;
+    }
+}
+
 // A person's own folders that may not be written, or not even be read by their owner, are no reason to leave them there.
 TEST_F(FileOperationsTest, whatIsLeftBehindGoesWhateverItsModes) {
     const std::string left = ".TemporaryLocalFolder/.staging-1-1/item";
@@ -1114,7 +1179,7 @@ TEST_F(FileOperationsTest, twoThatWantTheSameNamesOverwriteNothing) {
             const KsURL from = next(2) == 0 ? url("here") : url("target");
             switch (next(4)) {
                 case 0: {
-                    // A folder with one of its own inside, so that what was taken over would be missed.
+                    // An empty one, which a rename that replaces takes over without a word: it would be missed.
                     const auto folder = createSubFolder(from, name());
                     made[who] += folder.ok() ? 1 : 0;
                     break;
@@ -1198,7 +1263,7 @@ TEST_F(FileOperationsTest, noSwappedFolderLeadsOutside) {
         (void)remove(url("door/sub"), progress);
         (void)remove(url("door/new" + std::to_string(i)), progress);
         (void)importUnderFolder(url("target/taken"), url("door"), progress);
-        (void)file_operations::makeFolderUnlessThere(url("door/.Trash"));
+        (void)makeFolderUnlessThere(url("door/.Trash"));
         (void)trash(url("door/a"), url("door/.Trash"));
         (void)reparent(url("door/.Trash/a"), url("door"), std::nullopt, Bouncing::isRefused, progress);
     }
