@@ -13,6 +13,8 @@ let context;
 let page;
 let complaints;
 
+// High enough for the folders of all tests.
+const SIZE = { width: 1100, height: 1500 };
 // A picture of one dot.
 const PNG = Buffer.from('iVBORw0KGgoAAAANSUhEUgAAAAEAAAABCAYAAAAfFcSJAAAADUlEQVR42mNk+M9QDwADhgGAWjR9awAAAABJRU5ErkJggg==', 'base64');
 const PDF = ['%PDF-1.4', '1 0 obj<</Type/Catalog/Pages 2 0 R>>endobj', '2 0 obj<</Type/Pages/Kids[3 0 R]/Count 1>>endobj',
@@ -25,7 +27,7 @@ before(async () => {
   storage.addApplication('org.example.Sketch', 'Sketch');
   daemon = await Daemon.start(storage);
   browser = await launch();
-  context = await browser.newContext({ viewport: { width: 1100, height: 700 }, acceptDownloads: true, reducedMotion: 'reduce' });
+  context = await browser.newContext({ viewport: SIZE, acceptDownloads: true, reducedMotion: 'reduce' });
   context.setDefaultTimeout(PATIENCE);
   page = await context.newPage();
   complaints = watchPage(page, daemon.origin);
@@ -146,7 +148,7 @@ test('no view has anything that keeps somebody out', async () => {
   await page.setViewportSize({ width: 320, height: 640 });
   await noViolations('320 pixels');
   assert.ok(await page.evaluate(() => document.documentElement.scrollWidth <= 320), 'nothing is cut off');
-  await page.setViewportSize({ width: 1100, height: 700 });
+  await page.setViewportSize(SIZE);
   for (const place of ['Recents', 'Favourites', 'Trash', 'Sketch']) {
     await goTo(place);
     await page.getByRole('heading', { level: 1, name: place }).waitFor();
