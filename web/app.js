@@ -264,7 +264,22 @@ function drawState(text = null, retry = null) {
 
 // MARK: Places
 
+let anchor = null;
+
+// A listing says which libraries there were when somebody last asked for changes.
+async function takeUpLibraries() {
+  for (let moreComing = anchor !== null; moreComing;) {
+    try {
+      ({ anchor, moreComing } = await call('enumerateChanges', { container: ROOT, anchor }));
+    } catch {
+      break; // Expired: the next one begins with now.
+    }
+  }
+  ({ anchor } = await call('currentSyncAnchor', { container: ROOT }));
+}
+
 async function readPlaces() {
+  await takeUpLibraries();
   const [listing, tags] = await Promise.all([
     call('enumerateItems', { container: ROOT }), call('tags').catch(() => ({ tags: [] }))]);
   knownTags = tags.tags.map(({ tag }) => tag);
@@ -307,22 +322,27 @@ function may(bit) {
   return items.length > 0 && items.every((item) => item.capabilities & bit);
 }
 
+// `isThere` says in which views a command stands in the bar; whether it can be used now is said by `when`. So the bar stays as
+// it is while items are chosen, and nothing moves under the pointer.
+const notInTrash = () => view?.kind !== 'trash';
+const inTrash = () => view?.kind === 'trash';
+
 const commands = {
   open: { label: 'Open', when: () => chosen().length === 1, run: () => open(chosen()[0]) },
-  newFolder: { label: 'New folder', always: true, when: mayWriteHere, run: newFolder },
-  upload: { label: 'Upload', always: true, when: mayWriteHere, run: () => files.click() },
-  uploadFolder: { label: 'Upload folder', always: true, when: mayWriteHere, run: () => folders.click() },
-  download: { label: 'Download', when: () => chosen().length > 0 && chosen().every((item) => item.documentSize !== undefined && !format.isFolder(item)), run: () => chosen().forEach(download) },
-  rename: { label: 'Rename', when: () => chosen().length === 1 && may(CAN.rename) && view.kind !== 'trash', run: () => rows.edit(chosen()[0]) },
-  move: { label: 'Move…', when: () => may(CAN.move) && view.kind !== 'trash', run: moveByDialog },
-  copy: { label: 'Copy…', when: () => chosen().length > 0 && view.kind !== 'trash', run: copyByDialog },
-  tags: { label: 'Tags…', when: () => chosen().length > 0 && view.kind !== 'trash', run: changeTags },
-  favorite: { label: 'Favourite', when: () => chosen().length > 0 && view.kind !== 'trash', run: toggleFavorite },
-  trash: { label: 'Move to trash', when: () => may(CAN.trash) && view.kind !== 'trash', run: () => work.trash(chosen()) },
-  putBack: { label: 'Put back', when: () => view?.kind === 'trash' && chosen().length > 0, run: () => work.putBack(chosen()) },
-  delete: { label: 'Delete…', when: () => view?.kind === 'trash' && may(CAN.delete), run: deleteChosen },
-  information: { label: 'Information', always: true, when: () => true, run: toggleInformation, isPressed: () => !information.hidden },
-  layout: { label: 'Icons', always: true, when: () => true, run: toggleLayout, isPressed: () => settings.layout === 'icons' },
+  newFolder: { label: 'New folder', isThere: mayWriteHere, when: mayWriteHere, run: newFolder },
+  upload: { label: 'Upload', isThere: mayWriteHere, when: mayWriteHere, run: () => files.click() },
+  uploadFolder: { label: 'Upload folder', isThere: mayWriteHere, when: mayWriteHere, run: () => folders.click() },
+  download: { label: 'Download', isThere: notInTrash, when: () => chosen().length > 0 && chosen().every((item) => item.documentSize !== undefined && !format.isFolder(item)), run: () => chosen().forEach(download) },
+  rename: { label: 'Rename', isThere: notInTrash, when: () => chosen().length === 1 && may(CAN.rename) && view.kind !== 'trash', run: () => rows.edit(chosen()[0]) },
+  move: { label: 'Move…', isThere: notInTrash, when: () => may(CAN.move) && view.kind !== 'trash', run: moveByDialog },
+  copy: { label: 'Copy…', isThere: notInTrash, when: () => chosen().length > 0 && view.kind !== 'trash', run: copyByDialog },
+  tags: { label: 'Tags…', isThere: notInTrash, when: () => chosen().length > 0 && view.kind !== 'trash', run: changeTags },
+  favorite: { label: 'Favourite', isThere: notInTrash, when: () => chosen().length > 0 && view.kind !== 'trash', run: toggleFavorite },
+  trash: { label: 'Move to trash', isThere: notInTrash, when: () => may(CAN.trash) && view.kind !== 'trash', run: () => work.trash(chosen()) },
+  putBack: { label: 'Put back', isThere: inTrash, when: () => view?.kind === 'trash' && chosen().length > 0, run: () => work.putBack(chosen()) },
+  delete: { label: 'Delete…', isThere: inTrash, when: () => view?.kind === 'trash' && may(CAN.delete), run: deleteChosen },
+  information: { label: 'Information', when: () => true, run: toggleInformation, isPressed: () => !information.hidden },
+  layout: { label: 'Icons', when: () => true, run: toggleLayout, isPressed: () => settings.layout === 'icons' },
 };
 
 const toolButtons = new Map(Object.entries(commands).map(([name, command]) => [name,
@@ -343,9 +363,8 @@ function drawSelection() {
   if (!view) return;
   for (const [name, command] of Object.entries(commands)) {
     const element = toolButtons.get(name);
-    const isThere = command.when();
-    element.hidden = !isThere && !command.always;
-    element.disabled = !isThere;
+    element.hidden = command.isThere !== undefined && !command.isThere();
+    element.disabled = !command.when();
     if (command.isPressed) element.setAttribute('aria-pressed', command.isPressed());
   }
   const favorites = chosen();
@@ -487,7 +506,7 @@ function showMenu(x, y) {
     else return;
     event.preventDefault();
   });
-  document.body.append(menu);
+  app.querySelector('main').append(menu);
   menu.style.left = `${Math.min(x, innerWidth - menu.offsetWidth - 4)}px`;
   menu.style.top = `${Math.min(y, innerHeight - menu.offsetHeight - 4)}px`;
   menu.firstChild?.focus();

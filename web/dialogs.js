@@ -77,7 +77,7 @@ export function askFolder(title, yes, start) {
         let page = null;
         do {
           const answer = await call('enumerateItems', { container: identifier, ...(page ? { page } : {}) });
-          folders.push(...answer.items.filter((item) => format.isFolder(item) && (identifier !== ROOT || item.parentIdentifier === ROOT)));
+          folders.push(...answer.items.filter((item) => format.isFolder(item) && (identifier !== ROOT || (item.parentIdentifier === ROOT && item.filename !== '.TemporaryLocalFolder'))));
           page = answer.nextPage;
         } while (page);
         folders.sort((a, b) => format.collator.compare(a.filename, b.filename));

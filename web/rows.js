@@ -239,10 +239,12 @@ export class Rows {
         this.scroller.scrollTop += lines * this.#lineHeight;
       }
     }
-    for (const identifier of this.selected.keys()) {
-      const element = this.elements.get(identifier);
-      // What is out of sight may be anywhere; what was in sight and is no more is gone.
-      if (element && !places.has(identifier) && seen.some(([each]) => each === identifier)) this.selected.delete(identifier);
+    // What is out of sight may be anywhere; what was in sight and is no more is gone.
+    for (const [identifier, index] of seen) {
+      if (places.has(identifier)) continue;
+      this.selected.delete(identifier);
+      // The keyboard goes on from where it was.
+      if (this.current === identifier) this.current = source.get(Math.min(index, source.total - 1))?.identifier ?? null;
     }
     if (this.editing && !places.has(this.editing.identifier)) this.editing.isAlone = true;
     this.draw();

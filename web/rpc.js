@@ -26,6 +26,7 @@ let token = null;
 let lastRequest = 0;
 let stream = null;
 let connection = null;
+let wasConnected = false;
 const progressOf = new Map();
 const listeners = { signal: new Set(), queryChanged: new Set(), connected: new Set(), lost: new Set() };
 
@@ -65,7 +66,9 @@ function openStream() {
     if (isFirst) arrived(name);
     else connection = Promise.resolve(name);
     isFirst = false;
-    tell('connected', name);
+    // The page as it begins asks for what it follows by itself.
+    if (wasConnected) tell('connected', name);
+    wasConnected = true;
   });
   stream.onmessage = (event) => {
     const { method, params } = JSON.parse(event.data);

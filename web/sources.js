@@ -4,6 +4,8 @@ import { call, listen, ROOT } from './rpc.js';
 import { collator, kind, isFolder } from './format.js';
 
 const PAGE = 200;
+// Where the provider builds what is not to be seen before it is whole.
+const isWorkshop = (item) => item.filename === '.TemporaryLocalFolder' && item.parentIdentifier === ROOT;
 
 class Source {
   constructor() {
@@ -48,6 +50,19 @@ export class SortedSource extends Source {
     this.pages = new Map();
     this.loading = new Map();
     this.generation = 0;
+    this.known = 0; // Items that the host counts.
+    this.left = null; // Index of the one that is left out, once it was met.
+  }
+
+  get total() { return this.known - (this.left === null ? 0 : 1); }
+
+  set total(value) { this.known = value; }
+
+  #take(page, items) {
+    this.pages.set(page, items);
+    if (this.container !== ROOT) return;
+    const found = items.findIndex(isWorkshop);
+    if (found >= 0) this.left = page * PAGE + found;
   }
 
   async open() {
@@ -57,14 +72,15 @@ export class SortedSource extends Source {
   }
 
   get(index) {
-    return this.pages.get(Math.floor(index / PAGE))?.[index % PAGE];
+    const place = this.left !== null && index >= this.left ? index + 1 : index;
+    return this.pages.get(Math.floor(place / PAGE))?.[place % PAGE];
   }
 
   // Makes rows from `first` to `last` known; false where they were.
   async load(first, last) {
     const wanted = [];
-    for (let page = Math.floor(first / PAGE); page <= Math.floor(last / PAGE); page += 1) {
-      if (!this.pages.has(page) && page * PAGE < Math.max(this.total, 1)) wanted.push(this.#fetch(page));
+    for (let page = Math.floor(first / PAGE); page <= Math.floor((last + 1) / PAGE); page += 1) {
+      if (!this.pages.has(page) && page * PAGE < Math.max(this.known, 1)) wanted.push(this.#fetch(page));
     }
     await Promise.all(wanted);
     return wanted.length > 0;
@@ -81,7 +97,10 @@ export class SortedSource extends Source {
     const generation = this.generation;
     await Promise.all([...fresh.keys()].map(async (page) => { fresh.set(page, await this.#ask(page)); }));
     if (generation !== this.generation) return;
-    this.pages = new Map([...fresh].map(([page, answer]) => [page, answer.items]));
+    const wasLeft = this.left !== null && this.pages.get(Math.floor(this.left / PAGE));
+    if (wasLeft && fresh.has(Math.floor(this.left / PAGE))) this.left = null;
+    this.pages = new Map();
+    for (const [page, answer] of fresh) this.#take(page, answer.items);
     this.total = fresh.get(from).total;
   }
 
@@ -96,7 +115,7 @@ export class SortedSource extends Source {
     const { generation } = this;
     const loading = this.#ask(page).then((answer) => {
       if (generation !== this.generation) return;
-      this.pages.set(page, answer.items);
+      this.#take(page, answer.items);
       this.total = answer.total;
       this.isComplete = true;
     }).finally(() => this.loading.delete(page));

@@ -13,6 +13,8 @@ let context;
 let page;
 let complaints;
 
+// High enough for the folders of all tests.
+const SIZE = { width: 1100, height: 1500 };
 // A picture of one dot.
 const PNG = Buffer.from('iVBORw0KGgoAAAANSUhEUgAAAAEAAAABCAYAAAAfFcSJAAAADUlEQVR42mNk+M9QDwADhgGAWjR9awAAAABJRU5ErkJggg==', 'base64');
 const PDF = ['%PDF-1.4', '1 0 obj<</Type/Catalog/Pages 2 0 R>>endobj', '2 0 obj<</Type/Pages/Kids[3 0 R]/Count 1>>endobj',
@@ -25,7 +27,7 @@ before(async () => {
   storage.addApplication('org.example.Sketch', 'Sketch');
   daemon = await Daemon.start(storage);
   browser = await launch();
-  context = await browser.newContext({ viewport: { width: 1100, height: 700 }, acceptDownloads: true, reducedMotion: 'reduce' });
+  context = await browser.newContext({ viewport: SIZE, acceptDownloads: true, reducedMotion: 'reduce' });
   context.setDefaultTimeout(PATIENCE);
   page = await context.newPage();
   complaints = watchPage(page, daemon.origin);
@@ -110,10 +112,10 @@ test('a list has its rows in the natural order of names, and in others', async (
   await openHere(['älter.txt', 'Scan 9.txt', 'Scan 10.txt', 'Zoo.txt']);
   assert.deepEqual(await shownNames(), ['älter.txt', 'Scan 9.txt', 'Scan 10.txt', 'Zoo.txt']);
   assert.equal(await page.getByRole('grid').getAttribute('aria-rowcount'), '5');
-  await page.getByRole('button', { name: 'Size' }).click();
+  await page.getByRole('button', { name: 'Size', exact: true }).click();
   await until('the biggest is first', async () => (await shownNames())[0] === 'Scan 9.txt');
   assert.equal(await page.getByRole('columnheader', { name: 'Size' }).getAttribute('aria-sort'), 'descending');
-  await page.getByRole('button', { name: 'Name' }).click();
+  await page.getByRole('button', { name: 'Name', exact: true }).click();
   await until('names again', async () => (await shownNames())[0] === 'älter.txt');
 });
 
@@ -146,7 +148,7 @@ test('no view has anything that keeps somebody out', async () => {
   await page.setViewportSize({ width: 320, height: 640 });
   await noViolations('320 pixels');
   assert.ok(await page.evaluate(() => document.documentElement.scrollWidth <= 320), 'nothing is cut off');
-  await page.setViewportSize({ width: 1100, height: 700 });
+  await page.setViewportSize(SIZE);
   for (const place of ['Recents', 'Favourites', 'Trash', 'Sketch']) {
     await goTo(place);
     await page.getByRole('heading', { level: 1, name: place }).waitFor();
@@ -158,7 +160,6 @@ test('an application is a place with its documents', async () => {
   fs.writeFileSync(path.join(storage.folder, 'data', 'org.example.Sketch', 'Documents', 'drawing.txt'), '');
   await goTo('Sketch');
   await row('drawing.txt').waitFor();
-  fs.writeFileSync(path.join(storage.applications, 'org.example.Later.desktop'), '');
   storage.addApplication('org.example.Later', 'Later');
   await page.getByRole('navigation', { name: 'Places' }).getByRole('button', { name: 'Later' }).waitFor();
 });
@@ -427,11 +428,12 @@ test('a name that is taken is asked about: keep both, replace, skip, for all', a
 
 test('long work shows how far it is, and is cancelled', async () => {
   await openHere();
-  // A body that is not read to its end until somebody lets it: the network is slow for this one.
+  const outside = path.join(storage.folder, 'long.bin');
+  fs.writeFileSync(outside, Buffer.alloc(4_000_000));
   const client = await context.newCDPSession(page);
   await client.send('Network.enable');
   await client.send('Network.emulateNetworkConditions', { offline: false, latency: 0, downloadThroughput: -1, uploadThroughput: 20_000 });
-  await page.locator('#files').setInputFiles({ name: 'long.bin', mimeType: 'application/octet-stream', buffer: Buffer.alloc(4_000_000) });
+  await page.locator('#files').setInputFiles(outside);
   await page.getByRole('progressbar').waitFor();
   await page.getByRole('button', { name: 'Cancel: Upload' }).click();
   await page.getByRole('progressbar').waitFor({ state: 'detached' });
