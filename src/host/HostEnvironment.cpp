@@ -112,8 +112,11 @@ HostEnvironment HostEnvironment::ofProcess() {
         const char* value = std::getenv(name);
         return value != nullptr ? std::optional<std::string>(value) : std::nullopt;
     };
+    // Asking the account database takes as long as a small command; it is for a process that was started without HOME.
+    const bool hasHome = lookup("HOME").value_or("").starts_with('/');
     std::error_code error;
-    return from(lookup, accountHome(), std::filesystem::current_path(error).string(), ::isatty(STDOUT_FILENO) == 1);
+    return from(lookup, hasHome ? "" : accountHome(), std::filesystem::current_path(error).string(),
+                ::isatty(STDOUT_FILENO) == 1);
 }
 
 std::optional<std::string> documentsFolderFrom(std::string_view userDirectories, std::string_view home) {
