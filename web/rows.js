@@ -353,7 +353,7 @@ export class Rows {
     else if (event.key === 'Home') this.#goTo(0, { extends: event.shiftKey });
     else if (event.key === 'End') this.#goTo(this.source.total - 1, { extends: event.shiftKey });
     else if (event.key === ' ' && event.ctrlKey && at >= 0) this.toggle(this.source.get(at));
-    else if (event.key.length === 1 && !event.ctrlKey && event.key !== ' ' && event.key !== '/' && /\S/.test(event.key)) this.#typeAhead(event.key);
+    else if (event.key.length === 1 && !event.ctrlKey && event.key !== '/' && event.key !== '?' && (event.key !== ' ' || this.typed)) this.#typeAhead(event.key);
     else return;
     event.preventDefault();
   }
