@@ -8,7 +8,7 @@ import * as format from './format.js';
 import { fileAddress } from './rpc.js';
 
 const ROW = 40;
-const CELL = { width: 132, height: 140 };
+const CELL = { width: 132, height: 156 };
 const MARGIN = 6; // Rows beyond what is seen.
 const PICTURE_BYTES_MAX = 8e6;
 
@@ -206,7 +206,7 @@ export class Rows {
   }
 
   #picture(item) {
-    if (item.isAppLibrary) return h('img', { class: 'icon', src: `/thumbnail/${encodeURIComponent(item.identifier)}?size=128`, alt: '', draggable: false });
+    if (item.isAppLibrary) return h('img', { class: 'icon', src: `/thumbnail/${encodeURIComponent(item.identifier)}?size=128`, alt: '', draggable: false, onerror: (event) => event.target.replaceWith(icon('app')) });
     const isSmall = (item.documentSize ?? 0) > 0 && item.documentSize < PICTURE_BYTES_MAX;
     if (this.layout === 'icons' && isSmall && /^image\/(png|jpeg|gif|webp|bmp|avif|svg\+xml)$/.test(item.typeIdentifier)) {
       return h('img', { class: 'icon picture', src: fileAddress(item), alt: '', loading: 'lazy', draggable: false, onerror: (event) => event.target.replaceWith(icon('image')) });
