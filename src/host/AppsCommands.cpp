@@ -64,10 +64,14 @@ std::string textOf(const InstalledApplication& application, std::size_t width) {
                            (why.empty() ? "" : fmt::format(" ({})", terminalText(why))));
 }
 
-void list(const std::vector<InstalledApplication>& applications, bool json, TextOutput& output) {
+void list(const std::vector<InstalledApplication>& applications, const HostOptions& options, TextOutput& output) {
+    if (options.endsWithNul) {
+        for (const auto& each : applications) output.line(each.record->bundleIdentifier());
+        return;
+    }
     std::size_t width = 0;
     for (const auto& each : applications) width = std::max(width, terminalText(each.record->bundleIdentifier()).size());
-    for (const auto& each : applications) output.line(json ? jsonOf(each) : textOf(each, width));
+    for (const auto& each : applications) output.line(options.json ? jsonOf(each) : textOf(each, width));
 }
 
 /// The application of a look, or null.
@@ -121,7 +125,7 @@ Result<void> choose(const RosterSources& sources, const std::string& identifier,
 Result<void> runAppsCommand(const HostOptions& options, const HostEnvironment& environment, TextOutput& output) {
     const RosterSources sources = rosterSources(options, environment);
     if (options.command == HostCommand::apps) {
-        list(RosterScanner(sources).scan().applications, options.json, output);
+        list(RosterScanner(sources).scan().applications, options, output);
         return {};
     }
     const auto choice = options.command == HostCommand::appsEnable ? PersonalChoices::Choice::enabled

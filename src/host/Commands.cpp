@@ -117,6 +117,8 @@ Result<std::shared_ptr<const TesselItem>> Commands::item() const {
 void Commands::printItem(const TesselItem& item) {
     if (context_.options.json) {
         ItemWriter(context_.paths).append(output_.buffer(), item);
+    } else if (context_.options.endsWithNul) {
+        appendBareName(output_.buffer(), item, context_.paths);
     } else {
         text_.appendLine(output_.buffer(), item);
     }
@@ -124,6 +126,7 @@ void Commands::printItem(const TesselItem& item) {
 }
 
 void Commands::printValue(std::string_view key, const std::string& value) {
+    if (context_.options.endsWithNul) return output_.line(value);
     output_.line(context_.options.json ? fmt::format("{{{}:{}}}", jsonString(key), jsonString(value))
                                        : terminalText(value));
 }
@@ -150,7 +153,9 @@ Result<void> Commands::list() {
 Result<void> Commands::tree() {
     const TesselItemIdentifier container = TRY(identifier());
     TreePrinter::Options options;
-    options.json = context_.options.json;
+    options.form = context_.options.json          ? TreePrinter::Form::json
+                   : context_.options.endsWithNul ? TreePrinter::Form::bareNames
+                                                  : TreePrinter::Form::drawing;
     options.intoPackages = context_.options.intoPackages;
     options.title = terminalText(context_.paths.real());
     if (!isManyFolders(container)) {

@@ -371,6 +371,10 @@ Result<void> EditCommands::printTags(const std::string& word) {
     const auto named = TRY(item(word));
     if (context_.options.json) return print(word, named);
     for (const std::string& label : named->tags().value_or(std::vector<std::string>())) {
+        if (context_.options.endsWithNul) {
+            output_.line(label);
+            continue;
+        }
         if (options_.words.size() > 1) output_.buffer() += terminalText(word) + "  ";
         output_.line(terminalText(label));
     }

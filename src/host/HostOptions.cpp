@@ -8,6 +8,7 @@
 #include "host/HostError.h"
 #include "host/HostVersion.h"
 #include "host/PresentedPaths.h"
+#include "host/ShellTexts.h"
 #include "host/TerminalText.h"
 
 namespace cindral {
@@ -34,6 +35,7 @@ struct Words {
     bool noFlatpak = false;
     bool desktopTags = false;
     bool json = false;
+    bool endsWithNul = false;
     bool intoPackages = false;
     std::string since;
     std::string outputFile;
@@ -89,6 +91,37 @@ constexpr CommandDescription kAppsCommands[] = {
     {"disable", "Don't publish an application's documents.", HostCommand::appsDisable, Argument::application},
 };
 
+/// What commands are for, in the order in which they are shown.
+struct CommandGroup {
+    const char* name;
+    std::vector<std::string_view> commands;
+};
+constexpr const char* kOtherCommands = "More";
+
+const std::vector<CommandGroup>& commandGroups() {
+    static const std::vector<CommandGroup> kGroups = {
+        {"Look", {"ls", "tree", "info", "url", "id", "tags", "thumbnail", "apps"}},
+        {"Search", {"find", "recents", "tagged", "favorites"}},
+        {"Follow", {"anchor", "changes", "watch"}},
+        {"Edit", {"import", "mkdir", "rename", "mv", "rm"}},
+        {"Throw away", {"trash", "restore", "empty-trash"}},
+        {"Label", {"tag", "untag", "favorite", "unfavorite", "touch-used"}},
+        {"Connect", {"serve", "rpc", "status"}},
+    };
+    return kGroups;
+}
+
+std::string groupOf(const std::string& command) {
+    for (const CommandGroup& group : commandGroups()) {
+        if (std::ranges::find(group.commands, command) != group.commands.end()) return group.name;
+    }
+    return kOtherCommands;
+}
+
+/// Those whose output is a list of items or names.
+constexpr const char* kListCommands[] = {"ls",     "tree",      "url",   "id",   "find", "recents",
+                                         "tagged", "favorites", "trash", "tags", "apps"};
+
 RecorderChoice recorderOf(const std::string& name) {
     if (name == "inotify") return RecorderChoice::inotify;
     return name == "fanotify" ? RecorderChoice::fanotify : RecorderChoice::automatic;
@@ -119,7 +152,7 @@ void addOptions(CLI::App& app, Words& words) {
         ->take_all();
     app.add_flag("--no-flatpak", words.noFlatpak, "Leave Flatpak's applications out.");
     app.add_flag("--desktop-tags", words.desktopTags, "Share tags with file managers that keep them in user.xdg.tags.");
-    app.add_option("--recorder", words.recorder, "How events are recorded: inotify, fanotify or auto (the default).")
+    app.add_option("--recorder", words.recorder, "How events are recorded: inotify, fanotify or auto (default).")
         ->type_name("HOW")
         ->check(CLI::IsMember({"inotify", "fanotify", "auto"}));
     app.add_flag("--json", words.json, "Write JSON to standard output, one value a line for lists.");
@@ -200,6 +233,17 @@ void addCommands(CLI::App& app, Words& words) {
     }
 }
 
+/// The library takes what a callback throws for what is to be said instead of working.
+void addShellTexts(CLI::App& app) {
+    const auto say = [](const std::string& text) { throw CLI::CallForVersion(text, kExitDone); };
+    // They are for who builds and packs the program, not for its manual.
+    app.add_flag_callback("--manual", [&app, say] { say(manualText(app, std::string(hostVersion()))); })->group("");
+    app.add_option_function<std::string>("--completion",
+                                         [&app, say](const std::string& shell) { say(completionText(app, shell)); })
+        ->check(CLI::IsMember(std::vector<std::string>(std::begin(kCompletionShells), std::end(kCompletionShells))))
+        ->group("");
+}
+
 /// The innermost command that was named.
 const CLI::App& chosenApp(const CLI::App& app) {
     const CLI::App* chosen = app.get_subcommands().front();
@@ -271,6 +315,7 @@ HostOptions optionsOf(const CLI::App& app, const Words& words, const HostEnviron
     options.flatpak = !words.noFlatpak;
     options.recorder = recorderOf(words.recorder);
     options.json = words.json;
+    options.endsWithNul = words.endsWithNul;
     options.intoPackages = words.intoPackages;
     options.since = words.since;
     if (words.http || words.httpPort != 0) options.httpPort = words.httpPort;
@@ -279,13 +324,18 @@ HostOptions optionsOf(const CLI::App& app, const Words& words, const HostEnviron
     return options;
 }
 
+std::string withLineEnd(std::string text) {
+    if (!text.ends_with('\n')) text += '\n';
+    return text;
+}
+
 HostReply usageReply(std::string_view message) {
     return {kExitUsage, fmt::format("cindral: {}\n", terminalText(message))};
 }
 
 std::string helpText(const CLI::App& app) {
     const auto chosen = app.get_subcommands();
-    if (chosen.empty()) return app.help();
+    if (chosen.empty()) return screenHelp(app);
     // The options stand with the program, before or after any command.
     return chosenApp(app).help(app.get_name()) + "\nOptions of every command: cindral --help\n";
 }
@@ -327,7 +377,15 @@ std::variant<HostOptions, HostReply> parseHostOptions(std::span<const std::strin
     addEditCommands(app, parsed.edit);
     app.set_version_flag("--version", fmt::format("cindral {}", hostVersion()), "Print the version and exit.");
     app.set_help_flag("-h,--help", "Say what can be said and exit.");
+    for (const char* name : kListCommands) {
+        app.get_subcommand(name)
+            ->add_flag("-0,--null", parsed.endsWithNul,
+                       "Print bare paths (or names) alone, as they are, each with a NUL behind it.")
+            ->excludes(app.get_option("--json"));
+    }
+    addShellTexts(app);
     for (CLI::App* command : app.get_subcommands({})) {
+        command->group(groupOf(command->get_name()));
         command->set_help_flag("-h,--help", "Say what can be said and exit.");
         for (CLI::App* inner : command->get_subcommands({}))
             inner->set_help_flag("-h,--help", "Say what can be said and exit.");
@@ -344,7 +402,7 @@ std::variant<HostOptions, HostReply> parseHostOptions(std::span<const std::strin
     } catch (const CLI::CallForHelp&) {
         return HostReply{kExitDone, helpText(app)};
     } catch (const CLI::CallForVersion& version) {
-        return HostReply{kExitDone, std::string(version.what()) + "\n"};
+        return HostReply{kExitDone, withLineEnd(version.what())};
     } catch (const CLI::ParseError& error) {
         return usageReply(app.get_subcommands().empty() ? missingCommandText(app, error) : error.what());
     }

@@ -53,6 +53,7 @@ struct HostOptions {
     bool desktopTags = false;
     RecorderChoice recorder = RecorderChoice::automatic;
     bool json = false;
+    bool endsWithNul = false;                    ///< lists: bare names, each with a NUL behind it
     bool intoPackages = false;                   ///< tree
     EditOptions edit;                            ///< edit
     std::string since;                           ///< changes: an anchor, as printed

@@ -109,6 +109,11 @@ bool isContainer(ItemKind kind) {
     return kind == ItemKind::folder || kind == ItemKind::package;
 }
 
+void appendBareName(std::string& out, const TesselItem& item, const PresentedPaths& paths) {
+    const KsURL* url = item.fileURL();
+    out += url != nullptr ? paths.realPath(url->path()) : item.itemIdentifier();
+}
+
 void ItemText::appendName(std::string& out, std::string_view name, ItemKind kind) const {
     const std::string_view color = wantsColor_ ? colorOf(kind) : std::string_view();
     out += color;

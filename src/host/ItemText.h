@@ -3,6 +3,7 @@
 #include <string>
 #include <string_view>
 
+#include "host/PresentedPaths.h"
 #include "platform/tessel/TesselItem.h"
 
 namespace cindral {
@@ -13,6 +14,9 @@ ItemKind kindOf(const TesselItem& item);
 
 /// Whether the item is listed by what is in it: folders, app libraries and packages.
 bool isContainer(ItemKind kind);
+
+/// How programs are told of an item: its path as it is, its identifier where it has none. Either names it to a command.
+void appendBareName(std::string& out, const TesselItem& item, const PresentedPaths& paths);
 
 /// Items in the words of the command line.
 ///

@@ -136,8 +136,12 @@ int runServe(HostOptions options, const HostEnvironment& environment, TesselExte
     return served.ok() ? kExitDone : failWith(hostFailure(fmt::format("can't serve: {}", served.error().reason())));
 }
 
+TextOutput outputFor(const HostOptions& options) {
+    return {STDOUT_FILENO, ::isatty(STDOUT_FILENO) == 1, options.endsWithNul ? '\0' : '\n'};
+}
+
 int runCommand(const Commands::Context& context) {
-    TextOutput output(STDOUT_FILENO, ::isatty(STDOUT_FILENO) == 1);
+    TextOutput output = outputFor(context.options);
     const auto done = Commands(context, output).run();
     // What was found before something went wrong is shown before the line that says what.
     if (const auto error = output.finish()) return outputFailure(*error);
@@ -188,7 +192,7 @@ int runRemotely(const HostOptions& options, const HostEnvironment& environment, 
 
 /// They look at the applications themselves, with a daemon's eyes where there is one.
 int runApps(const HostOptions& options, const HostEnvironment& environment) {
-    TextOutput output(STDOUT_FILENO, ::isatty(STDOUT_FILENO) == 1);
+    TextOutput output = outputFor(options);
     const auto done = runAppsCommand(options, environment, output);
     if (const auto error = output.finish()) return outputFailure(*error);
     return done.ok() ? kExitDone : failWith(done.error());

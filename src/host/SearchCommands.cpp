@@ -25,6 +25,8 @@ SearchCommands::SearchCommands(const Commands::Context& context, TextOutput& out
 void SearchCommands::printItem(const TesselItem& item) {
     if (context_.options.json) {
         ItemWriter(context_.paths).append(output_.buffer(), item);
+    } else if (context_.options.endsWithNul) {
+        appendBareName(output_.buffer(), item, context_.paths);
     } else {
         const KsURL* url = item.fileURL();
         text_.appendLine(output_.buffer(), item,
@@ -51,6 +53,10 @@ Result<void> SearchCommands::allTags() {
     const auto tags = context_.search.tags();
     if (!tags.ok()) return failure(tags.error());
     for (const TagCount& each : *tags) {
+        if (context_.options.endsWithNul) {
+            output_.line(each.tag);
+            continue;
+        }
         output_.line(context_.options.json ? fmt::format(R"({{"tag":{},"count":{}}})", jsonString(each.tag), each.count)
                                            : fmt::format("{:>7}  {}", each.count, terminalText(each.tag)));
     }

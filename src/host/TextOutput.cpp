@@ -11,7 +11,8 @@ constexpr std::size_t kBufferBytes = 64 << 10;
 
 }  // namespace
 
-TextOutput::TextOutput(int fd, bool isTerminal) : fd_(fd), bufferBytesMax_(isTerminal ? 0 : kBufferBytes) {}
+TextOutput::TextOutput(int fd, bool isTerminal, char lineEnd)
+    : fd_(fd), lineEnd_(lineEnd), bufferBytesMax_(isTerminal ? 0 : kBufferBytes) {}
 
 void TextOutput::line(std::string_view text) {
     buffer_ += text;
@@ -19,7 +20,7 @@ void TextOutput::line(std::string_view text) {
 }
 
 void TextOutput::endLine() {
-    buffer_ += '\n';
+    buffer_ += lineEnd_;
     if (buffer_.size() > bufferBytesMax_) flush();
 }
 

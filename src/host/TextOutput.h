@@ -14,14 +14,14 @@ namespace cindral {
 /// Thread safety: for one thread at a time.
 class TextOutput {
 public:
-    /// `fd` is borrowed for life. A terminal is shown each line at once.
-    TextOutput(int fd, bool isTerminal);
+    /// `fd` is borrowed for life. A terminal is shown each line at once. `lineEnd` stands behind each line.
+    TextOutput(int fd, bool isTerminal, char lineEnd = '\n');
     /// Does not flush: what is to be written, and whether it was, is finish()'s.
     ~TextOutput() = default;
     TextOutput(const TextOutput&) = delete;
     TextOutput& operator=(const TextOutput&) = delete;
 
-    /// Appends a line; the newline is added.
+    /// Appends a line; its end is added.
     void line(std::string_view text);
     /// The same for text that was appended to buffer().
     void endLine();
@@ -40,6 +40,7 @@ public:
 
 private:
     const int fd_;
+    const char lineEnd_;
     const std::size_t bufferBytesMax_;
     std::string buffer_;
     bool isBroken_ = false;

@@ -24,10 +24,10 @@ TreePrinter::TreePrinter(ProviderAccess& client, const PresentedPaths& paths, co
 Result<void> TreePrinter::print(const TesselItemIdentifier& container) {
     auto top = std::make_unique<Level>(client_, container);
     TRY(advance(*top));
-    if (!options_.json) output_.line(options_.title);
+    if (options_.form == Form::drawing) output_.line(options_.title);
     levels_.push_back(std::move(top));
     while (!levels_.empty() && !output_.isBroken()) printNext();
-    if (!options_.json) printCounts();
+    if (options_.form == Form::drawing) printCounts();
     return {};
 }
 
@@ -89,13 +89,15 @@ void TreePrinter::note(const TesselItem& item, const KsError& error) {
 
 void TreePrinter::printLine(const TesselItem& item, ItemKind kind, bool isLast, std::string_view remark) {
     std::string& out = output_.buffer();
-    if (options_.json) {
-        ItemWriter(paths_).append(out, item);
-    } else {
-        out += indent_;
-        out += isLast ? "└── " : "├── ";
-        text_.appendName(out, item, kind);
-        out += remark;
+    switch (options_.form) {
+        case Form::json: ItemWriter(paths_).append(out, item); break;
+        case Form::bareNames: appendBareName(out, item, paths_); break;
+        case Form::drawing:
+            out += indent_;
+            out += isLast ? "└── " : "├── ";
+            text_.appendName(out, item, kind);
+            out += remark;
+            break;
     }
     output_.endLine();
 }

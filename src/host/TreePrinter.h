@@ -19,8 +19,10 @@ namespace cindral {
 /// Thread safety: for one thread at a time.
 class TreePrinter {
 public:
+    /// All but the drawing are one item a line, without counts.
+    enum class Form { drawing, json, bareNames };
     struct Options {
-        bool json = false;  ///< one item a line, without drawing and counts
+        Form form = Form::drawing;
         bool intoPackages = false;
         std::string title;  ///< the first line, escaped
     };
