@@ -172,6 +172,7 @@ async function show(next, { keepsFocus = false } = {}) {
     source = made;
     next.title ??= trail.at(-1).filename;
     source.onchange = paced(REFRESH_INTERVAL, () => refresh(made));
+    made.better?.then((better) => takeBetter(made, better), (error) => { if (made === source) failed(error); });
     rows.show(source, { layout: settings.layout, sort: settings.sort, label: next.title, sortable: next.kind === 'folder' });
     drawPath(trail);
     drawPlaces();
@@ -188,6 +189,15 @@ async function show(next, { keepsFocus = false } = {}) {
     clearTimeout(slow);
   }
   return undefined;
+}
+
+function takeBetter(made, better) {
+  if (made !== source) return better.stop();
+  made.stop();
+  source = better;
+  source.onchange = paced(REFRESH_INTERVAL, () => refresh(better));
+  rows.replace(better);
+  return drawState();
 }
 
 // A change that comes while another is looked at is looked at next.

@@ -69,6 +69,13 @@ export class Rows {
     this.draw();
   }
 
+  // The same items in another order, or more of them.
+  replace(source) {
+    this.source = source;
+    this.draw();
+    this.actions.selectionChanged();
+  }
+
   #makeHeader(sortable) {
     this.header.setAttribute('role', 'rowgroup');
     this.header.replaceChildren(h('div', { class: 'row heading', role: 'row', 'aria-rowindex': 1 }, COLUMNS.map(({ name, label }) => {

@@ -4,6 +4,8 @@ import { call, listen, ROOT } from './rpc.js';
 import { collator, kind, isFolder } from './format.js';
 
 const PAGE = 200;
+// Milliseconds until somebody who waits for an order is shown another.
+const PATIENCE = 400;
 // Where the provider builds what is not to be seen before it is whole.
 const isWorkshop = (item) => item.filename === '.TemporaryLocalFolder' && item.parentIdentifier === ROOT;
 
@@ -134,8 +136,10 @@ export class SortedSource extends Source {
 
 // What the host finds by a question, one page after the other.
 export class QuerySource extends Source {
-  constructor(method, params = {}) {
+  constructor(method, params = {}, { follows = true, keeps = () => true } = {}) {
     super();
+    this.follows = follows;
+    this.keeps = keeps;
     this.method = method;
     this.params = params;
     this.items = [];
@@ -144,7 +148,7 @@ export class QuerySource extends Source {
   }
 
   async open() {
-    await Promise.all([this.#read(PAGE), this.follow({ query: this.method, ...this.params })]);
+    await Promise.all([this.#read(PAGE), this.follows ? this.follow({ query: this.method, ...this.params }) : null]);
   }
 
   get(index) { return this.items[index]; }
@@ -163,7 +167,7 @@ export class QuerySource extends Source {
     let page = null;
     do {
       const answer = await call(this.method, { ...this.params, limit: PAGE, ...(page ? { page } : {}) });
-      items.push(...answer.items);
+      items.push(...answer.items.filter(this.keeps));
       page = answer.nextPage;
     } while (page && items.length < least);
     this.#take(items, page);
@@ -171,7 +175,7 @@ export class QuerySource extends Source {
 
   async #more(before) {
     const answer = await call(this.method, { ...this.params, limit: PAGE, page: this.next });
-    if (before === this.items) this.#take([...before, ...answer.items], answer.nextPage);
+    if (before === this.items) this.#take([...before, ...answer.items.filter(this.keeps)], answer.nextPage);
   }
 
   #take(items, page) {
@@ -240,17 +244,22 @@ export class ListedSource extends Source {
   async all() { return this.items; }
 }
 
-// The rows of a folder: the host's order where it has one.
+// The rows of a folder: the host's order where it has one. Where it has none yet, the provider's own for now, and `better`
+// is the promise of the other.
 export async function openFolder(container, sort) {
   const source = new SortedSource(container, sort);
-  try {
-    await source.open();
-    return source;
-  } catch (error) {
+  const sorted = source.open().then(() => source, async (error) => {
     source.stop();
     if (!error.isUnknownMethod) throw error;
-  }
-  const listed = new ListedSource(container, sort);
-  await listed.open();
-  return listed;
+    const listed = new ListedSource(container, sort);
+    await listed.open();
+    return listed;
+  });
+  const inTime = await Promise.race([sorted, new Promise((resolve) => { setTimeout(() => resolve(null), PATIENCE); })]);
+  if (inTime) return inTime;
+  const isHere = (item) => container !== ROOT || (item.parentIdentifier === ROOT && !isWorkshop(item));
+  const now = new QuerySource('enumerateItems', { container }, { follows: false, keeps: isHere });
+  await now.open();
+  now.better = sorted;
+  return now;
 }

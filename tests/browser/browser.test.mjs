@@ -156,6 +156,23 @@ test('no view has anything that keeps somebody out', async () => {
   }
 });
 
+test('a folder whose order is not known yet is shown in another', async () => {
+  for (const name of ['b 10.txt', 'b 9.txt', 'a.txt']) file(name);
+  await openHere(['a.txt']);
+  await goTo('Documents');
+  let release;
+  const released = new Promise((resolve) => { release = resolve; });
+  await page.route('**/rpc', async (route) => {
+    if (route.request().postData().includes('"sortedItems"')) await released;
+    await route.continue();
+  });
+  await row(here).dblclick();
+  await row('b 9.txt').waitFor();
+  release();
+  await until('the order is there', async () => (await shownNames()).join() === 'a.txt,b 9.txt,b 10.txt');
+  await page.unroute('**/rpc');
+});
+
 test('an application is a place with its documents', async () => {
   fs.writeFileSync(path.join(storage.folder, 'data', 'org.example.Sketch', 'Documents', 'drawing.txt'), '');
   await goTo('Sketch');
