@@ -744,8 +744,8 @@ Result<void> SearchStore::refreshSample() {
     const bool isAlike = total <= sample_.total() * 3 / 2 && sample_.total() <= total * 3 / 2;
     if (isAlike && change - sampledAt_ < kChangesOfSampleMax && sampledAt_ != 0) return {};
     std::vector<std::string> names;
-    const auto take = [&](std::int64_t from, std::int64_t rows) -> Result<void> {
-        SqliteStatement& some = reader_->someNames.bind(from, rows);
+    const auto take = [&names, &reader = *reader_](std::int64_t from, std::int64_t rows) -> Result<void> {
+        SqliteStatement& some = reader.someNames.bind(from, rows);
         while (TRY(some.step())) names.push_back(name_folding::fold(some.text(0)));
         some.reset();
         return {};
