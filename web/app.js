@@ -652,7 +652,7 @@ function showSignedOut() {
   source = null;
   app.replaceChildren(h('main', { class: 'state' }, h('h1', {}, 'Cindral'),
     h('p', {}, 'This browser has no session. Open the link that the program has printed; each is good once.'),
-    h('p', { class: 'hint' }, 'Start the program again for another link.')));
+    h('p', { class: 'hint' }, 'When a link was used, the program prints another.')));
 }
 
 async function begin() {

@@ -79,18 +79,19 @@ void raiseDescriptorLimit() {
     ::setrlimit(RLIMIT_NOFILE, &limit);
 }
 
-/// Lets browsers in too, where that is asked for. The link goes to standard output, and nowhere else.
+/// Lets browsers in too, where that is asked for. Links go to standard output, and nowhere else; who has closed it needs
+/// none.
 Result<void> addHttp(Daemon& daemon, const HostOptions& options) {
     if (!options.httpPort) return {};
-    auto listener = HttpListener::make(*options.httpPort, options.uploadBytesMax);
+    const auto show = [json = options.json](const std::string& link) {
+        [[maybe_unused]] const auto written =
+            descriptor::writeAll(STDOUT_FILENO, json ? fmt::format("{{\"url\":{}}}\n", jsonString(link))
+                                                     : fmt::format("Your documents, for one browser: {}\n", link));
+    };
+    auto listener = HttpListener::make(*options.httpPort, options.uploadBytesMax, show);
     if (!listener.ok())
         return hostFailure(fmt::format("can't listen at port {}: {}", *options.httpPort, listener.error().reason()));
-    const std::string link = (*listener)->makeLink();
     daemon.add(*std::move(listener));
-    const std::string line = options.json ? fmt::format("{{\"url\":{}}}\n", jsonString(link))
-                                          : fmt::format("Your documents, once: {}\n", link);
-    const auto written = descriptor::writeAll(STDOUT_FILENO, line);
-    if (!written.ok()) return hostFailure(fmt::format("can't write to standard output: {}", written.error().reason()));
     return {};
 }
 

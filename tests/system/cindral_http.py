@@ -215,11 +215,21 @@ class HttpDaemon(Daemon):
             super().__init__(["--http", *words], environment, stdout=write, **popen)
         finally:
             os.close(write)
-        with os.fdopen(read) as output:
-            self.printed = output.readline()
+        self._output = os.fdopen(read)
+        self.printed = self._output.readline()
         found = re.search(r"http://127\.0\.0\.1:(\d+)/#([0-9a-f]{64})", self.printed)
         self.port = int(found.group(1)) if found else None
         self.link = found.group(2) if found else None
+
+
+    def next_link(self):
+        """The secret of the link that is printed next."""
+        return re.search(r"#([0-9a-f]{64})", self._output.readline()).group(1)
+
+    def status(self):
+        status = super().status()
+        self._output.close()
+        return status
 
 
 class HttpTest(SystemTest):

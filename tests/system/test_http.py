@@ -67,10 +67,13 @@ class ServingTest(HttpTest):
         self.assertEqual(other.post("/rpc", message).status, 409)
 
     def browser_of_another_link(self):
-        # Another process of the same storage would be refused; another session needs another daemon.
-        self.daemon_process.stop()
-        self.daemon_process = self.serve()
-        return self.browser(self.daemon_process)
+        other = Browser(self.page.port)
+        self.assertEqual(other.trade(self.daemon_process.next_link()).status, 200)
+        return other
+
+    def test_another_link_is_printed_when_one_was_used(self):
+        self.assertEqual(self.browser_of_another_link().get("/session").status, 200)
+        self.assertEqual(self.page.get("/session").status, 200, "the first browser stays")
 
     # MARK: Documents
 

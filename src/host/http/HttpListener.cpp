@@ -31,7 +31,7 @@ struct HttpListener::Connection {
     std::uint64_t waitingSince{};  ///< a number that grows
 };
 
-Result<std::unique_ptr<HttpListener>> HttpListener::make(std::uint16_t port, std::uint64_t uploadBytesMax) {
+Result<std::unique_ptr<HttpListener>> HttpListener::make(std::uint16_t port, std::uint64_t uploadBytesMax, Show show) {
     UniqueFd socket(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     if (!socket) return KsError::errorWithPOSIXCode();
     const int one = 1;
@@ -46,33 +46,38 @@ Result<std::unique_ptr<HttpListener>> HttpListener::make(std::uint16_t port, std
         ::getsockname(socket.get(), generic, &size) != 0)
         return KsError::errorWithPOSIXCode();
     // The constructor is nobody else's to call.
-    return std::unique_ptr<HttpListener>(new HttpListener(std::move(socket), ntohs(address.sin_port), uploadBytesMax));
+    return std::unique_ptr<HttpListener>(
+        new HttpListener(std::move(socket), ntohs(address.sin_port), uploadBytesMax, std::move(show)));
 }
 
-HttpListener::HttpListener(UniqueFd socket, std::uint16_t port, std::uint64_t uploadBytesMax)
-    : socket_(std::move(socket)), port_(port), uploadBytesMax_(uploadBytesMax) {}
+HttpListener::HttpListener(UniqueFd socket, std::uint16_t port, std::uint64_t uploadBytesMax, Show show)
+    : socket_(std::move(socket)), port_(port), uploadBytesMax_(uploadBytesMax), show_(std::move(show)) {}
 
 HttpListener::~HttpListener() {
     stop();
     waitUntilStopped();
 }
 
-std::string HttpListener::makeLink() {
+void HttpListener::showLink() {
+    const MutexLock lock(showMutex_);
     // Behind the "#", which no browser sends anywhere.
-    return HttpGuard(port_, sessions_).origin() + "/#" + sessions_.makeLink();
+    show_(site_->origin() + "/#" + sessions_.makeLink());
 }
 
 Result<void> HttpListener::start(const HostProcess& host) {
     stop_ = TRY(descriptor::makeInterrupt());
     service_.emplace(serviceOf(host));
-    site_ = std::make_unique<HttpSite>(*service_, sessions_, port_, uploadBytesMax_);
+    site_ = std::make_unique<HttpSite>(*service_, sessions_, port_, uploadBytesMax_, [this] { showLink(); });
     threads_.enter();
     const int failure = startBackgroundThread([this] {
         nameCurrentThread("cindral-http");
         accept();
         threads_.leave();
     });
-    if (failure == 0) return {};
+    if (failure == 0) {
+        showLink();
+        return {};
+    }
     threads_.leave();
     return KsError::posix(failure);
 }

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <list>
 #include <memory>
 #include <optional>
@@ -23,15 +24,15 @@ class HttpListener final : public DaemonListener {
 public:
     static constexpr std::size_t kConnectionsMax = 128;
 
+    /// Takes a link that lets one browser in, once: the first when the service starts, then another whenever one was used,
+    /// by one at a time. Nobody else is told.
+    using Show = std::function<void(const std::string& link)>;
     /// Listens on this machine's own address alone. Port 0 is one that is free. EADDRINUSE where another has it.
-    static Result<std::unique_ptr<HttpListener>> make(std::uint16_t port, std::uint64_t uploadBytesMax);
+    static Result<std::unique_ptr<HttpListener>> make(std::uint16_t port, std::uint64_t uploadBytesMax, Show show);
     /// Stopped before, where it was started.
     ~HttpListener() override;
     HttpListener(const HttpListener&) = delete;
     HttpListener& operator=(const HttpListener&) = delete;
-
-    /// A link that lets one browser in, once.
-    std::string makeLink();
 
     Result<void> start(const HostProcess& host) override;
     void stop() override;
@@ -39,7 +40,8 @@ public:
 
 private:
     struct Connection;
-    HttpListener(UniqueFd socket, std::uint16_t port, std::uint64_t uploadBytesMax);
+    HttpListener(UniqueFd socket, std::uint16_t port, std::uint64_t uploadBytesMax, Show show);
+    void showLink();
     void accept();
     bool acceptAll();
     void welcome(UniqueFd socket);
@@ -50,6 +52,8 @@ private:
     const UniqueFd socket_;
     const std::uint16_t port_;
     const std::uint64_t uploadBytesMax_;
+    const Show show_;
+    Mutex showMutex_;
     HttpSessions sessions_;
     UniqueFd stop_;                      ///< constant once started
     std::optional<RpcService> service_;  ///< constant once started

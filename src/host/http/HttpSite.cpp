@@ -54,13 +54,15 @@ constexpr HttpSite::Route HttpSite::kRoutes[] = {
     {HttpRequest::Method::post, "/upload", &HttpSite::receiveUpload},
 };
 
-HttpSite::HttpSite(const RpcService& service, HttpSessions& sessions, std::uint16_t port, std::uint64_t uploadBytesMax)
+HttpSite::HttpSite(const RpcService& service, HttpSessions& sessions, std::uint16_t port, std::uint64_t uploadBytesMax,
+                   std::function<void()> didTrade)
     : service_(service),
       sessions_(sessions),
       guard_(port, sessions),
       clients_(service),
       documents_(*service.provider),
-      uploads_(*service.provider, service.paths, uploadBytesMax) {}
+      uploads_(*service.provider, service.paths, uploadBytesMax),
+      didTrade_(std::move(didTrade)) {}
 
 void HttpSite::serve(HttpConnection& connection, const HttpRequest& request, int socket, int stop) {
     const auto refuse = [&](const HttpResponse& response) {
@@ -120,6 +122,7 @@ void HttpSite::openSession(HttpConnection& connection, const HttpRequest& reques
     HttpResponse response = HttpResponse::json(tokenText(*session));
     response.fields = {guard_.cookieField(*session)};
     connection.answer(response);
+    didTrade_();
 }
 
 void HttpSite::sayToken(const Call& call) {

@@ -33,8 +33,9 @@ namespace cindral {
 /// Thread safety: all operations, from any thread.
 class HttpSite {
 public:
-    /// Borrowed for life.
-    HttpSite(const RpcService& service, HttpSessions& sessions, std::uint16_t port, std::uint64_t uploadBytesMax);
+    /// The first two are borrowed for life. `didTrade` is called when a link was used, on any thread.
+    HttpSite(const RpcService& service, HttpSessions& sessions, std::uint16_t port, std::uint64_t uploadBytesMax,
+             std::function<void()> didTrade);
 
     /// Answers the request. `stop`, when it can be read, ends a stream of events.
     void serve(HttpConnection& connection, const HttpRequest& request, int socket, int stop);
@@ -73,6 +74,7 @@ private:
     HttpClients clients_;
     const HttpDocuments documents_;
     const HttpUploads uploads_;
+    const std::function<void()> didTrade_;
 };
 
 }  // namespace cindral
