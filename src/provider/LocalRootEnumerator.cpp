@@ -71,6 +71,12 @@ private:
     const std::uint64_t version_;
 };
 
+/// From the taking of a list to its saving, one working set at a time: who took an older list must not save it over a newer.
+SerialQueue& publishingQueue() {
+    static SerialQueue& queue = *new SerialQueue("cindral.root-enumerator.publishing");
+    return queue;
+}
+
 }  // namespace
 
 std::shared_ptr<LocalRootEnumerator> LocalRootEnumerator::initWithContainer(TesselItemIdentifier container) {
@@ -191,17 +197,25 @@ bool LocalRootEnumerator::sendNews(TesselChangeObserver& observer, FSChangeToken
 }
 
 bool LocalRootEnumerator::upgrade(TesselChangeObserver* observer) {
+    if (!isWorkingSet()) return takeNewerList(observer);
+    bool isUpgraded = false;
+    publishingQueue().sync([&] {
+        isUpgraded = takeNewerList(observer);
+        if (!isUpgraded) return;
+        if (const Result<void> saved = appLibraryManager_->saveToCache(); !saved.ok())
+            logError("can't save working-set cache to disk; {}", saved.error().description());
+    });
+    return isUpgraded;
+}
+
+bool LocalRootEnumerator::takeNewerList(TesselChangeObserver* observer) {
     // Between two refreshes: so that the process's own list is the same, and what it has is published.
     bool isUpgraded = false;
     LocalAppLibraryManager::backgroundQueue().sync([&] {
         isUpgraded = appLibraryManager_->upgradeFromMainCache(observer, /*deleteIndexOfRemovedDomains=*/isWorkingSet());
     });
-    if (!isUpgraded) return false;
-    updateMonitoredRoots();
-    if (!isWorkingSet()) return true;
-    if (const Result<void> saved = appLibraryManager_->saveToCache(); !saved.ok())
-        logError("can't save working-set cache to disk; {}", saved.error().description());
-    return true;
+    if (isUpgraded) updateMonitoredRoots();
+    return isUpgraded;
 }
 
 /// What is in a root was recorded when the root was first published, which may be before the client's anchor: replaying

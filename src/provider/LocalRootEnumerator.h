@@ -39,6 +39,7 @@ public:
     /// Another one after the list of roots has changed.
     std::shared_ptr<LocalFileEnumerator> localFileEnumerator() const;
     bool isRunning() const;
+    const SerialQueue& enumQueue() const { return enumQueue_; }
 
 private:
     explicit LocalRootEnumerator(TesselItemIdentifier container);
@@ -52,6 +53,7 @@ private:
     bool sendAllKnown(TesselChangeObserver& observer, FSChangeToken& token);
     bool sendNews(TesselChangeObserver& observer, FSChangeToken& token);
     bool upgrade(TesselChangeObserver* observer);
+    bool takeNewerList(TesselChangeObserver* observer);
     void updateMonitoredRoots();
     bool sendContents(TesselChangeObserver& observer, const std::vector<KsURL>& roots) const;
     bool sendDepartures(TesselChangeObserver& observer, const std::vector<KsURL>& roots, std::uint64_t since) const;

@@ -481,6 +481,24 @@ TEST_F(LocalRootEnumeratorTest, departuresThatCannotBeReadExpireTheAnchor) {
 
 // Monitoring
 
+TEST_F(LocalRootEnumeratorTest, itsQueueBearsItsName) {
+    EXPECT_EQ(root()->enumQueue().label(), "cindral.root-enumerator.queue");
+}
+
+TEST_F(LocalRootEnumeratorTest, aListIsSavedOnceItsRootsAreMonitored) {
+    installAndPublish("a");
+    changesFromVersion(*workingSet(), 0);
+    const auto lines = log_.lines();
+    const auto at = [&](std::string_view part) {
+        return std::ranges::find_if(lines,
+                                    [&](const auto& line) { return line.second.find(part) != std::string::npos; });
+    };
+    const auto saving = at("saving bundle proxies to working-set cache");
+    ASSERT_NE(saving, lines.end());
+    EXPECT_LT(at("upgraded manager "), at("updated root enumerator to monitor "));
+    EXPECT_LT(at("updated root enumerator to monitor "), saving);
+}
+
 TEST_F(LocalRootEnumeratorTest, isRunningBetweenStartAndStop) {
     const auto all = root();
     EXPECT_FALSE(all->isRunning());
