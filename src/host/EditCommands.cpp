@@ -327,8 +327,7 @@ Result<void> EditCommands::restore(const std::string& word) {
     std::optional<TesselItemIdentifier> folder;
     if (options_.folder) folder = TRY(target());
     return print(word, await(word, [&](auto completion) {
-                     provider().untrashItemWithIdentifier(identifier, folder, std::move(completion));
-                     return nullptr;
+                     return provider().untrashItemWithIdentifier(identifier, folder, std::move(completion));
                  }));
 }
 

@@ -167,7 +167,9 @@ void untrashItem(const HostMethodsContext& context, const Json& params, const Re
     const auto identifier = given.string("identifier");
     std::optional<std::string> parent;
     if (!identifier || !given.optionalString("parent", parent)) return;
-    context.client.provider().untrashItemWithIdentifier(*identifier, parent, itemCompletion(context, reply));
+    follow(reply, itemCompletion(context, reply), [&](TesselExtension::ItemCompletion completion) {
+        return context.client.provider().untrashItemWithIdentifier(*identifier, parent, std::move(completion));
+    });
 }
 
 void removeTrashedItemsOlderThan(const HostMethodsContext& context, const Json& params, const Reply& reply) {

@@ -131,12 +131,14 @@ void RemoteProvider::trashItemWithIdentifier(const TesselItemIdentifier& identif
     sendForItem("trashItem", Params().add("identifier", identifier), std::move(completion));
 }
 
-void RemoteProvider::untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
-                                               const std::optional<TesselItemIdentifier>& parent,
-                                               ItemCompletion completion) {
+std::shared_ptr<TesselProgress> RemoteProvider::untrashItemWithIdentifier(
+    const TesselItemIdentifier& identifier, const std::optional<TesselItemIdentifier>& parent,
+    ItemCompletion completion) {
+    auto progress = std::make_shared<TesselProgress>();
     Params params;
     if (parent) params.add("parent", *parent);
-    sendForItem("untrashItem", params.add("identifier", identifier), std::move(completion));
+    sendForItem("untrashItem", params.add("identifier", identifier), std::move(completion), progress);
+    return progress;
 }
 
 void RemoteProvider::removeTrashedItemsOlderThanDate(const KsDate& date, Completion completion) {

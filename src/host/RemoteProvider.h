@@ -40,9 +40,9 @@ public:
     std::shared_ptr<TesselProgress> deleteItemWithIdentifier(const TesselItemIdentifier& identifier,
                                                              Completion completion) override;
     void trashItemWithIdentifier(const TesselItemIdentifier& identifier, ItemCompletion completion) override;
-    void untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
-                                   const std::optional<TesselItemIdentifier>& parent,
-                                   ItemCompletion completion) override;
+    std::shared_ptr<TesselProgress> untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
+                                                              const std::optional<TesselItemIdentifier>& parent,
+                                                              ItemCompletion completion) override;
     void removeTrashedItemsOlderThanDate(const KsDate& date, Completion completion) override;
 
     void setLastUsedDate(const std::optional<KsDate>& date, const TesselItemIdentifier& identifier,

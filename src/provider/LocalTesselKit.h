@@ -59,9 +59,9 @@ public:
     /// The trash is the folder ".Trash" in the first folder "Documents" of the item's path. A trashed item bears the
     /// date, and where it was.
     void trashItemWithIdentifier(const TesselItemIdentifier& identifier, ItemCompletion completion) override;
-    void untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
-                                   const std::optional<TesselItemIdentifier>& parent,
-                                   ItemCompletion completion) override;
+    std::shared_ptr<TesselProgress> untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
+                                                              const std::optional<TesselItemIdentifier>& parent,
+                                                              ItemCompletion completion) override;
     /// Of the storage and of every app library. What has no date yet is given one and kept; links, FIFOs and the like,
     /// which can't bear one, go by when they last changed, which being trashed is.
     void removeTrashedItemsOlderThanDate(const KsDate& date, Completion completion) override;

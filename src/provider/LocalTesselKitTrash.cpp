@@ -136,11 +136,12 @@ void LocalTesselKit::trashItemWithIdentifier(const TesselItemIdentifier& identif
     });
 }
 
-void LocalTesselKit::untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
-                                               const std::optional<TesselItemIdentifier>& parent,
-                                               ItemCompletion completion) {
+std::shared_ptr<TesselProgress> LocalTesselKit::untrashItemWithIdentifier(
+    const TesselItemIdentifier& identifier, const std::optional<TesselItemIdentifier>& parent,
+    ItemCompletion completion) {
     const LogSection section("untrash item \"{}\"", identifier);
-    attempt([identifier, parent, completion = std::move(completion)](const Again& again) {
+    auto progress = std::make_shared<TesselProgress>();
+    attempt([identifier, parent, progress, completion = std::move(completion)](const Again& again) {
         const Result<MeantFile> file = find(identifier, Lookup::lenient);
         if (!file.ok()) return completion(file.error());
         const auto item = fetchItem(identifier);
@@ -154,14 +155,16 @@ void LocalTesselKit::untrashItemWithIdentifier(const TesselItemIdentifier& ident
             logDebug("can't compute valid parent URL for {}", file->url.description());
             return completion(tsInvalidParameterError("parent", parent.value_or("")));
         }
-        ts_reparentUnderFolder(*file, *folder, Bouncing::isAllowed,
-                               [identifier, file = *file, again, completion](const Result<KsURL>& restored) {
-                                   if (restored.ok()) return completion(withoutTrashDate(*restored));
-                                   if (!hasGone(restored.error(), file))
-                                       return completion(translated(restored.error()));
-                                   if (!again()) completion(missingItem(identifier, Lookup::lenient));
-                               });
+        ts_reparentUnderFolder(
+            *file, *folder, Bouncing::isAllowed,
+            [identifier, file = *file, again, completion](const Result<KsURL>& restored) {
+                if (restored.ok()) return completion(withoutTrashDate(*restored));
+                if (!hasGone(restored.error(), file)) return completion(translated(restored.error()));
+                if (!again()) completion(missingItem(identifier, Lookup::lenient));
+            },
+            progress);
     });
+    return progress;
 }
 
 /// What was put back, as it is now.

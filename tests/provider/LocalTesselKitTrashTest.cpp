@@ -210,6 +210,9 @@ TEST_F(LocalTesselKitTrash, goesBackToWhereItWas) {
     EXPECT_EQ(contents("Letters/a"), "A");
     EXPECT_EQ(trashDate("Letters/a"), std::nullopt);
     EXPECT_EQ(putBack("Letters/a"), "Letters/a");
+    EXPECT_TRUE(log.containsPart(LogLevel::debug, " untrash item \"" + document + "\""));
+    EXPECT_TRUE(
+        log.contains(LogLevel::debug, "[DEBUG] putback: 'Letters/a' library: '" + storageURL().description() + "'"));
     EXPECT_TRUE(log.contains(LogLevel::debug, "[DEBUG] removing trash date xattr"));
 }
 
@@ -304,6 +307,24 @@ TEST_F(LocalTesselKitTrash, whatCannotBearAttributesIsTrashedAllTheSame) {
                              "[ERROR] couldn't set putback xattr (" + KsError::posix(EPERM).description() + ")"));
     EXPECT_EQ(errorOf(untrash((*trashed)->itemIdentifier())), "");
     EXPECT_TRUE(exists("link"));
+}
+
+// To another device it is copied, which may take its time.
+TEST_F(LocalTesselKitTrash, aPutBackCanBeFollowedAndCancelled) {
+    storage_.file(".Trash/a");
+    DispatchSemaphore answered(0);
+    std::optional<KsError> error;
+    const auto progress =
+        provider_->untrashItemWithIdentifier(identifier(".Trash/a"), std::nullopt, [&](const ItemResult& item) {
+            if (!item.ok()) error = item.error();
+            answered.signal();
+        });
+    ASSERT_NE(progress, nullptr);
+    answered.wait();
+    EXPECT_EQ(error, std::nullopt);
+    // What is one rename counts nothing, and is over before it could be cancelled.
+    EXPECT_EQ(progress->counts().totalItems, 0U);
+    EXPECT_TRUE(exists("a"));
 }
 
 // --- Sweep ---------------------------------------------------------------------------------------------------------------
@@ -412,6 +433,18 @@ TEST_F(LocalTesselKitTrash, whatHasNoRoomForADateIsKept) {
     }
     EXPECT_EQ(sweep({KsDate::now().seconds + 3600, 0}), std::nullopt);
     EXPECT_TRUE(exists(".Trash/full"));
+}
+
+TEST_F(LocalTesselKitTrash, whatHasNoIdentifierIsKept) {
+    storage_.file(".Trash/old");
+    setTrashDate(".Trash/old", kThen);
+    // Without a store no document gets an identifier.
+    RvStorageManager::defaultManager().setStore(nullptr);
+    const LogCapture log;
+    EXPECT_EQ(sweep(kLater), std::nullopt);
+    EXPECT_TRUE(exists(".Trash/old"));
+    EXPECT_TRUE(log.contains(LogLevel::error,
+                             "[ERROR] identifier lookup failed for URL \"" + url(".Trash/old").description() + "\""));
 }
 
 TEST_F(LocalTesselKitTrash, aSweepOfNothingIsDone) {

@@ -47,10 +47,11 @@ void TesselExtension::trashItemWithIdentifier(const TesselItemIdentifier& /*iden
     completion(notOffered());
 }
 
-void TesselExtension::untrashItemWithIdentifier(const TesselItemIdentifier& /*identifier*/,
-                                                const std::optional<TesselItemIdentifier>& /*parent*/,
-                                                ItemCompletion completion) {
+std::shared_ptr<TesselProgress> TesselExtension::untrashItemWithIdentifier(
+    const TesselItemIdentifier& /*identifier*/, const std::optional<TesselItemIdentifier>& /*parent*/,
+    ItemCompletion completion) {
     completion(notOffered());
+    return nullptr;
 }
 
 void TesselExtension::removeTrashedItemsOlderThanDate(const KsDate& /*date*/, Completion completion) {

@@ -62,9 +62,9 @@ public:
                                                                      Completion completion);
     virtual void trashItemWithIdentifier(const TesselItemIdentifier& identifier, ItemCompletion completion);
     /// Takes an item out of the trash: to the parent, where one is named and will do, else to where it was.
-    virtual void untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
-                                           const std::optional<TesselItemIdentifier>& parent,
-                                           ItemCompletion completion);
+    virtual std::shared_ptr<TesselProgress> untrashItemWithIdentifier(const TesselItemIdentifier& identifier,
+                                                                      const std::optional<TesselItemIdentifier>& parent,
+                                                                      ItemCompletion completion);
     /// Deletes what was trashed before the date. Answers when all deletions are done, with the first error.
     virtual void removeTrashedItemsOlderThanDate(const KsDate& date, Completion completion);
 
