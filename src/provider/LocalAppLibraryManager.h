@@ -38,6 +38,7 @@ public:
     /// The queue on which the registry is looked at ("cindral.app-library.background").
     static SerialQueue& backgroundQueue();
     /// Reads the registry into the main cache. Whether that changed: another application, or another order, is a change.
+    const std::string& queueLabel() const { return queue_.label(); }
     /// Waits for the background queue, unless it is on it.
     static bool refreshAppLibraries();
     /// Adds the record to the list when it is an application's, whose documents are published.

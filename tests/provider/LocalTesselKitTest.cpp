@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <filesystem>
 #include <thread>
 
 #include "platform/tessel/NotificationCenter.h"
@@ -46,6 +47,11 @@ TEST_F(LocalTesselKitTest, signalsTheWorkingSetOnceAtStart) {
     EXPECT_EQ(log_.count("pacer event"), 1U);
 }
 
+TEST_F(LocalTesselKitTest, itsQueueAndPacerBearTheirNames) {
+    EXPECT_EQ(provider_->appRefreshQueue().label(), "cindral.app-refresh.queue");
+    EXPECT_EQ(provider_->appRefreshPacer().name(), "cindral.app-refresh.pacer");
+}
+
 TEST_F(LocalTesselKitTest, bothRegistryNotificationsSignalThePacer) {
     for (const std::string_view name : {kApplicationRegisteredNotification, kApplicationUnregisteredNotification}) {
         provider_->appRefreshPacer().suspend();
@@ -55,10 +61,20 @@ TEST_F(LocalTesselKitTest, bothRegistryNotificationsSignalThePacer) {
 }
 
 TEST_F(LocalTesselKitTest, aNotificationAfterTheProviderDoesNothing) {
+    // The event of the start is over: what comes after would be another.
+    provider_->appRefreshQueue().sync([] {});
+    ASSERT_EQ(log_.count("pacer event"), 1U);
+    const auto signalled = host_->signalled();
     provider_.reset();
     NotificationCenter::distributedCenter()->post(kApplicationRegisteredNotification);
     SerialQueue::main().sync([] {});
     NotificationCenter::distributedCenter()->post(kApplicationRegisteredNotification);
+    EXPECT_EQ(log_.count("pacer event"), 1U);
+    EXPECT_EQ(host_->signalled(), signalled);
+    // Another provider has its own events: the one that is gone was not kept by a post.
+    provider_ = LocalTesselKit::init();
+    provider_->appRefreshQueue().sync([] {});
+    EXPECT_EQ(log_.count("pacer event"), 2U);
 }
 
 TEST_F(LocalTesselKitTest, looksItemsUpByIdentifier) {
@@ -167,6 +183,41 @@ TEST_F(LocalTesselKitTest, anUnknownApplicationHasNoDefaultContainer) {
         });
     EXPECT_EQ(calls, 1);
     EXPECT_TRUE(log_.contains(LogLevel::error, "[ERROR] can't create bundle proxy with 'org.example.App'"));
+}
+
+class DefaultContainerTest : public AppLibraryTest {
+protected:
+    /// What the one call of the completion answers.
+    Result<std::shared_ptr<const TesselItem>> containerOf(const std::string& identifier) {
+        const auto provider = LocalTesselKit::init();
+        provider->waitUntilReady();
+        std::vector<Result<std::shared_ptr<const TesselItem>>> answers;
+        provider->defaultApplicationContainerForBundleIdentifier(
+            identifier, [&](auto answer) { answers.push_back(std::move(answer)); });
+        EXPECT_EQ(answers.size(), 1U);
+        return answers.at(0);
+    }
+};
+
+TEST_F(DefaultContainerTest, isTheLibraryOfTheApplication) {
+    install("org.example.App");
+    const auto item = containerOf("org.example.App");
+    ASSERT_TRUE(item.ok());
+    EXPECT_EQ((*item)->itemIdentifier(), "#org.example.App");
+    EXPECT_TRUE(log_.containsPart(LogLevel::debug, " default location for org.example.App"));
+}
+
+TEST_F(DefaultContainerTest, withoutADocumentsFolderThereIsNone) {
+    install("org.example.App");
+    std::filesystem::remove(documents("org.example.App"));
+    const auto item = containerOf("org.example.App");
+    ASSERT_FALSE(item.ok());
+    EXPECT_TRUE(item.error().is("TSErrorDomain", 1));
+    EXPECT_EQ(item.error().userInfo().at("parameter"), "bundleIdentifier");
+    EXPECT_EQ(item.error().userInfo().at("value"), "org.example.App");
+    EXPECT_TRUE(
+        log_.contains(LogLevel::error, "[ERROR] can't create an app library item with " +
+                                           RoBundleProxy::bundleProxyForIdentifier("org.example.App")->description()));
 }
 
 TEST_F(LocalTesselKitTest, everySectionThatOpensCloses) {

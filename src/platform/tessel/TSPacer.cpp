@@ -20,7 +20,7 @@ struct TSPacer::State : std::enable_shared_from_this<State> {
           clock(std::move(itsClock)),
           timer(std::move(itsTimer)) {}
 
-    const std::string name;  ///< for a debugger
+    const std::string name;
     SerialQueue& queue;
     const std::chrono::milliseconds minFireInterval;
     const Clock clock;
@@ -97,6 +97,10 @@ TSPacer::~TSPacer() {
     const MutexLock lock(state_->mutex);
     state_->hasEnded = true;
     state_->block.swap(block);
+}
+
+const std::string& TSPacer::name() const {
+    return state_->name;
 }
 
 void TSPacer::setEventBlock(std::function<void()> block) {

@@ -33,6 +33,7 @@ public:
     TSPacer(const TSPacer&) = delete;
     TSPacer& operator=(const TSPacer&) = delete;
 
+    const std::string& name() const;
     void setEventBlock(std::function<void()> block);
     void resume();
     void suspend();
