@@ -2,6 +2,7 @@
 
 import base64
 import datetime
+import errno
 import json
 import os
 import plistlib
@@ -728,6 +729,78 @@ class CachesTest(AppsTest):
         self.finish()
         self.start()
         self.wait_for_libraries(self.views(ROOT)[0], "org.a", "org.b")
+
+
+class OtherMountTest(AppsTest):
+    """An application's documents may be mounted where they are: the kernel moves nothing from one mount to another, so it's copied."""
+
+    def setUp(self):
+        super().setUp()
+        self.install("org.a")
+        self.start(launcher=["unshare", "--user", "--map-root-user", "--mount", "sh", "-c", 'mount --bind "$0" "$0" && exec "$@"',
+                             self.documents("org.a")])
+        self.library, = self.views(ROOT)
+        self.wait_for_libraries(self.library, "org.a")
+        self.target = self.host.identifier(self.make_folder("target"))
+
+    def make_folder(self, name):
+        path = os.path.join(self.storage, name)
+        os.makedirs(path)
+        return path
+
+    def trashed(self, mebibytes):
+        """A document of the application's, in its trash."""
+        source = os.path.join(self.folder, "big")
+        with open(source, "wb") as file:
+            for _ in range(mebibytes):
+                file.write(bytes(range(1, 129)) * 8192)
+        item = self.call("importDocument", path=source, parent="#org.a")
+        return self.call("trashItem", identifier=item["identifier"])["identifier"]
+
+    def test_a_put_back_that_copies_is_followed_and_cancelled(self):
+        # Whether it is over before its cancellation comes is not to be said: then one of more is tried.
+        for mebibytes in (32, 128, 512, 2048):
+            item = self.trashed(mebibytes)
+            request = self.host.send("untrashItem", identifier=item, parent=self.target)
+            while (told := self.host.next_notification("progress"))["request"] != request:
+                pass  # The import told of itself, too.
+            self.assertEqual((told["totalBytes"], told["totalItems"]), (mebibytes << 20, 1))
+            self.assertEqual(self.call("cancel", request=request), {})
+            answer = self.host.answer(request)
+            if "error" in answer:
+                break
+            self.call("deleteItem", identifier=answer["result"]["identifier"])
+        self.assertEqual((answer["error"]["data"]["domain"], answer["error"]["data"]["code"]), ("KsPOSIXErrorDomain", errno.ECANCELED))
+        self.assertEqual(os.listdir(os.path.join(self.storage, "target")), [])
+        self.assertTrue(self.call("itemForIdentifier", identifier=item)["isTrashed"])
+
+        # It is as it was, and the next attempt gets to its end.
+        restored = self.call("untrashItem", identifier=item, parent=self.target)
+        self.assertEqual((restored["parentIdentifier"], restored["isTrashed"]), (self.target, False))
+        with open(os.path.join(self.storage, "target", "big"), "rb") as file, open(os.path.join(self.folder, "big"), "rb") as source:
+            self.assertTrue(file.read() == source.read())
+        self.assertEqual(os.listdir(self.documents("org.a", ".Trash")), [])
+
+    def test_every_edit_works_there(self):
+        folder = self.call("createDirectory", name="folder", parent="#org.a")["identifier"]
+        source = os.path.join(self.folder, "tree")
+        os.makedirs(os.path.join(source, "below"))
+        with open(os.path.join(source, "below", "file"), "w", encoding="ascii") as file:
+            file.write("contents")
+        tree = self.call("importDocument", path=source, parent=folder)["identifier"]
+        self.assertEqual(os.listdir(self.documents("org.a", "folder", "tree")), ["below"])
+        # There and back.
+        for parent, path in ((self.target, os.path.join(self.storage, "target")), (folder, self.documents("org.a", "folder"))):
+            tree = self.call("reparentItem", identifier=tree, parent=parent)["identifier"]
+            with open(os.path.join(path, "tree", "below", "file"), encoding="ascii") as file:
+                self.assertEqual(file.read(), "contents")
+        self.assertEqual(os.listdir(os.path.join(self.storage, "target")), [])
+        self.call("deleteItem", identifier=tree)
+        self.assertEqual(os.listdir(self.documents("org.a", "folder")), [])
+        # Nothing is left behind where things are built.
+        for root in (self.storage, self.documents("org.a")):
+            temporary = os.path.join(root, ".TemporaryLocalFolder")
+            self.assertEqual(os.listdir(temporary) if os.path.exists(temporary) else [], [])
 
 
 class ConvergenceTest(AppsTest):

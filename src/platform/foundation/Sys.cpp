@@ -155,6 +155,7 @@ Result<FileStatus> statx(int directory, const char* name) {
     FileStatus status;
     status.fileID = raw.stx_ino;
     status.device = (std::uint64_t{raw.stx_dev_major} << 32) | raw.stx_dev_minor;
+    if ((raw.stx_mask & STATX_MNT_ID) != 0) status.mount = raw.stx_mnt_id;
     status.size = raw.stx_size;
     status.attributes = raw.stx_attributes;
     status.modificationTime = dateOf(raw.stx_mtime);

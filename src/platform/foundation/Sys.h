@@ -31,6 +31,7 @@ struct ObjectIdentity {
 struct FileStatus {
     std::uint64_t fileID = 0;
     std::uint64_t device = 0;      ///< st_dev; valid until the next boot only
+    std::uint64_t mount = 0;       ///< of which of the process's mounts it was asked; 0 where the kernel doesn't tell
     std::uint64_t size = 0;        ///< bytes
     std::uint64_t attributes = 0;  ///< STATX_ATTR_ bits
     KsDate modificationTime;

@@ -205,24 +205,16 @@ Result<void> renameWithoutReplacing(int from, const char* name, int to, const ch
     return moved;
 }
 
-/// The staging folder that is one rename away from the folder: the storage's, else one on the folder's own root.
+/// The staging folder that is one rename away from the folder: the storage's, else one on the folder's own root. (The
+/// kernel renames nothing from one mount to another, though both be of one device.)
 Result<std::unique_ptr<StagingFolder>> stagingFor(const Folder& folder,
                                                   StagingFolder::Contents contents = StagingFolder::Contents::mayGo) {
     const Root storage =
         RootDirectories::shared().rootHolding(TesselManager::defaultManager().documentStorageURL().path());
-    if (storage && storage->status.device == folder.status.device) return StagingFolder::make(storage, contents);
-    return StagingFolder::make(folder.root, contents);
-}
-
-/// Calls `move` for the staging folder; once more with one on the folder's own root where the first was on another
-/// mount. (Mounts of one device can't be told by its number.)
-template <typename Move>
-Result<void> withStagingFor(const Folder& folder, StagingFolder::Contents contents, Move move) {
-    const auto staging = stagingFor(folder, contents);
-    if (!staging.ok()) return staging.error();
-    const Result<void> moved = move(**staging);
-    if (moved.ok() || !moved.error().isPosix(EXDEV)) return moved;
-    return move(*TRY(StagingFolder::make(folder.root, contents)));
+    const auto isOneRenameAway = [&](const FileStatus& root) {
+        return root.device == folder.status.device && root.mount == folder.status.mount;
+    };
+    return StagingFolder::make(storage && isOneRenameAway(storage->status) ? storage : folder.root, contents);
 }
 
 /// Gives what was built in the temporary folder its place.
@@ -296,13 +288,12 @@ Result<void> importFile(const Source& source, const Folder& folder, const std::s
 Result<void> importByStaging(const Source& source, const Folder& folder, const std::string& path,
                              TesselProgress& progress) {
     if (source.status.isDirectory() && TRY(isWithin(folder.fd.get(), source.status))) return KsError::posix(EINVAL);
-    return withStagingFor(folder, StagingFolder::Contents::mayGo, [&](StagingFolder& staging) -> Result<void> {
-        TRY(measureTree(source.folder.get(), source.name.c_str(), path, &staging.status(), progress));
-        TreeCopy copy(progress, path, {.attributeLoss = AttributeLoss::isLogged, .excluded = &staging.status()});
-        TRY(copy.copy(source.folder.get(), source.name.c_str(), staging.fd(), StagingFolder::kItemName));
-        TRY(progress.check());
-        return putInPlace(staging.fd(), StagingFolder::kItemName, folder, source.name);
-    });
+    const auto staging = TRY(stagingFor(folder));
+    TRY(measureTree(source.folder.get(), source.name.c_str(), path, &staging->status(), progress));
+    TreeCopy copy(progress, path, {.attributeLoss = AttributeLoss::isLogged, .excluded = &staging->status()});
+    TRY(copy.copy(source.folder.get(), source.name.c_str(), staging->fd(), StagingFolder::kItemName));
+    TRY(progress.check());
+    return putInPlace(staging->fd(), StagingFolder::kItemName, folder, source.name);
 }
 
 /// The answer of an edit that was to give something a place.
@@ -428,17 +419,16 @@ Result<std::string> moveUnder(const WantedName& wanted, const Place& place, cons
 
 /// Takes the entry out of sight, and then removes it. Once it is out of sight, it is deleted.
 Result<void> removeByStaging(const Place& place, TesselProgress* progress) {
-    return withStagingFor(place.folder, StagingFolder::Contents::areKept, [&](StagingFolder& staging) -> Result<void> {
-        TRY(takeAway(place.folder, place.name, place.handle, staging));
-        const Result<void> released = staging.letGo();
-        if (!released.ok()) {
-            putBack(staging, place.folder, place.name, place.status);
-            return released;
-        }
-        const Result<void> removed = removeTree(staging.fd(), StagingFolder::kItemName, place.path(), progress);
-        if (!removed.ok()) logError("can't remove all of {}; {}", place.path(), removed.error().description());
-        return {};
-    });
+    const auto staging = TRY(stagingFor(place.folder, StagingFolder::Contents::areKept));
+    TRY(takeAway(place.folder, place.name, place.handle, *staging));
+    const Result<void> released = staging->letGo();
+    if (!released.ok()) {
+        putBack(*staging, place.folder, place.name, place.status);
+        return released;
+    }
+    const Result<void> removed = removeTree(staging->fd(), StagingFolder::kItemName, place.path(), progress);
+    if (!removed.ok()) logError("can't remove all of {}; {}", place.path(), removed.error().description());
+    return {};
 }
 
 Result<void> unlink(const Place& place, int flags) {
