@@ -8,6 +8,7 @@ import plistlib
 import random
 import shutil
 import signal
+import tempfile
 import unittest
 
 from cindral_rpc import ROOT, WORKING_SET, Client, RpcError, SystemTest, base64_text
@@ -445,6 +446,22 @@ class WhatChangesMean:
             with self.assertRaises(RpcError) as raised:
                 self.call("enumerateChanges", container=container, anchor=anchor)
             self.assertNotEqual(raised.exception.domain_code, -1002)
+
+    def test_a_change_by_a_name_that_left_the_storage_with_its_folder_is_told_where_the_other_name_is(self):
+        with tempfile.TemporaryDirectory(dir=os.path.dirname(self.storage)) as outside:
+            self.make_file("stays", "one name.txt")
+            os.mkdir(self.path("leaves"))
+            self.start()
+            everything = self.view(WORKING_SET)
+            for number in range(3):
+                os.link(self.path("stays", "one name.txt"), self.path("leaves", "another.txt"))
+                self.changes(everything)
+                os.kill(self.host.process.pid, signal.SIGSTOP)
+                self.write("leaves", "another.txt", contents=b"x" * (number + 1))
+                os.rename(self.path("leaves"), os.path.join(outside, str(number)))
+                os.mkdir(self.path("leaves"))
+                os.kill(self.host.process.pid, signal.SIGCONT)
+                self.changes(everything)
 
     # Ends and beginnings.
 

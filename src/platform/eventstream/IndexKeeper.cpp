@@ -168,6 +168,11 @@ Result<void> IndexKeeper::lookAtDirtyFolder(FileID fileID, FolderDirt dirt) {
         if (rootWithID(fileID) != nullptr) return {};
         // Where it can't be reached, its own parent tells what became of it.
         TRY(lookAtObject(fileID));
+        // Should it be gone from the roots, what changed by a name in it may have another name that is not.
+        for (const std::string& name : dirt.names) {
+            const std::optional<Known> known = findAt(fileID, name);
+            if (known && !known->isAt(fileID, name)) dirtyObjects_.insert(known->object.fileID);
+        }
         lookAgainLater(fileID, std::move(dirt));
         return {};
     }
