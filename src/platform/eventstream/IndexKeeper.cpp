@@ -232,6 +232,7 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
         !known->isAt(departure.parent, departure.name))
         return {};
     if (holds(departure.parent, departure.name, departure.fileID, departure.birthTime)) return {};
+    entriesChanged(departure.parent);
     if (known->object.hasOtherNames && keepUnderOtherName(departure.fileID)) return {};
     if (known->object.documentID != DocumentID{}) {
         recent_.add(departure.parent, departure.name, known->object.documentID, options_.now());
@@ -253,7 +254,6 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
     }
     placed_.erase(departure.fileID);
     changes().remove(departure.fileID);
-    packagesChanged(departure.parent);
     return {};
 }
 
@@ -279,7 +279,7 @@ IndexChanges& IndexKeeper::changes() {
 Result<void> IndexKeeper::flush() {
     placed_.clear();
     // In one transaction with what changed inside of them.
-    for (const FileID package : std::exchange(touchedPackages_, {})) changes().touch(package);
+    for (const FileID folder : std::exchange(touchedFolders_, {})) changes().touch(folder);
     if (!changes_ || changes_->empty()) return {};
     const auto changes = std::exchange(changes_, nullptr);
     changeCount_ += changes->size();
@@ -320,7 +320,7 @@ void IndexKeeper::lost(FileID parent, std::string_view name, const Known& known,
     if (!known.isAt(parent, name)) {
         // One of its other names. The number of names is part of its status.
         changes().removeName(known.object.fileID, parent, name);
-        packagesChanged(parent);
+        entriesChanged(parent);
         dirtyObjects_.insert(known.object.fileID);
         return;
     }
@@ -387,7 +387,8 @@ Result<void> IndexKeeper::seeMoved(OpenFolder& folder, std::string_view name, co
             }
         }
     }
-    packagesChanged(object.parent);
+    entriesChanged(object.parent);
+    entriesChanged(folder.fileID);
     if (!status.isDirectory()) {
         const bool mayHoldOldName = status.names > 1 && !openFolder(object.parent);
         put(folder.fileID, name, status, false);
@@ -418,7 +419,7 @@ Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name
     const bool isKnownName = here && here->object.fileID == object.fileID;
     if (!isKnownName) {
         changes().addName(object.fileID, folder.fileID, name);
-        packagesChanged(folder.fileID);
+        entriesChanged(folder.fileID);
     }
     if (object.changeTime != stampOf(status.changeTime) || object.size != sizeOf(status)) {
         put(object.parent, known.name, status, false);
@@ -450,7 +451,7 @@ Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, cons
         if (document != DocumentID{}) {
             recent_.add(formerHolder->object.parent, formerHolder->name, document, options_.now());
         }
-        packagesChanged(formerHolder->object.parent);
+        entriesChanged(formerHolder->object.parent);
         if (formerHolder->isFolder()) {
             TRY(removeBelow(fileID));
             // What was below and turns up elsewhere is new from here on, with all that is in it.
@@ -464,6 +465,7 @@ Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, cons
     const bool isClosed = isFolder && !sys::isReadableDirectory(folder.fd.get(), std::string(name).c_str());
     if (isFolder) noteClosed(fileID, isClosed);
     put(folder.fileID, name, status, isClosed);
+    entriesChanged(folder.fileID);
     arrived(folder.fileID, name, fileID);
     if (isFolder) {
         if (!isClosed) toScan_.push_back(fileID);
@@ -649,7 +651,15 @@ const IndexKeeper::Context& IndexKeeper::contextOf(FileID folder) {
 void IndexKeeper::packagesChanged(FileID folder) {
     if (journal_ == Journal::no) return;
     const Context& context = contextOf(folder);
-    touchedPackages_.insert(context.packages.begin(), context.packages.end());
+    touchedFolders_.insert(context.packages.begin(), context.packages.end());
+}
+
+/// A folder that entries came to or went from has changed. Its stamp need not say so: some file systems give it that of
+/// the entry, which may be one that it bears already.
+void IndexKeeper::entriesChanged(FileID folder) {
+    if (journal_ == Journal::no) return;
+    if (rootWithID(folder) == nullptr) touchedFolders_.insert(folder);
+    packagesChanged(folder);
 }
 
 }  // namespace cindral

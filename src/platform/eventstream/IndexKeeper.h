@@ -187,6 +187,7 @@ private:
     const Context& contextOf(FileID folder);
     Context contextInside(FileID parent, std::string_view name, ObjectKind kind);
     void packagesChanged(FileID folder);
+    void entriesChanged(FileID folder);
 
     // The tree.
     std::shared_ptr<OpenFolder> openFolder(FileID folder);
@@ -225,7 +226,7 @@ private:
     std::unordered_map<FileID, int> putOff_;  // Newcomers under a number whose former holder is not given up yet.
     std::uint64_t roundNumber_ = 0;
     std::unordered_map<FileID, Context> contexts_;
-    std::unordered_set<FileID> touchedPackages_;
+    std::unordered_set<FileID> touchedFolders_;
     std::unordered_map<FileID, std::shared_ptr<OpenFolder>> openFolders_;
 
     RecentDepartures recent_;

@@ -17,7 +17,9 @@ namespace cindral::test {
 
 namespace fs = std::filesystem;
 
-RecorderTest::RecorderTest() : storage_(folder_.folder("Documents")) {
+RecorderTest::RecorderTest() : RecorderTest(::testing::TempDir()) {}
+
+RecorderTest::RecorderTest(const std::string& place) : folder_(place), storage_(folder_.folder("Documents")) {
     folder_.folder("outside");
     store_ = *VolumeStore::open(state_ / "store");
     root_ = *RootDirectories::shared().add(storage_, RootPolicy::storage);

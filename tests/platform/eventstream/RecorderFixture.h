@@ -21,6 +21,7 @@ namespace cindral::test {
 class RecorderTest : public ::testing::TestWithParam<Recorder::Choice> {
 protected:
     RecorderTest();
+    explicit RecorderTest(const std::string& place);
     ~RecorderTest() override;
 
     // The recorder.

@@ -1,6 +1,7 @@
 #include "platform/eventstream/Recorder.h"
 
 #include <fcntl.h>
+#include <fmt/format.h>
 #include <gmock/gmock.h>
 #include <sys/mman.h>
 #include <sys/stat.h>
@@ -787,6 +788,31 @@ std::string nameOf(const ::testing::TestParamInfo<Recorder::Choice>& info) {
 }
 
 // Automatic is fanotify where the process may.
+/// In memory, where a folder is given the stamp of what comes to it or goes from it, which may be one that it bears.
+class RecorderInMemoryTest : public RecorderTest {
+protected:
+    RecorderInMemoryTest() : RecorderTest(TemporaryFolder::inMemory()) {}
+};
+
+TEST_P(RecorderInMemoryTest, tellsOfAFolderAsOftenAsItsEntriesChange) {
+    constexpr int kTimes = 200;
+    makeFolder("f");
+    makeFolder("files");
+    for (int i = 0; i < kTimes; ++i) write(fmt::format("files/{}", i));
+    start();
+    // Most of the time within a tick of the clock.
+    for (int i = 0; i < kTimes; ++i) {
+        write("f/" + std::to_string(i));
+        EXPECT_THAT(changes(), ::testing::Contains("f"));
+        link(fmt::format("files/{}", i), fmt::format("f/link {}", i));
+        EXPECT_THAT(changes(), ::testing::Contains("f")) << i;
+        remove(fmt::format("files/{}", i));
+        EXPECT_THAT(changes(), ::testing::Contains("files")) << i;
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(Sources, RecorderInMemoryTest,
+                         ::testing::Values(Recorder::Choice::inotify, Recorder::Choice::automatic), nameOf);
 INSTANTIATE_TEST_SUITE_P(Sources, RecorderTest,
                          ::testing::Values(Recorder::Choice::inotify, Recorder::Choice::automatic), nameOf);
 
