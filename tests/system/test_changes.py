@@ -463,6 +463,45 @@ class WhatChangesMean:
                 os.kill(self.host.process.pid, signal.SIGCONT)
                 self.changes(everything)
 
+    # Packages whose contents others follow.
+
+    def _package(self, name, *files):
+        for file in files:
+            self.make_file(name, file)
+        return self.path(name)
+
+    def test_what_is_in_a_package_is_followed_when_another_takes_its_place(self):
+        old, new = self._package("a.folio", "gone.txt", "both.txt"), self._package("b.folio", "both.txt", "new.txt")
+        self.start()
+        followed = self.view(self.identifier("a.folio"))
+        other = self.identifier("b.folio")
+        names = lambda: sorted(item["filename"] for item in followed.items.values())  # noqa: E731
+        self.assertEqual(names(), ["both.txt", "gone.txt"])
+        shutil.rmtree(old)
+        os.rename(new, old)
+        self.changes(followed)
+        self.assertEqual(names(), ["both.txt", "new.txt"])
+        self.assertEqual(self.identifier("a.folio"), followed.container)
+        # Of the two identifiers that it had, one is no more: for nothing at all.
+        self.assert_error("CindralProvider.LocalTesselKitError", 0, self.call, "itemForIdentifier", identifier=other)
+        self.assert_error(TESSEL, -1001, self.call, "currentSyncAnchor", container=other)
+
+    def test_what_is_in_a_package_is_followed_when_it_is_saved_with_a_backup(self):
+        package = self._package("a.folio", "gone.txt", "both.txt")
+        self.start()
+        followed = self.view(self.identifier("a.folio"))
+        everything = self.view(WORKING_SET)
+        for number in range(3):
+            saved = self._package("a.folio.tmp", "both.txt", f"{number}.txt")
+            os.rename(package, package + "~")
+            os.rename(saved, package)
+            self.changes(followed)
+            self.assertEqual(sorted(item["filename"] for item in followed.items.values()), [f"{number}.txt", "both.txt"])
+            self.assertEqual(self.identifier("a.folio"), followed.container)
+            shutil.rmtree(package + "~")
+            self.changes(followed)
+            self.changes(everything)
+
     # Ends and beginnings.
 
     def _change_a_little(self):

@@ -569,10 +569,23 @@ Result<void> IndexKeeper::takeOver(DocumentID document, FileID parent, const std
     const std::optional<Known> known = find(newcomer);
     if (!known || !known->isAt(parent, name) || !mayTakeOver(*known)) return {};
     if (known->object.documentID == document) return {};
+    if (known->object.kind == ObjectKind::package) TRY(replaceContents(document, newcomer));
     changes().handOver(document, newcomer);
     (void)recent_.take(parent, name, options_.now());
     restoreAttributes(document, parent, name, newcomer);
     return {};
+}
+
+/// Who looks into a package by its document finds the newcomer's contents there now, and no longer those of the former
+/// one, should that be still there.
+Result<void> IndexKeeper::replaceContents(DocumentID document, FileID newcomer) {
+    const auto record = store_.document(document);
+    const std::optional<Known> former = record ? find(record->fileID) : std::nullopt;
+    if (former && former->object.documentID == document) {
+        TRY(store_.children(former->object.fileID,
+                            [&](const IndexedObject& child) { changes().leave(child.fileID, newcomer); }));
+    }
+    return store_.children(newcomer, [&](const IndexedObject& child) { changes().touch(child.fileID); });
 }
 
 /// An older document with a number of its own was moved over another, and stays itself.

@@ -139,6 +139,7 @@ private:
     void movedAway(const Known& known, FileID newParent, std::string_view newName);
     void arrived(FileID parent, std::string_view name, FileID newcomer);
     Result<void> takeOver(DocumentID document, FileID parent, const std::string& name, FileID newcomer);
+    Result<void> replaceContents(DocumentID document, FileID newcomer);
     bool mayTakeOver(const Known& newcomer) const;
     void restoreAttributes(DocumentID document, FileID parent, const std::string& name, FileID newcomer);
 

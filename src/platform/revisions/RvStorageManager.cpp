@@ -183,6 +183,9 @@ std::uint64_t RvStorageManager::resolveDocumentID(std::int64_t documentID, std::
     if (!found.ok()) return fail(errnoOf(found.error()));
     // The number went to another object: the document's own is gone.
     if (found->status.birthStamp() != document->birthTime) return fail(ENOENT);
+    // The object took another document over, and is that one since.
+    const auto object = store->object(document->fileID);
+    if (object && object->documentID != DocumentID{static_cast<std::uint32_t>(documentID)}) return fail(ENOENT);
     return static_cast<std::uint64_t>(document->fileID);
 }
 

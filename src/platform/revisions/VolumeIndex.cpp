@@ -30,6 +30,10 @@ void IndexChanges::removeName(FileID fileID, FileID parent, std::string_view nam
     add({.kind = Operation::Kind::removeName, .object = {.fileID = fileID, .parent = parent}}, name);
 }
 
+void IndexChanges::leave(FileID fileID, FileID folder) {
+    add({.kind = Operation::Kind::leave, .object = {.fileID = fileID, .parent = folder}}, {});
+}
+
 void IndexChanges::handOver(DocumentID document, FileID to) {
     add({.kind = Operation::Kind::handOver, .object = {.fileID = to}, .document = document}, {});
 }

@@ -72,6 +72,9 @@ public:
     /// One more name of an object that is recorded under another, and the end of one.
     void addName(FileID fileID, FileID parent, std::string_view name);
     void removeName(FileID fileID, FileID parent, std::string_view name);
+    /// The object is no longer what it was in the folder, although it did not move: the folder is another than the one
+    /// that it is in, and has taken that one's document over.
+    void leave(FileID fileID, FileID folder);
     /// `to`, which must be recorded, takes the document over from whatever has it. A document that `to` had before is
     /// reported as gone.
     void handOver(DocumentID document, FileID to);
@@ -81,7 +84,7 @@ public:
     Journal journal() const { return journal_; }
 
     struct Operation {
-        enum class Kind { put, remove, touch, addName, removeName, handOver };
+        enum class Kind { put, remove, touch, addName, removeName, leave, handOver };
         Kind kind = Kind::put;
         IndexedObject object;  ///< its name points into `names`, by offset until it is read: nameOf()
         DocumentID document{};

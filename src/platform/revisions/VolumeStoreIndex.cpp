@@ -38,6 +38,7 @@ Result<std::uint64_t> VolumeStore::Implementation::apply(const IndexChanges& cha
             case Kind::touch: update.touch(object.fileID); break;
             case Kind::addName: update.addName(object.fileID, object.parent, name); break;
             case Kind::removeName: update.removeName(object.fileID, object.parent, name); break;
+            case Kind::leave: update.leave(object.fileID, object.parent); break;
             case Kind::handOver: TRY(update.handOver(operation.document, object.fileID)); break;
         }
     }

@@ -155,6 +155,13 @@ void VolumeStore::Implementation::Update::touch(FileID fileID) {
     if (touched.isThere) announce(touched);
 }
 
+void VolumeStore::Implementation::Update::leave(FileID fileID, FileID folder) {
+    Object left = object(fileID);
+    if (!left.isThere || !left.now.isKnownToSomebody()) return;
+    left.now.parent = folder;
+    depart(left, /*goesOn=*/true);
+}
+
 /// Its event is the newest from now on.
 void VolumeStore::Implementation::Update::announce(Object& object) {
     if (journals_) object.now.eventID = nextEvent_++;

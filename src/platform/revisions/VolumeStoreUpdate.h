@@ -41,6 +41,7 @@ public:
     void touch(FileID fileID);
     void addName(FileID fileID, FileID parent, std::string_view name);
     void removeName(FileID fileID, FileID parent, std::string_view name);
+    void leave(FileID fileID, FileID folder);
     /// ENOENT when the object is not recorded, or the document was never given.
     Result<void> handOver(DocumentID documentID, FileID to);
     void putAttributes(DocumentID documentID, ByteView attributes) { attributes_.emplace(documentID, attributes); }

@@ -219,6 +219,22 @@ TEST_P(VolumeIndexTest, tellsThatAListedObjectLeftItsPlace) {
     EXPECT_TRUE(recordOf(10).isListed);
 }
 
+TEST_P(VolumeIndexTest, tellsThatAListedObjectIsNoLongerInWhatTookItsFoldersDocumentOver) {
+    put(directory(3, "a~"));
+    put(directory(4, "a"));
+    put(file(10, "x", 3));
+    put(file(11, "y", 3));
+    list(file(10, "x", 3), false);
+    const std::uint64_t before = store_->currentEventID();
+    IndexChanges changes;
+    changes.leave(FileID{10}, FileID{4});
+    changes.leave(FileID{11}, FileID{4});  // Nobody knows of it.
+    changes.leave(FileID{99}, FileID{4});  // Nor of this.
+    apply(changes);
+    EXPECT_THAT(eventsAfter(before), ElementsAre("5 departed 10 4/x at 2:a/x"));
+    EXPECT_EQ(recordOf(10).parent, FileID{3});
+}
+
 TEST_P(VolumeIndexTest, tellsThatAListedObjectIsGone) {
     put(file(10, "a"));
     const DocumentID document = list(file(10, "a"));
