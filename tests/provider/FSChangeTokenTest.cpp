@@ -114,6 +114,15 @@ TEST(FSChangeToken, isAPropertyListOfItsFields) {
     EXPECT_EQ(*list, PropertyList(fieldsOfAPage()));
 }
 
+TEST(FSChangeToken, saysThatItIsAFollowers) {
+    FSChangeToken token;
+    const Bytes plain = token.encode();
+    token.isForFollower = true;
+    EXPECT_EQ(FSChangeToken::decode(token.encode()), token);
+    EXPECT_NE(token.encode(), plain);
+    EXPECT_FALSE(FSChangeToken::decode(plain)->isForFollower);
+}
+
 TEST(FSChangeToken, equalTokensHaveEqualBytes) {
     EXPECT_EQ(page().encode(), page().encode());
     EXPECT_EQ(FSChangeToken::decode(page().encode())->encode(), page().encode());

@@ -466,6 +466,62 @@ TEST_F(GatherWithHistoryTest, aPageExpiresAfterADeletion) {
                               "[INFO] deletion of " + (storage_ / "file17") + " requires to re-gather from scratch"));
 }
 
+// Every deletion moves the entries behind it up.
+TEST_F(GatherWithHistoryTest, aFollowersListingGoesBackByWhatWasDeleted) {
+    files(1'500);
+    const auto listed = enumerator();
+    std::set<std::string> seen;
+    std::set<std::string> removed;
+    std::optional<TesselPage> next = tesselInitialPageForFollowers();
+    for (int pages = 0; next; ++pages) {
+        ASSERT_LT(pages, 100);
+        const ListedPage listing = page(*listed, *next);
+        ASSERT_FALSE(listing.error) << listing.error->description();
+        const auto names = listing.names();
+        seen.insert(names.begin(), names.end());
+        next = listing.next;
+        // A few, and once more than two pages overlap by.
+        for (std::size_t i = 0; i < std::min<std::size_t>(names.size(), pages == 3 ? 90 : 5); ++i) {
+            if (removed.insert(names[i]).second) remove(names[i]);
+        }
+    }
+    for (int i = 0; i < 1'500; ++i) {
+        const std::string name = "file" + std::to_string(i);
+        EXPECT_TRUE(seen.contains(name)) << name;
+    }
+    EXPECT_GT(removed.size(), 100U);
+}
+
+TEST_F(GatherWithHistoryTest, aFollowersListingRepeatsNothingButTheOverlapWhereNothingIsDeleted) {
+    files(1'000);
+    const auto listed = enumerator();
+    std::size_t count = 0;
+    std::set<std::string> seen;
+    for (std::optional<TesselPage> next = tesselInitialPageForFollowers(); next;) {
+        const ListedPage listing = page(*listed, *next);
+        ASSERT_FALSE(listing.error);
+        const auto names = listing.names();
+        seen.insert(names.begin(), names.end());
+        count += names.size();
+        next = listing.next;
+    }
+    EXPECT_EQ(seen.size(), 1'000U);
+    EXPECT_LE(count, 1'150U);
+}
+
+// A folder that moves takes along what its one event does not count.
+TEST_F(GatherWithHistoryTest, aFollowersListingOfEverythingBelowExpires) {
+    files(250);
+    const auto listed =
+        LocalFileEnumerator::initWithContainer(kTesselWorkingSetContainerItemIdentifier, {storageURL()});
+    const ListedPage first = page(*listed, tesselInitialPageForFollowers());
+    ASSERT_TRUE(first.next);
+    remove(first.names().front());
+    const ListedPage second = page(*listed, *first.next);
+    ASSERT_TRUE(second.error);
+    EXPECT_TRUE(second.error->is("TesselErrorDomain", -1002));
+}
+
 TEST_F(GatherWithHistoryTest, aPageOutlivesItsProcess) {
     files(450);
     const ListedPage first = firstPage(*enumerator());
