@@ -13,6 +13,7 @@ namespace cindral {
 namespace {
 
 thread_local bool isPoolThread = false;
+thread_local int blockingDepth = 0;
 
 void nameThread(std::string_view name) {
     // Saves a system call where one queue comes after itself. Names that are equal as far as the kernel shows them may
@@ -126,11 +127,11 @@ void ThreadPool::didBlock() {
 }
 
 ThreadPool::BlockingRegion::BlockingRegion() {
-    if (isPoolThread) ThreadPool::shared().willBlock();
+    if (isPoolThread && blockingDepth++ == 0) ThreadPool::shared().willBlock();
 }
 
 ThreadPool::BlockingRegion::~BlockingRegion() {
-    if (isPoolThread) ThreadPool::shared().didBlock();
+    if (isPoolThread && --blockingDepth == 0) ThreadPool::shared().didBlock();
 }
 
 }  // namespace cindral

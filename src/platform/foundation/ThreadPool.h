@@ -34,7 +34,7 @@ public:
     void submit(Job job, std::string_view name = kThreadName);
 
     /// Around a wait for another thread: meanwhile a job that is ready may run in the caller's place.
-    /// Costs nothing on threads that are not the pool's.
+    /// Within another one it changes nothing. Costs nothing on threads that are not the pool's.
     class BlockingRegion {
     public:
         BlockingRegion();

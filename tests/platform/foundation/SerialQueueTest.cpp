@@ -402,6 +402,29 @@ TEST(DispatchAsync, runsOnThreadsOfThePool) {
     EXPECT_EQ(name, "cindral.pool");
 }
 
+// Each wait makes room for one other, however many regions the waiting task is in.
+TEST(ThreadPool, blockingRegionsMayBeNested) {
+    const std::size_t tasks = std::thread::hardware_concurrency() + 2;
+    DispatchGroup group;
+    for (std::size_t i = 0; i < tasks; ++i) {
+        group.enter();
+        dispatchAsync([&] {
+            const ThreadPool::BlockingRegion outer;
+            SerialQueue queue("cindral.test-inner");
+            Gate gate;
+            queue.async([&] {
+                const ThreadPool::BlockingRegion inner;
+                gate.open();
+            });
+            const ThreadPool::BlockingRegion inner;
+            gate.pass();
+            queue.sync([] {});
+            group.leave();
+        });
+    }
+    group.wait();
+}
+
 // Tasks beyond the bound wait for a thread and are run all the same.
 TEST(DispatchAsync, neverUsesMoreThreadsThanTheBound) {
     constexpr std::size_t kTasks = ThreadPool::kThreadsMax + 50;
