@@ -46,7 +46,7 @@ std::optional<HighWaterMarks> decodeHighWaterFile(ByteView bytes) {
 }
 
 Result<HighWaterFile> HighWaterFile::open(int folder) {
-    StoreFile file = TRY(StoreFile::open(folder, "ids"));
+    StoreFile file = TRY(StoreFile::open(folder, kName));
     const Bytes bytes = TRY(file.readAll());
     if (bytes.empty()) TRY(syncFolder(folder));  // Its name, too, has to be there after a power cut.
     return HighWaterFile(std::move(file), decodeHighWaterFile(bytes));

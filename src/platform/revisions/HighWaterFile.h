@@ -25,6 +25,8 @@ struct HighWaterMarks {
 /// Thread safety: the caller's.
 class HighWaterFile {
 public:
+    static constexpr const char* kName = "ids";
+
     /// The marks are none when the file is new or neither of its slots is good.
     static Result<HighWaterFile> open(int folder);
 

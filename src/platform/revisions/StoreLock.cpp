@@ -26,7 +26,7 @@ std::string pidOf(const std::string& note) {
 
 Result<StoreLock> StoreLock::acquire(int folder, const std::string& folderPath) {
     StoreLock lock;
-    lock.file_ = TRY(StoreFile::open(folder, "lock"));
+    lock.file_ = TRY(StoreFile::open(folder, kName));
     // Of the open file, not of the process: a second store in the same process is refused as well, and closing
     // some other descriptor of the file lets nothing go.
     struct flock whole {};

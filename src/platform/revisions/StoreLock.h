@@ -14,6 +14,8 @@ namespace cindral {
 /// Thread safety: the caller's.
 class StoreLock {
 public:
+    static constexpr const char* kName = "lock";
+
     StoreLock() = default;
     /// EBUSY with "holder" (the pid as text) and "path" when somebody has it already, be it this process.
     static Result<StoreLock> acquire(int folder, const std::string& folderPath);

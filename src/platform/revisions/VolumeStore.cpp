@@ -104,6 +104,10 @@ std::optional<std::uint64_t> VolumeStore::historyBegin() const {
     return implementation_->historyBegin();
 }
 
+std::optional<std::chrono::system_clock::time_point> VolumeStore::oldestEventTime() const {
+    return implementation_->oldestEventTime();
+}
+
 Result<std::uint64_t> VolumeStore::beginHistory() {
     return implementation_->beginHistory();
 }
@@ -118,6 +122,18 @@ Result<void> VolumeStore::trimJournal(std::uint64_t eventsMax, std::chrono::seco
 
 VolumeStore::Counts VolumeStore::counts() const {
     return implementation_->counts();
+}
+
+std::optional<KsError> VolumeStore::failure() const {
+    return implementation_->failure();
+}
+
+const std::string& VolumeStore::replacement() const {
+    return implementation_->replacement();
+}
+
+Result<std::vector<std::string>> VolumeStore::setAsideWhatStops(const std::string& folder) {
+    return Implementation::setAsideWhatStops(folder);
 }
 
 std::uint64_t VolumeStore::transactionCount() const {

@@ -175,6 +175,8 @@ public:
 
     /// The smallest ID after which every event is still there; none before beginHistory().
     std::optional<std::uint64_t> historyBegin() const;
+    /// About when the oldest event that is kept was journalled: at most ten minutes too early. None for no events.
+    std::optional<std::chrono::system_clock::time_point> oldestEventTime() const;
     /// Says that the index is complete: from the ID that it answers on, what happens is journalled. Forgets older
     /// events.
     Result<std::uint64_t> beginHistory();
@@ -190,6 +192,15 @@ public:
         std::uint64_t events = 0;  ///< in the journal
     };
     Counts counts() const;
+
+    /// Why what is new is in memory and in the logs alone at present; none where all is as it should be.
+    std::optional<KsError> failure() const;
+    /// What was wrong with the store that this one took the place of when it was opened, and where that was put; empty
+    /// where there was none.
+    const std::string& replacement() const;
+    /// Before a store is opened: renames what is not of the kind that a store is made of, such as a folder where a file
+    /// is to be, beside itself. Answers the new paths. What a store could open is left alone.
+    static Result<std::vector<std::string>> setAsideWhatStops(const std::string& folder);
 
     /// Transactions written since the store was opened. For tests of what a listing costs.
     std::uint64_t transactionCount() const;

@@ -63,9 +63,17 @@ public:
     Result<std::vector<JournalEvent>> events(std::uint64_t after, std::size_t max) const;
     Result<std::vector<JournalEvent>> documentEvents(std::uint64_t after, std::size_t max) const;
     std::optional<std::uint64_t> historyBegin() const;
+    std::optional<std::chrono::system_clock::time_point> oldestEventTime() const;
     Result<std::uint64_t> beginHistory();
     Result<void> renewUUID();
     Result<void> trimJournal(std::uint64_t eventsMax, std::chrono::seconds ageMax);
+
+    std::optional<KsError> failure() const {
+        const MutexLock lock(mutex_);
+        return lastFailure_;
+    }
+    const std::string& replacement() const { return replacement_; }
+    static Result<std::vector<std::string>> setAsideWhatStops(const std::string& folder);
 
     std::uint64_t transactionCount() const { return transactionCount_.load(std::memory_order_relaxed); }
 
@@ -147,6 +155,7 @@ private:
     bool opened_ = false;
     std::thread checkpointThread_;
 
+    std::string replacement_;  // Constant once the store is open.
     std::atomic<std::uint64_t> transactionCount_{0};
     mutable std::atomic<bool> isSuspect_{
         false};  // Damage was met while the store was in use: the next opening looks at everything.

@@ -1,5 +1,6 @@
 #include <algorithm>
 #include <limits>
+#include <map>
 
 #include "platform/revisions/VolumeIndex.h"
 #include "platform/revisions/VolumeStoreReading.h"
@@ -195,6 +196,27 @@ Result<std::vector<JournalEvent>> VolumeStore::Implementation::documentEvents(st
 std::optional<std::uint64_t> VolumeStore::Implementation::historyBegin() const {
     const MutexLock lock(mutex_);
     return hasHistory_ ? std::optional(forgottenEvent_) : std::nullopt;
+}
+
+std::optional<std::chrono::system_clock::time_point> VolumeStore::Implementation::oldestEventTime() const {
+    std::map<std::uint64_t, std::int64_t> marks;
+    std::uint64_t first = 0;
+    {
+        const MutexLock lock(mutex_);
+        if (counts_.events == 0) return std::nullopt;
+        first = forgottenEvent_ + 1;
+        for (const Overlay* overlay : {frozen_.get(), static_cast<const Overlay*>(active_.get())}) {
+            if (overlay != nullptr) marks.insert(overlay->timeMarks().begin(), overlay->timeMarks().end());
+        }
+    }
+    if (const auto saved = ObjectTables::Snapshot(*tables_).timeMarks(); saved.ok())
+        marks.insert(saved->begin(), saved->end());
+    if (marks.empty()) return std::nullopt;
+    // The newest mark before the first event that is kept is that event's.
+    auto mark = marks.upper_bound(first);
+    if (mark != marks.begin()) --mark;
+    return std::chrono::system_clock::time_point(
+        std::chrono::duration_cast<std::chrono::system_clock::duration>(std::chrono::nanoseconds(mark->second)));
 }
 
 Result<std::uint64_t> VolumeStore::Implementation::beginHistory() {

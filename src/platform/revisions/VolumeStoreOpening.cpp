@@ -9,6 +9,7 @@
 #include <ctime>
 
 #include "platform/foundation/Log.h"
+#include "platform/foundation/SetAside.h"
 #include "platform/foundation/Sys.h"
 #include "platform/revisions/TablePages.h"
 #include "platform/revisions/VolumeStoreImplementation.h"
@@ -148,9 +149,25 @@ Result<void> VolumeStore::Implementation::setAside(const KsError& damage) {
     }
     TRY(syncFolder(folderFd_.get()));
     const auto message = damage.userInfo().find("message");
-    logError("the volume store in {} is damaged ({}); it was set aside as {}{} and a new one begins", folder_,
-             message != damage.userInfo().end() ? message->second : damage.reason(), kTablesName, suffix);
+    replacement_ =
+        fmt::format("the volume store in {} is damaged ({}); it was set aside as {}{} and a new one begins", folder_,
+                    message != damage.userInfo().end() ? message->second : damage.reason(), kTablesName, suffix);
+    logError("{}", replacement_);
     return {};
+}
+
+Result<std::vector<std::string>> VolumeStore::Implementation::setAsideWhatStops(const std::string& folder) {
+    std::vector<std::string> aside;
+    const auto setAside = [&](const std::string& path, ExpectedKind kind) -> Result<void> {
+        if (auto renamed = TRY(setAsideUnless(path, kind))) aside.push_back(*std::move(renamed));
+        return {};
+    };
+    TRY(setAside(folder, ExpectedKind::folder));
+    for (const char* name : {kTablesName, kLogNames[0], kLogNames[1], StoreLock::kName, HighWaterFile::kName})
+        TRY(setAside(folder + "/" + name, ExpectedKind::file));
+    // LMDB's own, which it makes anew.
+    TRY(setAside(fmt::format("{}/{}-lock", folder, kTablesName), ExpectedKind::file));
+    return aside;
 }
 
 // MARK: The logs

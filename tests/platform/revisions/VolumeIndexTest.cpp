@@ -672,6 +672,29 @@ TEST_P(VolumeIndexTest, forgetsEventsThatAreTooOldAndNoOther) {
     EXPECT_EQ(store_->historyBegin(), store_->currentEventID());
 }
 
+TEST_P(VolumeIndexTest, knowsAboutWhenItsOldestEventWas) {
+    using std::chrono::minutes;
+    *store_->beginHistory();
+    EXPECT_FALSE(store_->oldestEventTime());
+    const auto begin = now_;
+    for (std::uint64_t id = 10; id < 40; ++id) {  // Events 2 to 31, five minutes apart.
+        put(file(id, "a", id));
+        EXPECT_EQ(store_->oldestEventTime(), begin) << "also where it is not saved yet";
+        now_ += minutes(5);
+        if (id == 25) reopen();
+    }
+    for (std::uint64_t kept = 29; kept > 0; --kept) {
+        ASSERT_TRUE(store_->trimJournal(kept, std::chrono::hours(10)).ok());
+        const auto first = begin + minutes(5 * (30 - static_cast<int>(kept)));
+        EXPECT_LE(store_->oldestEventTime(), first);
+        EXPECT_GE(store_->oldestEventTime(), first - minutes(10));
+    }
+    ASSERT_TRUE(store_->renewUUID().ok());
+    EXPECT_FALSE(store_->oldestEventTime());
+    put(file(50, "later", 50));
+    EXPECT_EQ(store_->oldestEventTime(), now_);
+}
+
 TEST_P(VolumeIndexTest, goesByAClockThatWasSetBack) {
     using std::chrono::hours;
     *store_->beginHistory();

@@ -819,6 +819,7 @@ protected:
         EXPECT_EQ(log.count("[ERROR]"), 1U);
         EXPECT_EQ(log.count("is damaged"), 1U);
         EXPECT_EQ(filesWith("volume.damaged-", folder()).size(), 1U);
+        EXPECT_NE(store_->replacement().find("is damaged"), std::string::npos);
         EXPECT_GT(number(documentOf(1, "new")), last_);
     }
 
