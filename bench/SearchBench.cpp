@@ -152,10 +152,11 @@ void measure(const std::string& path, std::uint64_t count) {
     const TesselItemIdentifier root = kTesselRootContainerItemIdentifier;
     require(store->beginGather(Bytes{std::byte{1}}, std::span(&root, 1)));
     for (std::uint64_t number = 0; number < count;) {
-        TesselItems items;
-        for (; number < count && items.size() < 10'000; ++number) {
-            items.push_back(makeItem(number, random));
-            linear.add(*items.back());
+        std::vector<IndexedItem> items;
+        for (const std::size_t atOnce = store->itemsAtOnce(); number < count && items.size() < atOnce; ++number) {
+            const auto item = makeItem(number, random);
+            linear.add(*item);
+            items.push_back(IndexedItem::of(*item));
         }
         filling += seconds([&] { require(store->putListed(items, std::span(&root, 1), {})); });
     }

@@ -32,6 +32,7 @@ struct IndexedItem {
     std::vector<std::string> tags;  ///< sorted, each once
 
     static IndexedItem of(const TesselItem& item);
+    bool operator==(const IndexedItem&) const = default;
 
     /// What counts as the item's date where the newest come first.
     std::optional<std::int64_t> recency() const { return used ? used : modified; }

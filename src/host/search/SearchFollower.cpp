@@ -11,9 +11,7 @@
 namespace cindral {
 namespace {
 
-// Put in together: a transaction costs more than an item.
-constexpr std::size_t kItemsAtOnceMax = 10'000;
-constexpr std::size_t kContainersAtOnceMax = 256;
+constexpr std::size_t kContainersAtOnceMax = 20'000;
 
 bool isExpired(const KsError& error) {
     return error.is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::pageExpired));
@@ -42,10 +40,10 @@ public:
                 if (listed.error().isPosix(ECANCELED)) return listed.error();
                 break;
             }
-            items_.insert(items_.end(), std::make_move_iterator(listed->items.begin()),
-                          std::make_move_iterator(listed->items.end()));
+            // What is kept of an item is a fraction of it.
+            for (const auto& item : listed->items) items_.push_back(IndexedItem::of(*item));
             page = std::move(listed->nextPage);
-            if (items_.size() >= kItemsAtOnceMax) TRY(put());
+            if (items_.size() >= itemsAtOnce_) TRY(put());
         }
         addTrash(container);
         listed_.push_back(container);
@@ -57,6 +55,7 @@ public:
         items_.clear();
         listed_.clear();
         more_.clear();
+        itemsAtOnce_ = store_.itemsAtOnce();
         return {};
     }
 
@@ -72,7 +71,8 @@ private:
 
     SearchFollower& follower_;
     SearchStore& store_;
-    TesselItems items_;
+    std::size_t itemsAtOnce_ = store_.itemsAtOnce();
+    std::vector<IndexedItem> items_;
     std::vector<TesselItemIdentifier> listed_;
     std::vector<TesselItemIdentifier> more_;
 };

@@ -25,12 +25,13 @@ public:
     /// Returns when everything that was complete before the call is in the store. `gathered` says whether the index was
     /// gathered anew on the way.
     Result<void> catchUp(SearchStore& store, bool& gathered);
+    /// All there is will be gathered once more by the next catchUp().
+    Result<void> beginGather(SearchStore& store);
     /// What is under way ends with ECANCELED, as all that is begun later.
     void stop() { isStopped_ = true; }
 
 private:
     class Listing;
-    Result<void> beginGather(SearchStore& store);
     Result<void> listAll(SearchStore& store);
     Result<bool> followOnce(SearchStore& store);
     Result<void> confirmForgotten(SearchStore& store);

@@ -1,9 +1,11 @@
 #include "host/search/SearchIndex.h"
 
+#include <fmt/format.h>
 #include <sys/stat.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <charconv>
 #include <limits>
 #include <unordered_map>
 #include <utility>
@@ -38,8 +40,12 @@ void orderByDate(TesselItems& items, const std::vector<SearchStore::Hit>& hits) 
 }  // namespace
 
 SearchIndex::SearchIndex(std::shared_ptr<TesselExtension> provider, SignalDispatcher& signals, std::string file,
-                         std::string locale)
-    : file_(std::move(file)), locale_(std::move(locale)), client_(std::move(provider)), signals_(signals) {}
+                         std::string locale, Clock clock)
+    : file_(std::move(file)),
+      locale_(std::move(locale)),
+      clock_(std::move(clock)),
+      client_(std::move(provider)),
+      signals_(signals) {}
 
 SearchIndex::~SearchIndex() {
     stop();
@@ -60,6 +66,18 @@ void SearchIndex::stop() {
     }
     queue_.sync([] {});
     watchQueue_.sync([] {});
+    std::optional<Moment> reached;
+    {
+        const MutexLock lock(mutex_);
+        reached.swap(reachedMoment_);
+    }
+    if (reached) noteMoment(*reached);
+}
+
+/// For the status of the next process alone: where it can't be written, more seems to be left to do than there is.
+void SearchIndex::noteMoment(const Moment& moment) {
+    const MutexLock lock(storeMutex_);
+    if (store_) (void)store_->setNote(fmt::format("{} {}", moment.history, moment.event));
 }
 
 // MARK: Following
@@ -69,6 +87,7 @@ Result<std::shared_ptr<SearchStore>> SearchIndex::store() {
     if (!store_) {
         if (!collation_) collation_ = std::make_unique<NameCollation>(locale_);
         store_ = TRY(SearchStore::open(file_, *collation_));
+        wasDamaged_ = wasDamaged_ || store_->isReplacement();
         store_->setWitness([this](const IndexedItem& item) { witness(item); });
     }
     return store_;
@@ -125,8 +144,18 @@ Result<void> SearchIndex::runOnce() {
 Result<void> SearchIndex::attempt() {
     const auto current = TRY(store());
     bool gathered = false;
+    const std::uint64_t changesBefore = current->changeCount();
     Result<void> done = follower_.catchUp(*current, gathered);
     if (gathered) noteAll();
+    if (done.ok() && clock_) {
+        // What was complete before is in the history by now. What came while it was followed counts as followed, for as
+        // long as it takes its signal to come.
+        Moment moment = clock_();
+        // What has changed nothing costs no write.
+        if (current->changeCount() != changesBefore) noteMoment(moment);
+        const MutexLock lock(mutex_);
+        reachedMoment_ = std::move(moment);
+    }
     if (!done.ok() && isDamagedDatabase(done.error())) replaceDamaged(current);
     return done;
 }
@@ -136,6 +165,7 @@ void SearchIndex::replaceDamaged(const std::shared_ptr<SearchStore>& damaged) {
     if (store_ != damaged) return;
     logError("making the search index anew; it is damaged");
     store_.reset();
+    wasDamaged_ = true;
     if (const Result<void> removed = SearchStore::remove(file_); !removed.ok())
         logError("can't remove {}; {}", file_, removed.error().description());
 }
@@ -262,8 +292,7 @@ void SearchIndex::deleteItems(const std::vector<std::string>& domains, TesselMan
         {
             // Where there is no index yet, there is nothing to forget.
             const MutexLock lock(storeMutex_);
-            struct stat there {};
-            if (!store_ && ::lstat(file_.c_str(), &there) != 0) return {};
+            if (!store_ && !hasFile()) return {};
         }
         TRY(TRY(store())->forgetDomains(domains));
         tellWatches();
@@ -273,38 +302,81 @@ void SearchIndex::deleteItems(const std::vector<std::string>& domains, TesselMan
     if (completion) completion(forget.ok() ? std::nullopt : std::optional(forget.error()));
 }
 
+bool SearchIndex::hasFile() const {
+    struct stat there {};
+    return ::lstat(file_.c_str(), &there) == 0;
+}
+
+std::optional<std::uint64_t> SearchIndex::eventsBehind(SearchStore& store, const std::optional<Moment>& reached) {
+    if (!clock_) return 0;
+    const Moment now = clock_();
+    const auto since = [&](const Moment& then) {
+        return then.history == now.history && then.event <= now.event ? std::optional(now.event - then.event)
+                                                                      : std::nullopt;
+    };
+    if (reached) return since(*reached);
+    // As the last process left it.
+    const Result<std::string> note = store.note();
+    if (!note.ok()) return std::nullopt;
+    const std::size_t space = note->find(' ');
+    Moment then{note->substr(0, space), 0};
+    const char* const end = note->data() + note->size();
+    if (space == std::string::npos || std::from_chars(note->data() + space + 1, end, then.event).ptr != end)
+        return std::nullopt;
+    return since(then);
+}
+
 SearchIndex::Status SearchIndex::status() {
     Status status;
-    std::shared_ptr<SearchStore> current;
+    std::optional<Moment> reached;
+    {
+        const MutexLock lock(mutex_);
+        status.reachedAt = reachedAt_;
+        reached = reachedMoment_;
+        if (!outcome_.ok() && !outcome_.error().isPosix(ECANCELED)) status.error = outcome_.error();
+    }
     {
         const MutexLock lock(storeMutex_);
-        current = store_;
+        status.exists = store_ || hasFile();
     }
-    if (current) {
-        status.isOpen = true;
-        if (const auto counts = current->counts(); counts.ok()) {
-            status.items = counts->items;
-            status.bytes = counts->bytes;
-        }
-        if (const auto position = current->position(); position.ok()) status.isGathering = position->isGathering;
+    if (!status.exists) return status;
+    const auto current = store();
+    if (!current.ok()) {
+        status.error = current.error();
+        return status;
     }
-    const MutexLock lock(mutex_);
-    status.reachedAt = reachedAt_;
-    if (!outcome_.ok()) status.error = outcome_.error().description();
+    if (const auto counts = (*current)->counts(); counts.ok()) {
+        status.items = counts->items;
+        status.bytes = counts->bytes;
+    }
+    status.isGathering = (*current)->isGathering();
+    if (!status.isGathering) status.eventsBehind = eventsBehind(**current, reached);
     return status;
 }
 
 Result<SearchIndex::Audit> SearchIndex::audit() {
     Audit audit;
+    const auto gathersOf = [](SearchStore& store) { return store.gatherCounts().gather; };
+    const std::uint64_t before = hasFile() ? gathersOf(*TRY(store())) : 0;
     TRY(catchUp());
-    const auto current = TRY(store());
-    if (const Result<void> checked = current->check(); !checked.ok()) {
-        if (!isDamagedDatabase(checked.error())) return checked.error();
-        audit.wasDamaged = true;
+    auto current = TRY(store());
+    const Result<void> checked = current->check();
+    if (!checked.ok() && !isDamagedDatabase(checked.error())) return checked.error();
+    if (!checked.ok()) {
         replaceDamaged(current);
         TRY(catchUp());
-        return audit;
+    } else if (gathersOf(*current) == before) {
+        Result<void> begun;
+        queue_.sync([&] { begun = follower_.beginGather(*current); });
+        TRY(std::move(begun));
+        TRY(catchUp());
+        const SearchStore::GatherCounts found = current->gatherCounts();
+        audit.missing = found.put;
+        audit.outdated = found.changed;
+        audit.superfluous = found.removed;
     }
+    const MutexLock lock(storeMutex_);
+    audit.wasDamaged = std::exchange(wasDamaged_, false);
     return audit;
 }
 

@@ -32,9 +32,16 @@ namespace cindral {
 /// Thread safety: all operations, from any thread.
 class SearchIndex final : public SearchQueries, public SearchableItems {
 public:
-    /// `file` is where it is kept. `signals` is borrowed for life.
+    /// Where the history of changes is: the number of its last event. Numbers of two histories can't be compared.
+    struct Moment {
+        std::string history;
+        std::uint64_t event = 0;
+    };
+    using Clock = std::function<Moment()>;
+
+    /// `file` is where it is kept. `signals` is borrowed for life. Without a clock nothing is behind.
     SearchIndex(std::shared_ptr<TesselExtension> provider, SignalDispatcher& signals, std::string file,
-                std::string locale = NameCollation::localeOfProcess());
+                std::string locale = NameCollation::localeOfProcess(), Clock clock = {});
     /// What waits is answered with ECANCELED.
     ~SearchIndex() override;
     SearchIndex(const SearchIndex&) = delete;
@@ -56,21 +63,27 @@ public:
     void deleteItems(const std::vector<std::string>& domains, TesselManager::Completion completion) override;
 
     struct Status {
-        bool isOpen = false;
+        bool exists = false;  ///< false: nobody has asked for it yet
         bool isGathering = false;
         std::uint64_t items = 0;
         std::uint64_t bytes = 0;
-        std::optional<KsDate> reachedAt;   ///< when it last was at the present; none: not since the start
-        std::optional<std::string> error;  ///< why it isn't, where something went wrong
+        /// Events since it was at the present. Those that are none of its business count too until it has looked. None
+        /// where all is to be gathered anew.
+        std::optional<std::uint64_t> eventsBehind;
+        std::optional<KsDate> reachedAt;  ///< when it last was at the present; none: not since the start
+        std::optional<KsError> error;     ///< why it isn't, where something went wrong
     };
+    /// Opens a file that is there, and leaves it as it is.
     Status status();
 
     struct Audit {
-        bool wasDamaged = false;
-        std::uint64_t missing = 0;      ///< were in the tree alone
-        std::uint64_t superfluous = 0;  ///< were in the index alone
+        bool wasDamaged = false;        ///< and was made anew, now or since the last audit
+        std::uint64_t missing = 0;      ///< items that were not in it
+        std::uint64_t outdated = 0;     ///< items that were in it as they no longer are
+        std::uint64_t superfluous = 0;  ///< items that were in it alone
     };
-    /// Compares the index with what the provider lists, and gathers it anew where they differ.
+    /// Looks at the whole file, and gathers all there is once more, which puts right what is wrong. What comes, changes
+    /// and goes meanwhile is counted too.
     Result<Audit> audit();
 
 private:
@@ -87,6 +100,9 @@ private:
     void witness(const IndexedItem& item);
     void noteAll();
     void tellWatches();
+    bool hasFile() const;
+    std::optional<std::uint64_t> eventsBehind(SearchStore& store, const std::optional<Moment>& reached);
+    void noteMoment(const Moment& moment);
     void replaceDamaged(const std::shared_ptr<SearchStore>& damaged);
     template <typename Value>
     Result<Value> ask(const std::function<Result<Value>(SearchStore&)>& question);
@@ -95,6 +111,7 @@ private:
     // Constant after construction.
     const std::string file_;
     const std::string locale_;
+    const Clock clock_;
     ProviderClient client_;
     SignalDispatcher& signals_;
     SearchFollower follower_{client_};
@@ -102,6 +119,7 @@ private:
     Mutex storeMutex_;
     std::unique_ptr<NameCollation> collation_ GUARDED_BY(storeMutex_);  ///< null until there has been a store
     std::shared_ptr<SearchStore> store_ GUARDED_BY(storeMutex_);        ///< null until it is opened
+    bool wasDamaged_ GUARDED_BY(storeMutex_) = false;                   ///< since the last audit
 
     Mutex mutex_;
     Condition reachedChanged_;
@@ -111,6 +129,7 @@ private:
     bool isScheduled_ GUARDED_BY(mutex_) = false;
     bool isStopped_ GUARDED_BY(mutex_) = false;
     std::optional<KsDate> reachedAt_ GUARDED_BY(mutex_);
+    std::optional<Moment> reachedMoment_ GUARDED_BY(mutex_);
 
     Mutex watchesMutex_;
     std::map<std::uint64_t, Watch> watches_ GUARDED_BY(watchesMutex_);

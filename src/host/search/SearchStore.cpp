@@ -13,6 +13,7 @@
 #include "host/search/NameFolding.h"
 #include "host/search/SearchFunctions.h"
 #include "platform/foundation/Log.h"
+#include "platform/foundation/SetAside.h"
 #include "platform/foundation/Sys.h"
 #include "platform/tessel/TesselErrors.h"
 
@@ -33,8 +34,15 @@ constexpr std::size_t kViewsMax = 8;
 // Matches that are read all together, and put in order then.
 constexpr std::uint64_t kFoundAtOnceMax = 4'000;
 constexpr std::uint64_t kChangesOfSampleMax = 10'000;
+constexpr std::size_t kItemsAtOnceMin = 10'000;
+// Some 30 MB of memory.
+constexpr std::size_t kItemsAtOnceMax = 100'000;
 // Small files are looked at in whole when they are opened; of others, damage shows where it is come upon.
 constexpr std::int64_t kCheckedPagesMax = 1'024;
+
+// What a gather writes to lies all over the file.
+constexpr const char* kManyPages = "PRAGMA cache_size = -98304";
+constexpr const char* kFewPages = "PRAGMA cache_size = -16384; PRAGMA shrink_memory";
 
 constexpr const char* kSchema = R"(
     CREATE TABLE facts(name TEXT PRIMARY KEY, value) WITHOUT ROWID;
@@ -84,7 +92,7 @@ std::string matchOf(const std::vector<std::string>& grams) {
 Result<void> configure(SqliteDatabase& database) {
     // A transaction that is lost with the power takes its anchor with it, so that nothing is missed.
     TRY(
-        database.run("PRAGMA journal_mode = WAL; PRAGMA synchronous = NORMAL; PRAGMA cache_size = -32768;"
+        database.run("PRAGMA journal_mode = WAL; PRAGMA synchronous = NORMAL; PRAGMA cache_size = -16384;"
                      "PRAGMA wal_autocheckpoint = 4000; PRAGMA temp_store = MEMORY;"));
     return {};
 }
@@ -123,8 +131,8 @@ Result<void> createTables(SqliteDatabase& database, const NameCollation& collati
     return transaction.commit();
 }
 
-/// A connection that writes, with a file that can be gone on with.
-Result<SqliteDatabase> openOurs(const std::string& path, const NameCollation& collation) {
+/// A connection that writes, with a file that can be gone on with. `isReplacement`: another had to go for it.
+Result<SqliteDatabase> openOurs(const std::string& path, const NameCollation& collation, bool& isReplacement) {
     const auto attempt = [&]() -> Result<SqliteDatabase> {
         struct stat there {};
         if (::lstat(path.c_str(), &there) == 0 && !S_ISREG(there.st_mode))
@@ -143,6 +151,7 @@ Result<SqliteDatabase> openOurs(const std::string& path, const NameCollation& co
     logError("making the search index anew; {}",
              why != opened.error().userInfo().end() ? why->second : "it is damaged");
     TRY(SearchStore::remove(path));
+    isReplacement = true;
     return attempt();
 }
 
@@ -182,6 +191,7 @@ struct SearchStore::Writer {
     std::int64_t count = 0;   ///< of items
     std::int64_t gather = 0;  ///< number of the gather that is under way, or was the last
     bool isGathering = false;
+    GatherCounts gatherCounts;
     std::unordered_map<std::string, std::int64_t> wordIDs;
     std::unordered_map<std::int64_t, std::string> words;
     /// What is still to be said to the table of names in the transaction.
@@ -236,7 +246,7 @@ Result<void> SearchStore::Writer::prepare() {
     count = TRY(database.integer("SELECT value FROM facts WHERE name = 'items'")).value_or(0);
     gather = TRY(database.integer("SELECT value FROM facts WHERE name = 'gather'")).value_or(0);
     isGathering = TRY(database.integer("SELECT value FROM facts WHERE name = 'isGathering'")).value_or(0) != 0;
-    return {};
+    return isGathering ? database.run(kManyPages) : Result<void>();
 }
 
 Result<std::int64_t> SearchStore::Writer::wordID(const std::string& word) {
@@ -342,8 +352,12 @@ Result<void> SearchStore::Writer::put(const IndexedItem& item) {
     if (isGathering && item.isFolder() && (!before || before->gather != gather))
         TRY(insertUnlisted.run(std::string_view(item.identifier)));
     see(item);
-    if (!before) return insert(item, TRY(freePlace(item)));
+    if (!before) {
+        ++gatherCounts.put;
+        return insert(item, TRY(freePlace(item)));
+    }
     see(before->item);
+    if (!(before->item == item)) ++gatherCounts.changed;
 
     const bool isSamePlace = before->item.recency() == item.recency();
     const bool isSameName = before->item.name == item.name && before->item.isTrashed() == item.isTrashed();
@@ -460,6 +474,7 @@ Result<std::unique_ptr<SearchStore>> SearchStore::open(std::string path, const N
         logError("making the search index anew; {}", opened.error().description());
         store = std::unique_ptr<SearchStore>(new SearchStore(store->path_, collation));
         TRY(remove(store->path_));
+        store->isReplacement_ = true;
         opened = store->openBoth();
     }
     if (!opened.ok()) return opened.error();
@@ -469,8 +484,9 @@ Result<std::unique_ptr<SearchStore>> SearchStore::open(std::string path, const N
 Result<void> SearchStore::openBoth() {
     const MutexLock writing(writerMutex_);
     const MutexLock reading(readerMutex_);
-    writer_ = std::make_unique<Writer>(TRY(openOurs(path_, collation_)));
+    writer_ = std::make_unique<Writer>(TRY(openOurs(path_, collation_, isReplacement_)));
     TRY(writer_->prepare());
+    isGathering_ = writer_->isGathering;
     const auto index = TRY(writer_->database.integer("SELECT value FROM facts WHERE name = 'index'"));
     if (!index) return KsError::posix(EBADMSG).with("message", "it has no number");
     index_ = static_cast<std::uint64_t>(*index);
@@ -482,6 +498,8 @@ Result<void> SearchStore::openBoth() {
 
 Result<void> SearchStore::remove(const std::string& path) {
     for (const char* suffix : {"-wal", "-shm", "-journal", ""}) {
+        // A folder may hold something that somebody wants to have.
+        TRY(setAsideUnless(path + suffix, ExpectedKind::file));
         if (::unlink((path + suffix).c_str()) != 0 && errno != ENOENT)
             return KsError::errorWithPOSIXCode().with("path", path + suffix);
     }
@@ -515,6 +533,7 @@ Result<void> SearchStore::write(const Work& work) {
         writer.words.clear();
         writer.nameChanges.clear();
     }
+    isGathering_ = writer.isGathering;
     ++changes_;
     return done;
 }
@@ -535,9 +554,11 @@ Result<SearchStore::Position> SearchStore::position() {
 Result<void> SearchStore::beginGather(const TesselSyncAnchor& anchor,
                                       std::span<const TesselItemIdentifier> firstContainers) {
     const MutexLock lock(writerMutex_);
+    TRY(writer_->database.run(kManyPages));
     return write([&](Writer& writer) -> Result<void> {
         ++writer.gather;
         writer.isGathering = true;
+        writer.gatherCounts = {};
         TRY(writer.setFact.run(std::string_view("gather"), writer.gather));
         TRY(writer.setFact.run(std::string_view("isGathering"), std::int64_t{1}));
         TRY(writer.setAnchor(anchor));
@@ -556,11 +577,16 @@ Result<std::vector<TesselItemIdentifier>> SearchStore::unlisted(std::size_t max)
     return containers;
 }
 
-Result<void> SearchStore::putListed(const TesselItems& items, std::span<const TesselItemIdentifier> listed,
+std::size_t SearchStore::itemsAtOnce() {
+    const MutexLock lock(writerMutex_);
+    return std::clamp(static_cast<std::size_t>(writer_->count) / 8, kItemsAtOnceMin, kItemsAtOnceMax);
+}
+
+Result<void> SearchStore::putListed(std::span<const IndexedItem> items, std::span<const TesselItemIdentifier> listed,
                                     std::span<const TesselItemIdentifier> more) {
     const MutexLock lock(writerMutex_);
     return write([&](Writer& writer) -> Result<void> {
-        for (const auto& item : items) TRY(writer.put(IndexedItem::of(*item)));
+        for (const IndexedItem& item : items) TRY(writer.put(item));
         for (const auto& container : more) TRY(writer.insertUnlisted.run(std::string_view(container)));
         for (const auto& container : listed) TRY(writer.deleteUnlisted.run(std::string_view(container)));
         return {};
@@ -583,7 +609,7 @@ Result<void> SearchStore::apply(const ChangesBatch& batch) {
 
 Result<void> SearchStore::endGather() {
     const MutexLock lock(writerMutex_);
-    return write([&](Writer& writer) -> Result<void> {
+    TRY(write([&](Writer& writer) -> Result<void> {
         std::vector<TesselItemIdentifier> stale;
         writer.selectStale.bind(writer.gather);
         while (TRY(writer.selectStale.step())) stale.emplace_back(writer.selectStale.text(0));
@@ -593,8 +619,30 @@ Result<void> SearchStore::endGather() {
             if (const auto there = TRY(writer.row(identifier))) TRY(writer.erase(*there));
         }
         writer.isGathering = false;
+        writer.gatherCounts.removed = stale.size();
         return writer.setFact.run(std::string_view("isGathering"), std::int64_t{0});
-    });
+    }));
+    return writer_->database.run(kFewPages);
+}
+
+SearchStore::GatherCounts SearchStore::gatherCounts() {
+    const MutexLock lock(writerMutex_);
+    GatherCounts counts = writer_->gatherCounts;
+    counts.gather = static_cast<std::uint64_t>(writer_->gather);
+    return counts;
+}
+
+Result<void> SearchStore::setNote(const std::string& note) {
+    const MutexLock lock(writerMutex_);
+    return writer_->setFact.run(std::string_view("note"), std::string_view(note));
+}
+
+Result<std::string> SearchStore::note() {
+    const MutexLock lock(writerMutex_);
+    SqliteStatement& fact = writer_->selectFact;
+    std::string note = TRY(fact.bind(std::string_view("note")).step()) ? std::string(fact.text(0)) : std::string();
+    fact.reset();
+    return note;
 }
 
 Result<void> SearchStore::forgetDomains(const std::vector<std::string>& domains) {
@@ -864,6 +912,10 @@ Result<std::vector<TesselItemIdentifier>> SearchStore::identifiers() {
 }
 
 Result<void> SearchStore::check() {
+    {
+        const MutexLock lock(writerMutex_);
+        TRY(writer_->database.run("INSERT INTO names(names, rank) VALUES('integrity-check', 0)"));
+    }
     const MutexLock lock(readerMutex_);
     SqliteStatement rows = TRY(reader_->database.prepare("PRAGMA integrity_check(1)"));
     if (TRY(rows.step()) && rows.text(0) == "ok") return {};

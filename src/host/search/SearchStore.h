@@ -53,15 +53,35 @@ public:
         bool isGathering = false;                ///< what is there is not all
     };
     Result<Position> position();
+    /// The same, without waiting for who writes.
+    bool isGathering() const { return isGathering_; }
     /// From now on what is put in counts as found, and what was not found by endGather() goes. Containers that are come
     /// upon are to be listed, the first among them.
     Result<void> beginGather(const TesselSyncAnchor& anchor, std::span<const TesselItemIdentifier> firstContainers);
     /// Some of those that are to be listed.
     Result<std::vector<TesselItemIdentifier>> unlisted(std::size_t max);
-    Result<void> putListed(const TesselItems& items, std::span<const TesselItemIdentifier> listed,
+    Result<void> putListed(std::span<const IndexedItem> items, std::span<const TesselItemIdentifier> listed,
                            std::span<const TesselItemIdentifier> more);
+    /// How many items are best put in together: places lie all over the table, so that each time nearly every page of it
+    /// is written.
+    std::size_t itemsAtOnce();
     Result<void> apply(const ChangesBatch& batch);
     Result<void> endGather();
+    struct GatherCounts {
+        std::uint64_t gather = 0;   ///< its number
+        std::uint64_t put = 0;      ///< that were not there
+        std::uint64_t changed = 0;  ///< that were there otherwise
+        std::uint64_t removed = 0;  ///< that were not found
+    };
+    /// Of the gather that is under way, or was the last; 0 for what was done before the store was opened.
+    GatherCounts gatherCounts();
+    /// A note of its owner's, kept with the rest; empty for none.
+    Result<void> setNote(const std::string& note);
+    Result<std::string> note();
+    /// Grows with each transaction that puts in or takes out.
+    std::uint64_t changeCount() const { return changes_; }
+    /// Whether it took the place of another file, which was damaged or of another form, when it was opened.
+    bool isReplacement() const { return isReplacement_; }
     /// Takes out what belongs to the domains. Remembers them until the next confirmDomains().
     Result<void> forgetDomains(const std::vector<std::string>& domains);
     Result<std::vector<std::string>> forgottenDomains();
@@ -126,6 +146,8 @@ private:
     std::uint64_t index_ = 0;
 
     std::atomic<std::uint64_t> changes_ = 0;
+    std::atomic<bool> isGathering_ = false;
+    bool isReplacement_ = false;  ///< constant once it is open
 
     /// Held over transactions, and so over the disk.
     Mutex writerMutex_;

@@ -220,6 +220,55 @@ TEST_F(SearchIndexTest, isMadeAnewWhenItTurnsOutDamaged) {
     EXPECT_EQ(log.count("making the search index anew"), 1U);
 }
 
+TEST_F(SearchIndexTest, auditsItselfAgainstWhatIsListed) {
+    EXPECT_EQ(names("report").size(), 2U);
+    const auto whole = index_->audit();
+    ASSERT_TRUE(whole.ok());
+    EXPECT_EQ(whole->missing + whole->superfluous, 0U);
+    EXPECT_FALSE(whole->wasDamaged);
+    // Nobody told of these.
+    provider_->remove("did=1");
+    provider_->document("did=8", "report eight", "fid=10");
+    provider_->document("did=9", "report nine", "fid=10");
+    const auto audit = index_->audit();
+    ASSERT_TRUE(audit.ok());
+    EXPECT_EQ(audit->missing, 2U);
+    EXPECT_EQ(audit->outdated, 0U);
+    EXPECT_EQ(audit->superfluous, 1U);
+    EXPECT_EQ(names("report").size(), 3U);
+}
+
+TEST_F(SearchIndexTest, tellsHowFarItIsBehind) {
+    SearchIndex::Moment now{"history", 7};
+    const auto open = [&] {
+        index_ = std::make_unique<SearchIndex>(provider_, signals_, file_, "C", [&now] { return now; });
+    };
+    open();
+    EXPECT_FALSE(index_->status().exists);
+    EXPECT_EQ(names("report").size(), 2U);
+    SearchIndex::Status status = index_->status();
+    EXPECT_TRUE(status.exists);
+    EXPECT_EQ(status.items, 3U);
+    EXPECT_EQ(status.eventsBehind, 0U);
+    EXPECT_TRUE(status.reachedAt);
+    EXPECT_FALSE(status.error);
+    now.event = 10;
+    EXPECT_EQ(index_->status().eventsBehind, 3U);
+    index_.reset();
+    open();
+    EXPECT_EQ(index_->status().eventsBehind, 3U) << "also after a restart";
+    EXPECT_FALSE(index_->status().reachedAt);
+    names("report");
+    EXPECT_EQ(index_->status().eventsBehind, 0U);
+    now.history = "another";
+    EXPECT_FALSE(index_->status().eventsBehind);
+    now = {"history", 3};
+    EXPECT_FALSE(index_->status().eventsBehind) << "a history that was put back";
+    provider_->changes[kWorkingSet] = {{{}, "anchor", false, KsError::posix(EIO)}};
+    EXPECT_FALSE(index_->find({SearchQuery::Kind::names, "report"}, std::nullopt, 1).ok());
+    EXPECT_TRUE(index_->status().error->isPosix(EIO));
+}
+
 TEST_F(SearchIndexTest, sharesOneLookAmongManyQuestions) {
     open();
     std::vector<std::thread> threads;

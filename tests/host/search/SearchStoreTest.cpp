@@ -326,7 +326,8 @@ TEST_F(SearchStoreTest, gathersAnewAndLeavesOutWhatWasNotFound) {
     EXPECT_TRUE(store_->position()->isGathering) << "also after a restart";
     EXPECT_EQ(anchor(), "n");
     EXPECT_THAT(*store_->unlisted(9), ElementsAre(kRoot));
-    const TesselItems listed{item("did=1", "stays"), folder("fid=5", "new folder")};
+    const std::vector<IndexedItem> listed{IndexedItem::of(*item("did=1", "stays")),
+                                          IndexedItem::of(*folder("fid=5", "new folder"))};
     ASSERT_TRUE(store_->putListed(listed, std::span(&first, 1), {}).ok());
     EXPECT_THAT(*store_->unlisted(9), ElementsAre("fid=5")) << "what is come upon is to be listed";
     // One that comes with the changes is to be listed as well, unless it was come upon before.
