@@ -12,6 +12,7 @@
 #include "host/ItemWriter.h"
 #include "host/JsonText.h"
 #include "host/SearchCommands.h"
+#include "host/StatusReport.h"
 #include "host/TerminalText.h"
 #include "host/TreePrinter.h"
 #include "platform/foundation/Base64.h"
@@ -27,6 +28,10 @@ constexpr unsigned kThumbnailPixels = 256;
 bool isManyFolders(const TesselItemIdentifier& container) {
     return container == kTesselRootContainerItemIdentifier || container == kTesselWorkingSetContainerItemIdentifier ||
            container == kTesselAllDirectoriesContainerItemIdentifier;
+}
+
+KsError notWell(std::size_t problems) {
+    return hostFailure(problems == 1 ? "one thing is not well" : fmt::format("{} things are not well", problems));
 }
 
 bool isExpired(const KsError& error) {
@@ -55,6 +60,7 @@ Result<void> Commands::run() {
         case HostCommand::changes: return changes();
         case HostCommand::watch: return watch();
         case HostCommand::status: return status();
+        case HostCommand::doctor: return doctor();
         case HostCommand::edit: return EditCommands(context_, EditTerminal::ofProcess(), output_).run();
         case HostCommand::thumbnail: return thumbnail();
         case HostCommand::find: return search({SearchQuery::Kind::names, context_.options.text});
@@ -271,16 +277,24 @@ Result<void> Commands::watch() {
 
 Result<void> Commands::status() {
     const std::string text = TRY(context_.statusText());
+    const StatusReport report = StatusReport::of(text);
     if (context_.options.json) {
         output_.line(text);
-        return {};
+    } else {
+        output_.buffer() += report.text;
     }
-    const auto fields = nlohmann::ordered_json::parse(text, nullptr, /*allow_exceptions=*/false);
-    for (const auto& [key, value] : fields.items()) {
-        const std::string shown = value.is_string() ? value.get<std::string>() : value.dump();
-        output_.line(fmt::format("{:<19} {}", key, terminalText(shown)));
+    return report.problems == 0 ? Result<void>() : notWell(report.problems);
+}
+
+Result<void> Commands::doctor() {
+    const std::string text = TRY(context_.doctorText());
+    const DoctorReport report = DoctorReport::of(text, context_.setAside);
+    if (context_.options.json) {
+        output_.line(report.json);
+    } else {
+        output_.buffer() += report.text;
     }
-    return {};
+    return report.problems == 0 ? Result<void>() : notWell(report.problems);
 }
 
 Result<void> Commands::search(const SearchQuery& query) {

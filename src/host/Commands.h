@@ -3,6 +3,7 @@
 #include <functional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "host/ChangePrinter.h"
 #include "host/HostOptions.h"
@@ -32,6 +33,9 @@ public:
         /// From the call on, what asks a command that has no end to end makes the descriptor readable.
         std::function<Result<int>()> stopDescriptor;
         SearchQueries& search;
+        std::function<Result<std::string>()> doctorText;  ///< as JSON
+        /// Where what stopped the start was put before this one.
+        std::vector<std::string> setAside;
     };
 
     /// All borrowed for life.
@@ -58,6 +62,7 @@ private:
     Result<void> changes();
     Result<void> watch();
     Result<void> status();
+    Result<void> doctor();
     Result<void> thumbnail();
     Result<void> search(const SearchQuery& query);
 

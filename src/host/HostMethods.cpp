@@ -217,6 +217,12 @@ void status(const HostMethodsContext& context, const Json& /*params*/, const Rep
     reply->result([&](std::string& out) { out += context.statusText(); });
 }
 
+void doctor(const HostMethodsContext& context, const Json& /*params*/, const Reply& reply) {
+    const Result<std::string> done = context.doctorText();
+    if (!done.ok()) return answerWithError(*reply, done.error(), context.paths);
+    reply->result([&](std::string& out) { out += *done; });
+}
+
 void hello(const HostMethodsContext& context, const Json& params, const Reply& reply) {
     const auto endsSoon = params.find("endsSoon");
     const bool says = endsSoon != params.end() && endsSoon->is_boolean() && endsSoon->get<bool>();
@@ -271,6 +277,7 @@ JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context) {
         {"fetchThumbnails", fetchThumbnails},
         {"status", status},
         {"hello", hello},
+        {"doctor", doctor},
     };
     JsonRpcServer::Methods methods = makeEditMethods(context);
     methods.merge(makeSearchMethods(context));

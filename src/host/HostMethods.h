@@ -21,6 +21,7 @@ struct HostMethodsContext {
     QueryWatches& watches;
     /// What the host says of itself, as JSON; told whether the client ends soon, and by itself.
     std::function<std::string(bool endsSoon)> hello;
+    std::function<Result<std::string>()> doctorText;  ///< as JSON
 };
 
 /// The methods of the host interface, for one client.

@@ -22,6 +22,7 @@ enum class HostCommand {
     changes,
     watch,
     status,
+    doctor,
     rpc,
     serve,
     edit,

@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "host/HealthCheck.h"
 #include "host/HostError.h"
 #include "host/HostVersion.h"
 #include "host/JsonText.h"
@@ -23,8 +24,16 @@ namespace {
 
 constexpr const char* kOwnBundleIdentifier = "com.vemra.CindralStorage";
 
+std::string storeFolder(const std::string& state) {
+    return state + "/store";
+}
+
+std::string applicationSupportFolder(const std::string& state) {
+    return state + "/Application Support";
+}
+
 Result<std::shared_ptr<VolumeStore>> openStore(const std::string& state) {
-    auto store = VolumeStore::open(state + "/store");
+    auto store = VolumeStore::open(storeFolder(state));
     if (store.ok()) return std::shared_ptr<VolumeStore>(*std::move(store));
     const auto holder = store.error().userInfo().find("holder");
     if (store.error().isPosix(EBUSY) && holder != store.error().userInfo().end()) {
@@ -81,6 +90,7 @@ bool records(HostCommand command) {
         case HostCommand::changes:
         case HostCommand::watch:
         case HostCommand::status:
+        case HostCommand::doctor:
         case HostCommand::find:
         case HostCommand::recents:
         case HostCommand::tagged:
@@ -103,6 +113,38 @@ bool records(HostCommand command) {
     return false;
 }
 
+std::string searchStatusText(const SearchIndex::Status& search) {
+    std::string out;
+    appendField(out, "exists", search.exists ? "true" : "false");
+    appendField(out, "isGathering", search.isGathering ? "true" : "false");
+    appendField(out, "items", fmt::to_string(search.items));
+    appendField(out, "bytes", fmt::to_string(search.bytes));
+    if (search.eventsBehind) appendField(out, "eventsBehind", fmt::to_string(*search.eventsBehind));
+    if (search.reachedAt) appendField(out, "reachedAt", jsonString(search.reachedAt->rfc3339()));
+    return out + "}";
+}
+
+KsDate dateOf(std::chrono::system_clock::time_point time) {
+    const auto since = time.time_since_epoch();
+    const auto seconds = std::chrono::floor<std::chrono::seconds>(since);
+    return {seconds.count(),
+            static_cast<std::uint32_t>(std::chrono::duration_cast<std::chrono::nanoseconds>(since - seconds).count())};
+}
+
+std::string_view recorderStateName(const Recorder::Status& recorder) {
+    if (recorder.failure) return "failing";
+    return recorder.isReading ? "reading" : "following";
+}
+
+std::string problemsText(const std::vector<HealthProblem>& problems) {
+    std::string out = "[";
+    for (const auto& [what, remedy] : problems) {
+        if (out.size() > 1) out += ',';
+        out += fmt::format(R"({{"what":{},"remedy":{}}})", jsonString(what), jsonString(remedy));
+    }
+    return out + "]";
+}
+
 /// What is checked by comparison instead of by events, and what below the roots is not published at all: "full" where
 /// there is neither.
 std::string coverageText(const Recorder::Status& recorder, const PresentedPaths& paths) {
@@ -123,8 +165,20 @@ std::string coverageText(const Recorder::Status& recorder, const PresentedPaths&
 }  // namespace
 
 HostProcess::HostProcess(HostOptions options, PresentedPaths paths, std::string state,
-                         std::shared_ptr<VolumeStore> store)
-    : options_(std::move(options)), paths_(std::move(paths)), state_(std::move(state)), store_(std::move(store)) {}
+                         std::shared_ptr<VolumeStore> store, std::unique_ptr<ErrorLog> errors)
+    : options_(std::move(options)),
+      paths_(std::move(paths)),
+      state_(std::move(state)),
+      errors_(std::move(errors)),
+      store_(std::move(store)) {}
+
+Result<std::vector<std::string>> HostProcess::setAsideWhatStops(const std::string& state,
+                                                                ProviderRepair repairProvider) {
+    std::vector<std::string> aside = TRY(VolumeStore::setAsideWhatStops(storeFolder(state)));
+    const std::vector<std::string> providers = TRY(repairProvider(applicationSupportFolder(state)));
+    aside.insert(aside.end(), providers.begin(), providers.end());
+    return aside;
+}
 
 Result<std::unique_ptr<HostProcess>> HostProcess::start(HostOptions options, const HostEnvironment& environment,
                                                         TesselExtensionFactory makeProvider, const Steps& steps) {
@@ -135,6 +189,7 @@ Result<std::unique_ptr<HostProcess>> HostProcess::start(HostOptions options, con
 
     std::string state = TRY(storage_folders::makeState(options.state));
     if (steps.stateIsThere) TRY(steps.stateIsThere(state));
+    auto errors = std::make_unique<ErrorLog>();
     auto store = TRY(openStore(state));
     if (steps.stateIsOurs) TRY(steps.stateIsOurs(state));
     const std::string real = TRY(storage_folders::makeStorage(options.storage));
@@ -143,11 +198,15 @@ Result<std::unique_ptr<HostProcess>> HostProcess::start(HostOptions options, con
 
     // The constructor is nobody else's to call.
     std::unique_ptr<HostProcess> host(
-        new HostProcess(std::move(options), std::move(paths), std::move(state), std::move(store)));
+        new HostProcess(std::move(options), std::move(paths), std::move(state), std::move(store), std::move(errors)));
     TRY(host->connect());
     RoApplicationWorkspace::defaultWorkspace().start(rosterSources(host->options_, environment));
     host->provider_ = makeProvider();
-    host->search_ = std::make_shared<SearchIndex>(host->provider_, *host->signals_, host->state_ + "/search-index");
+    host->search_ =
+        std::make_shared<SearchIndex>(host->provider_, *host->signals_, host->state_ + "/search-index",
+                                      NameCollation::localeOfProcess(), [store = host->store_] {
+                                          return SearchIndex::Moment{store->uuid().string(), store->currentEventID()};
+                                      });
     host->signals_->setSearchableItems(host->search_);
     host->provider_->waitUntilReady();
     if (records(host->options_.command)) host->startRecorder();
@@ -164,7 +223,7 @@ Result<void> HostProcess::connect() {
     }
     RoApplicationWorkspace::defaultWorkspace().setOwnRecord(ownRecord(paths_));
     TesselManager::defaultManager().setDocumentStorageURL(KsURL::fileURL(paths_.presented()));
-    TesselManager::defaultManager().setApplicationSupportURL(KsURL::fileURL(state_ + "/Application Support"));
+    TesselManager::defaultManager().setApplicationSupportURL(KsURL::fileURL(applicationSupportFolder(state_)));
     TesselManager::defaultManager().setSharesDesktopTags(options_.desktopTags);
     TesselManager::defaultManager().setHost(signals_);
     return {};
@@ -256,6 +315,7 @@ std::string HostProcess::statusText() const {
     appendField(out, "storage", jsonString(paths_.real()));
     appendField(out, "state", jsonString(state_));
     appendField(out, "recorder", jsonString(recorder.recorder));
+    appendField(out, "recorderState", jsonString(std::string(recorderStateName(recorder))));
     appendField(out, "recorderOption", jsonString(recorderChoiceName(options_.recorder)));
     appendField(out, "applicationFolders", listText(options_.applications));
     appendField(out, "flatpak", options_.flatpak ? "true" : "false");
@@ -265,10 +325,47 @@ std::string HostProcess::statusText() const {
     appendField(out, "documents", fmt::to_string(counts.documents));
     appendField(out, "events", fmt::to_string(counts.events));
     appendField(out, "oldestEventID", fmt::to_string(store_->historyBegin().value_or(currentEventID)));
+    if (const auto oldest = store_->oldestEventTime())
+        appendField(out, "oldestEventDate", jsonString(dateOf(*oldest).rfc3339()));
     appendField(out, "currentEventID", fmt::to_string(currentEventID));
     appendField(out, "volumeUUID", jsonString(store_->uuid().string()));
     appendField(out, "coverage", coverageText(recorder, paths_));
     appendField(out, "auditedDifferences", fmt::to_string(recorder.auditedDifferences));
+    appendField(out, "watches",
+                fmt::format(R"({{"used":{},"limit":{}}})", recorder.watches.used, recorder.watches.limit));
+    appendField(out, "appLibraries", fmt::to_string(roots.empty() ? 0 : roots.size() - 1));
+    const SearchIndex::Status search = search_->status();
+    appendField(out, "search", searchStatusText(search));
+    const ErrorLog::Recent errors = errors_->recent(KsDate::now());
+    appendField(out, "errors", fmt::format(R"({{"lastHour":{},"last":{}}})", errors.count, jsonString(errors.last)));
+    appendField(out, "problems",
+                problemsText(findHealthProblems({paths_, state_, recorder, store_->failure(), search, errors})));
+    return out + "}";
+}
+
+Result<std::string> HostProcess::doctorText() const {
+    if (!recorder_) return hostFailure("nothing is recorded");
+    const auto unwell = [](std::string_view what, const KsError& error) {
+        return hostFailure(fmt::format("can't compare {}: {}", what, messageOf(error)));
+    };
+    const auto differences = recorder_->audit();
+    if (!differences.ok()) return unwell("the files", differences.error());
+    const auto audit = search_->audit();
+    if (!audit.ok()) return unwell("the search index", audit.error());
+    // Whatever was logged: all has been looked at.
+    errors_->forget();
+    const SearchIndex::Status search = search_->status();
+    std::string out;
+    appendField(out, "objects", fmt::to_string(store_->counts().objects));
+    appendField(out, "differences", fmt::to_string(*differences));
+    appendField(out, "search",
+                fmt::format(R"({{"items":{},"wasDamaged":{},"missing":{},"outdated":{},"superfluous":{}}})",
+                            search.items, audit->wasDamaged, audit->missing, audit->outdated, audit->superfluous));
+    std::vector<std::string> repairs;
+    if (!store_->replacement().empty()) repairs.push_back(store_->replacement());
+    appendField(out, "repairs", listText(repairs));
+    appendField(out, "problems",
+                problemsText(findHealthProblems({paths_, state_, recorder_->status(), store_->failure(), search, {}})));
     return out + "}";
 }
 

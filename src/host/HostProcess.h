@@ -4,6 +4,7 @@
 #include <memory>
 #include <string>
 
+#include "host/ErrorLog.h"
 #include "host/HostOptions.h"
 #include "host/PresentedPaths.h"
 #include "host/SignalDispatcher.h"
@@ -14,6 +15,10 @@
 #include "platform/tessel/TesselExtension.h"
 
 namespace cindral {
+
+/// Before a provider is made: sets aside what would keep one from starting, in the folder in which providers keep what
+/// they know. Answers the new paths.
+using ProviderRepair = Result<std::vector<std::string>> (*)(const std::string& applicationSupport);
 
 /// The host: the folders, the stores and the provider of one process, set up and taken down in order.
 ///
@@ -31,6 +36,9 @@ public:
     /// info says which.
     static Result<std::unique_ptr<HostProcess>> start(HostOptions options, const HostEnvironment& environment,
                                                       TesselExtensionFactory makeProvider, const Steps& steps = {});
+    /// Before a start, of a state folder that nobody uses: sets aside what would keep one from coming to its end. Answers
+    /// the new paths.
+    static Result<std::vector<std::string>> setAsideWhatStops(const std::string& state, ProviderRepair repairProvider);
     ~HostProcess();
     HostProcess(const HostProcess&) = delete;
     HostProcess& operator=(const HostProcess&) = delete;
@@ -49,19 +57,23 @@ public:
     void waitForHistory() const;
     /// What `status` answers, as JSON text.
     std::string statusText() const;
+    /// Compares and repairs, and answers what `doctor` answers, as JSON text. May take as long as a first reading.
+    Result<std::string> doctorText() const;
     /// What `hello` answers, as JSON text: what a command that finds the daemon has to know of it.
     std::string helloText() const;
     /// The end is near: who waits for the first reading of the roots is told that it will not come to its end.
     void beginStop() const;
 
 private:
-    HostProcess(HostOptions options, PresentedPaths paths, std::string state, std::shared_ptr<VolumeStore> store);
+    HostProcess(HostOptions options, PresentedPaths paths, std::string state, std::shared_ptr<VolumeStore> store,
+                std::unique_ptr<ErrorLog> errors);
     Result<void> connect();
     void startRecorder();
 
     const HostOptions options_;
     const PresentedPaths paths_;
     const std::string state_;
+    const std::unique_ptr<ErrorLog> errors_;  // Before what may log.
     const std::shared_ptr<SignalDispatcher> signals_ = std::make_shared<SignalDispatcher>();
     std::shared_ptr<VolumeStore> store_;
     std::shared_ptr<Recorder> recorder_;  // Null for commands that don't ask for changes.

@@ -150,7 +150,7 @@ int runCommand(const Commands::Context& context) {
 }
 
 /// Alone: with a host of the command's own, for as long as it takes.
-int runAlone(const HostProcess& host, const HostEnvironment& environment) {
+int runAlone(const HostProcess& host, const HostEnvironment& environment, std::vector<std::string> setAside) {
     if (host.options().command == HostCommand::rpc) return runRpc(host);
     ProviderClient client(host.provider());
     const auto statusText = [&] {
@@ -162,8 +162,8 @@ int runAlone(const HostProcess& host, const HostEnvironment& environment) {
         stopSignals = TRY(StopSignals::catchThem());
         return stopSignals->descriptor();
     };
-    return runCommand(
-        {client, host.paths(), host.options(), environment, statusText, host.signals(), stopDescriptor, host.search()});
+    return runCommand({client, host.paths(), host.options(), environment, statusText, host.signals(), stopDescriptor,
+                       host.search(), [&] { return host.doctorText(); }, std::move(setAside)});
 }
 
 /// By the daemon.
@@ -187,8 +187,16 @@ int runRemotely(const HostOptions& options, const HostEnvironment& environment, 
         stopSignals = TRY(StopSignals::catchThem());
         return stopSignals->descriptor();
     };
-    return runCommand({client, paths, options, environment, [&] { return client.statusText(); }, signals,
-                       stopDescriptor, client.search()});
+    return runCommand({client,
+                       paths,
+                       options,
+                       environment,
+                       [&] { return client.statusText(); },
+                       signals,
+                       stopDescriptor,
+                       client.search(),
+                       [&] { return client.doctorText(); },
+                       {}});
 }
 
 /// They look at the applications themselves, with a daemon's eyes where there is one.
@@ -200,7 +208,8 @@ int runApps(const HostOptions& options, const HostEnvironment& environment) {
 }
 
 /// What the options say, by the daemon where there is one.
-int runByDaemonOrAlone(HostOptions options, const HostEnvironment& environment, TesselExtensionFactory makeProvider) {
+int runByDaemonOrAlone(HostOptions options, const HostEnvironment& environment, TesselExtensionFactory makeProvider,
+                       ProviderRepair repairProvider) {
     while (true) {
         auto found = findDaemon(options);
         if (!found.ok()) return failWith(found.error());
@@ -214,12 +223,22 @@ int runByDaemonOrAlone(HostOptions options, const HostEnvironment& environment, 
         // Without a state folder nobody could be kept from becoming its daemon meanwhile.
         const bool isSure = found->handover.has_value();
         HostProcess::Steps steps;
+        std::vector<std::string> setAside;
+        if (options.command == HostCommand::doctor) {
+            steps.stateIsThere = [&](const std::string& state) -> Result<void> {
+                auto done = HostProcess::setAsideWhatStops(state, repairProvider);
+                if (!done.ok())
+                    return hostFailure(fmt::format("can't set aside what is damaged: {}", messageOf(done.error())));
+                setAside = *std::move(done);
+                return {};
+            };
+        }
         steps.stateIsOurs = [&](const std::string&) -> Result<void> {
             found->handover.reset();
             return {};
         };
         const auto host = HostProcess::start(options, environment, makeProvider, steps);
-        if (host.ok()) return runAlone(**host, environment);
+        if (host.ok()) return runAlone(**host, environment, std::move(setAside));
         if (isSure || !host.error().userInfo().contains("holder")) return failWith(host.error());
     }
 }
@@ -227,7 +246,7 @@ int runByDaemonOrAlone(HostOptions options, const HostEnvironment& environment, 
 }  // namespace
 
 int runProgram(std::span<const std::string> words, const HostEnvironment& environment,
-               TesselExtensionFactory makeProvider) {
+               TesselExtensionFactory makeProvider, ProviderRepair repairProvider) {
     auto parsed = parseHostOptions(words, environment);
     if (const auto* reply = std::get_if<HostReply>(&parsed)) return say(*reply);
     auto& options = std::get<HostOptions>(parsed);
@@ -238,7 +257,7 @@ int runProgram(std::span<const std::string> words, const HostEnvironment& enviro
     if (!isRpc && !isServe && !environment.hasLogLevel) log::setLevel(LogLevel::error);
 
     if (isServe) return runServe(std::move(options), environment, makeProvider);
-    return runByDaemonOrAlone(std::move(options), environment, makeProvider);
+    return runByDaemonOrAlone(std::move(options), environment, makeProvider, repairProvider);
 }
 
 }  // namespace cindral

@@ -99,4 +99,8 @@ Result<std::string> RemoteClient::statusText() {
     return connection_.callForText("status", Params());
 }
 
+Result<std::string> RemoteClient::doctorText() {
+    return connection_.callForText("doctor", Params());
+}
+
 }  // namespace cindral

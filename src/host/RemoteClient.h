@@ -33,6 +33,7 @@ public:
 
     /// What `status` answers, as JSON text, once the roots have been read or compared.
     Result<std::string> statusText();
+    Result<std::string> doctorText();
 
 private:
     void didLoseDaemon();

@@ -49,9 +49,13 @@ Result<void> readAll(int input, int output, const UniqueFd& interrupt, LineSplit
 }  // namespace
 
 RpcService serviceOf(const HostProcess& host) {
-    return {host.provider(), host.paths(),
-            host.signals(),  [&host] { return host.statusText(); },
-            host.search(),   [&host](bool) { return host.helloText(); }};
+    return {host.provider(),
+            host.paths(),
+            host.signals(),
+            [&host] { return host.statusText(); },
+            host.search(),
+            [&host](bool) { return host.helloText(); },
+            [&host] { return host.doctorText(); }};
 }
 
 Result<void> serveRpc(int input, int output, const RpcService& service) {

@@ -12,5 +12,6 @@ int main(int argc, char** argv) {
     // A reader that goes away is told by the write.
     std::signal(SIGPIPE, SIG_IGN);
     const std::vector<std::string> words(argv + (argc > 0 ? 1 : 0), argv + argc);
-    return cindral::runProgram(words, cindral::HostEnvironment::ofProcess(), &cindral::makeCindralProvider);
+    return cindral::runProgram(words, cindral::HostEnvironment::ofProcess(), &cindral::makeCindralProvider,
+                               &cindral::repairCindralProvider);
 }

@@ -12,6 +12,7 @@
 #include "platform/foundation/KeyedArchive.h"
 #include "platform/foundation/Log.h"
 #include "platform/foundation/Mutex.h"
+#include "platform/foundation/SetAside.h"
 #include "platform/tessel/TesselManager.h"
 
 namespace cindral {
@@ -65,6 +66,12 @@ bool hasOnlyAllowedClasses(const PropertyList& value) {
         }
     }
     return true;
+}
+
+/// Whether the archive can be read, and is of something else than a cache.
+bool isOfSomethingElse(const keyed_archive::Unarchived& archive) {
+    if (archive.root && !hasOnlyAllowedClasses(*archive.root)) return false;
+    return !archive.root || !archive.root->dictionary() || RoBundleProxy::archivedClassOf(*archive.root) != nullptr;
 }
 
 std::optional<RoBundleProxies> bundleProxiesIn(const PropertyList* value) {
@@ -134,13 +141,25 @@ LocalAppLibraryCache::Loaded LocalAppLibraryCache::loadBundleProxies() {
     logDebug("read from disk {} bytes at {}", bytes->size(), cacheURL_.path());
     const auto archive = keyed_archive::unarchive(*bytes);
     if (!archive || (archive->root && !hasOnlyAllowedClasses(*archive->root))) return {};
-    const bool isDictionary =
-        archive->root && archive->root->dictionary() && RoBundleProxy::archivedClassOf(*archive->root) == nullptr;
-    if (!isDictionary) {
+    if (isOfSomethingElse(*archive)) {
         fatal(fmt::format("the {} at {} is an archive of something else; remove that file, and it is made anew",
                           description(), cacheURL_.path()));
     }
     return loadFrom(*archive->root->dictionary());
+}
+
+Result<std::optional<std::string>> LocalAppLibraryCache::setAsideWhatStops() const {
+    if (auto aside = TRY(setAsideUnless(cacheURL_.path(), ExpectedKind::file))) return aside;
+    const Result<Bytes> bytes = readFile();
+    const auto archive = bytes.ok() ? keyed_archive::unarchive(*bytes) : std::nullopt;
+    if (!archive) return std::optional<std::string>();
+    const auto* root = archive->root ? archive->root->dictionary() : nullptr;
+    const auto token = root != nullptr ? root->find(kVersionTokenKey) : PropertyList::Dictionary::const_iterator();
+    // Such a version can have no successor.
+    const bool isUsedUp = root != nullptr && token != root->end() && token->second.unsignedInteger() != nullptr &&
+                          *token->second.unsignedInteger() == std::numeric_limits<std::uint64_t>::max();
+    if (!isUsedUp && !isOfSomethingElse(*archive)) return std::optional<std::string>();
+    return std::optional(TRY(setAside(cacheURL_.path())));
 }
 
 LocalAppLibraryCache::Loaded LocalAppLibraryCache::loadFrom(const PropertyList::Dictionary& root) {

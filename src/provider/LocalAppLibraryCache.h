@@ -43,6 +43,10 @@ public:
 
     LocalAppLibraryCache(LocalAppLibraryCacheSource source, const KsURL& applicationSupport);
 
+    /// Sets aside a file that would stop the process when it is loaded, and what is no file. Answers the new path; none
+    /// where there is nothing of the kind.
+    Result<std::optional<std::string>> setAsideWhatStops() const;
+
     SerialQueue& queue() { return queue_; }
     std::string_view description() const { return descriptionOf(source_); }
     const KsURL& cacheURL() const { return cacheURL_; }

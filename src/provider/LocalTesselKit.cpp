@@ -11,6 +11,7 @@
 #include "platform/foundation/Dispatch.h"
 #include "platform/foundation/Log.h"
 #include "platform/foundation/RootDirectories.h"
+#include "platform/foundation/SetAside.h"
 #include "platform/roster/Roster.h"
 #include "platform/tessel/NotificationCenter.h"
 #include "platform/tessel/StagingFolder.h"
@@ -19,6 +20,7 @@
 #include "provider/AppRefresh.h"
 #include "provider/CindralProvider.h"
 #include "provider/KsURL+CdlFileObjectIdentifier.h"
+#include "provider/LocalAppLibraryCache.h"
 #include "provider/LocalAppLibraryItem.h"
 #include "provider/LocalFileEnumerator.h"
 #include "provider/LocalRootEnumerator.h"
@@ -280,6 +282,20 @@ void LocalTesselKit::fetchThumbnailsForItemIdentifiersWithType(const std::vector
         perThumbnail(identifier, std::move(thumbnail), type);
     }
     completion(std::nullopt);
+}
+
+Result<std::vector<std::string>> repairCindralProvider(const std::string& applicationSupport) {
+    std::vector<std::string> aside;
+    const KsURL folder = KsURL::fileURL(applicationSupport);
+    if (auto renamed = TRY(setAsideUnless(applicationSupport, ExpectedKind::folder))) aside.push_back(*renamed);
+    for (const auto source : {LocalAppLibraryCacheSource::main, LocalAppLibraryCacheSource::workingSet}) {
+        const LocalAppLibraryCache cache(source, folder);
+        const std::string& file = cache.cacheURL().path();
+        const std::string holder = file.substr(0, file.rfind('/'));
+        if (auto renamed = TRY(setAsideUnless(holder, ExpectedKind::folder))) aside.push_back(*std::move(renamed));
+        if (auto renamed = TRY(cache.setAsideWhatStops())) aside.push_back(*std::move(renamed));
+    }
+    return aside;
 }
 
 std::shared_ptr<TesselExtension> makeCindralProvider() {

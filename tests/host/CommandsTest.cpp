@@ -60,9 +60,16 @@ protected:
         options_.command = command;
         options_.item = std::move(item);
         ProviderClient client(provider_);
-        const auto done = Commands({client, paths_, options_, environment_,
-                                    [] { return std::string(R"({"version":"1","events":0})"); }, signals_,
-                                    [this]() -> Result<int> { return stop_.get(); }, search_},
+        const auto done = Commands({client,
+                                    paths_,
+                                    options_,
+                                    environment_,
+                                    [this] { return status_; },
+                                    signals_,
+                                    [this]() -> Result<int> { return stop_.get(); },
+                                    search_,
+                                    [this] { return Result<std::string>(doctor_); },
+                                    {}},
                                    output)
                               .run();
         failure_ = done.ok() ? "" : messageOf(done.error());
@@ -115,6 +122,8 @@ protected:
     HostOptions options_;
     SignalDispatcher signals_;
     test::FakeSearch search_;
+    std::string status_ = R"({"version":"1","events":0})";
+    std::string doctor_;
     const UniqueFd stop_ = *descriptor::makeInterrupt();
     std::string failure_;
 };
@@ -323,9 +332,59 @@ TEST_F(CommandsTest, printsAnchors) {
 }
 
 TEST_F(CommandsTest, printsStatus) {
-    EXPECT_EQ(run(HostCommand::status), "version             1\nevents              0\n");
+    EXPECT_EQ(run(HostCommand::status), "All is well.\nversion   1\nhistory   0 events kept\n");
+    EXPECT_EQ(failure_, "");
     options_.json = true;
     EXPECT_EQ(jsonLines(run(HostCommand::status))[0], (json{{"version", "1"}, {"events", 0}}));
+}
+
+TEST_F(CommandsTest, failsWhereTheStatusTellsOfAProblem) {
+    status_ = R"({"version":"1","problems":[{"what":"it hurts","remedy":"don't do that"}]})";
+    EXPECT_THAT(run(HostCommand::status), StartsWith("Not well: it hurts\n  To do: don't do that\n"));
+    EXPECT_EQ(failure_, "one thing is not well");
+    options_.json = true;
+    EXPECT_EQ(jsonLines(run(HostCommand::status))[0]["version"], "1");
+    EXPECT_EQ(failure_, "one thing is not well");
+}
+
+TEST_F(CommandsTest, saysWhatTheDoctorDid) {
+    doctor_ = R"({"objects":7,"differences":0,"search":{"items":6}})";
+    EXPECT_THAT(run(HostCommand::doctor), HasSubstr("it is whole.\n"));
+    EXPECT_EQ(failure_, "");
+    doctor_ = R"({"objects":7,"problems":[{"what":"it hurts","remedy":"rest"},{"what":"more","remedy":"r"}]})";
+    EXPECT_THAT(run(HostCommand::doctor), HasSubstr("Not well: it hurts\n  To do: rest\n"));
+    EXPECT_EQ(failure_, "2 things are not well");
+    options_.json = true;
+    EXPECT_EQ(jsonLines(run(HostCommand::doctor))[0]["setAside"], json::array());
+    EXPECT_EQ(failure_, "2 things are not well");
+}
+
+TEST_F(CommandsTest, printsWhatIsFoundWithItsPath) {
+    document("did=1", "report.txt");
+    document("did=2", "other.txt");
+    search_.pages = {{{*provider_->itemForIdentifier("did=1")}, Bytes{std::byte{'x'}}},
+                     {{*provider_->itemForIdentifier("did=2")}, std::nullopt}};
+    options_.text = "rep";
+    const std::string found = run(HostCommand::find);
+    EXPECT_THAT(found, HasSubstr("/report.txt\n"));
+    EXPECT_THAT(found, HasSubstr("/other.txt\n"));
+    EXPECT_THAT(search_.asked,
+                ::testing::ElementsAre(test::FakeSearch::Asked{SearchQuery::Kind::names, "rep", "", 200},
+                                       test::FakeSearch::Asked{SearchQuery::Kind::names, "rep", "x", 200}));
+    search_.asked.clear();
+    options_.limit = 3;
+    run(HostCommand::tagged);
+    EXPECT_EQ(search_.asked.at(0), (test::FakeSearch::Asked{SearchQuery::Kind::tagged, "rep", "", 3}));
+    search_.error = KsError::posix(EIO);
+    run(HostCommand::recents);
+    EXPECT_EQ(failure_, "can't search: Input/output error");
+}
+
+TEST_F(CommandsTest, printsAllTags) {
+    search_.tagCounts = {{"red", 2}, {"a\nb", 1}};
+    EXPECT_EQ(run(HostCommand::allTags), "      2  red\n      1  a\\x0Ab\n");
+    options_.json = true;
+    EXPECT_EQ(jsonLines(run(HostCommand::allTags))[0], (json{{"tag", "red"}, {"count", 2}}));
 }
 
 TEST_F(CommandsTest, tellsOfItemsThatAreNotThere) {

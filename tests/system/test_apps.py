@@ -661,6 +661,19 @@ class CachesTest(AppsTest):
             os.unlink(path)
         self.assertEqual(self.run_program("ls")[0], 0)
 
+    def test_the_doctor_sets_aside_a_cache_that_stops_the_process(self):
+        for path in (self.main, self.working_set):
+            self.write(path, self.archive("text"))
+        status, output, _ = self.run_program("doctor")
+        self.assertEqual(status, 0)
+        self.assertEqual(output.count(b"Set aside"), 2)
+        for path in (self.main, self.working_set):
+            [aside] = [name for name in os.listdir(os.path.dirname(path)) if name.startswith(os.path.basename(path) + ".")]
+            with open(os.path.join(os.path.dirname(path), aside), "rb") as file:
+                self.assertEqual(file.read(), self.archive("text"))
+        self.assertEqual(self.run_program("ls")[0], 0)
+        self.assertNotIn(b"Set aside", self.run_program("doctor")[1])
+
     def test_an_older_token_of_the_main_cache_is_another_list(self):
         """As when the file was put back from a copy."""
         self.start()

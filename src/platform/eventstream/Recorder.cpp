@@ -268,8 +268,14 @@ Result<void> Recorder::settle() {
         settled = keeper_.settle();
         noteState();
     }
+    noteOutcome(settled);
     tellObservers();
     return settled;
+}
+
+void Recorder::noteOutcome(const Result<void>& outcome) {
+    const MutexLock lock(stateMutex_);
+    failure_ = outcome.ok() ? std::nullopt : std::optional(outcome.error());
 }
 
 void Recorder::trim() {
@@ -408,19 +414,22 @@ void Recorder::noteState() {
     }
     const auto& roots = keeper_.roots();
     status.recorder = roots.empty() || !roots.front().source ? "none" : std::string(roots.front().source->name());
+    if (!roots.empty() && roots.front().source) status.watches = roots.front().source->usage();
     for (const IndexKeeper::Root& root : roots) {
         if (!root.source)
             status.uncovered.push_back({root.directory->path, "its file system does not tell of changes"});
     }
     for (const FileID folder : keeper_.closedFolders()) {
         std::map<FileID, std::string> paths;
-        status.uncovered.push_back({pathOf(*this->roots(), keeper_.rootIDs(), folder, paths), "it can't be read"});
+        status.uncovered.push_back(
+            {pathOf(*this->roots(), keeper_.rootIDs(), folder, paths), std::string(kUnreadable)});
     }
     if (keeper_.reachedWatchLimit() && inotify_) {
         const EventSource::Usage usage = inotify_->usage();
         const std::size_t unwatched = keeper_.unwatchedFolders().size();
         const std::string needed =
             fmt::format("{} watches used, limit {}, {} needed", usage.used, usage.limit, usage.used + unwatched);
+        status.unwatchedFolders = unwatched;
         if (unwatched > 0) {
             if (!saidWatchLimit_) {
                 logInfo("the limit of watches is reached ({}); the rest is compared at each request", needed);
@@ -439,7 +448,10 @@ void Recorder::noteState() {
 
 Recorder::Status Recorder::status() const {
     const MutexLock lock(stateMutex_);
-    return status_;
+    Status status = status_;
+    status.isReading = !isReady_ && !startError_;
+    status.failure = startError_ ? startError_ : failure_;
+    return status;
 }
 
 bool Recorder::isReady() const {

@@ -79,10 +79,15 @@ public:
         std::string path;
         std::string why;
     };
+    static constexpr std::string_view kUnreadable = "it can't be read";
     struct Status {
         std::string recorder = "none";  ///< "inotify", "fanotify", or "none" where nothing tells of changes
         std::vector<Uncovered> uncovered;
         std::uint64_t auditedDifferences = 0;  ///< changes that only an audit found
+        EventSource::Usage watches;            ///< of the first root's source
+        std::uint64_t unwatchedFolders = 0;    ///< beyond the limit of watches
+        bool isReading = false;                ///< the first look at the roots is not over
+        std::optional<KsError> failure;        ///< why what happens is not recorded at present
     };
     Status status() const;
 
@@ -103,6 +108,7 @@ private:
     Result<void> settle() EXCLUDES(mutex_);
     void noteState() REQUIRES(mutex_);
     void finished(const Result<void>& startUp);
+    void noteOutcome(const Result<void>& outcome) EXCLUDES(stateMutex_);
     void tellObservers() EXCLUDES(observersMutex_);
     void trim();
     enum class Wake { news, timeout, stop };
@@ -145,6 +151,7 @@ private:
     RootPaths formerRoots_ GUARDED_BY(stateMutex_);
     std::vector<int> pollDescriptors_ GUARDED_BY(stateMutex_);
     Status status_ GUARDED_BY(stateMutex_);
+    std::optional<KsError> failure_ GUARDED_BY(stateMutex_);  ///< of the last try to record
 
     /// Held while observers are called, so that one that was removed is not called any more.
     Mutex observersMutex_;
