@@ -227,6 +227,31 @@ class SearchTest(SystemTest):
         for text in ("bytes\ufffd", "A\nB", "文名", "字", "\"QUOTED\"", "%", "t_"):
             self.assertEqual(len(self.found(client, text=text)), 1, text)
 
+    def test_the_temporary_folder_is_in_no_answer(self):
+        """What an import puts together there least of all, also while it is at it."""
+        source = os.path.join(self.folder, "source")
+        os.makedirs(os.path.join(source, "report below"))
+        for number in range(300):
+            with open(os.path.join(source, "report below", f"report {number}"), "wb"):
+                pass
+        self.make_file(".TemporaryLocalFolder", "somebody's", "report.txt")
+        os.mkdir(self.path("sub"))
+        client = self.client()
+        self.assertEqual(self.found(client, text="report"), [])
+        self.assertEqual(self.found(client, text="temporary"), [])
+        self.assertEqual(self.found(client, "recents"), [])
+        self.assertEqual(names(client.call("sortedItems", container=ROOT)["items"]), ["sub"])
+        imported = client.send("importDocument", path=source, parent=client.identifier(self.path("sub")))
+        while imported not in client._early:
+            for item in self.found(client, text="report"):
+                self.assertNotIn(".TemporaryLocalFolder", item["fileURL"])
+            client.call("status")
+        self.assertIn("result", client.answer(imported))
+        self.assertEqual(len(self.found(client, text="report")), 301)
+        self.assertEqual(client.call("sortedItems", container=ROOT)["total"], 1)
+        hidden = client.call("itemForIdentifier", identifier="TesselTemporaryLocalFolderItemIdentifier")["identifier"]
+        self.assertEqual(client.call("sortedItems", container=hidden)["total"], 0)
+
 
 class DesktopTagsTest(SystemTest):
     def desktop_tags(self, path):

@@ -5,6 +5,7 @@
 
 #include "host/ItemText.h"
 #include "host/search/NameFolding.h"
+#include "platform/tessel/StagingFolder.h"
 
 namespace cindral {
 namespace {
@@ -31,6 +32,11 @@ std::int64_t flagsOf(const TesselItem& item) {
     return trashed;
 }
 
+bool isTemporaryFolder(const IndexedItem& item) {
+    return item.name == kTemporaryLocalFolderName &&
+           (item.parent == kTesselRootContainerItemIdentifier || item.parent.starts_with('#'));
+}
+
 }  // namespace
 
 IndexedItem IndexedItem::of(const TesselItem& item) {
@@ -44,7 +50,7 @@ IndexedItem IndexedItem::of(const TesselItem& item) {
     } else if (const std::string* bundle = item.appContainerBundleIdentifier()) {
         indexed.domain = *bundle;
     }
-    indexed.flags = flagsOf(item);
+    indexed.flags = flagsOf(item) | (isTemporaryFolder(indexed) ? kTemporary : 0);
     indexed.modified = nanosecondsOf(item.contentModificationDate());
     indexed.used = nanosecondsOf(item.lastUsedDate());
     if (const auto size = item.documentSize()) {
@@ -62,14 +68,14 @@ IndexedItem IndexedItem::of(const TesselItem& item) {
 bool IndexedItem::isIn(const SearchQuery& query) const {
     switch (query.kind) {
         case SearchQuery::Kind::names:
-            return !isTrashed() && !query.text.empty() &&
+            return isOrdinary() && !query.text.empty() &&
                    nameMatchOf(name_folding::fold(name), name_folding::fold(query.text)).has_value();
-        case SearchQuery::Kind::recents: return isDocument() && !isTrashed();
-        case SearchQuery::Kind::tagged: return !isTrashed() && std::ranges::binary_search(tags, query.text);
-        case SearchQuery::Kind::favorites: return rank.has_value() && !isTrashed();
-        case SearchQuery::Kind::trashed: return isTrashed();
-        case SearchQuery::Kind::children: return parent == query.text;
-        case SearchQuery::Kind::tags: return !tags.empty();
+        case SearchQuery::Kind::recents: return isDocument() && isOrdinary();
+        case SearchQuery::Kind::tagged: return isOrdinary() && std::ranges::binary_search(tags, query.text);
+        case SearchQuery::Kind::favorites: return rank.has_value() && isOrdinary();
+        case SearchQuery::Kind::trashed: return isTrashed() && !isTemporary();
+        case SearchQuery::Kind::children: return parent == query.text && !isTemporary();
+        case SearchQuery::Kind::tags: return !tags.empty() && isOrdinary();
     }
     return false;
 }

@@ -8,6 +8,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <limits>
+#include <unordered_set>
 #include <utility>
 
 #include "host/search/NameFolding.h"
@@ -22,7 +23,7 @@ namespace {
 
 // Written into the file: another number for another form.
 constexpr std::int64_t kApplicationID = 0x43645378;
-constexpr std::int64_t kVersion = 1;
+constexpr std::int64_t kVersion = 2;
 
 // Milliseconds from 1900 to 1970, so that dates before 1970 have places too.
 constexpr std::int64_t kPlaceOfEpoch = 2'208'988'800'000;
@@ -54,6 +55,7 @@ constexpr const char* kSchema = R"(
     CREATE UNIQUE INDEX items_identifier ON items(identifier);
     CREATE INDEX items_parent ON items(parent, name_key(name), modified, size, type, flags);
     CREATE INDEX items_trashed ON items(place) WHERE flags & 2;
+    CREATE INDEX items_temporary ON items(identifier) WHERE flags & 8;
     CREATE INDEX items_rank ON items(rank, place) WHERE rank IS NOT NULL;
     CREATE TABLE tags(tag TEXT NOT NULL, place INTEGER NOT NULL, PRIMARY KEY(tag, place)) WITHOUT ROWID;
     CREATE INDEX tags_place ON tags(place);
@@ -182,6 +184,8 @@ struct SearchStore::Writer {
     Result<std::vector<TesselItemIdentifier>> below(const TesselItemIdentifier& identifier);
     Result<void> passOn(const IndexedItem& folder);
     Result<void> writeNames();
+    void noteTemporary(const IndexedItem& item);
+    Result<void> readTemporary();
     void see(const IndexedItem& item) const {
         if (witness) witness(item);
     }
@@ -194,6 +198,8 @@ struct SearchStore::Writer {
     GatherCounts gatherCounts;
     std::unordered_map<std::string, std::int64_t> wordIDs;
     std::unordered_map<std::int64_t, std::string> words;
+    /// Folders in the table that are temporary.
+    std::unordered_set<std::string> temporary;
     /// What is still to be said to the table of names in the transaction.
     struct NameChange {
         std::int64_t place;
@@ -246,7 +252,16 @@ Result<void> SearchStore::Writer::prepare() {
     count = TRY(database.integer("SELECT value FROM facts WHERE name = 'items'")).value_or(0);
     gather = TRY(database.integer("SELECT value FROM facts WHERE name = 'gather'")).value_or(0);
     isGathering = TRY(database.integer("SELECT value FROM facts WHERE name = 'isGathering'")).value_or(0) != 0;
+    TRY(readTemporary());
     return isGathering ? database.run(kManyPages) : Result<void>();
+}
+
+Result<void> SearchStore::Writer::readTemporary() {
+    temporary.clear();
+    SqliteStatement select =
+        TRY(database.prepare("SELECT identifier FROM items INDEXED BY items_temporary WHERE flags & 8 AND flags & 4"));
+    while (TRY(select.step())) temporary.emplace(select.text(0));
+    return {};
 }
 
 Result<std::int64_t> SearchStore::Writer::wordID(const std::string& word) {
@@ -322,17 +337,19 @@ Result<void> SearchStore::Writer::insert(const IndexedItem& item, std::int64_t p
     std::optional<std::int64_t> domain;
     if (!item.domain.empty()) domain = TRY(wordID(item.domain));
     ++count;
+    noteTemporary(item);
     TRY(insertItem.run(place, std::string_view(item.identifier), std::string_view(item.parent), bytesOf(item.name),
                        type, item.flags, gather, domain, item.size, item.modified, item.used, item.rank));
-    if (!item.isTrashed()) nameChanges.push_back({place, true, name_folding::fold(item.name)});
+    if (item.isOrdinary()) nameChanges.push_back({place, true, name_folding::fold(item.name)});
     for (const std::string& tag : item.tags) TRY(insertTag.run(std::string_view(tag), place));
     return {};
 }
 
 Result<void> SearchStore::Writer::erase(const Row& row) {
     --count;
+    temporary.erase(row.item.identifier);
     TRY(deleteItem.run(row.place));
-    if (!row.item.isTrashed()) nameChanges.push_back({row.place, false, name_folding::fold(row.item.name)});
+    if (row.item.isOrdinary()) nameChanges.push_back({row.place, false, name_folding::fold(row.item.name)});
     if (!row.item.tags.empty()) TRY(deleteTags.run(row.place));
     return {};
 }
@@ -346,7 +363,9 @@ Result<void> SearchStore::Writer::writeNames() {
     return {};
 }
 
-Result<void> SearchStore::Writer::put(const IndexedItem& item) {
+Result<void> SearchStore::Writer::put(const IndexedItem& listed) {
+    IndexedItem item = listed;
+    if (temporary.contains(item.parent)) item.flags |= IndexedItem::kTemporary;
     const std::optional<Row> before = TRY(row(item.identifier));
     // What is in a folder that comes along while others are listed may have been missed on both sides.
     if (isGathering && item.isFolder() && (!before || before->gather != gather))
@@ -354,25 +373,37 @@ Result<void> SearchStore::Writer::put(const IndexedItem& item) {
     see(item);
     if (!before) {
         ++gatherCounts.put;
-        return insert(item, TRY(freePlace(item)));
+        TRY(insert(item, TRY(freePlace(item))));
+        // What is in it may have come along before it.
+        return item.isTemporary() && item.isFolder() ? passOn(item) : Result<void>();
     }
     see(before->item);
     if (!(before->item == item)) ++gatherCounts.changed;
 
     const bool isSamePlace = before->item.recency() == item.recency();
-    const bool isSameName = before->item.name == item.name && before->item.isTrashed() == item.isTrashed();
+    const bool isSameName = before->item.name == item.name && before->item.isOrdinary() == item.isOrdinary();
     if (isSamePlace && isSameName && before->item.tags == item.tags) {
         const std::int64_t type = TRY(wordID(item.type));
         std::optional<std::int64_t> domain;
         if (!item.domain.empty()) domain = TRY(wordID(item.domain));
+        noteTemporary(item);
         TRY(updateItem.run(before->place, std::string_view(item.parent), type, item.flags, gather, domain, item.size,
                            item.modified, item.used, item.rank));
     } else {
         TRY(erase(*before));
         TRY(insert(item, isSamePlace ? before->place : TRY(freePlace(item))));
     }
-    const bool isPassedOn = before->item.isTrashed() != item.isTrashed() || before->item.domain != item.domain;
+    const bool isPassedOn = (before->item.flags & IndexedItem::kPassedOn) != (item.flags & IndexedItem::kPassedOn) ||
+                            before->item.domain != item.domain;
     return isPassedOn ? passOn(item) : Result<void>();
+}
+
+void SearchStore::Writer::noteTemporary(const IndexedItem& item) {
+    if (item.isTemporary() && item.isFolder()) {
+        temporary.insert(item.identifier);
+    } else {
+        temporary.erase(item.identifier);
+    }
 }
 
 /// What is below a folder is in the trash with it, and belongs to whom it belongs, without being told of.
@@ -382,7 +413,7 @@ Result<void> SearchStore::Writer::passOn(const IndexedItem& folder) {
         const std::optional<Row> there = TRY(row(identifier));
         if (!there) continue;
         IndexedItem item = there->item;
-        item.flags = (item.flags & ~IndexedItem::kTrashed) | (folder.flags & IndexedItem::kTrashed);
+        item.flags = (item.flags & ~IndexedItem::kPassedOn) | (folder.flags & IndexedItem::kPassedOn);
         item.domain = folder.domain;
         see(there->item);
         see(item);
@@ -425,32 +456,32 @@ struct SearchStore::Reader {
                  "names.rowid WHERE names MATCH ?1 AND names.rowid < ?2 ORDER BY names.rowid DESC"));
         TRY(make(
             allNames,
-            "SELECT place, identifier, name FROM items WHERE ?1 = '' AND place < ?2 AND NOT flags & 2 ORDER BY place "
+            "SELECT place, identifier, name FROM items WHERE ?1 = '' AND place < ?2 AND NOT flags & 10 ORDER BY place "
             "DESC"));
         TRY(make(someNames, "SELECT name FROM items WHERE place >= ? ORDER BY place LIMIT ?"));
         TRY(make(itemCount, "SELECT value FROM facts WHERE name = 'items'"));
         TRY(make(recents,
-                 "SELECT place, identifier, 0 FROM items WHERE place < ?1 AND flags & 3 = 1 ORDER BY place DESC"));
+                 "SELECT place, identifier, 0 FROM items WHERE place < ?1 AND flags & 11 = 1 ORDER BY place DESC"));
         TRY(make(tagged,
                  "SELECT tags.place, items.identifier, 0 FROM tags CROSS JOIN items ON items.place = tags.place WHERE "
-                 "tags.tag = ?2 AND tags.place < ?1 AND NOT items.flags & 2 ORDER BY tags.place DESC"));
+                 "tags.tag = ?2 AND tags.place < ?1 AND NOT items.flags & 10 ORDER BY tags.place DESC"));
         TRY(make(favorites,
                  "SELECT place, identifier, rank FROM items INDEXED BY items_rank WHERE rank IS NOT NULL AND NOT flags "
-                 "& 2 AND (rank > ?2 OR (rank = ?2 AND place < ?1)) ORDER BY rank, place DESC"));
-        TRY(make(
-            trashed,
-            "SELECT place, identifier, 0 FROM items INDEXED BY items_trashed WHERE flags & 2 AND place < ?1 AND NOT "
-            "EXISTS (SELECT 1 FROM items AS holder WHERE holder.identifier = items.parent) ORDER BY place DESC"));
+                 "& 10 AND (rank > ?2 OR (rank = ?2 AND place < ?1)) ORDER BY rank, place DESC"));
+        TRY(make(trashed,
+                 "SELECT place, identifier, 0 FROM items INDEXED BY items_trashed WHERE flags & 2 AND NOT flags & 8 "
+                 "AND place < ?1 AND NOT "
+                 "EXISTS (SELECT 1 FROM items AS holder WHERE holder.identifier = items.parent) ORDER BY place DESC"));
         // In the order of the index, which is that of names. To ask for the order would be to ask for the names, too,
         // and for every row of the table.
-        TRY(make(children, "SELECT place FROM items INDEXED BY items_parent WHERE parent = ?1"));
+        TRY(make(children, "SELECT place FROM items INDEXED BY items_parent WHERE parent = ?1 AND NOT flags & 8"));
         TRY(make(values,
                  "SELECT place, CASE ?2 WHEN 1 THEN modified WHEN 2 THEN size WHEN 3 THEN type END, flags FROM items "
-                 "INDEXED BY items_parent WHERE parent = ?1"));
+                 "INDEXED BY items_parent WHERE parent = ?1 AND NOT flags & 8"));
         TRY(make(identifier, "SELECT identifier FROM items WHERE place = ?"));
         TRY(make(
             tags,
-            "SELECT tag, count(*) FROM tags CROSS JOIN items ON items.place = tags.place WHERE NOT items.flags & 2 "
+            "SELECT tag, count(*) FROM tags CROSS JOIN items ON items.place = tags.place WHERE NOT items.flags & 10 "
             "GROUP BY tag"));
         return {};
     }
@@ -532,6 +563,8 @@ Result<void> SearchStore::write(const Work& work) {
         writer.wordIDs.clear();
         writer.words.clear();
         writer.nameChanges.clear();
+        // Where that can't be read, nothing can be put in either.
+        (void)writer.readTemporary();
     }
     isGathering_ = writer.isGathering;
     ++changes_;

@@ -237,6 +237,58 @@ TEST_F(SearchStoreTest, movesWhatIsBelowATrashedFolderAlong) {
     EXPECT_THAT(find({SearchQuery::Kind::trashed, ""}), IsEmpty());
 }
 
+TEST_F(SearchStoreTest, leavesOutWhatIsInATemporaryFolder) {
+    const auto expectHidden = [&](bool isHidden) {
+        const std::vector<std::string> all = isHidden ? std::vector<std::string>() : std::vector<std::string>{"did=3"};
+        EXPECT_EQ(names("bottom"), all);
+        EXPECT_EQ(names("ttom"), all);
+        EXPECT_EQ(names("m"), all) << "where every name is compared";
+        EXPECT_EQ(find({SearchQuery::Kind::recents, ""}), all);
+        EXPECT_EQ(find({SearchQuery::Kind::favorites, ""}), all);
+        EXPECT_EQ(find({SearchQuery::Kind::tagged, "x"}), all);
+        EXPECT_EQ(store_->tags()->size(), all.size());
+        for (const auto order : {SortedQuery::Order::name, SortedQuery::Order::date}) {
+            const auto page = store_->sorted({"fid=2", order, false, 0, 10});
+            ASSERT_TRUE(page.ok());
+            EXPECT_EQ(page->identifiers, all);
+            EXPECT_EQ(page->total, all.size());
+        }
+    };
+    const auto bottom = item("did=3", "bottom", 5, "fid=2");
+    bottom->rank = 1;
+    bottom->tagList = {"x"};
+    const auto workshop = folder("fid=1", ".TemporaryLocalFolder");
+    // In any order.
+    put({bottom, folder("fid=2", "piece", "fid=1"), workshop});
+    expectHidden(true);
+    EXPECT_THAT(sorted(SortedQuery::Order::name), IsEmpty());
+    put({bottom});
+    expectHidden(true);
+    open();
+    put({bottom});
+    expectHidden(true);
+    // Put together, it moves to where it is to be, which one change tells.
+    put({folder("fid=2", "piece")});
+    expectHidden(false);
+    EXPECT_THAT(sorted(SortedQuery::Order::name), ElementsAre("fid=2"));
+    put({folder("fid=2", "piece", "fid=1")});
+    expectHidden(true);
+    const auto trashed = folder("fid=2", "piece", "fid=1");
+    trashed->trashed = true;
+    put({trashed});
+    EXPECT_THAT(find({SearchQuery::Kind::trashed, ""}), IsEmpty());
+    put({folder("fid=2", "piece")});
+    // A number that comes back is another folder.
+    remove("fid=1");
+    put({item("did=4", "other bottom", 0, "fid=1"), folder("fid=1", "ordinary")});
+    EXPECT_THAT(names("other"), ElementsAre("did=4"));
+    // Of an application's documents, too; elsewhere it is a name as any.
+    put({folder("fid=5", ".TemporaryLocalFolder", "#org.example"), item("did=5", "of the app", 0, "fid=5"),
+         folder("fid=6", ".TemporaryLocalFolder", "fid=2"), item("did=6", "of a person", 0, "fid=6")});
+    EXPECT_THAT(names("of the app"), IsEmpty());
+    EXPECT_THAT(names("of a person"), ElementsAre("did=6"));
+}
+
 TEST_F(SearchStoreTest, listsDocumentsByWhenTheyWereUsed) {
     auto used = item("did=1", "old but used", 1);
     used->lastUsed = KsDate{100, 0};
