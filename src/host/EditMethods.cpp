@@ -210,8 +210,7 @@ void setFavoriteRank(const HostMethodsContext& context, const Json& params, cons
 }  // namespace
 
 JsonRpcServer::Methods makeEditMethods(const HostMethodsContext& context) {
-    using Handler = void (*)(const HostMethodsContext&, const Json&, const Reply&);
-    constexpr std::pair<const char*, Handler> kHandlers[] = {
+    constexpr HostMethod kMethods[] = {
         {"importDocument", importDocument},
         {"copyItem", copyItem},
         {"createDirectory", createDirectory},
@@ -225,13 +224,7 @@ JsonRpcServer::Methods makeEditMethods(const HostMethodsContext& context) {
         {"setTags", setTags},
         {"setFavoriteRank", setFavoriteRank},
     };
-    JsonRpcServer::Methods methods;
-    for (const auto& entry : kHandlers) {
-        methods.emplace(entry.first, [context, handler = entry.second](const Json& params, const Reply& reply) {
-            handler(context, params, reply);
-        });
-    }
-    return methods;
+    return bindHostMethods(context, kMethods);
 }
 
 }  // namespace cindral

@@ -262,9 +262,18 @@ void answerItem(JsonRpcReply& reply, const Result<std::shared_ptr<const TesselIt
     reply.result([&](std::string& out) { ItemWriter(paths).append(out, **item); });
 }
 
+JsonRpcServer::Methods bindHostMethods(const HostMethodsContext& context, std::span<const HostMethod> handlers) {
+    JsonRpcServer::Methods methods;
+    for (const auto& [name, handler] : handlers) {
+        methods.emplace(name, [context, handler = handler](const Json& params, const Reply& reply) {
+            handler(context, params, reply);
+        });
+    }
+    return methods;
+}
+
 JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context) {
-    using Handler = void (*)(const HostMethodsContext&, const Json&, const Reply&);
-    constexpr std::pair<const char*, Handler> kHandlers[] = {
+    constexpr HostMethod kMethods[] = {
         {"itemForIdentifier", itemForIdentifier},
         {"URLForItem", urlForItem},
         {"identifierForItemAtURL", identifierForItemAtURL},
@@ -281,11 +290,7 @@ JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context) {
     };
     JsonRpcServer::Methods methods = makeEditMethods(context);
     methods.merge(makeSearchMethods(context));
-    for (const auto& entry : kHandlers) {
-        methods.emplace(entry.first, [context, handler = entry.second](const Json& params, const Reply& reply) {
-            handler(context, params, reply);
-        });
-    }
+    methods.merge(bindHostMethods(context, kMethods));
     return methods;
 }
 

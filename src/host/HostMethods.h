@@ -1,6 +1,8 @@
 #pragma once
 
 #include <functional>
+#include <memory>
+#include <span>
 #include <string>
 
 #include "host/ContainerMonitor.h"
@@ -23,6 +25,15 @@ struct HostMethodsContext {
     std::function<std::string(bool endsSoon)> hello;
     std::function<Result<std::string>()> doctorText;  ///< as JSON
 };
+
+/// A method by its name, and what carries it out: it answers by the reply, at once or later.
+struct HostMethod {
+    const char* name;
+    void (*handler)(const HostMethodsContext& context, const nlohmann::json& params,
+                    const std::shared_ptr<JsonRpcReply>& reply);
+};
+/// The methods with what they work on.
+JsonRpcServer::Methods bindHostMethods(const HostMethodsContext& context, std::span<const HostMethod> handlers);
 
 /// The methods of the host interface, for one client.
 JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context);

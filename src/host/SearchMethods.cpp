@@ -183,8 +183,7 @@ void unwatchQuery(const HostMethodsContext& context, const Json& params, const R
 }  // namespace
 
 JsonRpcServer::Methods makeSearchMethods(const HostMethodsContext& context) {
-    using Handler = void (*)(const HostMethodsContext&, const Json&, const Reply&);
-    constexpr std::pair<const char*, Handler> kHandlers[] = {
+    constexpr HostMethod kMethods[] = {
         {"search", findOf<SearchQuery::Kind::names>},
         {"recents", findOf<SearchQuery::Kind::recents>},
         {"taggedItems", findOf<SearchQuery::Kind::tagged>},
@@ -195,13 +194,7 @@ JsonRpcServer::Methods makeSearchMethods(const HostMethodsContext& context) {
         {"watchQuery", watchQuery},
         {"unwatchQuery", unwatchQuery},
     };
-    JsonRpcServer::Methods methods;
-    for (const auto& entry : kHandlers) {
-        methods.emplace(entry.first, [context, handler = entry.second](const Json& params, const Reply& reply) {
-            handler(context, params, reply);
-        });
-    }
-    return methods;
+    return bindHostMethods(context, kMethods);
 }
 
 }  // namespace cindral
