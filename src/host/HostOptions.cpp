@@ -109,7 +109,7 @@ const std::vector<CommandGroup>& commandGroups() {
         {"Edit", {"import", "mkdir", "rename", "mv", "rm"}},
         {"Throw away", {"trash", "restore", "empty-trash"}},
         {"Label", {"tag", "untag", "favorite", "unfavorite", "touch-used"}},
-        {"Connect", {"serve", "rpc", "status"}},
+        {"Connect", {"status", "doctor", "serve", "rpc"}},
     };
     return kGroups;
 }
