@@ -6,7 +6,8 @@ add_custom_target(uninstall COMMAND ${CMAKE_COMMAND} -DMANIFEST=${CMAKE_CURRENT_
   -P ${CMAKE_CURRENT_SOURCE_DIR}/cmake/Uninstall.cmake VERBATIM)
 
 set(CPACK_PACKAGE_NAME cindral)
-set(CPACK_PACKAGE_CONTACT "The developers of Cindral <cindral@localhost>")
+# By the name of no person: whoever packs it for others says who answers for that (-D CPACK_PACKAGE_CONTACT=...).
+set(CPACK_PACKAGE_CONTACT "Cindral maintainers <maintainers@cindral.invalid>" CACHE STRING "who answers for a package")
 set(CPACK_PACKAGE_DESCRIPTION_SUMMARY "items with lasting identifiers for a folder of documents")
 set(CPACK_PACKAGE_DESCRIPTION
   "A file provider: publishes a person's documents as items that keep their identifier when a file is renamed, moved or
