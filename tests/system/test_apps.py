@@ -551,6 +551,9 @@ class AppsCommandsTest(AppsTest):
         self.assertIn("Documents folder is missing", apps["org.homeless"]["why"])
         self.assertIn("names no data container", apps["org.nowhere"]["why"])
         self.assertNotIn("why", apps["org.mine"])
+        bare = self.run_program("apps", "-0")[1]
+        self.assertTrue(bare.endswith(b"\0"))
+        self.assertEqual(bare.decode().split("\0")[:-1], list(apps))
         lines = self.run_program("apps")[1].decode().splitlines()
         self.assertEqual(len(lines), 4)
         self.assertRegex(lines[0], r"^org\.mine +published +Mine$")

@@ -81,11 +81,43 @@ class PackagesTest(SystemTest):
         run(COMPILER, "-std=gnu++20", "-Wall", "-Wextra", "-Werror", os.path.join(EXAMPLES, "follow.cpp"), "-o", program, *flags, *FLAGS.split())
         self.daemon()
         self.assert_follows(program, prefix)
+        self.assert_connects(flags)
         # A folder that is not there is told of by the host's own words.
         done = subprocess.run([program, self.path("none"), self.storage, self.state], env=self.of_prefix(prefix), stdin=subprocess.DEVNULL,
                               stdout=subprocess.PIPE, stderr=subprocess.PIPE, timeout=PATIENCE, check=False)
         self.assertEqual((done.returncode, done.stdout), (1, b""))
         self.assertTrue(done.stderr.startswith(b"follow: "), done.stderr)
+
+    def assert_connects(self, flags):
+        """A program that knows the daemon's socket needs no other."""
+        source = os.path.join(self.folder, "connect.cpp")
+        with open(source, "w", encoding="ascii") as file:
+            file.write("""
+                #include <cindral/Client.h>
+                #include <iostream>
+                int main(int, char** words) {
+                    auto client = cindral::Client::connect(words[1]);
+                    if (!client.ok()) return std::cerr << client.error().message << "\\n", 1;
+                    const auto identifier = client->identifierAt(words[2]);
+                    const auto item = identifier.ok() ? client->item(*identifier) : identifier.error();
+                    if (!item.ok()) return std::cerr << item.error().message << "\\n", 2;
+                    std::cout << item->filename << "\\n";
+                }
+                """)
+        program = os.path.join(self.folder, "connect")
+        run(COMPILER, "-std=gnu++20", "-Wall", "-Wextra", "-Werror", source, "-o", program, *flags, *FLAGS.split())
+
+        def connect(socket, path):
+            done = subprocess.run([program, socket, path], stdin=subprocess.DEVNULL, stdout=subprocess.PIPE, stderr=subprocess.PIPE,
+                                  timeout=PATIENCE, check=False, text=True)
+            return done.returncode, done.stdout, done.stderr
+
+        path = self.make_file("sub", "there.txt")
+        socket = os.path.join(self.state, "socket")
+        self.assertEqual(connect(socket, path), (0, "there.txt\n", ""))
+        self.assertEqual(connect(socket, self.path("none"))[:2], (2, ""))
+        for nobody, why in ((self.path("none"), "No such file or directory"), (path, "Connection refused"), ("x" * 200, "File name too long")):
+            self.assertEqual(connect(nobody, path), (1, "", f"can't connect to {nobody}: {why}\n"))
 
     def test_uninstalling_leaves_documents_and_state_alone(self):
         prefix = self.install()

@@ -146,6 +146,14 @@ class ShellTest(SystemTest):
                 status, _, error = self.run_program(*command, item)
                 self.assertEqual((status, error), (0, b""), (command, item))
 
+    def test_single_values_may_end_with_a_nul_too(self):
+        odd = self.make_file("sub", b"a\nb \xff%")
+        identifier = self.bare("id", odd)
+        self.assertEqual(self.run_program("id", odd)[1].splitlines(), identifier)
+        url = b"file://" + os.fsencode(self.path("sub")) + b"/a%0Ab%20%FF%25"
+        self.assertEqual(self.bare("url", odd), [url])
+        self.assertEqual(self.bare("url", identifier[0].decode()), [url])
+
     def test_bare_names_and_json_exclude_each_other(self):
         for words in (["ls", "-0", "--json"], ["--json", "find", "x", "--null"], ["info", "-0", self.storage]):
             status, output, error = self.run_program(*words)
