@@ -238,11 +238,60 @@ class DisksTest(SystemTest):
         self.assertEqual({**{identifier: fresh[identifier] for identifier in view}, **told}, fresh)
         self.assertEqual(served.stop(), 0)
 
+    def test_on_a_full_disk_search_says_so_and_goes_on_when_there_is_room(self):
+        served = self.daemon(launcher=self.launcher('mount -t tmpfs -o size=24m,mode=700 none "$0"', self.state))
+        inside = f"/proc/{served.process.pid}/root{self.state}"
+        client = SocketClient(os.path.join(inside, "socket"))
+        self.addCleanup(client.close)
+        self.assertEqual([item["filename"] for item in client.call("search", text="notes")["items"]], ["notes.txt"])
+        self.assertEqual(client.call("status")["problems"], [])
+        filler = os.path.join(inside, "filler")
+        self.fill(filler)
+        before = self.contents()
+
+        # There may be room for some of it yet.
+        def search_until_full():
+            for number in range(10_000):
+                os.rename(self.path("many", "00000.txt"), self.path("many", f"renamed {number}"))
+                try:
+                    found = client.call("search", text=f"renamed {number}")["items"]
+                    self.assertEqual([item["filename"] for item in found], [f"renamed {number}"], "never a wrong answer")
+                except RpcError as refused:
+                    return refused
+                finally:
+                    os.rename(self.path("many", f"renamed {number}"), self.path("many", "00000.txt"))
+                self.fill(filler)
+            self.fail("the disk is never full")
+
+        refused = search_until_full()
+        self.assertEqual((refused.domain, refused.domain_code), ("KsPOSIXErrorDomain", errno.ENOSPC), refused)
+        # Again, and by another question; and what is wrong can be read.
+        for method, params in (("search", {"text": "notes"}), ("recents", {}), ("sortedItems", {"container": "TesselRootContainerItemIdentifier"})):
+            with self.assertRaises(RpcError) as raised:
+                client.call(method, **params)
+            self.assertEqual(raised.exception.domain_code, errno.ENOSPC, raised.exception)
+        problems = {problem["what"]: problem["remedy"] for problem in client.call("status")["problems"]}
+        self.assertIn("the search index can't follow: No space left on device", problems)
+        self.assertIn("make room on the disk", problems["the search index can't follow: No space left on device"])
+        self.assertEqual(self.contents(), before)
+
+        os.unlink(filler)
+        os.rename(self.path("many", "00000.txt"), self.path("many", "found again"))
+        self.assertEqual([item["filename"] for item in client.call("search", text="found again")["items"]], ["found again"])
+        self.assertEqual([item["filename"] for item in client.call("search", text="notes")["items"]], ["notes.txt"])
+        self.assertEqual(client.call("search", text="renamed")["items"], [])
+        # Nothing is wrong any more but what was logged of it, until somebody has looked after that.
+        for problem in client.call("status")["problems"]:
+            self.assertIn("logged within the last hour", problem["what"])
+        self.assertEqual(client.call("doctor")["problems"], [])
+        self.assertEqual(client.call("status")["problems"], [])
+        self.assertEqual(served.stop(), 0)
+
     def test_on_a_full_disk_commands_say_so(self):
         """Nobody can begin there; who begins once there is space does."""
         script = 'mount -t tmpfs -o size=64k,mode=700 none "$0" && { cat /dev/zero > "$0/filler" 2>/dev/null; true; }'
         before = self.contents()
-        for words in (["serve"], ["ls"], ["rpc"]):
+        for words in (["serve"], ["ls"], ["rpc"], ["find", "notes"], ["status"], ["doctor"]):
             done = subprocess.run([*self.launcher(script, self.state), PROGRAM, *words, *self.options()], env=self.environment,
                                   stdin=subprocess.DEVNULL, stdout=subprocess.PIPE, stderr=subprocess.PIPE, timeout=PATIENCE, check=False)
             self.assertEqual((done.returncode, done.stdout), (1, b""), words)
@@ -254,7 +303,7 @@ class DisksTest(SystemTest):
         self.run_program("ls")
         before = self.contents()
         script = 'mount --bind "$0" "$0" && mount -o remount,bind,ro "$0"'
-        for words in (["serve"], ["ls"], ["mkdir", self.path("many", "made")]):
+        for words in (["serve"], ["ls"], ["mkdir", self.path("many", "made")], ["find", "notes"], ["recents"], ["status"]):
             done = subprocess.run([*self.launcher(script, self.state), PROGRAM, *words, *self.options()], env=self.environment,
                                   stdin=subprocess.DEVNULL, stdout=subprocess.PIPE, stderr=subprocess.PIPE, timeout=PATIENCE, check=False)
             self.assertEqual((done.returncode, done.stdout), (1, b""), words)
