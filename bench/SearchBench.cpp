@@ -1,8 +1,12 @@
-// What a search costs in an index of many items, beside a look at every name in memory: search_bench [--items N]
+// What a search costs in an index of many items: search_bench [--items N]
+//
+// Beside it, in the same run and over the same names: a look at every folded name in memory, which finds and orders the
+// same; `plocate`, an index of names on the disk, where it is installed; and `grep -F -i` over a list of the names.
 
 #include <fmt/format.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
@@ -19,7 +23,7 @@ using namespace cindral;  // NOLINT(google-build-using-namespace)
 namespace {
 
 constexpr std::size_t kResults = 200;
-constexpr int kRounds = 21;
+constexpr int kRounds = 9;
 constexpr std::size_t kItemsInFolder = 100;
 
 struct Item final : TesselItem {
@@ -137,6 +141,42 @@ T require(Result<T> result) {
     std::exit(1);
 }
 
+/// Programs that find names, each with all of them in a form of its own. They look at bytes: case is folded, accents are
+/// not, and nothing is ordered.
+class Programs {
+public:
+    explicit Programs(std::string folder) : list_(folder + "/names.txt"), index_(folder + "/names.plocate") {
+        file_ = std::fopen(list_.c_str(), "w");
+    }
+    void add(const TesselItem& item) { fmt::print(file_, "{}\n", item.filename()); }
+    void finish() {
+        std::fclose(file_);
+        // Where it is not found, the column is empty.
+        hasLocate_ =
+            std::system(
+                fmt::format("PATH=$PATH:/usr/sbin plocate-build -p {} {} 2>/dev/null", list_, index_).c_str()) == 0;
+    }
+    std::string locateTime(const std::string& text) const {
+        if (!hasLocate_) return "-";
+        return timeOf(fmt::format("plocate -d {} -i -l {} -- '{}' >/dev/null", index_, kResults, text));
+    }
+    std::string grepTime(const std::string& text) const {
+        return timeOf(fmt::format("grep -F -i -m {} -e '{}' {} >/dev/null", kResults, text, list_));
+    }
+
+private:
+    static std::string timeOf(const std::string& command) {
+        std::vector<double> times;
+        for (int round = 0; round < kRounds; ++round)
+            times.push_back(seconds([&] { (void)std::system(command.c_str()); }) * 1'000);
+        return fmt::format("{:.1f}", median(std::move(times)));
+    }
+    const std::string list_;
+    const std::string index_;
+    std::FILE* file_ = nullptr;
+    bool hasLocate_ = false;
+};
+
 double milliseconds(const std::function<void()>& work) {
     std::vector<double> times;
     for (int round = 0; round < kRounds; ++round) times.push_back(seconds(work) * 1'000);
@@ -145,8 +185,9 @@ double milliseconds(const std::function<void()>& work) {
 
 void measure(const std::string& path, std::uint64_t count) {
     const NameCollation collation("en_US.UTF-8");
-    const auto store = require(SearchStore::open(path, collation));
+    auto store = require(SearchStore::open(path, collation));
     LinearScan linear;
+    Programs programs(std::filesystem::path(path).parent_path());
     std::mt19937_64 random(1);
     double filling = 0;
     const TesselItemIdentifier root = kTesselRootContainerItemIdentifier;
@@ -156,17 +197,23 @@ void measure(const std::string& path, std::uint64_t count) {
         for (const std::size_t atOnce = store->itemsAtOnce(); number < count && items.size() < atOnce; ++number) {
             const auto item = makeItem(number, random);
             linear.add(*item);
+            programs.add(*item);
             items.push_back(IndexedItem::of(*item));
         }
         filling += seconds([&] { require(store->putListed(items, std::span(&root, 1), {})); });
     }
     filling += seconds([&] { require(store->endGather()); });
-    const auto counts = require(store->counts());
-    fmt::print("{} items, put in in {:.1f} s ({:.1f} us an item), {:.0f} bytes an item\n\n", count, filling,
-               filling * 1e6 / static_cast<double>(count),
-               static_cast<double>(counts.bytes) / static_cast<double>(count));
+    programs.finish();
+    // As it is left behind: with nothing beside it.
+    store.reset();
+    const auto bytes = std::filesystem::file_size(path);
+    store = require(SearchStore::open(path, collation));
+    fmt::print("{} items, put in in {:.1f} s ({:.1f} us an item), {:.0f} bytes an item on the disk\n\n", count, filling,
+               filling * 1e6 / static_cast<double>(count), static_cast<double>(bytes) / static_cast<double>(count));
 
-    fmt::print("| what is looked for | results | ours, ms | linear scan, ms | ratio |\n|---|---|---|---|---|\n");
+    fmt::print(
+        "| what is looked for | results | ours, ms | scan of names in memory, ms | ratio | plocate, ms | grep, ms |\n"
+        "|---|---|---|---|---|---|---|\n");
     for (const char* text : {"rep", "report", "pdf", ".pdf", "ort", "201", "2026-11-2", "résumé plan 77", "übersicht",
                              "img000", "no such name", "epor", "aaaa", "ta", "e", "qx"}) {
         const std::string folded = name_folding::fold(text);
@@ -180,9 +227,11 @@ void measure(const std::string& path, std::uint64_t count) {
             fmt::print(stderr, "{} results of \"{}\" where there are {}\n", found, text, alsoFound);
             std::exit(1);
         }
-        fmt::print("| {} | {} | {:.2f} | {:.2f} | {:.2f} |\n", text, found, ours, theirs, ours / theirs);
+        fmt::print("| {} | {} | {:.2f} | {:.1f} | {:.3f} | {} | {} |\n", text, found, ours, theirs, ours / theirs,
+                   programs.locateTime(text), programs.grepTime(text));
+        std::fflush(stdout);
     }
-    fmt::print("| recents | {} | {:.2f} | - | - |\n", kResults, milliseconds([&] {
+    fmt::print("| recents | {} | {:.2f} | - | - | - | - |\n", kResults, milliseconds([&] {
                    require(store->find({SearchQuery::Kind::recents, ""}, std::nullopt, kResults));
                }));
 
