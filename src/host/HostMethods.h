@@ -21,6 +21,8 @@ struct HostMethodsContext {
     QueryWatches& watches;
     /// What the host says of itself, as JSON; told whether the client ends soon, and by itself.
     std::function<std::string(bool endsSoon)> hello;
+    /// A link that lets a browser in; null where none is let in.
+    std::function<Result<std::string>()> makeLink;
 };
 
 /// The methods of the host interface, for one client.

@@ -24,6 +24,7 @@ enum class HostCommand {
     status,
     rpc,
     serve,
+    link,
     edit,
     thumbnail,
     find,

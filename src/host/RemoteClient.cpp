@@ -99,4 +99,11 @@ Result<std::string> RemoteClient::statusText() {
     return connection_.callForText("status", Params());
 }
 
+Result<std::string> RemoteClient::makeLink() {
+    const Json answer = TRY(connection_.call("makeLink", Params()));
+    const auto url = answer.find("url");
+    if (url == answer.end() || !url->is_string()) return unreadableAnswer();
+    return url->get<std::string>();
+}
+
 }  // namespace cindral

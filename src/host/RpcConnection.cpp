@@ -51,7 +51,8 @@ Result<void> readAll(int input, int output, const UniqueFd& interrupt, LineSplit
 RpcService serviceOf(const HostProcess& host) {
     return {host.provider(), host.paths(),
             host.signals(),  [&host] { return host.statusText(); },
-            host.search(),   [&host](bool) { return host.helloText(); }};
+            host.search(),   [&host](bool) { return host.helloText(); },
+            nullptr};
 }
 
 Result<void> serveRpc(int input, int output, const RpcService& service) {
