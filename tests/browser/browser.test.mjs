@@ -96,6 +96,29 @@ async function until(what, isSo) {
   }
 }
 
+// A moment of film: the browser makes it itself.
+async function filmOf(on) {
+  const bytes = await on.evaluate(async () => {
+    const canvas = document.createElement('canvas');
+    [canvas.width, canvas.height] = [64, 48];
+    const paint = canvas.getContext('2d');
+    const recorder = new MediaRecorder(canvas.captureStream(25), { mimeType: 'video/webm;codecs=vp8' });
+    const parts = [];
+    recorder.ondataavailable = ({ data }) => parts.push(data);
+    const ended = new Promise((resolve) => { recorder.onstop = resolve; });
+    recorder.start();
+    for (let frame = 0; frame < 8; frame += 1) {
+      paint.fillStyle = `hsl(${frame * 40} 80% 50%)`;
+      paint.fillRect(0, 0, 64, 48);
+      await new Promise((resolve) => { requestAnimationFrame(resolve); });
+    }
+    recorder.stop();
+    await ended;
+    return [...new Uint8Array(await new Blob(parts).arrayBuffer())];
+  });
+  return Buffer.from(bytes);
+}
+
 const isThere = (name) => until(`${name} is there`, () => storage.has(path.join(here, name)));
 const isGone = (name) => until(`${name} is gone`, () => !storage.has(path.join(here, name)));
 
@@ -369,6 +392,7 @@ testAmongOthers('documents are previewed by what they are', async () => {
   file('paper.pdf', PDF);
   file('sound.wav', WAV);
   file('blob.bin', Buffer.from([0, 1, 2, 3]));
+  file('film.webm', await filmOf(page));
   await openHere(['blob.bin', 'sound.wav']);
   const shows = async (name, selector, isSo) => {
     await row(name).dblclick();
@@ -381,6 +405,7 @@ testAmongOthers('documents are previewed by what they are', async () => {
   await shows('vector.svg', 'img', (image) => image.naturalWidth === 9);
   await shows('page.html', 'pre', (text) => text.textContent.includes('parent.document'));
   await shows('sound.wav', 'audio', (sound) => sound.duration > 0);
+  await shows('film.webm', 'video', (film) => film.videoWidth === 64);
   await shows('paper.pdf', 'iframe', (frame) => frame.src.includes('/file/'));
   await shows('blob.bin', 'p', (text) => text.textContent.startsWith('There is no preview'));
   assert.ok(!(await page.title()).includes('run'));
