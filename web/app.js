@@ -69,7 +69,6 @@ let dragged = [];
 const SORTS = [['name', 'Name'], ['date', 'Changed'], ['size', 'Size'], ['kind', 'Kind']];
 const sortField = h('select', { id: 'sort', 'aria-label': 'Sort by', onchange: () => setSort(sortField.value ? { by: sortField.value, descending: downByNature(sortField.value) } : null) });
 const sortWay = button('', () => setSort({ ...sortOf(view), descending: !sortOf(view).descending }), { class: 'tool', 'aria-label': 'Descending' });
-const sorting = h('span', { class: 'sorting' }, sortField, sortWay);
 
 const work = new Works({ shown: drawWorks, say });
 
@@ -434,7 +433,8 @@ const commands = {
 const toolButtons = new Map(Object.entries(commands).map(([name, command]) => [name,
   button(command.label, () => run(name), { class: `tool ${name}` })]));
 toolbar.append(...toolButtons.values());
-toolButtons.get('information').before(sorting);
+// How it is shown stays together at the end of the bar.
+toolbar.append(h('span', { class: 'showing' }, sortField, sortWay, toolButtons.get('information'), toolButtons.get('layout')));
 
 async function run(name) {
   const command = commands[name];
