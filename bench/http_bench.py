@@ -25,6 +25,8 @@ ROOT = "TesselRootContainerItemIdentifier"
 HERE = os.path.dirname(os.path.realpath(__file__))
 # How long a change waits to be told together with others.
 LATENCY = 0.5
+# Items that the page asks for at a time (web/sources.js).
+PAGE = 100
 
 
 def percentile(values, share):
@@ -67,14 +69,14 @@ class Page:
 
 def time_pages(page, folder, files, rounds):
     for sort in ("name", "date", "size", "kind"):
-        for offset in (0, files // 2, files - 200):
+        for offset in (0, files // 2, files - PAGE):
             times = []
             for _ in range(rounds):
                 begin = time.perf_counter()
-                answer = page.call("sortedItems", container=folder, sort=sort, offset=offset, limit=200)
+                answer = page.call("sortedItems", container=folder, sort=sort, offset=offset, limit=PAGE)
                 times.append((time.perf_counter() - begin) * 1e3)
-                assert answer["total"] == files and len(answer["items"]) == 200
-            print(f"200 items by {sort} from {offset}: median {statistics.median(times):.1f} ms, 95th percentile {percentile(times, 0.95):.1f} ms")
+                assert answer["total"] == files and len(answer["items"]) == PAGE
+            print(f"{PAGE} items by {sort} from {offset}: median {statistics.median(times):.1f} ms, 95th percentile {percentile(times, 0.95):.1f} ms")
 
 
 def time_changes(page, folder, path, rounds):
@@ -89,7 +91,7 @@ def time_changes(page, folder, path, rounds):
             pass
         while page.events.get() != {"jsonrpc": "2.0", "method": "queryChanged", "params": {"watch": watch}}:
             pass
-        page.call("sortedItems", container=folder, sort="name", offset=0, limit=200)
+        page.call("sortedItems", container=folder, sort="name", offset=0, limit=PAGE)
         times.append((time.perf_counter() - begin) * 1e3)
     print(f"a change until its page is there again: median {statistics.median(times):.0f} ms, 95th percentile {percentile(times, 0.95):.0f} ms")
 
@@ -120,7 +122,7 @@ def main():
             page = Page(port, secret)
             begin = time.perf_counter()
             big = page.call("sortedItems", container=ROOT, limit=1)["items"][0]["identifier"]
-            page.call("sortedItems", container=big, limit=200)
+            page.call("sortedItems", container=big, limit=PAGE)
             print(f"{words.files:,} files; the very first page, with the first look at all of them: {time.perf_counter() - begin:.1f} s")
             time_pages(page, big, words.files, words.rounds)
             time_changes(page, big, path, words.changes)

@@ -1,9 +1,9 @@
 // The document browser.
 
-import { h, icon, button, paced } from './dom.js';
+import { h, icon, button, paced, later } from './dom.js';
 import * as format from './format.js';
-import { call, listen, signIn, signOut, fileAddress, ROOT, SignedOut } from './rpc.js';
-import { openFolder, QuerySource } from './sources.js';
+import { call, listen, signIn, signOut, fileAddress, archiveAddress, ROOT, SignedOut } from './rpc.js';
+import { openFolder, FolderWatch, QuerySource } from './sources.js';
 import { Rows } from './rows.js';
 import { Works, entriesOf, entriesOfFiles } from './works.js';
 import * as dialogs from './dialogs.js';
@@ -14,6 +14,7 @@ const CAN = { move: 4, rename: 8, trash: 16, delete: 32 };
 const ITEMS = 'application/x-cindral-items';
 const REFRESH_INTERVAL = 120;
 const SEARCH_DELAY = 150;
+const PLACES_DELAY = 250;
 
 const settings = {
   get layout() { return localStorage.getItem('layout') ?? 'list'; },
@@ -61,8 +62,13 @@ const rows = new Rows({
   },
   dragOver,
   drop: (event, target) => drop(event, target),
+  released: () => { if (source) refresh(source); },
 });
 let dragged = [];
+
+const SORTS = [['name', 'Name'], ['date', 'Changed'], ['size', 'Size'], ['kind', 'Kind']];
+const sortField = h('select', { id: 'sort', 'aria-label': 'Sort by', onchange: () => setSort(sortField.value ? { by: sortField.value, descending: downByNature(sortField.value) } : null) });
+const sortWay = button('', () => setSort({ ...sortOf(view), descending: !sortOf(view).descending }), { class: 'tool', 'aria-label': 'Descending' });
 
 const work = new Works({ shown: drawWorks, say });
 
@@ -137,14 +143,18 @@ function go(next) {
 
 addEventListener('hashchange', () => { if (hasSession) show(viewOfAddress()); });
 
+// What is found comes in an order of its own, until somebody wants another.
+function sortOf(next) { return next.kind === 'folder' ? settings.sort : next.sort ?? null; }
+
 function sourceOf(next) {
+  const sort = sortOf(next);
   switch (next.kind) {
-    case 'folder': return openFolder(next.container, settings.sort);
-    case 'search': return opened(new QuerySource('search', { text: next.text }));
-    case 'recents': return opened(new QuerySource('recents'));
-    case 'favorites': return opened(new QuerySource('favorites'));
-    case 'tag': return opened(new QuerySource('taggedItems', { tag: next.tag }));
-    default: return opened(new QuerySource('trashedItems'));
+    case 'folder': return openFolder(next.container, sort);
+    case 'search': return opened(new QuerySource('search', { text: next.text }, { sort }));
+    case 'recents': return opened(new QuerySource('recents', {}, { sort }));
+    case 'favorites': return opened(new QuerySource('favorites', {}, { sort }));
+    case 'tag': return opened(new QuerySource('taggedItems', { tag: next.tag }, { sort }));
+    default: return opened(new QuerySource('trashedItems', {}, { sort }));
   }
 }
 
@@ -165,18 +175,20 @@ async function show(next, { keepsFocus = false } = {}) {
   source?.stop();
   source = null;
   view = next;
+  followTrail([]);
   if (next.kind !== 'search') search.value = '';
   try {
     const [made, trail] = await Promise.all([sourceOf(next), trailOf(next)]);
     if (turn !== opening) return made.stop();
     source = made;
-    next.title ??= trail.at(-1).filename;
+    if (trail.length) next.title = trail.at(-1).filename;
     source.onchange = paced(REFRESH_INTERVAL, () => refresh(made));
     made.better?.then((better) => takeBetter(made, better), (error) => { if (made === source) failed(error); });
-    rows.show(source, { layout: settings.layout, sort: settings.sort, label: next.title, sortable: next.kind === 'folder' });
+    rows.show(source, { layout: settings.layout, sort: sortOf(next), label: next.title });
+    drawSort();
     drawPath(trail);
+    followTrail(trail);
     drawPlaces();
-    document.title = `${next.title} – Cindral`;
     drawState();
     status.textContent = `${next.title}, ${format.count(source.total)}`;
     if (!keepsFocus) rows.scroller.focus({ preventScroll: true });
@@ -184,7 +196,8 @@ async function show(next, { keepsFocus = false } = {}) {
     if (turn !== opening) return undefined;
     if (error instanceof SignedOut) return showSignedOut();
     drawPath([]);
-    drawState(`This can’t be shown: ${error.message}`, () => show(next));
+    if (error.isNoSuchItem) drawState('This folder is not there any more.', () => go({ kind: 'folder', container: ROOT }), 'To the documents');
+    else drawState(`This can’t be shown: ${error.message}`, () => show(next));
   } finally {
     clearTimeout(slow);
   }
@@ -205,7 +218,7 @@ let refreshing = null;
 let again = false;
 
 async function refresh(of) {
-  if (of !== source) return;
+  if (of !== source || rows.isHeld) return;
   if (refreshing) {
     again = true;
     return;
@@ -220,7 +233,8 @@ async function refresh(of) {
         drawInformation();
       }
     } catch (error) {
-      if (of === source) failed(error);
+      if (of === source && error.isNoSuchItem) showGone();
+      else if (of === source) failed(error);
     }
     refreshing = null;
   } while (again && of === source);
@@ -238,8 +252,53 @@ async function trailOf(next) {
   return [{ identifier: ROOT, filename: 'Documents' }, ...trail];
 }
 
+// Any folder on the way may get another name or another place, or go.
+let trailWatches = [];
+
+function followTrail(trail) {
+  for (const each of trailWatches.splice(0)) each.stop();
+  const of = view;
+  const changed = later(PLACES_DELAY, () => retrace(of, trail).catch(failed));
+  trailWatches = trail.slice(0, -1).map(({ identifier }) => new FolderWatch(identifier, changed));
+}
+
+async function retrace(of, before) {
+  if (of !== view) return;
+  let trail;
+  try {
+    trail = await trailOf(of);
+  } catch (error) {
+    if (of !== view) return;
+    if (!error.isNoSuchItem) throw error;
+    showGone();
+    return;
+  }
+  const isSame = trail.length === before.length && trail.every(({ identifier, filename }, index) => identifier === before[index].identifier && filename === before[index].filename);
+  if (of !== view || isSame) return;
+  of.title = trail.at(-1).filename;
+  rows.scroller.setAttribute('aria-label', of.title);
+  drawPath(trail);
+  followTrail(trail);
+}
+
+// Where somebody has taken the folder away that is shown.
+function showGone() {
+  const ways = path.trail.slice(0, -1).map(({ identifier }) => identifier).reverse();
+  source?.stop();
+  source = null;
+  followTrail([]);
+  rows.clear();
+  const nearest = async () => {
+    for (const identifier of ways) {
+      if (identifier === ROOT || await call('itemForIdentifier', { identifier }).then(() => true, () => false)) return go({ kind: 'folder', container: identifier });
+    }
+    return undefined;
+  };
+  drawState('This folder is not there any more.', nearest, 'To the folder that it was in');
+}
+
 function drawPath(trail) {
-  const crumbs = trail.length ? trail : [{ filename: view.title ?? '' }];
+  const crumbs = trail.length ? trail : [{ filename: view.title ?? 'Folder' }];
   path.replaceChildren(h('ol', {}, crumbs.map((item, index) => {
     const isLast = index === crumbs.length - 1;
     const crumb = isLast ? h('h1', { 'aria-current': 'page', dir: 'auto' }, item.filename)
@@ -250,7 +309,8 @@ function drawPath(trail) {
     }
     return h('li', {}, crumb);
   })));
-  path.parent = trail.at(-2)?.identifier ?? null;
+  path.trail = trail;
+  document.title = `${crumbs.at(-1).filename} – Cindral`;
 }
 
 const EMPTY = {
@@ -262,39 +322,54 @@ const EMPTY = {
   trash: 'The trash is empty.',
 };
 
-function drawState(text = null, retry = null) {
+function drawState(text = null, way = null, label = 'Try again') {
   const isEmpty = source?.total === 0 && source.isComplete !== false;
   const shown = text ?? (isEmpty ? EMPTY[view.kind] : null);
   state.hidden = !shown;
   rows.element.hidden = Boolean(text);
   if (!shown) return;
-  state.replaceChildren(h('p', { role: retry ? 'alert' : 'status' }, shown));
-  if (retry) state.append(button('Try again', retry, { class: 'main' }));
+  state.replaceChildren(h('p', { role: way ? 'alert' : 'status' }, shown));
+  if (way) state.append(button(label, way, { class: 'main' }));
 }
 
 // MARK: Places
 
 let anchor = null;
 
-// A listing says which libraries there were when somebody last asked for changes.
+// Whether the applications are others than they were. A listing says which there were when somebody last asked for changes.
 async function takeUpLibraries() {
-  for (let moreComing = anchor !== null; moreComing;) {
+  let isOther = anchor === null;
+  for (let moreComing = !isOther; moreComing;) {
     try {
-      ({ anchor, moreComing } = await call('enumerateChanges', { container: ROOT, anchor }));
+      const changes = await call('enumerateChanges', { container: ROOT, anchor });
+      ({ anchor, moreComing } = changes);
+      isOther ||= changes.updated.some((item) => item.isAppLibrary) || changes.deleted.some((identifier) => identifier.startsWith('#'));
     } catch {
-      break; // Expired: the next one begins with now.
+      anchor = null; // Expired: the next one begins with now.
+      return takeUpLibraries();
     }
   }
-  ({ anchor } = await call('currentSyncAnchor', { container: ROOT }));
+  if (anchor === null) ({ anchor } = await call('currentSyncAnchor', { container: ROOT }));
+  return isOther;
 }
 
-async function readPlaces() {
-  await takeUpLibraries();
-  const [listing, tags] = await Promise.all([
-    call('enumerateItems', { container: ROOT }), call('tags').catch(() => ({ tags: [] }))]);
-  knownTags = tags.tags.map(({ tag }) => tag);
-  places.libraries = listing.items.filter((item) => item.isAppLibrary);
-  places.tags = tags.tags;
+async function readLibraries() {
+  if (!await takeUpLibraries()) return;
+  const libraries = [];
+  let page = null;
+  do {
+    const answer = await call('enumerateItems', { container: ROOT, ...(page ? { page } : {}) });
+    libraries.push(...answer.items.filter((item) => item.isAppLibrary));
+    page = answer.nextPage;
+  } while (page);
+  places.libraries = libraries;
+  drawPlaces();
+}
+
+async function readTags() {
+  const { tags } = await call('tags');
+  knownTags = tags.map(({ tag }) => tag);
+  places.tags = tags;
   drawPlaces();
 }
 
@@ -342,7 +417,7 @@ const commands = {
   newFolder: { label: 'New folder', isThere: mayWriteHere, when: mayWriteHere, run: newFolder },
   upload: { label: 'Upload', isThere: mayWriteHere, when: mayWriteHere, run: () => files.click() },
   uploadFolder: { label: 'Upload folder', isThere: mayWriteHere, when: mayWriteHere, run: () => folders.click() },
-  download: { label: 'Download', isThere: notInTrash, when: () => chosen().length > 0 && chosen().every((item) => item.documentSize !== undefined && !format.isFolder(item)), run: () => chosen().forEach(download) },
+  download: { label: 'Download', isThere: notInTrash, when: () => chosen().length > 0 && view.kind !== 'trash', run: () => download(chosen()) },
   rename: { label: 'Rename', isThere: notInTrash, when: () => chosen().length === 1 && may(CAN.rename) && view.kind !== 'trash', run: () => rows.edit(chosen()[0]) },
   move: { label: 'Move…', isThere: notInTrash, when: () => may(CAN.move) && view.kind !== 'trash', run: moveByDialog },
   copy: { label: 'Copy…', isThere: notInTrash, when: () => chosen().length > 0 && view.kind !== 'trash', run: copyByDialog },
@@ -358,6 +433,8 @@ const commands = {
 const toolButtons = new Map(Object.entries(commands).map(([name, command]) => [name,
   button(command.label, () => run(name), { class: `tool ${name}` })]));
 toolbar.append(...toolButtons.values());
+// How it is shown stays together at the end of the bar.
+toolbar.append(h('span', { class: 'showing' }, sortField, sortWay, toolButtons.get('information'), toolButtons.get('layout')));
 
 async function run(name) {
   const command = commands[name];
@@ -386,11 +463,14 @@ function drawSelection() {
 function open(item) {
   if (format.isFolder(item)) return go({ kind: 'folder', container: item.identifier, title: item.filename });
   call('setLastUsedDate', { identifier: item.identifier, date: new Date().toISOString() }).catch(() => {});
-  return dialogs.preview(item, download);
+  return dialogs.preview(item, () => download([item]).catch(failed));
 }
 
-function download(item) {
-  const link = h('a', { href: fileAddress(item, true), download: item.filename, hidden: true });
+// A document as it is; folders, and several items, as an archive.
+async function download(items) {
+  const isDocument = items.length === 1 && items[0].documentSize !== undefined && !format.isFolder(items[0]);
+  const address = isDocument ? fileAddress(items[0], true) : await archiveAddress(items);
+  const link = h('a', { href: address, download: '', hidden: true });
   document.body.append(link);
   link.click();
   link.remove();
@@ -444,14 +524,33 @@ async function emptyChosenOrTrash() {
 function toggleLayout() {
   settings.layout = settings.layout === 'list' ? 'icons' : 'list';
   const items = chosen();
-  rows.show(source, { layout: settings.layout, sort: settings.sort, label: view.title, sortable: view.kind === 'folder' });
+  if (!source) return;
+  rows.show(source, { layout: settings.layout, sort: sortOf(view), label: view.title });
   if (items.length) rows.reveal(items[0].identifier);
 }
 
+const downByNature = (by) => by === 'date' || by === 'size';
+
 function sortBy(by) {
-  const before = settings.sort;
-  settings.sort = { by, descending: before.by === by ? !before.descending : by === 'date' || by === 'size' };
-  show(view);
+  const before = sortOf(view);
+  return setSort({ by, descending: before?.by === by ? !before.descending : downByNature(by) });
+}
+
+async function setSort(sort) {
+  if (view.kind === 'folder') settings.sort = sort;
+  else view.sort = sort;
+  const heading = rows.header.contains(document.activeElement) ? document.activeElement.closest('.cell').classList[1] : null;
+  await show(view, { keepsFocus: true });
+  if (heading) rows.header.querySelector(`.cell.${heading} button`)?.focus();
+}
+
+function drawSort() {
+  const sort = sortOf(view);
+  const entries = view.kind === 'folder' ? SORTS : [['', 'As found'], ...SORTS];
+  sortField.replaceChildren(...entries.map(([value, label]) => h('option', { value, selected: value === (sort?.by ?? '') }, label)));
+  sortWay.disabled = !sort;
+  sortWay.textContent = sort?.descending ? '↓' : '↑';
+  sortWay.setAttribute('aria-pressed', sort?.descending ?? false);
 }
 
 // MARK: Information
@@ -460,7 +559,7 @@ const FIELDS = [
   ['typeIdentifier', 'Type'], ['documentSize', 'Size', (value) => `${format.size(value)} (${value.toLocaleString()})`], ['childItemCount', 'Items'],
   ['creationDate', 'Made', format.date], ['contentModificationDate', 'Changed', format.date], ['lastUsedDate', 'Used', format.date],
   ['tags', 'Tags', (tags) => tags.join(', ')], ['favoriteRank', 'Favourite', String], ['fileURL', 'Place', (url) => decodePlace(url)], ['bundleIdentifier', 'Application'],
-  ['isTrashed', 'In the trash', (value) => (value ? 'Yes' : 'No')], ['isUbiquitous', 'Synchronised', (value) => (value ? 'Yes' : 'No')], ['capabilities', 'May be', (bits) => capabilitiesText(bits)],
+  ['isAppLibrary', 'Documents of an application', () => 'Yes'], ['isTrashed', 'In the trash', (value) => (value ? 'Yes' : 'No')], ['isUbiquitous', 'Synchronised', (value) => (value ? 'Yes' : 'No')], ['capabilities', 'May be', (bits) => capabilitiesText(bits)],
   ['identifier', 'Identifier'], ['parentIdentifier', 'Folder'], ['docID', 'Document number'], ['fileID', 'File number'], ['versionIdentifier', 'Version']];
 
 function decodePlace(url) {
@@ -571,7 +670,8 @@ addEventListener('paste', (event) => {
   if (!mayWriteHere() || event.target.closest?.('input, dialog')) return;
   if (event.clipboardData.files.length) {
     event.preventDefault();
-    work.upload(entriesOfFiles(event.clipboardData.files), view.container).catch(failed);
+    const { container } = view;
+    entriesOf(event.clipboardData).then((entries) => work.upload(entries, container)).catch(failed);
   } else if (clipboard) {
     const { items, isCut } = clipboard;
     if (isCut) clipboard = null;
@@ -606,7 +706,7 @@ addEventListener('keydown', (event) => {
   } else if (key === '/') search.focus();
   else if (key === 'Ctrl+z') work.undo().catch(failed);
   else if (key === '?') dialogs.keys();
-  else if (key === 'Backspace' && path.parent) go({ kind: 'folder', container: path.parent });
+  else if (key === 'Backspace' && path.trail?.length > 1) go({ kind: 'folder', container: path.trail.at(-2).identifier });
   else if (!isInRows) return;
   else if (key === 'Enter' && chosen().length === 1) open(chosen()[0]);
   else if (key === ' ' && chosen().length === 1) open(chosen()[0]);
@@ -650,9 +750,10 @@ function showSignedOut() {
   hasSession = false;
   source?.stop();
   source = null;
+  for (const each of trailWatches.splice(0)) each.stop();
   app.replaceChildren(h('main', { class: 'state' }, h('h1', {}, 'Cindral'),
     h('p', {}, 'This browser has no session. Open the link that the program has printed; each is good once.'),
-    h('p', { class: 'hint' }, 'When a link was used, the program prints another.')));
+    h('p', { class: 'hint' }, 'The command “cindral link” prints another.')));
 }
 
 async function begin() {
@@ -666,27 +767,27 @@ async function begin() {
   hasSession = true;
   app.replaceChildren(
     h('header', {}, h('a', { class: 'skip', href: '#', onclick: (event) => { event.preventDefault(); rows.scroller.focus(); } }, 'To the documents'), placesButton, path, search, button('Keys', () => dialogs.keys(), { class: 'quiet keys' }), button('Sign out', async () => { await signOut(); showSignedOut(); }, { class: 'quiet' })),
-    h('div', { class: 'columns-of-page' }, places, h('main', {}, toolbar, h('div', { class: 'shown' }, rows.element, state)), information),
-    works, messages, status, files, folders);
-  const placesChanged = paced(500, () => readPlaces().catch(failed));
-  listen('signal', ({ container }) => { if (container === ROOT) placesChanged(); });
-  listen('connected', followPlaces);
+    h('div', { class: 'columns-of-page' }, places, h('main', {}, toolbar, h('div', { class: 'shown' }, rows.element, state)), information, messages),
+    works, status, files, folders);
+  // Whatever changes anywhere is signalled there. What is shown comes first.
+  const librariesChanged = later(PLACES_DELAY, () => readLibraries().catch(failed));
+  const tagsChanged = later(PLACES_DELAY, () => readTags().catch(failed));
+  listen('signal', ({ container }) => { if (container === ROOT) librariesChanged(); });
+  listen('connected', () => followPlaces().catch(failed));
   listen('lost', (isOver) => { if (isOver) signIn().catch(failed); });
   search.value = view?.text ?? '';
-  await Promise.all([show(viewOfAddress()), followPlaces().then(readPlaces).catch(failed)]);
+  await Promise.all([show(viewOfAddress()), followPlaces().catch(failed)]);
   if (view.kind === 'search') search.value = view.text;
   return undefined;
 
   async function followPlaces() {
     await call('startMonitoring', { container: ROOT });
-    try {
-      const { watch } = await call('watchQuery', { query: 'tags' });
-      tagsWatch?.();
-      tagsWatch = listen('queryChanged', (changed) => { if (changed.watch === watch) placesChanged(); });
-    } catch {
-      // Tags that can't be watched are read with the places.
-    }
-    placesChanged();
+    anchor = null;
+    await readLibraries();
+    const { watch } = await call('watchQuery', { query: 'tags' });
+    tagsWatch?.();
+    tagsWatch = listen('queryChanged', (changed) => { if (changed.watch === watch) tagsChanged(); });
+    await readTags();
   }
 }
 let tagsWatch = null;

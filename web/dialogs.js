@@ -134,7 +134,7 @@ function previewOf(item) {
 export function preview(item, download) {
   return ask(item.filename, (close) => [
     h('div', { class: 'preview' }, previewOf(item)),
-    h('div', { class: 'choices' }, button('Download', () => download(item)), button('Close', () => close(), { class: 'main', autofocus: true }))], { wide: true });
+    h('div', { class: 'choices' }, button('Download', download), button('Close', () => close(), { class: 'main', autofocus: true }))], { wide: true });
 }
 
 // Tags as a person changes them: those of all items that were given, one field for more.

@@ -49,3 +49,14 @@ export function paced(interval, work) {
     else run();
   };
 }
+
+// Calls once for all calls of an interval, at its end.
+export function later(interval, work) {
+  let timer = null;
+  return () => {
+    timer ??= setTimeout(() => {
+      timer = null;
+      work();
+    }, interval);
+  };
+}

@@ -17,7 +17,8 @@ const COLUMNS = [
   { name: 'kind', label: 'Kind' }];
 
 export class Rows {
-  // `actions`: open(item), selectionChanged(), menu(item), rename(item, name), sort(by), dragStart, drop.
+  // `actions`: open(item), selectionChanged(), menu(item), rename(item, name), sort(by), failed(error), dragStart, dragOver, drop,
+  // released().
   constructor(actions) {
     this.actions = actions;
     this.elements = new Map();
@@ -25,6 +26,7 @@ export class Rows {
     this.source = null;
     this.current = null; // Identifier of the row that the keyboard is at.
     this.anchor = null;
+    this.isHeld = false; // While a row is dragged, none moves away under the pointer.
     this.layout = 'list';
     this.spacer = h('div', { class: 'spacer' });
     this.body = h('div', { class: 'rows' });
@@ -39,7 +41,7 @@ export class Rows {
 
   // MARK: What is shown
 
-  show(source, { layout, sort, label, sortable }) {
+  show(source, { layout, sort, label }) {
     this.source = source;
     this.layout = layout;
     this.sort = sort;
@@ -48,6 +50,7 @@ export class Rows {
     this.selected.clear();
     this.current = null;
     this.anchor = null;
+    this.isHeld = false;
     this.editing = null;
     this.scroller.scrollTop = 0;
     this.scroller.className = `scroller ${layout}`;
@@ -57,7 +60,7 @@ export class Rows {
     this.scroller.removeAttribute('aria-activedescendant');
     this.body.setAttribute('role', layout === 'list' ? 'rowgroup' : 'presentation');
     if (layout === 'list') {
-      this.#makeHeader(sortable);
+      this.#makeHeader();
       this.scroller.replaceChildren(this.header, this.body);
       this.scroller.setAttribute('aria-colcount', COLUMNS.length);
     } else {
@@ -76,15 +79,13 @@ export class Rows {
     this.actions.selectionChanged();
   }
 
-  #makeHeader(sortable) {
+  #makeHeader() {
     this.header.setAttribute('role', 'rowgroup');
     this.header.replaceChildren(h('div', { class: 'row heading', role: 'row', 'aria-rowindex': 1 }, COLUMNS.map(({ name, label }) => {
-      const isSorted = sortable && this.sort.by === name;
-      const way = this.sort.descending ? 'descending' : 'ascending';
-      return h('div', { class: `cell ${name}`, role: 'columnheader', 'aria-sort': isSorted ? way : sortable ? 'none' : undefined },
-        sortable
-          ? h('button', { type: 'button', onclick: () => this.actions.sort(name) }, label, h('span', { 'aria-hidden': 'true' }, isSorted ? (this.sort.descending ? ' ▾' : ' ▴') : ''))
-          : h('span', {}, label));
+      const isSorted = this.sort?.by === name;
+      const way = this.sort?.descending ? 'descending' : 'ascending';
+      return h('div', { class: `cell ${name}`, role: 'columnheader', 'aria-sort': isSorted ? way : 'none' },
+        h('button', { type: 'button', onclick: () => this.actions.sort(name) }, label, h('span', { 'aria-hidden': 'true' }, isSorted ? (this.sort.descending ? ' ▾' : ' ▴') : '')));
     })));
   }
 
@@ -182,7 +183,12 @@ export class Rows {
       },
       ondragstart: (event) => {
         if (!this.selected.has(element.item.identifier)) this.select(element.item);
+        this.isHeld = true;
         this.actions.dragStart(event);
+      },
+      ondragend: () => {
+        this.isHeld = false;
+        this.actions.released();
       },
       ondragover: (event) => { if (format.isFolder(element.item)) this.actions.dragOver(event, element, element.item.identifier); },
       ondrop: (event) => { if (format.isFolder(element.item)) this.actions.drop(event, element.item.identifier); },
@@ -263,7 +269,7 @@ export class Rows {
   #click(event, element) {
     if (event.target.closest('input')) return;
     const { item } = element;
-    if (event.shiftKey) this.#extend(element.index);
+    if (event.shiftKey) this.#extend(element.index).catch((error) => this.actions.failed(error));
     else if (event.ctrlKey || event.metaKey) this.toggle(item);
     else this.select(item);
     if (!event.shiftKey) this.anchor = element.index;
@@ -302,8 +308,11 @@ export class Rows {
     return true;
   }
 
-  #extend(to) {
+  async #extend(to) {
     const from = this.anchor ?? to;
+    const { source } = this;
+    await source.load(Math.min(from, to), Math.max(from, to));
+    if (source !== this.source) return;
     this.selected.clear();
     for (let index = Math.min(from, to); index <= Math.max(from, to); index += 1) {
       const item = this.source.get(index);

@@ -2,6 +2,9 @@
 
 export const ROOT = 'TesselRootContainerItemIdentifier';
 
+// However deep what has missed it is.
+const NO_SUCH_ITEM = [['TesselErrorDomain', -1001], ['TSErrorDomain', 2], ['CindralProvider.LocalTesselKitError', 0], ['KsGeneralErrorDomain', 260]];
+
 export class RpcError extends Error {
   constructor(error) {
     super(error.message);
@@ -15,6 +18,7 @@ export class RpcError extends Error {
 
   get isCollision() { return this.is('TesselErrorDomain', -1003); }
   get isCancellation() { return this.is('KsPOSIXErrorDomain', 125); }
+  get isNoSuchItem() { return NO_SUCH_ITEM.some(([domain, code]) => this.is(domain, code)); }
   get isUnknownMethod() { return this.code === -32601; }
 }
 
@@ -127,6 +131,19 @@ export async function call(method, params = {}, follow = null) {
   } finally {
     progressOf.delete(id);
   }
+}
+
+// The address of an archive of the items, good for one download.
+export async function archiveAddress(items) {
+  const answer = await fetch('/archive', {
+    method: 'POST',
+    headers: { 'Content-Type': 'application/json', 'X-Cindral-Token': token },
+    body: JSON.stringify({ identifiers: items.map((item) => item.identifier) }),
+  });
+  if (answer.status === 401) throw new SignedOut();
+  const { archive, message } = await answer.json();
+  if (!answer.ok) throw new Error(message);
+  return `/archive/${archive}`;
 }
 
 export function fileAddress(item, saves = false) {

@@ -3,11 +3,28 @@
 import { call, listen, ROOT } from './rpc.js';
 import { collator, kind, isFolder } from './format.js';
 
-const PAGE = 200;
+// More rows than most screens show; each costs the host a look at its file.
+const PAGE = 100;
+// For what is done with all of them: as many as the host gives at once, so many times at a time.
+const RUN = 10;
+const RUNS_AT_ONCE = 3;
 // Milliseconds until somebody who waits for an order is shown another.
 const PATIENCE = 400;
 // Where the provider builds what is not to be seen before it is whole.
 const isWorkshop = (item) => item.filename === '.TemporaryLocalFolder' && item.parentIdentifier === ROOT;
+
+// An order that is made here, for what the host gives in one of its own.
+function comparatorOf(sort) {
+  const byName = (a, b) => collator.compare(a.filename, b.filename);
+  const by = {
+    name: byName,
+    date: (a, b) => new Date(a.contentModificationDate ?? 0) - new Date(b.contentModificationDate ?? 0),
+    size: (a, b) => (a.documentSize ?? -1) - (b.documentSize ?? -1),
+    kind: (a, b) => isFolder(b) - isFolder(a) || collator.compare(kind(a), kind(b)),
+  }[sort.by];
+  const way = sort.descending ? -1 : 1;
+  return (a, b) => way * by(a, b) || byName(a, b);
+}
 
 class Source {
   constructor() {
@@ -26,6 +43,7 @@ class Source {
       } catch {
         this.watch = null; // What can't be watched is looked at when somebody asks.
       }
+      if (this.isStopped) this.#unwatch();
     };
     this.stops.push(listen('queryChanged', ({ watch }) => { if (watch === this.watch) this.onchange(); }));
     this.stops.push(listen('connected', async () => {
@@ -38,8 +56,21 @@ class Source {
   stop() {
     this.isStopped = true;
     for (const each of this.stops.splice(0)) each();
+    this.#unwatch();
+  }
+
+  #unwatch() {
     if (this.watch !== null) call('unwatchQuery', { watch: this.watch }).catch(() => {});
     this.watch = null;
+  }
+}
+
+// Tells when what a folder holds may be other items, or items of other names.
+export class FolderWatch extends Source {
+  constructor(container, onchange) {
+    super();
+    this.onchange = onchange;
+    this.follow({ query: 'sortedItems', container });
   }
 }
 
@@ -80,12 +111,18 @@ export class SortedSource extends Source {
 
   // Makes rows from `first` to `last` known; false where they were.
   async load(first, last) {
-    const wanted = [];
+    const waited = [];
+    const runs = [];
     for (let page = Math.floor(first / PAGE); page <= Math.floor((last + 1) / PAGE); page += 1) {
-      if (!this.pages.has(page) && page * PAGE < Math.max(this.known, 1)) wanted.push(this.#fetch(page));
+      if (this.pages.has(page) || page * PAGE >= Math.max(this.known, 1)) continue;
+      if (this.loading.has(page)) waited.push(this.loading.get(page));
+      else if (runs.length && runs.at(-1).page + runs.at(-1).count === page && runs.at(-1).count < RUN) runs.at(-1).count += 1;
+      else runs.push({ page, count: 1 });
     }
-    await Promise.all(wanted);
-    return wanted.length > 0;
+    const isNews = waited.length + runs.length > 0;
+    const work = async () => { while (runs.length) { const { page, count } = runs.shift(); await this.#fetch(page, count); } };
+    await Promise.all([...waited, ...Array.from({ length: RUNS_AT_ONCE }, work)]);
+    return isNews;
   }
 
   // Everything that was known is looked at again, what is seen first.
@@ -106,28 +143,37 @@ export class SortedSource extends Source {
     this.total = fresh.get(from).total;
   }
 
-  #ask(page) {
+  #ask(page, count = 1) {
     return call('sortedItems', {
-      container: this.container, sort: this.sort.by, descending: this.sort.descending, offset: page * PAGE, limit: PAGE,
+      container: this.container, sort: this.sort.by, descending: this.sort.descending, offset: page * PAGE, limit: PAGE * count,
     });
   }
 
-  #fetch(page) {
-    if (this.loading.has(page)) return this.loading.get(page);
+  #fetch(page, count = 1) {
     const { generation } = this;
-    const loading = this.#ask(page).then((answer) => {
+    const loading = this.#ask(page, count).then((answer) => {
       if (generation !== this.generation) return;
-      this.#take(page, answer.items);
+      for (let each = 0; each < count; each += 1) {
+        this.loading.delete(page + each);
+        this.#take(page + each, answer.items.slice(each * PAGE, (each + 1) * PAGE));
+      }
       this.total = answer.total;
       this.isComplete = true;
-    }).finally(() => this.loading.delete(page));
-    this.loading.set(page, loading);
+    }, (error) => {
+      if (generation === this.generation) for (let each = 0; each < count; each += 1) this.loading.delete(page + each);
+      throw error;
+    });
+    for (let each = 0; each < count; each += 1) this.loading.set(page + each, loading);
     return loading;
   }
 
-  // All items, for what is done with all of them.
+  // All items, for what is done with all of them. A change on the way lets what was known go: then once more.
   async all() {
-    await this.load(0, Math.max(this.total - 1, 0));
+    let before;
+    do {
+      before = this.generation;
+      await this.load(0, Math.max(this.total - 1, 0));
+    } while (before !== this.generation && !this.isStopped);
     const items = [];
     for (let index = 0; index < this.total; index += 1) if (this.get(index)) items.push(this.get(index));
     return items;
@@ -136,8 +182,10 @@ export class SortedSource extends Source {
 
 // What the host finds by a question, one page after the other.
 export class QuerySource extends Source {
-  constructor(method, params = {}, { follows = true, keeps = () => true } = {}) {
+  // With a `sort` all that is found is fetched, and brought into that order.
+  constructor(method, params = {}, { follows = true, keeps = () => true, sort = null } = {}) {
     super();
+    this.sort = sort;
     this.follows = follows;
     this.keeps = keeps;
     this.method = method;
@@ -166,10 +214,11 @@ export class QuerySource extends Source {
     const items = [];
     let page = null;
     do {
-      const answer = await call(this.method, { ...this.params, limit: PAGE, ...(page ? { page } : {}) });
+      const answer = await call(this.method, { ...this.params, limit: this.sort ? PAGE * RUN : PAGE, ...(page ? { page } : {}) });
       items.push(...answer.items.filter(this.keeps));
       page = answer.nextPage;
-    } while (page && items.length < least);
+    } while (page && (this.sort || items.length < least));
+    if (this.sort) items.sort(comparatorOf(this.sort));
     this.#take(items, page);
   }
 
@@ -223,14 +272,7 @@ export class ListedSource extends Source {
       items.push(...answer.items.filter((item) => this.container !== ROOT || item.parentIdentifier === ROOT));
       page = answer.nextPage;
     } while (page);
-    const by = {
-      name: (a, b) => collator.compare(a.filename, b.filename),
-      date: (a, b) => (a.contentModificationDate ?? '').localeCompare(b.contentModificationDate ?? ''),
-      size: (a, b) => (a.documentSize ?? -1) - (b.documentSize ?? -1),
-      kind: (a, b) => isFolder(b) - isFolder(a) || collator.compare(kind(a), kind(b)),
-    }[this.sort.by];
-    const way = this.sort.descending ? -1 : 1;
-    items.sort((a, b) => way * by(a, b) || collator.compare(a.filename, b.filename));
+    items.sort(comparatorOf(this.sort));
     this.items = items;
     this.total = items.length;
     this.isComplete = true;

@@ -38,7 +38,7 @@ export class Works {
         const result = await each(item, work.follow, clash, items.length - work.completed > 1);
         if (result) {
           results.push(result.item ?? item);
-          if (result.undo) undos.unshift(result.undo);
+          if (result.undo) undos.unshift({ filename: item.filename, run: result.undo });
         }
       } catch (error) {
         if (!(error instanceof RpcError && error.isCancellation)) failures.push(`${item.filename ?? item.name}: ${error.message}`);
@@ -50,7 +50,8 @@ export class Works {
     this.shown(this.running);
     let undo = null;
     if (undos.length && undoable) {
-      undo = { title, run: () => this.#run(`Undo: ${title}`, undos, async (back) => { await back(); return {}; }, { undoable: false }) };
+      const each = async (back) => { await back.run(); return {}; };
+      undo = { title, run: () => this.#run(`Undo: ${title}`, undos, each, { undoable: false, done: () => 'Undone' }) };
       this.undos.push(undo);
     }
     if (failures.length) this.say(failures.slice(0, 3).join('\n') + (failures.length > 3 ? `\nand ${failures.length - 3} more` : ''), null, true);
@@ -62,33 +63,37 @@ export class Works {
   async undo(which = this.undos.at(-1)) {
     if (!which || !this.undos.includes(which)) return this.say('There is nothing to undo', null);
     this.undos = this.undos.filter((each) => each !== which);
-    await which.run();
-    return this.say('Undone', null);
+    return which.run();
   }
 
-  // Tries the name, and asks where it is taken.
-  async #withName(name, isOfFolder, clash, mayBeMore, attempt) {
+  // Tries the name, and asks where it is taken. What is replaced goes to the trash, and into the list.
+  async #withName(name, isOfFolder, clash, mayBeMore, attempt, replaced = []) {
     let tried = name;
+    let choice = null;
     for (let number = 2; ; ) {
       try {
         return await attempt(tried);
       } catch (error) {
         if (!(error instanceof RpcError && error.isCollision)) throw error;
-        if (tried === name && !clash.choice) {
+        choice ??= clash.choice;
+        if (!choice) {
           const answer = await askClash(name, error.data.item, mayBeMore);
-          if (answer.isForAll) clash.choice = answer.choice;
-          if (answer.choice === 'skip') return null;
-          if (answer.choice === 'replace') await call('trashItem', { identifier: error.data.item.identifier });
-          else tried = alternativeName(name, isOfFolder, number++);
-        } else if (clash.choice === 'skip') {
-          return null;
-        } else if (clash.choice === 'replace') {
-          await call('trashItem', { identifier: error.data.item.identifier });
-        } else {
-          tried = alternativeName(name, isOfFolder, number++);
+          ({ choice } = answer);
+          if (answer.isForAll) clash.choice = choice;
         }
+        if (choice === 'skip') return null;
+        if (choice === 'replace') replaced.push(await call('trashItem', { identifier: error.data.item.identifier }));
+        else tried = alternativeName(name, isOfFolder, number++);
       }
     }
+  }
+
+  // What undoes something by `back`, for which others went to the trash.
+  #undoOf(back, replaced) {
+    return async () => {
+      await back();
+      for (const item of replaced) await call('untrashItem', { identifier: item.identifier });
+    };
   }
 
   // MARK: The works
@@ -101,20 +106,23 @@ export class Works {
   }
 
   rename(item, name) {
-    return this.#run('Rename', [item], async () => {
-      const renamed = await call('renameItem', { identifier: item.identifier, name });
-      return { item: renamed, undo: () => call('renameItem', { identifier: renamed.identifier, name: item.filename }) };
-    }, { done: () => `Renamed to ${name}` });
+    return this.#run('Rename', [item], async (_, follow, clash) => {
+      const replaced = [];
+      const renamed = await this.#withName(name, isFolder(item), clash, false,
+        (tried) => call('renameItem', { identifier: item.identifier, name: tried }), replaced);
+      return renamed && { item: renamed, undo: this.#undoOf(() => call('renameItem', { identifier: renamed.identifier, name: item.filename }), replaced) };
+    }, { done: ([renamed]) => `Renamed to ${renamed.filename}` });
   }
 
   move(items, parent) {
     const moving = items.filter((item) => item.parentIdentifier !== parent && item.identifier !== parent);
     return this.#run('Move', moving, async (item, follow, clash, mayBeMore) => {
+      const replaced = [];
       const moved = await this.#withName(item.filename, isFolder(item), clash, mayBeMore,
-        (name) => call('reparentItem', { identifier: item.identifier, parent, name }, follow));
+        (name) => call('reparentItem', { identifier: item.identifier, parent, name }, follow), replaced);
       return moved && {
         item: moved,
-        undo: () => call('reparentItem', { identifier: moved.identifier, parent: item.parentIdentifier, name: item.filename }),
+        undo: this.#undoOf(() => call('reparentItem', { identifier: moved.identifier, parent: item.parentIdentifier, name: item.filename }), replaced),
       };
     }, { done: (results) => `Moved ${count(results.length)}` });
   }
@@ -194,8 +202,9 @@ export class Works {
   }
 }
 
-// What was dropped: files, and what is in folders.
+// What was dropped or pasted: files, and what is in folders.
 export async function entriesOf(transfer) {
+  // Before anything is waited for: afterwards there is nothing in there any more.
   const roots = [...transfer.items].filter((item) => item.kind === 'file').map((item) => item.webkitGetAsEntry?.() ?? item.getAsFile()).filter(Boolean);
   const entries = [];
   const walk = async (entry, folders) => {

@@ -73,6 +73,7 @@ Result<void> Commands::run() {
         case HostCommand::appsEnable:
         case HostCommand::appsDisable:
         case HostCommand::serve:
+        case HostCommand::link:
         case HostCommand::rpc: break;
     }
     return usageFailure("that is no command that prints");

@@ -2,6 +2,7 @@
 
 #include <fmt/format.h>
 
+#include <cerrno>
 #include <optional>
 
 #include "host/EditMethods.h"
@@ -229,6 +230,13 @@ void hello(const HostMethodsContext& context, const Json& params, const Reply& r
     reply->result([&](std::string& out) { out += context.hello(says); });
 }
 
+void makeLink(const HostMethodsContext& context, const Json& /*params*/, const Reply& reply) {
+    if (!context.makeLink) return answerWithError(*reply, KsError::posix(ENOTSUP), context.paths);
+    const auto link = context.makeLink();
+    if (!link.ok()) return answerWithError(*reply, link.error(), context.paths);
+    answerOptional(*reply, "url", true, [&](std::string& out) { appendJsonString(out, *link); });
+}
+
 }  // namespace
 
 void answerWithError(JsonRpcReply& reply, const KsError& error, const PresentedPaths& paths) {
@@ -287,6 +295,7 @@ JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context) {
         {"status", status},
         {"hello", hello},
         {"doctor", doctor},
+        {"makeLink", makeLink},
     };
     JsonRpcServer::Methods methods = makeEditMethods(context);
     methods.merge(makeSearchMethods(context));

@@ -24,6 +24,8 @@ struct HostMethodsContext {
     /// What the host says of itself, as JSON; told whether the client ends soon, and by itself.
     std::function<std::string(bool endsSoon)> hello;
     std::function<Result<std::string>()> doctorText;  ///< as JSON
+    /// A link that lets a browser in; null where none is let in.
+    std::function<Result<std::string>()> makeLink;
 };
 
 /// A method by its name, and what carries it out: it answers by the reply, at once or later.

@@ -85,6 +85,8 @@ constexpr CommandDescription kCommands[] = {
     {"serve",
      "Be the daemon of the state folder: the other commands, and all who speak JSON-RPC, find it by its socket.",
      HostCommand::serve, Argument::none},
+    {"link", "Have the daemon let one browser of this machine in, and print the link.", HostCommand::link,
+     Argument::none},
 };
 
 /// Words after "apps".
@@ -109,7 +111,7 @@ const std::vector<CommandGroup>& commandGroups() {
         {"Edit", {"import", "mkdir", "rename", "mv", "rm"}},
         {"Throw away", {"trash", "restore", "empty-trash"}},
         {"Label", {"tag", "untag", "favorite", "unfavorite", "touch-used"}},
-        {"Connect", {"status", "doctor", "serve", "rpc"}},
+        {"Connect", {"status", "doctor", "serve", "link", "rpc"}},
     };
     return kGroups;
 }

@@ -25,6 +25,7 @@ enum class HostCommand {
     doctor,
     rpc,
     serve,
+    link,
     edit,
     thumbnail,
     find,

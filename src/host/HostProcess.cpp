@@ -107,6 +107,7 @@ bool records(HostCommand command) {
         case HostCommand::edit:
         case HostCommand::thumbnail:
         case HostCommand::apps:
+        case HostCommand::link:
         case HostCommand::appsEnable:
         case HostCommand::appsDisable: return false;
     }

@@ -28,7 +28,7 @@
 #include "host/StopSignals.h"
 #include "host/TerminalText.h"
 #include "host/TextOutput.h"
-#include "host/http/HttpListener.h"
+#include "host/http/HttpDoor.h"
 #include "platform/foundation/Log.h"
 
 namespace cindral {
@@ -79,20 +79,19 @@ void raiseDescriptorLimit() {
     ::setrlimit(RLIMIT_NOFILE, &limit);
 }
 
-/// Lets browsers in too, where that is asked for. Links go to standard output, and nowhere else; who has closed it needs
-/// none.
-Result<void> addHttp(Daemon& daemon, const HostOptions& options) {
-    if (!options.httpPort) return {};
-    const auto show = [json = options.json](const std::string& link) {
-        [[maybe_unused]] const auto written =
-            descriptor::writeAll(STDOUT_FILENO, json ? fmt::format("{{\"url\":{}}}\n", jsonString(link))
-                                                     : fmt::format("Your documents, for one browser: {}\n", link));
-    };
-    auto listener = HttpListener::make(*options.httpPort, options.uploadBytesMax, show);
-    if (!listener.ok())
-        return hostFailure(fmt::format("can't listen at port {}: {}", *options.httpPort, listener.error().reason()));
-    daemon.add(*std::move(listener));
-    return {};
+/// Links go to standard output, and nowhere else; who has closed it needs none.
+void printLink(const std::string& link, bool json) {
+    [[maybe_unused]] const auto written =
+        descriptor::writeAll(STDOUT_FILENO, json ? fmt::format("{{\"url\":{}}}\n", jsonString(link))
+                                                 : fmt::format("Your documents, for one browser: {}\n", link));
+}
+
+/// Where nobody has asked for it yet, browsers are let in from when somebody does.
+Result<std::unique_ptr<HttpDoor>> makeDoor(const HostOptions& options) {
+    auto door = HttpDoor::make({options.httpPort, options.uploadBytesMax,
+                                [json = options.json](const std::string& link) { printLink(link, json); }});
+    if (door.ok()) return door;
+    return hostFailure(fmt::format("can't listen at port {}: {}", *options.httpPort, door.error().reason()));
 }
 
 int runServe(HostOptions options, const HostEnvironment& environment, TesselExtensionFactory makeProvider) {
@@ -124,12 +123,16 @@ int runServe(HostOptions options, const HostEnvironment& environment, TesselExte
 
     logInfo("serving {} at {}", (*host)->paths().real(), DaemonSocket::linkIn((*host)->state()));
     Daemon daemon(**host, manager);
-    for (DaemonSocket& each : sockets) daemon.add(std::make_unique<SocketListener>(std::move(each)));
-    if (const auto added = addHttp(daemon, (*host)->options()); !added.ok()) {
+    auto made = makeDoor((*host)->options());
+    if (!made.ok()) {
         // Who has connected already looks again when the store is closed.
         (void)takeOver((*host)->state());
-        return failWith(added.error());
+        return failWith(made.error());
     }
+    HttpDoor& door = **made;
+    daemon.add(*std::move(made));
+    for (DaemonSocket& each : sockets)
+        daemon.add(std::make_unique<SocketListener>(std::move(each), [&door] { return door.makeLink(); }));
     const auto served = daemon.run((*stopSignals)->descriptor(), [&] { (void)takeOver((*host)->state()); });
     // Held until the store is closed: until then, nobody else could use it.
     host->reset();
@@ -207,6 +210,15 @@ int runApps(const HostOptions& options, const HostEnvironment& environment) {
     return done.ok() ? kExitDone : failWith(done.error());
 }
 
+int runLink(const HostOptions& options, FoundDaemon daemon) {
+    SignalDispatcher signals;
+    const auto link = RemoteClient(std::move(daemon.socket), signals).makeLink();
+    if (!link.ok())
+        return failWith(hostFailure(fmt::format("the daemon lets no browser in: {}", messageOf(link.error()))));
+    printLink(*link, options.json);
+    return kExitDone;
+}
+
 /// What the options say, by the daemon where there is one.
 int runByDaemonOrAlone(HostOptions options, const HostEnvironment& environment, TesselExtensionFactory makeProvider,
                        ProviderRepair repairProvider) {
@@ -217,9 +229,12 @@ int runByDaemonOrAlone(HostOptions options, const HostEnvironment& environment, 
             auto agreed = agreeWithDaemon(std::move(options), *found->daemon);
             if (!agreed.ok()) return failWith(agreed.error());
             if (isAppsCommand(agreed->command)) return runApps(*agreed, environment);
+            if (agreed->command == HostCommand::link) return runLink(*agreed, *std::move(found->daemon));
             return runRemotely(*agreed, environment, *std::move(found->daemon));
         }
         if (isAppsCommand(options.command)) return runApps(options, environment);
+        if (options.command == HostCommand::link)
+            return failWith(hostFailure("no daemon runs that could let a browser in; \"cindral serve --http\" is one"));
         // Without a state folder nobody could be kept from becoming its daemon meanwhile.
         const bool isSure = found->handover.has_value();
         HostProcess::Steps steps;

@@ -103,4 +103,11 @@ Result<std::string> RemoteClient::doctorText() {
     return connection_.callForText("doctor", Params());
 }
 
+Result<std::string> RemoteClient::makeLink() {
+    const Json answer = TRY(connection_.call("makeLink", Params()));
+    const auto url = answer.find("url");
+    if (url == answer.end() || !url->is_string()) return unreadableAnswer();
+    return url->get<std::string>();
+}
+
 }  // namespace cindral

@@ -34,6 +34,8 @@ public:
     /// What `status` answers, as JSON text, once the roots have been read or compared.
     Result<std::string> statusText();
     Result<std::string> doctorText();
+    /// A link that lets a browser see the documents, once.
+    Result<std::string> makeLink();
 
 private:
     void didLoseDaemon();

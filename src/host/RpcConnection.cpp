@@ -55,7 +55,8 @@ RpcService serviceOf(const HostProcess& host) {
             [&host] { return host.statusText(); },
             host.search(),
             [&host](bool) { return host.helloText(); },
-            [&host] { return host.doctorText(); }};
+            [&host] { return host.doctorText(); },
+            nullptr};
 }
 
 Result<void> serveRpc(int input, int output, const RpcService& service) {

@@ -25,6 +25,7 @@ struct RpcService {
     SearchQueries& search;
     std::function<std::string(bool endsSoon)> hello = [](bool) { return std::string("{}"); };
     std::function<Result<std::string>()> doctorText = [] { return Result<std::string>("{}"); };
+    std::function<Result<std::string>()> makeLink = nullptr;  ///< for a browser; null where none is let in
 };
 /// All that a host has to offer.
 RpcService serviceOf(const HostProcess& host);

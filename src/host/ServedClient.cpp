@@ -38,7 +38,7 @@ ServedClient::ServedClient(const RpcService& service, JsonRpcServer::Sink tell,
                [this](const TesselItemIdentifier& container) { tell_(signalLine(container)); }),
       watches_(service.search, [this](std::uint64_t watch) { tell_(queryLine(watch)); }),
       server_(methodsWithout(makeHostMethods({client_, monitor_, service.paths, service.statusText, service.search,
-                                              watches_, service.hello, service.doctorText}),
+                                              watches_, service.hello, service.doctorText, service.makeLink}),
                              without),
               tell_) {}
 

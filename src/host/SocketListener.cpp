@@ -32,11 +32,12 @@ class SocketListener::Client {
 public:
     explicit Client(UniqueFd connection) : connection_(std::move(connection)), output_(connection_.get()) {}
 
-    Result<void> serve(const HostProcess& host) {
+    Result<void> serve(const HostProcess& host, const MakeLink& makeLink) {
         const UniqueFd never = TRY(descriptor::makeInterrupt());
         const int fd = connection_.get();
         RpcService service = serviceOf(host);
         service.hello = [&](bool endsSoon) { return hello(host, endsSoon); };
+        service.makeLink = makeLink;
         auto served = serveRpc(fd, fd, never, output_, service);
         output_.finish();
         return served;
@@ -67,7 +68,8 @@ private:
     bool isEnded_ GUARDED_BY(mutex_) = false;
 };
 
-SocketListener::SocketListener(DaemonSocket socket, Limits limits) : socket_(std::move(socket)), limits_(limits) {}
+SocketListener::SocketListener(DaemonSocket socket, Limits limits, MakeLink makeLink)
+    : socket_(std::move(socket)), limits_(limits), makeLink_(std::move(makeLink)) {}
 
 SocketListener::~SocketListener() {
     stop();
@@ -180,7 +182,7 @@ void SocketListener::welcome(UniqueFd connection, const HostProcess& host) {
 }
 
 void SocketListener::serve(const std::shared_ptr<Client>& client, const HostProcess& host) {
-    if (const auto served = client->serve(host); !served.ok())
+    if (const auto served = client->serve(host, makeLink_); !served.ok())
         logError("the connection to a client broke; {}", served.error().description());
     const MutexLock lock(mutex_);
     clients_.remove(client);

@@ -3,8 +3,10 @@
 #include <sys/types.h>
 #include <unistd.h>
 
+#include <functional>
 #include <list>
 #include <memory>
+#include <string>
 #include <utility>
 
 #include "host/DaemonListener.h"
@@ -32,8 +34,11 @@ public:
         uid_t user = ::geteuid();  ///< who is served
         std::size_t clientsMax = kClientsMax;
     };
-    explicit SocketListener(DaemonSocket socket) : SocketListener(std::move(socket), Limits()) {}
-    SocketListener(DaemonSocket socket, Limits limits);
+    /// What a client is given that asks for a link, which lets a browser in; null where there are none.
+    using MakeLink = std::function<Result<std::string>()>;
+    explicit SocketListener(DaemonSocket socket, MakeLink makeLink = nullptr)
+        : SocketListener(std::move(socket), Limits(), std::move(makeLink)) {}
+    SocketListener(DaemonSocket socket, Limits limits, MakeLink makeLink = nullptr);
     /// Stopped before, where it was started.
     ~SocketListener() override;
     SocketListener(const SocketListener&) = delete;
@@ -54,6 +59,7 @@ private:
 
     DaemonSocket socket_;
     const Limits limits_;
+    const MakeLink makeLink_;
     UniqueFd stop_;   ///< constant once started
     UniqueFd spare_;  ///< the accepting thread's
     DispatchGroup threads_;

@@ -89,20 +89,61 @@ export function watchPage(page, origin) {
   return complaints;
 }
 
-// What axe-core finds wrong on the page as it is now. It runs beside the page, not in it: the page's policy keeps it out.
-export async function violations(page) {
+// What axe-core finds wrong on the page as it is now, with all its rules, or with those that are named. It runs beside the page,
+// not in it: the page's policy keeps it out.
+export async function violations(page, rules = null) {
   const client = await page.context().newCDPSession(page);
-  const { frameTree } = await client.send('Page.getFrameTree');
-  const { executionContextId } = await client.send('Page.createIsolatedWorld', { frameId: frameTree.frame.id, worldName: 'axe' });
-  const evaluate = async (expression) => {
-    const { result, exceptionDetails } = await client.send('Runtime.evaluate', {
-      expression, contextId: executionContextId, awaitPromise: true, returnByValue: true });
+  const evaluate = async (expression, contextId) => {
+    const { result, exceptionDetails } = await client.send('Runtime.evaluate', { expression, contextId, awaitPromise: true, returnByValue: true });
     if (exceptionDetails) throw new Error(exceptionDetails.exception?.description ?? exceptionDetails.text);
     return result.value;
   };
-  await evaluate(`${axe}; 0`);
-  const found = await evaluate(`axe.run(document, { resultTypes: ['violations'], iframes: false }).then((results) => results.violations.map(
-    (each) => each.id + ': ' + each.nodes.map((node) => node.target.join(' ') + ' ' + (node.any[0]?.message ?? node.all[0]?.message ?? '')).join('; ')))`);
+  const { frameTree } = await client.send('Page.getFrameTree');
+  // The same world each time, for as long as the page is the same: reading the rules takes longer than looking.
+  const { executionContextId } = await client.send('Page.createIsolatedWorld', { frameId: frameTree.frame.id, worldName: 'axe' });
+  if (!await evaluate('typeof axe === "object"', executionContextId)) await evaluate(`${axe}; 0`, executionContextId);
+  const options = { resultTypes: ['violations'], iframes: false, ...(rules ? { runOnly: rules } : {}) };
+  const found = await evaluate(`axe.run(document, ${JSON.stringify(options)}).then((results) => results.violations.map(
+    (each) => each.id + ': ' + each.nodes.map((node) => node.target.join(' ') + ' ' + (node.any[0]?.message ?? node.all[0]?.message ?? '')).join('; ')))`, executionContextId);
   await client.detach();
   return found;
+}
+
+// Another program that is at work in a folder all the while, until it is told to stop: it makes documents, writes to them, gives
+// them other names and takes them away again, before and behind all others. Or, told to write, it writes to those that are there.
+export class Meddler {
+  constructor(folder, how = 'comings') {
+    this.process = spawn(process.execPath, ['-e', `(${meddle})(process.argv[1], process.argv[2])`, folder, how], { stdio: ['pipe', 'ignore', 'inherit'] });
+    this.ended = new Promise((resolve) => { this.process.once('exit', resolve); });
+  }
+
+  async stop() {
+    this.process.stdin.end();
+    return this.ended;
+  }
+}
+
+function meddle(folder, how) {
+  const fs = require('node:fs');
+  const path = require('node:path');
+  const attempt = (work) => { try { work(); } catch (error) { if (error.code !== 'ENOENT') throw error; } };
+  const name = (turn, state) => path.join(folder, `${turn % 2 ? 'zz' : '00'} of another ${turn} ${state}.txt`);
+  let turn = 0;
+  const comings = () => {
+    fs.writeFileSync(name(turn, 'new'), '');
+    if (turn >= 1) fs.appendFileSync(name(turn - 1, 'new'), 'more');
+    if (turn >= 2) fs.renameSync(name(turn - 2, 'new'), name(turn - 2, 'renamed'));
+    if (turn >= 3) fs.unlinkSync(name(turn - 3, 'renamed'));
+  };
+  const writes = () => {
+    for (const each of fs.readdirSync(folder)) {
+      // Not made anew where it has gone meanwhile.
+      attempt(() => { const file = fs.openSync(path.join(folder, each), fs.constants.O_WRONLY | fs.constants.O_APPEND); fs.writeSync(file, 'x'); fs.closeSync(file); });
+    }
+  };
+  const timer = setInterval(() => { (how === 'writes' ? writes : comings)(); turn += 1; }, 60);
+  process.stdin.on('end', () => {
+    clearInterval(timer);
+    if (how === 'comings') for (const each of fs.readdirSync(folder)) if (each.includes(' of another ')) attempt(() => fs.unlinkSync(path.join(folder, each)));
+  }).resume();
 }

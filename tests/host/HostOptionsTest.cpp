@@ -97,7 +97,7 @@ TEST(HostOptions, knowEveryCommand) {
     const std::pair<std::vector<std::string>, HostCommand> commands[] = {
         {{"ls"}, HostCommand::ls},         {{"tree"}, HostCommand::tree},  {{"info", "x"}, HostCommand::info},
         {{"url", "x"}, HostCommand::url},  {{"id", "x"}, HostCommand::id}, {{"anchor"}, HostCommand::anchor},
-        {{"status"}, HostCommand::status}, {{"rpc"}, HostCommand::rpc},
+        {{"status"}, HostCommand::status}, {{"rpc"}, HostCommand::rpc},    {{"link"}, HostCommand::link},
     };
     for (const auto& [words, command] : commands) EXPECT_EQ(options(words).command, command) << words.front();
 }
@@ -137,6 +137,7 @@ TEST(HostOptions, refuseWordsThatAreOff) {
     expectUsageFailure({"id"});
     expectUsageFailure({"status", "x"});
     expectUsageFailure({"rpc", "x"});
+    expectUsageFailure({"link", "x"});
     expectUsageFailure({"ls", "--storage"});
     expectUsageFailure({"ls", "--storage", ""});
     expectUsageFailure({"ls", "--state="});

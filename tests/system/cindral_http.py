@@ -72,8 +72,23 @@ class RawConnection:
     def response(self, has_body=True):
         status, fields = self.head()
         lengths = [int(value) for name, value in fields if name == "content-length"]
+        if ("transfer-encoding", "chunked") in fields:
+            return Response(status, fields, self.chunks())
         body = self.file.read(lengths[0]) if lengths and has_body else b""
         return Response(status, fields, body)
+
+    def chunks(self):
+        """A body in chunks; None where it ends before its end."""
+        body = b""
+        while (line := self.file.readline()):
+            length = int(line, 16)
+            chunk = self.file.read(length + 2)
+            if len(chunk) < length + 2:
+                return None
+            if length == 0:
+                return body
+            body += chunk[:-2]
+        return None
 
     def is_closed(self):
         """Waits for the other end to go."""
@@ -200,6 +215,11 @@ class Browser:
 
     def file(self, identifier, query="", more=()):
         return self.get("/file/" + urllib.parse.quote(identifier, safe="") + query, self.read_fields() + list(more))
+
+    def archive(self, *identifiers):
+        """What is to be saved of the items: the answer with the archive, or the one that refuses it."""
+        asked = self.post("/archive", json.dumps({"identifiers": identifiers}).encode())
+        return asked if asked.status != 200 else self.get("/archive/" + asked.json()["archive"])
 
     def upload(self, parent, name, body=b""):
         target = "/upload?" + urllib.parse.urlencode({"parent": parent, "name": name}, quote_via=urllib.parse.quote)

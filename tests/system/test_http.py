@@ -1,11 +1,15 @@
 """The document browser's HTTP: what it serves, and what is tried against it."""
 
+import io
 import json
 import os
+import re
 import socket
 import threading
+import time
 import unittest
 import urllib.parse
+import zipfile
 
 from cindral_http import Browser, Events, HttpDaemon, HttpTest, RawConnection, request_bytes
 from cindral_rpc import ROOT, PATIENCE, RpcError
@@ -150,6 +154,97 @@ class ServingTest(HttpTest):
         self.assertIsNone(answer.field("set-cookie"))
         self.assertEqual(answer.field("content-disposition"), "inline; filename*=UTF-8''" + urllib.parse.quote(name, safe=""))
 
+    # MARK: Archives
+
+    def archived(self, *identifiers):
+        answer = self.page.archive(*identifiers)
+        self.assertEqual((answer.status, answer.field("content-type")), (200, "application/zip"))
+        self.assert_walled_off(answer)
+        archive = zipfile.ZipFile(io.BytesIO(answer.body))
+        self.addCleanup(archive.close)
+        self.assertIsNone(archive.testzip())
+        return archive
+
+    def test_a_folder_is_an_archive_of_all_that_is_in_it(self):
+        self.make_file("Album", "Deep", "leaf ä.txt", contents=b"leaf")
+        self.make_file("Album", "picture.png", contents=os.urandom(300_000))
+        self.make_file("Album", "run.sh", contents=b"#!/bin/sh\n" * 9999)
+        os.chmod(self.path("Album", "run.sh"), 0o755)
+        os.utime(self.path("Album", "run.sh"), (1_000_000_000, 1_000_000_000))
+        os.mkdir(self.path("Album", "Empty"))
+        archive = self.archived(self.identifier("Album"))
+        self.assertEqual(sorted(archive.namelist()), ["Album/", "Album/Deep/", "Album/Deep/leaf ä.txt", "Album/Empty/", "Album/picture.png", "Album/run.sh"])
+        for name in ("Album/Deep/leaf ä.txt", "Album/picture.png", "Album/run.sh"):
+            with open(self.path(name), "rb") as file:
+                self.assertEqual(archive.read(name), file.read())
+        script = archive.getinfo("Album/run.sh")
+        self.assertEqual(script.external_attr >> 16, 0o100755)
+        self.assertLess(script.compress_size, script.file_size / 10)
+        self.assertEqual(archive.getinfo("Album/picture.png").external_attr >> 16, 0o100644)
+        self.assertEqual(script.date_time, time.localtime(1_000_000_000)[:6], "of the zone in which both work")
+
+    def test_several_items_are_one_archive_and_equal_names_stay_apart(self):
+        self.make_file("a", "same.txt", contents=b"1")
+        self.make_file("b", "same.txt", contents=b"2")
+        self.make_file("b", "Same", "x", contents=b"3")
+        archive = self.archived(self.identifier("a", "same.txt"), self.identifier("b", "same.txt"), self.identifier("b"))
+        self.assertEqual(archive.namelist(), ["same.txt", "same 2.txt", *archive.namelist()[2:]])
+        self.assertEqual((archive.read("same.txt"), archive.read("same 2.txt"), archive.read("b/Same/x")), (b"1", b"2", b"3"))
+
+    def test_an_archive_says_what_it_leaves_out(self):
+        os.mkdir(self.path("Mixed"))
+        os.mkfifo(self.path("Mixed", "pipe"))
+        os.symlink("/etc/passwd", self.path("Mixed", "link"))
+        os.symlink("/etc", self.path("Mixed", "door"))
+        self.make_file("Mixed", "plain.txt", contents=b"x")
+        archive = self.archived(self.identifier("Mixed"))
+        self.assertEqual(sorted(archive.namelist()), ["Left out.txt", "Mixed/", "Mixed/plain.txt"])
+        text = archive.read("Left out.txt").decode()
+        for name in ("pipe", "link", "door"):
+            self.assertIn(f"Mixed/{name}\n", text)
+
+    def test_names_of_an_archive_lead_nowhere_and_stay_names(self):
+        folder = self.path("Names").encode()
+        os.mkdir(folder)
+        for name in (b"..\\..\\escape.txt", b"bad \xff.txt", b"new\nline", "Größe".encode()):
+            with open(os.path.join(folder, name), "wb") as file:
+                file.write(name)
+        answer = self.page.archive(self.identifier("Names"))
+        archive = zipfile.ZipFile(io.BytesIO(answer.body))
+        self.addCleanup(archive.close)
+        names = sorted(archive.namelist())
+        self.assertEqual(names, sorted(["Names/", "Names/..\uff3c..\uff3cescape.txt", b"Names/bad \xff.txt".decode("cp437"), "Names/new\nline", "Names/Größe"]))
+
+    def test_an_archive_that_can_not_be_is_refused(self):
+        for message in (b"", b"{}", b"[]", b'{"identifiers":[]}', b'{"identifiers":[1]}', b'{"identifiers":"did=1"}',
+                        json.dumps({"identifiers": [ROOT]}).encode()):
+            with self.subTest(message):
+                self.assertEqual(self.page.post("/archive", message).status, 400)
+        self.assertEqual(self.page.archive("did=99999").status, 404)
+        self.assertEqual(self.page.post("/archive", b"{}", content_type="text/plain").status, 415)
+
+    def test_an_archive_is_had_once_and_by_who_asked(self):
+        message = json.dumps({"identifiers": [self.identifier("notes.txt")]}).encode()
+        name = self.page.post("/archive", message).json()["archive"]
+        self.assertEqual(self.browser_of_another_link().get("/archive/" + name).status, 404)
+        self.assertEqual(self.page.get("/archive/" + name, method="HEAD").status, 204)
+        self.assertEqual(self.page.get("/archive/" + name).status, 200)
+        self.assertEqual(self.page.get("/archive/" + name).status, 404)
+        # Those that nobody fetches are not kept for ever.
+        names = [self.page.post("/archive", message).json()["archive"] for _ in range(17)]
+        self.assertEqual([self.page.get("/archive/" + each).status for each in (names[0], names[1], names[16])], [404, 200, 200])
+
+    def test_an_archive_that_is_broken_off_has_no_end(self):
+        with open(self.path("big.bin"), "wb") as file:
+            file.truncate(20_000_000_000)
+        message = json.dumps({"identifiers": [self.identifier("big.bin")]}).encode()
+        name = self.page.post("/archive", message).json()["archive"]
+        with RawConnection(self.page.port) as connection:
+            connection.send(request_bytes("GET", "/archive/" + name, self.page.read_fields()))
+            self.assertEqual(connection.head()[0], 200)
+            self.assertEqual(self.daemon_process.stop(), 0)
+            self.assertIsNone(connection.chunks())
+
     # MARK: Uploads
 
     def temporary_files(self):
@@ -272,6 +367,7 @@ class AttackTest(HttpTest):
                 self.assertEqual(self.page.post("/rpc", self.message, fields).status, 403)
                 self.assertEqual(self.page.post("/logout", b"", fields).status, 403)
                 self.assertEqual(self.page.post("/upload?parent=" + ROOT + "&name=x", b"", fields).status, 403)
+                self.assertEqual(self.page.post("/archive", self.message, fields).status, 403)
 
     def test_a_write_without_an_origin_is_refused(self):
         fields = [field for field in self.page.write_fields() if field[0] != "Origin"]
@@ -293,7 +389,7 @@ class AttackTest(HttpTest):
     def test_what_another_site_fetches_is_refused(self):
         for site in ("cross-site", "same-site", "unknown"):
             fields = self.replaced(self.page.read_fields(), "Sec-Fetch-Site", site)
-            for target in ("/session", "/events", "/file/did=1", "/thumbnail/did=1"):
+            for target in ("/session", "/events", "/file/did=1", "/thumbnail/did=1", "/archive/x"):
                 with self.subTest(site=site, target=target):
                     self.assertEqual(self.page.get(target, fields).status, 403)
 
@@ -329,10 +425,10 @@ class AttackTest(HttpTest):
         stranger = Browser(self.page.port)
         for cookie in (None, "", f"cindral-{self.page.port}=", f"cindral-{self.page.port}=" + "0" * 64, "cindral=1"):
             stranger.cookie = cookie
-            for target in ("/session", "/events", "/file/did=1", "/thumbnail/did=1"):
+            for target in ("/session", "/events", "/file/did=1", "/thumbnail/did=1", "/archive/x"):
                 with self.subTest(cookie=cookie, target=target):
                     self.assertEqual(stranger.get(target).status, 401)
-            for target in ("/rpc", "/logout", "/upload?parent=" + ROOT + "&name=x"):
+            for target in ("/rpc", "/logout", "/archive", "/upload?parent=" + ROOT + "&name=x"):
                 with self.subTest(cookie=cookie, target=target):
                     self.assertEqual(stranger.post(target, self.message).status, 401)
 
@@ -384,7 +480,8 @@ class AttackTest(HttpTest):
                      "did=99999", "fid=0", "did=-1", "did=18446744073709551616", "did=", "", "#nobody", "%23..%2f..",
                      "file:%2f%2f%2fetc%2fpasswd", "..;/..;/etc/passwd", "TesselTemporaryLocalFolderItemIdentifier%2f..",
                      self.storage_path("secret.txt"), urllib.parse.quote(self.storage_path("secret.txt"), safe="")):
-            for route in ("/file/", "/thumbnail/"):
+            self.assertIn(self.page.archive(urllib.parse.unquote(path, errors="replace")).status, (400, 404))
+            for route in ("/file/", "/thumbnail/", "/archive/"):
                 if route == "/thumbnail/" and path.startswith("#"):
                     continue
                 with self.subTest(route=route, path=path):
@@ -406,6 +503,11 @@ class AttackTest(HttpTest):
             self.page.rpc("identifierForItemAtURL", path="/etc/passwd")
         self.assertEqual(raised.exception.code, -32601)
 
+    def test_no_browser_lets_another_one_in(self):
+        with self.assertRaises(RpcError) as raised:
+            self.page.rpc("makeLink")
+        self.assertEqual(raised.exception.code, -32601)
+
     def test_identifiers_of_what_is_not_published_are_nobodys(self):
         beside = self.holder.storage + "-of-others"
         os.mkdir(beside)
@@ -415,6 +517,7 @@ class AttackTest(HttpTest):
             number = os.stat(path).st_ino
             with self.subTest(path):
                 self.assertIn(self.page.file(f"fid={number}").status, (404, 403))
+                self.assertIn(self.page.archive(f"fid={number}").status, (404, 403))
                 with self.assertRaises(RpcError):
                     self.page.rpc("copyItem", identifier=f"fid={number}", parent=ROOT)
                 self.assertIn("error", self.page.upload(f"fid={number}", "x", b"x").json())
@@ -433,6 +536,7 @@ class AttackTest(HttpTest):
             item = self.page.named(ROOT)[name]["identifier"]
             with self.subTest(name):
                 self.assertIn(self.page.file(item).status, (403, 404, 415))
+                self.assertNotIn(b"secret\n", self.page.archive(item).body)
                 self.assertIn("error", self.page.upload(item, "x", b"x").json())
                 with self.assertRaises(RpcError):
                     self.page.rpc("createDirectory", name="x", parent=item)
@@ -460,6 +564,9 @@ class AttackTest(HttpTest):
         self.addCleanup(os.unlink, self.storage_path("swapped"))
         answer = self.page.file(document)
         self.assertEqual((answer.status, answer.body), (200, b"inside\n"), "it is followed to where it went")
+        archive = zipfile.ZipFile(io.BytesIO(self.page.archive(folder).body))
+        self.addCleanup(archive.close)
+        self.assertEqual([archive.read(name) for name in archive.namelist() if name.endswith("secret.txt")], [b"inside\n"])
         self.page.upload(folder, "put.txt", b"x")
         self.assertEqual(os.listdir(outside), ["secret.txt"])
 
@@ -588,6 +695,43 @@ class OptionsTest(HttpTest):
     def test_the_link_is_json_where_that_is_asked_for(self):
         daemon = self.serve("--json")
         self.assertEqual(json.loads(daemon.printed), {"url": f"http://127.0.0.1:{daemon.port}/#{daemon.link}"})
+
+    def link_beside(self, *words):
+        status, output, errors = self.run_program("link", *words)
+        self.assertEqual((status, errors), (0, b""))
+        found = re.fullmatch(r"Your documents, for one browser: http://127\.0\.0\.1:(\d+)/#([0-9a-f]{64})\n", output.decode())
+        self.assertIsNotNone(found, output)
+        return int(found.group(1)), found.group(2)
+
+    def test_a_daemon_that_runs_lets_a_browser_in_when_asked(self):
+        daemon = self.serve()
+        port, link = self.link_beside()
+        self.assertEqual(port, daemon.port)
+        self.assertNotEqual(link, daemon.link)
+        for each in (link, daemon.link):
+            self.assertEqual(Browser(port).trade(each).status, 200, "both are good")
+            self.assertEqual(Browser(port).trade(each).status, 401, "once")
+
+    def test_a_daemon_that_lets_nobody_in_does_when_asked(self):
+        daemon = self.daemon()
+        port, link = self.link_beside()
+        page = Browser(port)
+        self.assertEqual(page.trade(link).status, 200)
+        self.assertEqual(page.rpc("itemForIdentifier", identifier=ROOT)["identifier"], ROOT)
+        self.assertEqual(self.link_beside()[0], port, "it stays where it is")
+        status, output, _ = self.run_program("link", "--json")
+        self.assertEqual((status, json.loads(output)["url"].split("#")[0]), (0, f"http://127.0.0.1:{port}/"))
+        self.assertEqual(daemon.stop(), 0)
+        with self.assertRaises(ConnectionRefusedError):
+            page.get("/session")
+
+    def test_without_a_daemon_nobody_is_let_in(self):
+        status, output, errors = self.run_program("link")
+        self.assertEqual((status, output), (1, b""))
+        self.assertIn("no daemon runs", errors.decode())
+        with self.client() as alone, self.assertRaises(RpcError) as raised:
+            alone.call("makeLink")
+        self.assertEqual(raised.exception.data["domain"], "KsPOSIXErrorDomain")
 
     def test_an_upload_and_a_stream_end_with_the_daemon(self):
         daemon = self.serve()

@@ -15,8 +15,8 @@
 namespace cindral {
 namespace {
 
-// These take paths, and could be told of any.
-constexpr std::string_view kMethodsNotToBeHad[] = {"importDocument", "identifierForItemAtURL"};
+// The first two take paths, and could be told of any. Whom else to let in is not a browser's to say.
+constexpr std::string_view kMethodsNotToBeHad[] = {"importDocument", "identifierForItemAtURL", "makeLink"};
 
 /// Returns when the other end is gone or `stop` can be read.
 void waitForEnd(int socket, int stop) {

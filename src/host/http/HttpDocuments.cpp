@@ -19,9 +19,6 @@ namespace {
 // A save puts another object under the name between the question and the opening.
 constexpr int kAttemptsMax = 5;
 
-// Nothing is loaded, nothing runs, and whose it is, is nobody's.
-constexpr std::string_view kDocumentPolicy =
-    "sandbox; default-src 'none'; style-src 'unsafe-inline'; frame-ancestors 'self'";
 // The browser's own viewer does not work in a sandbox. It is no part of any page, and runs nothing of the document's in
 // our name.
 constexpr std::string_view kViewerPolicy = "default-src 'none'; object-src 'self'; frame-ancestors 'self'";
@@ -56,24 +53,28 @@ std::optional<std::uint64_t> numberOf(std::string_view digits) {
     return value;
 }
 
-/// The name for a file that is saved: none of its bytes can end the field.
-std::string dispositionOf(std::string_view name, bool isShown) {
+}  // namespace
+
+bool HttpDocuments::isIdentifier(std::string_view text) {
+    const bool isNumber = text.starts_with("did=") || text.starts_with("fid=");
+    return !isNumber || text.find_first_not_of("0123456789", 4) == std::string_view::npos;
+}
+
+std::string HttpDocuments::dispositionOf(std::string_view name, bool isShown) {
     std::string field = isShown ? "inline" : "attachment";
     field += "; filename*=UTF-8''";
-    // "/" is no part of a name.
+    // None of its bytes can end the field; "/" is no part of a name.
     appendPercentEncoded(field, name);
     return field;
 }
 
-int statusOf(const KsError& error) {
+int HttpDocuments::statusOf(const KsError& error) {
     if (isNoSuchItem(error) || error.isPosix(ENOENT) || error.is(kKsGeneralErrorDomain, kKsFileNoSuchFileError))
         return 404;
     if (error.isPosix(EACCES) || error.isPosix(EPERM) || error.isPosix(ELOOP) || error.isPosix(EXDEV)) return 403;
     if (error.isPosix(EISDIR)) return 415;
     return 500;
 }
-
-}  // namespace
 
 ServedType ServedType::of(std::string_view typeIdentifier) {
     for (const auto& [other, name] : kOtherNames) {
@@ -108,14 +109,6 @@ std::optional<ByteRange> ByteRange::parse(std::string_view field, std::uint64_t 
     return ByteRange{*first, std::min(last.value_or(size - 1), size - 1) - *first + 1};
 }
 
-/// A document as it is right now.
-struct HttpDocuments::Opened {
-    UniqueFd fd;
-    std::uint64_t size;
-    std::string name;
-    ServedType type;
-};
-
 Result<HttpDocuments::Opened> HttpDocuments::open(const TesselItemIdentifier& identifier) const {
     for (int attempt = 1;; ++attempt) {
         auto opened = openOnce(identifier);
@@ -135,7 +128,8 @@ Result<HttpDocuments::Opened> HttpDocuments::openOnce(const TesselItemIdentifier
     if (!status.isRegular()) return KsError::posix(EACCES);
     if (item->fileID() && *item->fileID() != status.fileID) return KsError::posix(ESTALE);
     UniqueFd fd = TRY(sys::reopen(handle.get(), O_RDONLY));
-    return Opened{std::move(fd), status.size, item->filename(), ServedType::of(item->typeIdentifier())};
+    return Opened{std::move(fd),    status.size,           status.modificationTime, (status.mode & S_IXUSR) != 0,
+                  item->filename(), item->typeIdentifier()};
 }
 
 void HttpDocuments::answer(HttpConnection& connection, const HttpRequest& request,
@@ -146,10 +140,11 @@ void HttpDocuments::answer(HttpConnection& connection, const HttpRequest& reques
         connection.answer(HttpResponse::refusal(statusOf(opened.error()), messageOf(opened.error())), withoutBody);
         return;
     }
+    const ServedType type = ServedType::of(opened->typeIdentifier);
     HttpResponse response;
-    response.contentType = opened->type.contentType;
-    response.contentPolicy = opened->type.contentType == "application/pdf" ? kViewerPolicy : kDocumentPolicy;
-    response.fields = {{"Content-Disposition", dispositionOf(opened->name, opened->type.isShown && !saves)},
+    response.contentType = type.contentType;
+    response.contentPolicy = type.contentType == "application/pdf" ? kViewerPolicy : kPolicy;
+    response.fields = {{"Content-Disposition", dispositionOf(opened->name, type.isShown && !saves)},
                        {"Accept-Ranges", "bytes"}};
     const auto range = ByteRange::parse(request.only("range").value_or(""), opened->size);
     if (!range) {
@@ -175,7 +170,7 @@ HttpResponse HttpDocuments::thumbnail(const TesselItemIdentifier& identifier, un
     if (!picture) return HttpResponse::refusal(404, "There is no picture of it");
     HttpResponse response;
     response.contentType = "image/png";
-    response.contentPolicy = kDocumentPolicy;
+    response.contentPolicy = kPolicy;
     response.body = textOf(*picture);
     return response;
 }

@@ -7,6 +7,8 @@
 
 #include "host/http/HttpConnection.h"
 #include "host/http/HttpRequest.h"
+#include "platform/foundation/KsDate.h"
+#include "platform/foundation/UniqueFd.h"
 #include "platform/tessel/TesselExtension.h"
 
 namespace cindral {
@@ -20,6 +22,11 @@ namespace cindral {
 /// Thread safety: all operations, from any thread.
 class HttpDocuments {
 public:
+    /// Under which a document is shown, and everything else that is not the page's own: nothing is loaded, nothing runs,
+    /// and whose it is, is nobody's.
+    static constexpr std::string_view kPolicy =
+        "sandbox; default-src 'none'; style-src 'unsafe-inline'; frame-ancestors 'self'";
+
     /// Borrowed for life.
     explicit HttpDocuments(TesselExtension& provider) : provider_(provider) {}
 
@@ -29,9 +36,27 @@ public:
     /// The picture that stands for an item.
     HttpResponse thumbnail(const TesselItemIdentifier& identifier, unsigned pixels) const;
 
-private:
-    struct Opened;
+    /// A document as it is right now.
+    struct Opened {
+        UniqueFd fd;
+        std::uint64_t size;
+        KsDate changed;
+        bool isExecutable;
+        std::string name;
+        std::string typeIdentifier;
+    };
+    /// The very document of that identifier, whatever stands under its name: a link leads nowhere, and nothing that would
+    /// have to be waited for is opened.
     Result<Opened> open(const TesselItemIdentifier& identifier) const;
+
+    /// Whether it is one as the provider writes them. The provider itself takes a number for what it begins with.
+    static bool isIdentifier(std::string_view text);
+    /// What to answer to an error.
+    static int statusOf(const KsError& error);
+    /// The field that says how a document is called, and whether it is to be saved.
+    static std::string dispositionOf(std::string_view name, bool isShown);
+
+private:
     Result<Opened> openOnce(const TesselItemIdentifier& identifier) const;
 
     TesselExtension& provider_;

@@ -58,10 +58,15 @@ HttpListener::~HttpListener() {
     waitUntilStopped();
 }
 
-void HttpListener::showLink() {
-    const MutexLock lock(showMutex_);
+std::string HttpListener::makeLink() {
     // Behind the "#", which no browser sends anywhere.
-    show_(site_->origin() + "/#" + sessions_.makeLink());
+    return site_->origin() + "/#" + sessions_.makeLink();
+}
+
+void HttpListener::showLink() {
+    if (show_ == nullptr) return;
+    const MutexLock lock(showMutex_);
+    show_(makeLink());
 }
 
 Result<void> HttpListener::start(const HostProcess& host) {

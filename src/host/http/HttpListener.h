@@ -25,7 +25,7 @@ public:
     static constexpr std::size_t kConnectionsMax = 128;
 
     /// Takes a link that lets one browser in, once: the first when the service starts, then another whenever one was used,
-    /// by one at a time. Nobody else is told.
+    /// by one at a time. Nobody else is told. Null where nobody is to be shown any.
     using Show = std::function<void(const std::string& link)>;
     /// Listens on this machine's own address alone. Port 0 is one that is free. EADDRINUSE where another has it.
     static Result<std::unique_ptr<HttpListener>> make(std::uint16_t port, std::uint64_t uploadBytesMax, Show show);
@@ -37,6 +37,9 @@ public:
     Result<void> start(const HostProcess& host) override;
     void stop() override;
     void waitUntilStopped() override;
+
+    /// A link that lets one browser in, once. Once started; from any thread.
+    std::string makeLink();
 
 private:
     struct Connection;

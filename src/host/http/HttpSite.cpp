@@ -10,7 +10,7 @@
 namespace cindral {
 namespace {
 
-constexpr std::size_t kRpcBytesMax = 4 << 20;
+constexpr std::size_t kMessageBytesMax = 4 << 20;
 constexpr std::size_t kLinkBytesMax = 1 << 10;
 constexpr unsigned kThumbnailPixelsUsual = 128;
 constexpr unsigned kThumbnailPixelsMax = 1024;
@@ -19,14 +19,10 @@ std::string tokenText(const HttpSession& session) {
     return R"({"token":)" + jsonString(session.token) + "}\n";
 }
 
-/// The identifier that a route ends with; none where it is none as the provider writes them. The provider itself takes a
-/// number for what it begins with.
+/// The identifier that a route ends with.
 std::optional<TesselItemIdentifier> identifierOf(std::string_view encoded) {
     auto identifier = percentDecode(encoded);
-    if (!identifier) return std::nullopt;
-    const bool isNumber = identifier->starts_with("did=") || identifier->starts_with("fid=");
-    if (isNumber && identifier->find_first_not_of("0123456789", 4) != std::string::npos) return std::nullopt;
-    return identifier;
+    return identifier && HttpDocuments::isIdentifier(*identifier) ? identifier : std::nullopt;
 }
 
 /// What to answer for a body that can't be taken; none where there is nobody to answer.
@@ -51,6 +47,8 @@ constexpr HttpSite::Route HttpSite::kRoutes[] = {
     {HttpRequest::Method::get, "/events", &HttpSite::streamEvents},
     {HttpRequest::Method::get, "/file/", &HttpSite::sendDocument},
     {HttpRequest::Method::get, "/thumbnail/", &HttpSite::sendThumbnail},
+    {HttpRequest::Method::post, "/archive", &HttpSite::prepareArchive},
+    {HttpRequest::Method::get, "/archive/", &HttpSite::sendArchive},
     {HttpRequest::Method::post, "/upload", &HttpSite::receiveUpload},
 };
 
@@ -61,6 +59,7 @@ HttpSite::HttpSite(const RpcService& service, HttpSessions& sessions, std::uint1
       guard_(port, sessions),
       clients_(service),
       documents_(*service.provider),
+      archives_(service.provider, documents_),
       uploads_(*service.provider, service.paths, uploadBytesMax),
       didTrade_(std::move(didTrade)) {}
 
@@ -138,17 +137,22 @@ void HttpSite::logOut(const Call& call) {
     call.connection.answer(response);
 }
 
-void HttpSite::answerRpc(const Call& call) {
+/// None once the request is answered.
+std::optional<std::string> HttpSite::readMessage(const Call& call) {
     const auto type = call.request.only("content-type");
     if (!type || !type->starts_with("application/json")) {
         call.connection.answer(HttpResponse::refusal(415, "A message is JSON"));
-        return;
+        return std::nullopt;
     }
-    const auto message = call.connection.readWholeBody(kRpcBytesMax);
-    if (!message.ok()) {
-        call.connection.answer(bodyRefusal(message.error()));
-        return;
-    }
+    auto message = call.connection.readWholeBody(kMessageBytesMax);
+    if (message.ok()) return *std::move(message);
+    call.connection.answer(bodyRefusal(message.error()));
+    return std::nullopt;
+}
+
+void HttpSite::answerRpc(const Call& call) {
+    const auto message = readMessage(call);
+    if (!message) return;
     std::string answer;
     const std::string_view client = call.request.only("x-cindral-connection").value_or("");
     if (!clients_.answer(*call.session, client, *message, answer)) {
@@ -187,6 +191,19 @@ void HttpSite::sendThumbnail(const Call& call) {
     std::from_chars(size.data(), size.data() + size.size(), pixels);
     call.connection.answer(documents_.thumbnail(*identifier, std::clamp(pixels, 1U, kThumbnailPixelsMax)),
                            call.request.method == HttpRequest::Method::head);
+}
+
+void HttpSite::prepareArchive(const Call& call) {
+    const auto message = readMessage(call);
+    if (message) call.connection.answer(archives_.prepare(call.session, *message));
+}
+
+void HttpSite::sendArchive(const Call& call) {
+    if (call.request.method == HttpRequest::Method::head) {
+        call.connection.answer(HttpResponse::noContent());
+        return;
+    }
+    archives_.send(call.connection, call.session, call.rest, call.stop);
 }
 
 void HttpSite::receiveUpload(const Call& call) {

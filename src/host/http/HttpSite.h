@@ -2,9 +2,11 @@
 
 #include <cstdint>
 #include <functional>
+#include <optional>
 #include <string>
 
 #include "host/RpcConnection.h"
+#include "host/http/HttpArchives.h"
 #include "host/http/HttpClients.h"
 #include "host/http/HttpConnection.h"
 #include "host/http/HttpDocuments.h"
@@ -26,6 +28,8 @@ namespace cindral {
 /// | GET /events | a session | what the page's client is told, as server-sent events |
 /// | GET /file/IDENTIFIER | a session | a document's bytes; with ?save, to be saved |
 /// | GET /thumbnail/IDENTIFIER?size=N | a session | the picture that stands for an item |
+/// | POST /archive | a session | takes down of which items there is to be an archive, and names it |
+/// | GET /archive/NAME | a session | the archive, once |
 /// | POST /upload?parent=IDENTIFIER&name=NAME | a session | a document, its bytes being the body |
 ///
 /// Items go by their identifiers: no route takes a path, and methods that do are not to be had here.
@@ -60,12 +64,15 @@ private:
     void openSession(HttpConnection& connection, const HttpRequest& request);
     void serveSession(const Call& call, const Route& route);
 
+    static std::optional<std::string> readMessage(const Call& call);
     void sayToken(const Call& call);
     void logOut(const Call& call);
     void answerRpc(const Call& call);
     void streamEvents(const Call& call);
     void sendDocument(const Call& call);
     void sendThumbnail(const Call& call);
+    void prepareArchive(const Call& call);
+    void sendArchive(const Call& call);
     void receiveUpload(const Call& call);
 
     const RpcService& service_;
@@ -73,6 +80,7 @@ private:
     const HttpGuard guard_;
     HttpClients clients_;
     const HttpDocuments documents_;
+    HttpArchives archives_;
     const HttpUploads uploads_;
     const std::function<void()> didTrade_;
 };
