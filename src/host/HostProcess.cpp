@@ -121,7 +121,6 @@ std::string searchStatusText(const SearchIndex::Status& search) {
     appendField(out, "items", fmt::to_string(search.items));
     appendField(out, "bytes", fmt::to_string(search.bytes));
     if (search.eventsBehind) appendField(out, "eventsBehind", fmt::to_string(*search.eventsBehind));
-    if (search.reachedAt) appendField(out, "reachedAt", jsonString(search.reachedAt->rfc3339()));
     return out + "}";
 }
 

@@ -128,7 +128,6 @@ void SearchIndex::run() {
     tellWatches();
     const MutexLock lock(mutex_);
     reached_ = target;
-    if (outcome.ok()) reachedAt_ = KsDate::now();
     outcome_ = std::move(outcome);
     isScheduled_ = false;
     if (wanted_ > target) schedule();
@@ -331,7 +330,6 @@ SearchIndex::Status SearchIndex::status() {
     std::optional<Moment> reached;
     {
         const MutexLock lock(mutex_);
-        status.reachedAt = reachedAt_;
         reached = reachedMoment_;
         if (!outcome_.ok() && !outcome_.error().isPosix(ECANCELED)) status.error = outcome_.error();
     }

@@ -70,8 +70,7 @@ public:
         /// Events since it was at the present. Those that are none of its business count too until it has looked. None
         /// where all is to be gathered anew.
         std::optional<std::uint64_t> eventsBehind;
-        std::optional<KsDate> reachedAt;  ///< when it last was at the present; none: not since the start
-        std::optional<KsError> error;     ///< why it isn't, where something went wrong
+        std::optional<KsError> error;  ///< why it isn't at the present, where something went wrong
     };
     /// Opens a file that is there, and leaves it as it is.
     Status status();
@@ -128,7 +127,6 @@ private:
     Result<void> outcome_ GUARDED_BY(mutex_);       ///< of the run that did it
     bool isScheduled_ GUARDED_BY(mutex_) = false;
     bool isStopped_ GUARDED_BY(mutex_) = false;
-    std::optional<KsDate> reachedAt_ GUARDED_BY(mutex_);
     std::optional<Moment> reachedMoment_ GUARDED_BY(mutex_);
 
     Mutex watchesMutex_;
