@@ -380,6 +380,13 @@ test('information shows every field of an item', async () => {
   await tool('Information').click();
   const details = page.getByRole('complementary', { name: 'Information' });
   for (const text of ['text/plain', '5 bytes (5)', 'Identifier', 'Document number', 'Version']) await details.getByText(text, { exact: true }).waitFor();
+  const labels = () => details.locator('dt').allTextContents();
+  assert.deepEqual(await labels(), ['Type', 'Size', 'Made', 'Changed', 'Place', 'Application', 'In the trash', 'Synchronised', 'May be', 'Identifier', 'Folder', 'Document number', 'File number', 'Version']);
+  // What is given to it meanwhile is shown as it comes, and so is what others write.
+  await tool('Favourite').click();
+  await details.getByText('Favourite', { exact: true }).waitFor();
+  file('facts.txt', '1234567');
+  await details.getByText('7 bytes (7)', { exact: true }).waitFor();
   await tool('Information').click();
 });
 

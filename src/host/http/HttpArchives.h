@@ -20,8 +20,9 @@ namespace cindral {
 /// A browser saves what an address leads to, and an address holds only so much: so what is to be in the archive is sent
 /// first, and answered with a name under which it can then be had, once.
 ///
-/// What can't be read, and what is neither folder nor document, is left out; a text in the archive says so. Each document
-/// is the one that the provider knows by its identifier, opened as HttpDocuments opens it: no link leads anywhere.
+/// What can't be read, and what is neither folder nor document, is left out; a text in the archive says so. Each
+/// document is the one that the provider knows by its identifier, opened as HttpDocuments opens it: no link leads
+/// anywhere.
 ///
 /// Thread safety: all operations, from any thread.
 class HttpArchives {

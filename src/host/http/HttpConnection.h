@@ -31,8 +31,8 @@ struct HttpLimits {
 /// Thread safety: for one thread at a time.
 class HttpConnection {
 public:
-    /// `socket` does not wait by itself. `interrupt`, when it can be read, ends the waiting for a request or for more of a body. Both are borrowed for
-    /// life.
+    /// `socket` does not wait by itself. `interrupt`, when it can be read, ends the waiting for a request or for more
+    /// of a body. Both are borrowed for life.
     HttpConnection(int socket, int interrupt, const HttpLimits& limits);
     ~HttpConnection();
     HttpConnection(const HttpConnection&) = delete;

@@ -22,15 +22,16 @@ namespace cindral {
 /// Thread safety: all operations, from any thread.
 class HttpDocuments {
 public:
-    /// Under which a document is shown, and everything else that is not the page's own: nothing is loaded, nothing runs,
-    /// and whose it is, is nobody's.
+    /// Under which a document is shown, and everything else that is not the page's own: nothing is loaded, nothing
+    /// runs, and whose it is, is nobody's.
     static constexpr std::string_view kPolicy =
         "sandbox; default-src 'none'; style-src 'unsafe-inline'; frame-ancestors 'self'";
 
     /// Borrowed for life.
     explicit HttpDocuments(TesselExtension& provider) : provider_(provider) {}
 
-    /// Answers with the bytes of the document, all or the range that is asked for. `saves`: to be saved, whatever it is.
+    /// Answers with the bytes of the document, all or the range that is asked for. `saves`: to be saved, whatever it
+    /// is.
     void answer(HttpConnection& connection, const HttpRequest& request, const TesselItemIdentifier& identifier,
                 bool saves) const;
     /// The picture that stands for an item.
@@ -45,8 +46,8 @@ public:
         std::string name;
         std::string typeIdentifier;
     };
-    /// The very document of that identifier, whatever stands under its name: a link leads nowhere, and nothing that would
-    /// have to be waited for is opened.
+    /// The very document of that identifier, whatever stands under its name: a link leads nowhere, and nothing that
+    /// would have to be waited for is opened.
     Result<Opened> open(const TesselItemIdentifier& identifier) const;
 
     /// Whether it is one as the provider writes them. The provider itself takes a number for what it begins with.
@@ -74,7 +75,8 @@ struct ByteRange {
     std::uint64_t offset = 0;
     std::uint64_t length = 0;
 
-    /// What a Range field asks of that many bytes: all where it is none that is known, none where it lies beyond the end.
+    /// What a Range field asks of that many bytes: all where it is none that is known, none where it lies beyond the
+    /// end.
     static std::optional<ByteRange> parse(std::string_view field, std::uint64_t size);
 };
 

@@ -11,8 +11,8 @@
 
 namespace cindral {
 
-/// The daemon's door for browsers: open from the start where that is asked for, else from when the person first asks for a
-/// link.
+/// The daemon's door for browsers: open from the start where that is asked for, else from when the person first asks
+/// for a link.
 ///
 /// Thread safety: makeLink() from any thread; the rest as DaemonListener.
 class HttpDoor final : public DaemonListener {

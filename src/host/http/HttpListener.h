@@ -24,8 +24,8 @@ class HttpListener final : public DaemonListener {
 public:
     static constexpr std::size_t kConnectionsMax = 128;
 
-    /// Takes a link that lets one browser in, once: the first when the service starts, then another whenever one was used,
-    /// by one at a time. Nobody else is told. Null where nobody is to be shown any.
+    /// Takes a link that lets one browser in, once: the first when the service starts, then another whenever one was
+    /// used, by one at a time. Nobody else is told. Null where nobody is to be shown any.
     using Show = std::function<void(const std::string& link)>;
     /// Listens on this machine's own address alone. Port 0 is one that is free. EADDRINUSE where another has it.
     static Result<std::unique_ptr<HttpListener>> make(std::uint16_t port, std::uint64_t uploadBytesMax, Show show);

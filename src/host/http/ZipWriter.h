@@ -10,8 +10,8 @@
 
 namespace cindral {
 
-/// Writes a ZIP archive as its contents come: what was written is never gone back to, and nothing is kept but the list of
-/// what is in it, which stands at the end.
+/// Writes a ZIP archive as its contents come: what was written is never gone back to, and nothing is kept but the list
+/// of what is in it, which stands at the end.
 ///
 /// Sizes and sums of documents follow their bytes; whatever needs more than 32 bits (and more than 65,534 entries) is
 /// written as ZIP64. Names that are UTF-8 say so; others are the bytes that they are. A "\" in a name, by which some
