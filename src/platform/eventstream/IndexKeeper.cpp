@@ -262,6 +262,8 @@ bool IndexKeeper::keepUnderOtherName(FileID fileID) {
     const std::optional<Known> known = find(fileID);
     if (!known) return false;
     for (const VolumeStore::Name& other : store_.otherNames(fileID)) {
+        // By its path, anew: a folder that was opened before may have left the roots since, with the name in it.
+        openFolders_.erase(other.parent);
         const std::optional<FileStatus> status = statusAt(other.parent, other.name);
         if (!status || !known->isSame(FileID{status->fileID}, status->birthStamp())) continue;
         changes().removeName(fileID, other.parent, other.name);

@@ -8,6 +8,7 @@
 #include <unistd.h>
 
 #include "RecorderFixture.h"
+#include "platform/foundation/SysFaults.h"
 
 namespace cindral::test {
 namespace {
@@ -788,6 +789,44 @@ std::string nameOf(const ::testing::TestParamInfo<Recorder::Choice>& info) {
 }
 
 // Automatic is fanotify where the process may.
+// With a document in it that has two names there.
+TEST_P(RecorderTest, aFolderMayLeaveAtAnyMomentOfALookAndComeBack) {
+    makeFolder("here");
+    start();
+    bool hasLeft = true;
+    for (int moment = 1; hasLeft; ++moment) {
+        makeFolder("here/f");
+        write("here/f/one");
+        link("here/f/one", "here/f/two");
+        changes();
+        list("here/f/one");
+        write("here/f/new");
+        write("here/other");
+        hasLeft = false;
+        {
+            int calls = 0;
+            const sys::FaultInjection faults([&](const char* /*call*/) {
+                if (++calls == moment) {
+                    hasLeft = true;
+                    renamePaths(path("here/f"), outside("f"));
+                }
+                return 0;
+            });
+            ASSERT_TRUE(recorder().drain().ok());
+        }
+        if (!hasLeft) break;
+        changes();
+        expectIndexIsTree();
+        renamePaths(outside("f"), path("here/f"));
+        EXPECT_THAT(changes(), ::testing::AnyOf(::testing::Contains("here/f/one"), ::testing::Contains("here/f/two")))
+            << moment;
+        expectIndexIsTree();
+        removeTree("here/f");
+        remove("here/other");
+        changes();
+    }
+}
+
 /// In memory, where a folder is given the stamp of what comes to it or goes from it, which may be one that it bears.
 class RecorderInMemoryTest : public RecorderTest {
 protected:
