@@ -396,6 +396,22 @@ class WhatChangesMean:
         self.changes(everything)
         self.assertEqual(len(everything.items), 501)
 
+    def test_each_answer_is_of_the_time_it_is_asked_for(self):
+        self.start()
+        everything = self.view(WORKING_SET)
+        for attempt in range(5):
+            folder = f"many{attempt}"
+            self.make_files(folder, 350)
+            first = self.call("enumerateChanges", container=WORKING_SET, anchor=everything.anchor)
+            self.assertTrue(first["moreComing"])
+            told = {item["filename"] for item in first["updated"]}
+            removed = [name for name in os.listdir(self.path(folder)) if name not in told]
+            for name in removed:
+                os.unlink(self.path(folder, name))
+            second = self.call("enumerateChanges", container=WORKING_SET, anchor=first["anchor"])
+            self.assertEqual({item["filename"] for item in second["updated"]} & set(removed), set())
+            self.changes(everything)
+
     def test_a_client_that_asks_again_from_the_same_anchor_is_told_the_same(self):
         self.start()
         everything = self.view(WORKING_SET)
