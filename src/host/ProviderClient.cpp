@@ -14,7 +14,7 @@ bool isKept(const TesselItemIdentifier& container) {
            container == kTesselAllDirectoriesContainerItemIdentifier;
 }
 
-// Times that changes are asked for when the enumeration is cut short.
+// Times that changes are asked for when the enumeration is cut short, or the container is elsewhere at its end.
 constexpr int kAttemptsMax = 5;
 
 /// Collects a page, and answers once. One that is dropped without an end answers with ECANCELED.
@@ -49,11 +49,10 @@ private:
 /// Collects changes, and answers once. One that is dropped without an end answers with ECANCELED.
 class ChangesCollector final : public TesselChangeObserver {
 public:
-    /// `retry` is called instead of the completion when the enumeration was cut short.
-    ChangesCollector(ProviderClient::ChangesCompletion completion,
-                     std::function<void(ProviderClient::ChangesCompletion)> retry)
-        : completion_(std::move(completion)), retry_(std::move(retry)) {}
-    ~ChangesCollector() override { finish(KsError::posix(ECANCELED)); }
+    /// Told whether the provider has brought the enumeration to an end.
+    using Completion = std::function<void(Result<ChangesBatch>, bool isEnded)>;
+    explicit ChangesCollector(Completion completion) : completion_(std::move(completion)) {}
+    ~ChangesCollector() override { finish(KsError::posix(ECANCELED), false); }
 
     void didUpdateItems(TesselItems items) override {
         for (auto& item : items) {
@@ -67,23 +66,16 @@ public:
     void finishEnumeratingChangesUpToSyncAnchor(TesselSyncAnchor anchor, bool moreComing) override {
         batch_.anchor = std::move(anchor);
         batch_.moreComing = moreComing;
-        finish(std::move(batch_));
+        finish(std::move(batch_), true);
     }
-    void finishEnumeratingWithError(const KsError& error) override {
-        if (error.isPosix(ECANCELED) && retry_ && completion_) {
-            retry_(std::exchange(completion_, nullptr));
-        } else {
-            finish(error);
-        }
-    }
+    void finishEnumeratingWithError(const KsError& error) override { finish(error, true); }
 
 private:
-    void finish(Result<ChangesBatch> result) {
-        if (auto completion = std::exchange(completion_, nullptr)) completion(std::move(result));
+    void finish(Result<ChangesBatch> result, bool isEnded) {
+        if (auto completion = std::exchange(completion_, nullptr)) completion(std::move(result), isEnded);
     }
 
-    ProviderClient::ChangesCompletion completion_;
-    const std::function<void(ProviderClient::ChangesCompletion)> retry_;
+    Completion completion_;
     ChangesBatch batch_;
 };
 
@@ -214,6 +206,11 @@ void ProviderClient::stopMonitoring(const TesselItemIdentifier& container) {
     if (handle) handle->enumerator().stop();
 }
 
+/// None of what stands for many folders.
+std::optional<KsURL> ProviderClient::placeOf(const TesselItemIdentifier& container) const {
+    return isKept(container) ? std::nullopt : provider_->URLForItemWithPersistentIdentifier(container);
+}
+
 void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor,
                                       ChangesCompletion completion) {
     enumerateChanges(container, anchor, kAttemptsMax, std::move(completion));
@@ -221,34 +218,40 @@ void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, con
 
 void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor,
                                       int attempts, ChangesCompletion completion) {
+    const std::optional<KsURL> place = placeOf(container);
     auto made = comingEnumerator(container);
     if (!made.ok()) {
         completion(std::move(made).error());
         return;
     }
     auto use = std::make_shared<Use>(*std::move(made));
-    std::function<void(ChangesCompletion)> retry;
-    if (attempts > 1) {
-        // Whoever stopped the enumeration meant something else: that the container is no longer monitored.
-        retry = [this, container, anchor, attempts](ChangesCompletion again) {
-            dispatchAsync([this, container, anchor, attempts, again = std::move(again)]() mutable {
-                enumerateChanges(container, anchor, attempts - 1, std::move(again));
-            });
-        };
-    }
     use->enumerator().enumerateChangesForObserver(
         std::make_shared<ChangesCollector>(
-            [use, completion = std::move(completion)](Result<ChangesBatch> result) mutable {
+            [=, this, completion = std::move(completion)](Result<ChangesBatch> result, bool isEnded) mutable {
                 Use::answered(use);
-                completion(std::move(result));
-            },
-            std::move(retry)),
+                // Whoever stopped the enumeration meant something else: that the container is no longer monitored.
+                const bool isCut = isEnded && !result.ok() && result.error().isPosix(ECANCELED);
+                // What was told is of the place where the container was when the enumerator was made: it has moved since, or
+                // another package has taken its document over.
+                const bool isElsewhere = result.ok() && placeOf(container) != place;
+                if (!isCut && !isElsewhere) return completion(std::move(result));
+                if (attempts == 1) return completion(KsError::posix(ECANCELED));
+                dispatchAsync([this, container, anchor, attempts, again = std::move(completion)]() mutable {
+                    enumerateChanges(container, anchor, attempts - 1, std::move(again));
+                });
+            }),
         anchor);
     use->callReturned();
 }
 
 void ProviderClient::enumerateItems(const TesselItemIdentifier& container, const TesselPage& page,
                                     PageCompletion completion) {
+    enumerateItems(container, page, kAttemptsMax, std::move(completion));
+}
+
+void ProviderClient::enumerateItems(const TesselItemIdentifier& container, const TesselPage& page, int attempts,
+                                    PageCompletion completion) {
+    const std::optional<KsURL> place = placeOf(container);
     // On the first page the client comes to see what there is; the others go on with that.
     const bool isFirst = page == tesselInitialPageSortedByName() || page == tesselInitialPageSortedByDate();
     auto made = isFirst ? comingEnumerator(container) : anyEnumerator(container);
@@ -258,10 +261,16 @@ void ProviderClient::enumerateItems(const TesselItemIdentifier& container, const
     }
     auto use = std::make_shared<Use>(*std::move(made));
     use->enumerator().enumerateItemsForObserver(
-        std::make_shared<PageCollector>([use, completion = std::move(completion)](Result<ItemsPage> result) mutable {
-            Use::answered(use);
-            completion(std::move(result));
-        }),
+        std::make_shared<PageCollector>(
+            [=, this, completion = std::move(completion)](Result<ItemsPage> result) mutable {
+                Use::answered(use);
+                // What is listed is the folder that was at the place by then.
+                if (!result.ok() || placeOf(container) == place) return completion(std::move(result));
+                if (attempts == 1) return completion(KsError::posix(ECANCELED));
+                dispatchAsync([this, container, page, attempts, again = std::move(completion)]() mutable {
+                    enumerateItems(container, page, attempts - 1, std::move(again));
+                });
+            }),
         page);
     use->callReturned();
 }

@@ -31,6 +31,8 @@ public:
     TesselExtension& provider() const override { return *provider_; }
 
     using PageCompletion = std::function<void(Result<ItemsPage>)>;
+    /// Asks the provider again while the container changes its place, as enumerateChanges() does, too, where the
+    /// enumeration is cut short; ECANCELED where that does not end.
     void enumerateItems(const TesselItemIdentifier& container, const TesselPage& page, PageCompletion completion);
     /// None in the result: the provider has no anchor to give.
     using AnchorCompletion = std::function<void(Result<std::optional<TesselSyncAnchor>>)>;
@@ -56,6 +58,9 @@ private:
     Result<std::shared_ptr<Handle>> keptEnumerator(const TesselItemIdentifier& container);
     Result<std::shared_ptr<Handle>> anyEnumerator(const TesselItemIdentifier& container);
     Result<std::shared_ptr<Handle>> comingEnumerator(const TesselItemIdentifier& container);
+    std::optional<KsURL> placeOf(const TesselItemIdentifier& container) const;
+    void enumerateItems(const TesselItemIdentifier& container, const TesselPage& page, int attempts,
+                        PageCompletion completion);
     void enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor, int attempts,
                           ChangesCompletion completion);
 

@@ -111,7 +111,9 @@ public:
     std::vector<std::string> askedAnchors;  ///< of enumerations of changes
     /// The present anchor of a container; its own name where nothing is said.
     std::map<std::string, std::string> anchors;
-    /// Guards the three above, where a host asks on threads of its own.
+    /// Called before changes are answered.
+    std::function<void()> beforeChanges;
+    /// Guards the three before that, where a host asks on threads of its own.
     Mutex changesMutex;
     /// Pages are answered on a queue of the enumerator's, after the call has returned.
     bool isAsynchronous = false;
@@ -193,6 +195,7 @@ public:
     }
     void enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,
                                      const TesselSyncAnchor& anchor) override {
+        if (provider_->beforeChanges) provider_->beforeChanges();
         const std::optional<FakeProvider::Changes> next = nextChanges(anchor);
         if (provider_->dropsObservers) return;
         if (!next) return observer->finishEnumeratingWithError(tesselErrorForExpiredPage());

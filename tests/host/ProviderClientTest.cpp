@@ -118,6 +118,36 @@ TEST_F(ProviderClientTest, passesErrorsOfChangesOn) {
     EXPECT_EQ(client.changesSince("fid=2", {}).error(), KsError::posix(ECANCELED));
 }
 
+// What is told of a place is nothing to who asks for a container that is another place by then.
+TEST_F(ProviderClientTest, asksAgainWhenTheContainerHasMovedMeanwhile) {
+    test::FakeItem& folder = provider_->folder("fid=3", "moving");
+    folder.url = KsURL::fileURL("/storage/before");
+    provider_->changes["fid=3"] = {{{}, "stale", false, std::nullopt}, {{}, "fresh", false, std::nullopt}};
+    provider_->beforeChanges = [&] { folder.url = KsURL::fileURL("/storage/after"); };
+    ProviderClient client(provider_);
+    EXPECT_EQ(textOf(client.changesSince("fid=3", {})->anchor), "fresh");
+    int moves = 0;
+    provider_->beforeChanges = [&] { folder.url = KsURL::fileURL("/storage/" + std::to_string(++moves)); };
+    EXPECT_EQ(client.changesSince("fid=3", {}).error(), KsError::posix(ECANCELED)) << "nothing that may lack something";
+    EXPECT_EQ(moves, 5);
+}
+
+TEST_F(ProviderClientTest, listsAgainWhenTheContainerHasMovedMeanwhile) {
+    test::FakeItem& folder = provider_->folder("fid=3", "moving");
+    folder.url = KsURL::fileURL("/storage/before");
+    int pages = 0;
+    provider_->beforePage = [&](const std::string&, std::size_t) {
+        if (++pages == 1) folder.url = KsURL::fileURL("/storage/after");
+    };
+    ProviderClient client(provider_);
+    EXPECT_TRUE(firstPage(client, "fid=3").ok());
+    EXPECT_EQ(pages, 2);
+    provider_->beforePage = [&](const std::string&, std::size_t) {
+        folder.url = KsURL::fileURL("/storage/" + std::to_string(++pages));
+    };
+    EXPECT_EQ(firstPage(client, "fid=3").error(), KsError::posix(ECANCELED));
+}
+
 // Who stops monitoring stops the enumerator, and the request that another thread is in with it.
 TEST_F(ProviderClientTest, asksAgainWhenChangesAreCutShort) {
     provider_->changes["fid=2"] = {{{}, "", false, KsError::posix(ECANCELED)},
