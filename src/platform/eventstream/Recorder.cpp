@@ -100,9 +100,9 @@ std::shared_ptr<const Recorder::Roots> Recorder::roots() const {
 void Recorder::run() {
     while (!stopping_) {
         const Result<void> started = startUp();
+        finished(started);
         // A first reading fills much that is empty now.
         returnFreeMemory();
-        finished(started);
         if (started.ok() || stopping_) break;
         logError("can't read the roots; {}", started.error().description());
         rest(kRetryDelay);

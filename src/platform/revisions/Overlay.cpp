@@ -241,6 +241,11 @@ void Overlay::addDocumentChange(std::uint64_t eventID, const DocumentChange& cha
     bytes_ += sizeof documentChanges_[0];
 }
 
+void Overlay::beginHistory(std::uint64_t eventID) {
+    historyBegin_ = eventID;
+    bytes_ += sizeof eventID;
+}
+
 std::vector<Overlay::Object> Overlay::objectsInKeyOrder() const {
     std::vector<Object> objects;
     objects.reserve(count_);

@@ -86,6 +86,10 @@ public:
     void addDeparture(std::uint64_t eventID, ByteView packed);
     void addDocumentChange(std::uint64_t eventID, const DocumentChange& change);
     void addTimeMark(std::uint64_t eventID, std::int64_t time) { timeMarks_.emplace_back(eventID, time); }
+    /// From now on the history begins after the event.
+    void beginHistory(std::uint64_t eventID);
+    /// 0 where this changes nothing of it.
+    std::uint64_t historyBegin() const { return historyBegin_; }
     /// Each list in the order of the events. Of presences only those are good whose object still has the event.
     const std::vector<std::pair<std::uint64_t, FileID>>& presences() const { return presences_; }
     const std::vector<std::pair<std::uint64_t, ByteView>>& departures() const { return departures_; }
@@ -148,6 +152,7 @@ private:
     std::vector<std::pair<std::uint64_t, ByteView>> departures_;
     std::vector<std::pair<std::uint64_t, DocumentChange>> documentChanges_;
     std::vector<std::pair<std::uint64_t, std::int64_t>> timeMarks_;
+    std::uint64_t historyBegin_ = 0;
 };
 
 template <typename Use>

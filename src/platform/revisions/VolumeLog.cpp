@@ -48,6 +48,7 @@ bool isGood(const LogRecord& record) {
             // Of document 0: what is remembered of the volume itself.
             return (record.key == 0 || isDocumentKey(record.key)) && record.value.size() <= kAttributesBytesMax;
         case LogRecordType::timeMark: return record.value.size() == sizeof(std::int64_t);
+        case LogRecordType::historyBegin: return record.key != 0 && record.value.empty();
     }
     return false;
 }

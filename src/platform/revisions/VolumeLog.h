@@ -25,6 +25,7 @@ enum class LogRecordType : std::uint8_t {
     documentChange = 9,      ///< key: event ID; DocumentChange
     attributes = 10,         ///< key: document ID; the bytes
     timeMark = 11,           ///< key: event ID; the time at which it was journalled, ns since 1970
+    historyBegin = 12,       ///< key: event ID; what happens after it is journalled
 };
 
 struct LogRecord {

@@ -286,21 +286,29 @@ Result<void> VolumeStore::Implementation::commit(Update& update) {
     // Reserved before they leave; taken only once the batch is in the log, and what it says can be read.
     if (update.documentCount() > 0) TRY(numbers_->reserveDocuments(update.documentCount()));
     if (events > 0) TRY(numbers_->reserveEvents(events));
-    TRY(logs_[activeLog_].append(batch_.finish(uuid(), nextBatch_)));
-    ++nextBatch_;
-    transactionCount_.fetch_add(1, std::memory_order_relaxed);
+    TRY(appendBatch());
     if (marksTime) lastTimeMark_ = TimeMark{update.firstEvent(), time};
     {
         const MutexLock lock(mutex_);
         update.writeTo(*active_, counts_, forgottenEvent_);
-        if (!due_) {
-            due_ = std::chrono::steady_clock::now() + kCheckpointDelay;
-            dueChanged_.notifyAll();
-        }
+        saveSoon();
     }
     numbers_->takeDocuments(update.documentCount());
     numbers_->takeEvents(events);
     return {};
+}
+
+Result<void> VolumeStore::Implementation::appendBatch() {
+    TRY(logs_[activeLog_].append(batch_.finish(uuid(), nextBatch_)));
+    ++nextBatch_;
+    transactionCount_.fetch_add(1, std::memory_order_relaxed);
+    return {};
+}
+
+void VolumeStore::Implementation::saveSoon() {
+    if (due_) return;
+    due_ = std::chrono::steady_clock::now() + kCheckpointDelay;
+    dueChanged_.notifyAll();
 }
 
 Result<std::uint64_t> VolumeStore::Implementation::advanceEventID() {
@@ -352,6 +360,10 @@ TablesHead VolumeStore::Implementation::headFor(const Overlay& overlay, std::uin
     TablesHead head = tables_->head();
     head.marks = marks;
     head.appliedBatch = lastBatch;
+    if (overlay.historyBegin() != 0) {
+        head.hasHistory = true;
+        head.forgottenEvent = std::max(head.forgottenEvent, overlay.historyBegin());
+    }
     if (!overlay.documents().empty()) {
         head.settledDocument = std::max(head.settledDocument, overlay.documents().back().first);
     }

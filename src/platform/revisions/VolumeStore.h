@@ -178,7 +178,7 @@ public:
     /// About when the oldest event that is kept was journalled: at most ten minutes too early. None for no events.
     std::optional<std::chrono::system_clock::time_point> oldestEventTime() const;
     /// Says that the index is complete: from the ID that it answers on, what happens is journalled. Forgets older
-    /// events.
+    /// events: where there are any, that is on the disk when this returns.
     Result<std::uint64_t> beginHistory();
     /// Takes a new UUID, and forgets the events: every token of before expires.
     Result<void> renewUUID();

@@ -117,6 +117,8 @@ private:
     // The journal.
     Result<std::uint64_t> resolve(std::vector<JournalEvent>& candidates, std::vector<JournalEvent>& found) const;
     Result<bool> readEvents(std::uint64_t& after, std::size_t max, std::vector<JournalEvent>& found) const;
+    Result<bool> hasEvents() const REQUIRES(writerMutex_);
+    Result<std::uint64_t> beginFirstHistory() REQUIRES(writerMutex_);
     std::int64_t now() const;
     Result<std::uint64_t> lastEventOlderThan(std::chrono::seconds age, std::uint64_t current) const;
 
@@ -125,6 +127,8 @@ private:
     Result<void> record(std::span<ObjectSighting> sightings, const std::vector<std::uint32_t>& news);
     Update beginUpdate(std::span<const FileID> roots, bool journals) REQUIRES(writerMutex_);
     Result<void> commit(Update& update) REQUIRES(writerMutex_);
+    Result<void> appendBatch() REQUIRES(writerMutex_);
+    void saveSoon() REQUIRES(mutex_);
     bool isTimeMarkDue(std::int64_t time) const REQUIRES(writerMutex_);
     Result<void> waitForRoom() REQUIRES(writerMutex_);
     bool isFull() const REQUIRES(mutex_);

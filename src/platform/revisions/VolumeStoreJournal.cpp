@@ -219,7 +219,41 @@ std::optional<std::chrono::system_clock::time_point> VolumeStore::Implementation
         std::chrono::duration_cast<std::chrono::system_clock::duration>(std::chrono::nanoseconds(mark->second)));
 }
 
+/// Whether there is anything that a history that begins now must not tell.
+Result<bool> VolumeStore::Implementation::hasEvents() const {
+    {
+        const MutexLock lock(mutex_);
+        for (const Overlay* overlay : {frozen_.get(), static_cast<const Overlay*>(active_.get())}) {
+            if (overlay != nullptr && (overlay->lastEvent() != 0 || !overlay->timeMarks().empty())) return true;
+        }
+    }
+    return tables_->eventCount() > 0 || !TRY(ObjectTables::Snapshot(*tables_).timeMarks()).empty();
+}
+
+/// With nothing to forget, a record says it: whoever waits for a first reading doesn't wait for the disk.
+Result<std::uint64_t> VolumeStore::Implementation::beginFirstHistory() {
+    const std::uint64_t begin = TRY(numbers_->reserveEvents(1));
+    batch_.begin();
+    batch_.add(LogRecordType::historyBegin, begin, ByteView());
+    TRY(appendBatch());
+    {
+        const MutexLock lock(mutex_);
+        active_->beginHistory(begin);
+        hasHistory_ = true;
+        forgottenEvent_ = begin;
+        counts_.events = 0;
+        saveSoon();
+    }
+    numbers_->takeEvents(1);
+    return begin;
+}
+
 Result<std::uint64_t> VolumeStore::Implementation::beginHistory() {
+    {
+        const MutexLock writerLock(writerMutex_);
+        TRY(waitForRoom());
+        if (!TRY(hasEvents())) return beginFirstHistory();
+    }
     TRY(checkpoint());
     const MutexLock checkpointLock(checkpointMutex_);
     const MutexLock writerLock(writerMutex_);

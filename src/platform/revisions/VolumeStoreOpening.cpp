@@ -82,7 +82,7 @@ Result<HighWaterMarks> VolumeStore::Implementation::openState(const std::optiona
     HighWaterMarks next = HighWaterMarks::highest(marks.value_or(HighWaterMarks{}), tables_->head().marks);
     // Only when the file of marks was lost can the logs know more.
     for (const Overlay* unsaved : {&replayed.unfinished, &replayed.rest}) {
-        next.event = std::max(next.event, unsaved->lastEvent() + 1);
+        next.event = std::max({next.event, unsaved->lastEvent() + 1, unsaved->historyBegin() + 1});
         if (unsaved->documents().empty()) continue;
         const auto last = static_cast<std::uint32_t>(unsaved->documents().back().first);
         next.document = std::max(next.document, std::uint64_t{last} + 1);
@@ -225,6 +225,7 @@ void VolumeStore::Implementation::replay(const volumelog::Batch& batch, Overlay&
                 break;
             case LogRecordType::attributes: unsaved.putAttributes(logged.documentID(), logged.value); break;
             case LogRecordType::timeMark: unsaved.addTimeMark(logged.key, logged.time()); break;
+            case LogRecordType::historyBegin: unsaved.beginHistory(logged.key); break;
         }
     }
 }

@@ -609,7 +609,21 @@ protected:
     bool crashes_ = false;
 };
 
-INSTANTIATE_TEST_SUITE_P(Seeds, VolumeIndexModelTest, ::testing::Range(1U, 5U));
+INSTANTIATE_TEST_SUITE_P(Seeds, VolumeIndexModelTest, ::testing::Range(1U, 7U));
+
+// As after a first reading: there are objects, and no event to forget.
+TEST_P(VolumeIndexModelTest, beginsAHistoryWithoutWaitingForTheDisk) {
+    for (std::uint64_t i = pick(3); i > 0; --i) list();
+    begin();
+    expectSame();
+    for (int i = 0; i < 20; ++i) {
+        SCOPED_TRACE(fmt::format("seed {}, step {}", GetParam(), i));
+        i == 0 && oneIn(2) ? crash() : step();
+        if (HasFatalFailure()) return;
+        expectSame();
+        if (HasFailure()) return;
+    }
+}
 
 TEST_P(VolumeIndexModelTest, answersAsPlainMapsDo) {
     for (int i = 0; i < 80; ++i) {

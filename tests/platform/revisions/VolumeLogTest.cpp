@@ -142,9 +142,10 @@ TEST(VolumeLog, writesAndReadsEveryTypeAsEver) {
     writer.add(LogRecordType::documentChange, 22, change.encode());
     writer.add(LogRecordType::attributes, 5, bytesOf("attributes"));
     writer.addTimeMark(21, 1'700'000'002'000'000'000);
+    writer.add(LogRecordType::historyBegin, 20, ByteView());
     const ByteView batch = writer.finish(kStore, 1);
     ASSERT_EQ(hex(batch),
-              "4356423283010000010000000000000016f078c90a00000000000000012e000000020000000000000000002a36fe9c971700"
+              "43564232900100000100000000000000a8a75aed0a00000000000000012e000000020000000000000000002a36fe9c971700"
               "0000007100cac471fe9c9717e80300000000000004000000000000006e0b00000000000000022e0000000200000000000000"
               "00002a36fe9c9717050000001100cac471fe9c9717e80300000000000009000000000000006e0c0000000000000003000000"
               "00060000000000000004100000000d00000000000000f9ffffffffffffff050000000000000005100000000e000000000000"
@@ -152,12 +153,12 @@ TEST(VolumeLog, writesAndReadsEveryTypeAsEver) {
               "000000030000000000000044332211010015000000000000000832000000020a000000000000000500000003000000000000"
               "000102000000000000000500612e7478746c6574746572732f612e74787416000000000000000914000000050000000b0000"
               "00000000000e0000000000000005000000000000000a0a0000006174747269627574657315000000000000000b0800000000"
-              "945fadfe9c9717");
+              "945fadfe9c971714000000000000000c00000000");
 
     const auto batches = volumelog::decode(batch, kStore);
     ASSERT_EQ(batches.size(), 1U);
     const auto records = volumelog::records(batches[0]);
-    ASSERT_EQ(records.size(), 11U);
+    ASSERT_EQ(records.size(), 12U);
     EXPECT_EQ(PackedRecord::decode(records[1].value), record);
     EXPECT_EQ(records[2].fileID(), FileID{12});
     EXPECT_EQ(decodeDocument(records[3].value)->birthTime, -7);
@@ -169,6 +170,8 @@ TEST(VolumeLog, writesAndReadsEveryTypeAsEver) {
     EXPECT_EQ(DocumentChange::decode(records[8].value), change);
     EXPECT_EQ(textOf(records[9].value), "attributes");
     EXPECT_EQ(records[10].time(), 1'700'000'002'000'000'000);
+    EXPECT_EQ(records[11].type, LogRecordType::historyBegin);
+    EXPECT_EQ(records[11].key, 20U);
 }
 
 TEST(VolumeLog, holdsNothingThatNoStoreWrites) {
@@ -197,8 +200,11 @@ TEST(VolumeLog, holdsNothingThatNoStoreWrites) {
     EXPECT_TRUE(isRead(LogRecordType::attributes, (1ULL << 32) - 1, 8));
     EXPECT_FALSE(isRead(LogRecordType::attributes, 1ULL << 32, 8));
     EXPECT_FALSE(isRead(LogRecordType::timeMark, 5, 7));
+    EXPECT_TRUE(isRead(LogRecordType::historyBegin, 5, 0));
+    EXPECT_FALSE(isRead(LogRecordType::historyBegin, 0, 0));
+    EXPECT_FALSE(isRead(LogRecordType::historyBegin, 5, 1));
     EXPECT_FALSE(isRead(LogRecordType{0}, 5, 8));
-    EXPECT_FALSE(isRead(LogRecordType{12}, 5, 8));
+    EXPECT_FALSE(isRead(LogRecordType{13}, 5, 8));
 }
 
 TEST(VolumeLog, takesTheWholeBatchesOfEveryTruncation) {
