@@ -3,7 +3,9 @@
 #include <algorithm>
 #include <array>
 #include <charconv>
+#include <chrono>
 #include <cstring>
+#include <optional>
 #include <unordered_set>
 
 #include "platform/eventstream/EventSource.h"
@@ -22,6 +24,9 @@ constexpr std::uint32_t kOfEntries = IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_
 
 // Enough for a few hundred events; one event is at most 272 bytes.
 constexpr std::size_t kReadBytes = 32'768;
+
+// The use of watches is asked for with every answer; how many there may be changes once in a machine's life.
+constexpr std::chrono::milliseconds kLimitIsGood{500};
 
 /// The number in a file of one; 0 where there is none.
 std::uint64_t numberInFile(const char* path) {
@@ -59,6 +64,8 @@ private:
 
     UniqueFd instance_;
     WatchTable watches_;
+    mutable std::optional<std::chrono::steady_clock::time_point> limitReadAt_;
+    mutable std::uint64_t limit_ = 0;
     // Ended by us, and events of theirs may still wait; the last of them is IN_IGNORED. Numbers come in a circle, so
     // that after two thousand million watches a new one may have one of these.
     std::unordered_set<int> ended_;
@@ -123,10 +130,14 @@ Result<void> InotifySource::drain(const Receiver& receive) {
 }
 
 EventSource::Usage InotifySource::usage() const {
-    const std::uint64_t ofUser = numberInFile("/proc/sys/fs/inotify/max_user_watches");
-    const std::uint64_t ofNamespace = numberInFile("/proc/sys/user/max_inotify_watches");
-    const std::uint64_t limit = ofUser != 0 && ofNamespace != 0 ? std::min(ofUser, ofNamespace) : ofUser + ofNamespace;
-    return {.used = watches_.size(), .limit = limit};
+    const auto now = std::chrono::steady_clock::now();
+    if (!limitReadAt_ || now - *limitReadAt_ > kLimitIsGood) {
+        const std::uint64_t ofUser = numberInFile("/proc/sys/fs/inotify/max_user_watches");
+        const std::uint64_t ofNamespace = numberInFile("/proc/sys/user/max_inotify_watches");
+        limit_ = ofUser != 0 && ofNamespace != 0 ? std::min(ofUser, ofNamespace) : ofUser + ofNamespace;
+        limitReadAt_ = now;
+    }
+    return {.used = watches_.size(), .limit = limit_};
 }
 
 }  // namespace
