@@ -99,23 +99,31 @@ Result<void> configure(SqliteDatabase& database) {
     return {};
 }
 
-/// Why the file is none that can be gone on with; empty where it is one, or where it is empty.
-Result<std::string> refusal(SqliteDatabase& database, const NameCollation& collation) {
+// An index of before: nothing is wrong with it.
+constexpr int kOutdatedCode = ESTALE;
+
+KsError refusalFor(int code, std::string why) {
+    return KsError::posix(code).with("message", std::move(why));
+}
+
+/// Fails where the file is none that can be gone on with: with kOutdatedCode, or as a damaged database does.
+Result<void> checkIsOurs(SqliteDatabase& database, const NameCollation& collation) {
     const std::int64_t application = TRY(database.integer("PRAGMA application_id")).value_or(0);
     const std::int64_t version = TRY(database.integer("PRAGMA user_version")).value_or(0);
     const std::int64_t tables = TRY(database.integer("SELECT count(*) FROM sqlite_schema")).value_or(0);
-    if (application == 0 && version == 0 && tables == 0) return std::string();
-    if (application != kApplicationID) return std::string("it is no search index");
-    if (version != kVersion) return fmt::format("it is of version {}", version);
+    if (application == 0 && version == 0 && tables == 0) return {};
+    if (application != kApplicationID) return refusalFor(EBADMSG, "it is no search index");
+    if (version != kVersion) return refusalFor(kOutdatedCode, fmt::format("it is of version {}", version));
     SqliteStatement order = TRY(database.prepare("SELECT value FROM facts WHERE name = 'names'"));
-    if (!TRY(order.step())) return std::string("it is not whole");
-    if (order.text(0) != versionOf(collation)) return std::string("names are folded or ordered otherwise now");
+    if (!TRY(order.step())) return refusalFor(EBADMSG, "it is not whole");
+    if (order.text(0) != versionOf(collation))
+        return refusalFor(kOutdatedCode, "names are folded or ordered otherwise now");
     order.reset();
     if (TRY(database.integer("PRAGMA page_count")).value_or(0) <= kCheckedPagesMax) {
         SqliteStatement check = TRY(database.prepare("PRAGMA quick_check(1)"));
-        if (!TRY(check.step()) || check.text(0) != "ok") return std::string("it is damaged");
+        if (!TRY(check.step()) || check.text(0) != "ok") return refusalFor(EBADMSG, "it is damaged");
     }
-    return std::string();
+    return {};
 }
 
 Result<void> createTables(SqliteDatabase& database, const NameCollation& collation) {
@@ -138,20 +146,24 @@ Result<SqliteDatabase> openOurs(const std::string& path, const NameCollation& co
     const auto attempt = [&]() -> Result<SqliteDatabase> {
         struct stat there {};
         if (::lstat(path.c_str(), &there) == 0 && !S_ISREG(there.st_mode))
-            return KsError::posix(EBADMSG).with("message", "it is no file");
+            return refusalFor(EBADMSG, "it is no file");
         SqliteDatabase database = TRY(SqliteDatabase::open(path, SqliteDatabase::Mode::readWrite));
         TRY(search_functions::install(database, collation));
-        const std::string why = TRY(refusal(database, collation));
-        if (!why.empty()) return KsError::posix(EBADMSG).with("message", why);
+        TRY(checkIsOurs(database, collation));
         TRY(configure(database));
         if (TRY(database.integer("PRAGMA user_version")).value_or(0) == 0) TRY(createTables(database, collation));
         return database;
     };
     Result<SqliteDatabase> opened = attempt();
-    if (opened.ok() || !isDamagedDatabase(opened.error())) return opened;
-    const auto why = opened.error().userInfo().find("message");
-    logError("making the search index anew; {}",
-             why != opened.error().userInfo().end() ? why->second : "it is damaged");
+    const bool isOutdated = !opened.ok() && opened.error().isPosix(kOutdatedCode);
+    if (opened.ok() || !(isOutdated || isDamagedDatabase(opened.error()))) return opened;
+    const auto found = opened.error().userInfo().find("message");
+    const std::string why = found != opened.error().userInfo().end() ? found->second : "it is damaged";
+    if (isOutdated) {
+        logInfo("making the search index anew; {}", why);
+    } else {
+        logError("making the search index anew; {}", why);
+    }
     TRY(SearchStore::remove(path));
     isReplacement = true;
     return attempt();

@@ -453,11 +453,12 @@ TEST_F(SearchStoreTest, isForItsOwnerAlone) {
 class SearchStoreFileTest : public SearchStoreTest {
 protected:
     /// What is there is put aside with one line, and the index is empty and works.
-    void expectAnew() {
+    void expectAnew(LogLevel level = LogLevel::error) {
         LogCapture log;
         open();
         ASSERT_TRUE(store_);
         EXPECT_EQ(log.count("making the search index anew"), 1U);
+        EXPECT_TRUE(log.containsPart(level, "making the search index anew"));
         EXPECT_EQ(anchor(), "");
         put({item("did=7", "afresh")});
         EXPECT_THAT(names("afresh"), ElementsAre("did=7"));
@@ -491,7 +492,7 @@ TEST_F(SearchStoreFileTest, isMadeAnewInPlaceOfAnotherDatabase) {
 
 TEST_F(SearchStoreFileTest, isMadeAnewInPlaceOfAnotherVersion) {
     execute("PRAGMA user_version = 99");
-    expectAnew();
+    expectAnew(LogLevel::info);
 }
 
 TEST_F(SearchStoreFileTest, isMadeAnewWhereTablesAreMissing) {
@@ -506,7 +507,7 @@ TEST_F(SearchStoreFileTest, isMadeAnewWhereFactsAreMissing) {
 
 TEST_F(SearchStoreFileTest, isMadeAnewForAnotherOrderOfNames) {
     execute("UPDATE facts SET value = 'another' WHERE name = 'names'");
-    expectAnew();
+    expectAnew(LogLevel::info);
 }
 
 TEST_F(SearchStoreFileTest, isMadeAnewInPlaceOfWhatIsNoFile) {
