@@ -113,17 +113,52 @@ void currentSyncAnchor(const HostMethodsContext& context, const Json& params, co
                                      });
 }
 
+void answerChanges(JsonRpcReply& reply, const Result<ChangesBatch>& changes, const PresentedPaths& paths) {
+    if (!changes.ok()) return answerWithError(reply, changes.error(), paths);
+    reply.result([&](std::string& out) {
+        ItemWriter writer(paths);
+        ItemWriter::reserve(out, changes->log.size());
+        // Each list with its own view of the log.
+        const auto appendList = [&](std::string_view key, const auto& append) {
+            out += key;
+            out += '[';
+            const std::size_t begin = out.size();
+            for (const auto& entry : changes->log) append(entry, out.size() == begin ? "" : ",");
+            out += ']';
+        };
+        appendList(R"({"updated":)", [&](const ChangesBatch::Entry& entry, std::string_view comma) {
+            if (!entry.item) return;
+            out += comma;
+            writer.append(out, *entry.item);
+        });
+        appendList(R"(,"deleted":)", [&](const ChangesBatch::Entry& entry, std::string_view comma) {
+            if (entry.item) return;
+            out += comma;
+            appendJsonString(out, entry.identifier);
+        });
+        out += R"(,"anchor":")";
+        appendBase64(out, changes->anchor);
+        out += changes->moreComing ? R"(","moreComing":true)" : R"(","moreComing":false)";
+        appendList(R"(,"log":)", [&](const ChangesBatch::Entry& entry, std::string_view comma) {
+            out += comma;
+            out += entry.item ? R"(["u",)" : R"(["d",)";
+            appendJsonString(out, entry.identifier);
+            out += ']';
+        });
+        out += '}';
+    });
+}
+
 void enumerateChanges(const HostMethodsContext& context, const Json& params, const Reply& reply) {
     const RequestParams given(params, *reply);
     const auto container = given.string("container");
     if (!container) return;
     const auto anchor = given.base64("anchor");
     if (!anchor) return;
-    context.changes.enumerateChanges(*container, *anchor,
-                                     [reply, &paths = context.paths](const Result<std::string>& changes) {
-                                         if (!changes.ok()) return answerWithError(*reply, changes.error(), paths);
-                                         reply->result([&](std::string& out) { out += *changes; });
-                                     });
+    context.client.enumerateChanges(*container, *anchor,
+                                    [reply, &paths = context.paths](const Result<ChangesBatch>& changes) {
+                                        answerChanges(*reply, changes, paths);
+                                    });
 }
 
 void startMonitoring(const HostMethodsContext& context, const Json& params, const Reply& reply) {
@@ -233,41 +268,6 @@ void answerItem(JsonRpcReply& reply, const Result<std::shared_ptr<const TesselIt
                 const PresentedPaths& paths) {
     if (!item.ok()) return answerWithError(reply, item.error(), paths);
     reply.result([&](std::string& out) { ItemWriter(paths).append(out, **item); });
-}
-
-std::string changesText(const ChangesBatch& changes, const PresentedPaths& paths) {
-    std::string out;
-    ItemWriter writer(paths);
-    ItemWriter::reserve(out, changes.log.size());
-    // Each list with its own view of the log.
-    const auto appendList = [&](std::string_view key, const auto& append) {
-        out += key;
-        out += '[';
-        const std::size_t begin = out.size();
-        for (const auto& entry : changes.log) append(entry, out.size() == begin ? "" : ",");
-        out += ']';
-    };
-    appendList(R"({"updated":)", [&](const ChangesBatch::Entry& entry, std::string_view comma) {
-        if (!entry.item) return;
-        out += comma;
-        writer.append(out, *entry.item);
-    });
-    appendList(R"(,"deleted":)", [&](const ChangesBatch::Entry& entry, std::string_view comma) {
-        if (entry.item) return;
-        out += comma;
-        appendJsonString(out, entry.identifier);
-    });
-    out += R"(,"anchor":")";
-    appendBase64(out, changes.anchor);
-    out += changes.moreComing ? R"(","moreComing":true)" : R"(","moreComing":false)";
-    appendList(R"(,"log":)", [&](const ChangesBatch::Entry& entry, std::string_view comma) {
-        out += comma;
-        out += entry.item ? R"(["u",)" : R"(["d",)";
-        appendJsonString(out, entry.identifier);
-        out += ']';
-    });
-    out += '}';
-    return out;
 }
 
 JsonRpcServer::Methods bindHostMethods(const HostMethodsContext& context, std::span<const HostMethod> handlers) {

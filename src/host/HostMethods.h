@@ -5,7 +5,6 @@
 #include <span>
 #include <string>
 
-#include "host/ChangesReadAhead.h"
 #include "host/ContainerMonitor.h"
 #include "host/JsonRpcServer.h"
 #include "host/PresentedPaths.h"
@@ -17,7 +16,6 @@ namespace cindral {
 /// What the methods of one client work with. Borrowed for as long as a method may run.
 struct HostMethodsContext {
     ProviderClient& client;
-    ChangesReadAhead& changes;
     ContainerMonitor& monitor;
     const PresentedPaths& paths;
     std::function<std::string()> statusText;  ///< as JSON
@@ -38,9 +36,6 @@ struct HostMethod {
 };
 /// The methods with what they work on.
 JsonRpcServer::Methods bindHostMethods(const HostMethodsContext& context, std::span<const HostMethod> handlers);
-
-/// The answer to a request for changes, as JSON.
-std::string changesText(const ChangesBatch& changes, const PresentedPaths& paths);
 
 /// The methods of the host interface, for one client.
 JsonRpcServer::Methods makeHostMethods(const HostMethodsContext& context);

@@ -34,14 +34,12 @@ ServedClient::ServedClient(const RpcService& service, JsonRpcServer::Sink tell,
                            std::span<const std::string_view> without)
     : tell_(std::move(tell)),
       client_(service.provider),
-      changes_(client_, [&paths = service.paths](const ChangesBatch& changes) { return changesText(changes, paths); }),
       monitor_(client_, service.signals,
                [this](const TesselItemIdentifier& container) { tell_(signalLine(container)); }),
       watches_(service.search, [this](std::uint64_t watch) { tell_(queryLine(watch)); }),
-      server_(methodsWithout(
-                  makeHostMethods({client_, changes_, monitor_, service.paths, service.statusText, service.search,
-                                   watches_, service.hello, service.doctorText, service.makeLink}),
-                  without),
+      server_(methodsWithout(makeHostMethods({client_, monitor_, service.paths, service.statusText, service.search,
+                                              watches_, service.hello, service.doctorText, service.makeLink}),
+                             without),
               tell_) {}
 
 }  // namespace cindral

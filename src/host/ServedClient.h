@@ -3,7 +3,6 @@
 #include <span>
 #include <string_view>
 
-#include "host/ChangesReadAhead.h"
 #include "host/ContainerMonitor.h"
 #include "host/JsonRpcServer.h"
 #include "host/ProviderClient.h"
@@ -28,7 +27,6 @@ public:
 private:
     const JsonRpcServer::Sink tell_;
     ProviderClient client_;
-    ChangesReadAhead changes_;
     ContainerMonitor monitor_;
     QueryWatches watches_;
     JsonRpcServer server_;

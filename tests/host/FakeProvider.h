@@ -109,12 +109,8 @@ public:
     };
     std::map<std::string, std::vector<Changes>> changes;
     std::vector<std::string> askedAnchors;  ///< of enumerations of changes
-    /// The present anchor of a container; its own name where nothing is said.
-    std::map<std::string, std::string> anchors;
     /// Called before changes are answered.
     std::function<void()> beforeChanges;
-    /// Guards the three before that, where a host asks on threads of its own.
-    Mutex changesMutex;
     /// Pages are answered on a queue of the enumerator's, after the call has returned.
     bool isAsynchronous = false;
     /// Deletions count so many items, and answer before the call returns.
@@ -195,11 +191,13 @@ public:
     }
     void enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,
                                      const TesselSyncAnchor& anchor) override {
+        provider_->askedAnchors.emplace_back(textOf(anchor));
         if (provider_->beforeChanges) provider_->beforeChanges();
-        const std::optional<FakeProvider::Changes> next = nextChanges(anchor);
         if (provider_->dropsObservers) return;
-        if (!next) return observer->finishEnumeratingWithError(tesselErrorForExpiredPage());
-        const FakeProvider::Changes& said = *next;
+        auto& script = provider_->changes[container_];
+        if (script.empty()) return observer->finishEnumeratingWithError(tesselErrorForExpiredPage());
+        const FakeProvider::Changes said = script.front();
+        if (script.size() > 1) script.erase(script.begin());
         if (said.error) return observer->finishEnumeratingWithError(*said.error);
         for (const std::string& line : said.log) {
             const std::string identifier = line.substr(2);
@@ -214,13 +212,7 @@ public:
     }
     void currentSyncAnchorWithCompletionHandler(
         std::function<void(std::optional<TesselSyncAnchor>)> completion) override {
-        std::string anchor = container_;
-        {
-            const MutexLock lock(provider_->changesMutex);
-            if (const auto said = provider_->anchors.find(container_); said != provider_->anchors.end())
-                anchor = said->second;
-        }
-        const ByteView bytes = bytesOf(anchor);
+        const ByteView bytes = bytesOf(container_);
         completion(container_ == "fid=noanchor" ? std::nullopt : std::optional(Bytes(bytes.begin(), bytes.end())));
     }
     void start() override { ++provider_->enumeratorsStarted; }
@@ -228,16 +220,6 @@ public:
     void invalidate() override { ++provider_->enumeratorsInvalidated; }
 
 private:
-    std::optional<FakeProvider::Changes> nextChanges(const TesselSyncAnchor& anchor) {
-        const MutexLock lock(provider_->changesMutex);
-        provider_->askedAnchors.emplace_back(textOf(anchor));
-        auto& script = provider_->changes[container_];
-        if (script.empty()) return std::nullopt;
-        FakeProvider::Changes said = script.front();
-        if (script.size() > 1) script.erase(script.begin());
-        return said;
-    }
-
     void list(TesselEnumerationObserver& observer, const TesselPage& page) {
         const bool isFirst = page == tesselInitialPageSortedByName() || page == tesselInitialPageSortedByDate() ||
                              page == tesselInitialPageForFollowers();

@@ -221,8 +221,7 @@ TEST_F(RemoteClientTest, readsChangesInTheirOrder) {
     EXPECT_THAT(log, ElementsAre("u b did=2", "d fid=7", "u a did=1"));
     EXPECT_EQ(textOf(batch->anchor), "next");
     EXPECT_TRUE(batch->moreComing);
-    const MutexLock lock(fake_->changesMutex);
-    EXPECT_EQ(fake_->askedAnchors.front(), std::string(3, '\0'));
+    EXPECT_EQ(fake_->askedAnchors, std::vector<std::string>{std::string(3, '\0')});
 }
 
 TEST_F(RemoteClientTest, passesSignalsOnUntilTheDaemonIsLost) {
