@@ -757,17 +757,20 @@ class WhatChangesMean:
         self.make_file("closed", "secret.txt")
         self.make_file("open", "file.txt")
         os.chmod(self.path("closed"), 0)
-        if os.geteuid() == 0:
-            self._give_away()
-            self.start(user=NOBODY, group=NOBODY, extra_groups=[])
-        else:
-            self.start()
+        self._start_as_an_ordinary_user()
         everything = self.view(WORKING_SET)
         self.write("open", "file.txt")
         self.make_file("open", "new.txt")
         self.changes(everything)
         self.assertEqual({item["filename"] for item in everything.items.values()}, {"closed", "open", "file.txt", "new.txt"})
         self.assertNotEqual(self.call("status")["coverage"], "full")
+
+    def _start_as_an_ordinary_user(self):
+        if os.geteuid() == 0:
+            self._give_away()
+            self.start(user=NOBODY, group=NOBODY, extra_groups=[])
+        else:
+            self.start()
 
     def _give_away(self):
         """To a user without privilege, with all that is in it."""
@@ -779,6 +782,18 @@ class WhatChangesMean:
 
 class InotifyChangesTest(WhatChangesMean, ChangesTest):
     recorder = "inotify"
+
+    def test_a_folder_that_is_opened_and_moved_at_once_is_read(self):
+        self.make_file("closed", "secret.txt")
+        os.chmod(self.path("closed"), 0)
+        self._start_as_an_ordinary_user()
+        everything = self.view(WORKING_SET)
+        self.host.process.send_signal(signal.SIGSTOP)
+        os.rename(self.path("closed"), self.path("moved"))
+        os.chmod(self.path("moved"), 0o755)
+        self.host.process.send_signal(signal.SIGCONT)
+        self.changes(everything)
+        self.assertEqual({item["filename"] for item in everything.items.values()}, {"moved", "secret.txt"})
 
     def test_the_status_names_the_recorder(self):
         self.start()

@@ -348,7 +348,7 @@ Result<void> IndexKeeper::seeKnown(OpenFolder& folder, std::string_view name, co
     const bool isChanged = object.changeTime != stampOf(status.changeTime) || object.size != sizeOf(status) ||
                            object.kind != kindOf(status, name);
     const bool isClosed = isFolder && (isChanged || object.isClosed)
-                              ? !sys::isReadableDirectory(folder.fd.get(), std::string(name).c_str())
+                              ? sys::isClosedDirectory(folder.fd.get(), std::string(name).c_str())
                               : object.isClosed;
     if (!known.isAt(folder.fileID, name)) {
         if (isFolder || !holds(object.parent, known.name, object.fileID, object.birthTime)) {
@@ -410,7 +410,8 @@ Result<void> IndexKeeper::seeMoved(OpenFolder& folder, std::string_view name, co
     put(folder.fileID, name, status, isClosed);
     arrived(folder.fileID, name, object.fileID);
     contexts_.clear();
-    if ((before.root != after.root || object.changeTime == 0) && !isClosed) toScan_.push_back(object.fileID);
+    const bool isUnread = before.root != after.root || object.changeTime == 0 || object.isClosed;
+    if (isUnread && !isClosed) toScan_.push_back(object.fileID);
     return isShownOtherwise ? touchBelow(object.fileID) : Result<void>();
 }
 
@@ -464,7 +465,7 @@ Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, cons
         placed_.erase(fileID);
     }
     const bool isFolder = status.isDirectory();
-    const bool isClosed = isFolder && !sys::isReadableDirectory(folder.fd.get(), std::string(name).c_str());
+    const bool isClosed = isFolder && sys::isClosedDirectory(folder.fd.get(), std::string(name).c_str());
     if (isFolder) noteClosed(fileID, isClosed);
     put(folder.fileID, name, status, isClosed);
     entriesChanged(folder.fileID);

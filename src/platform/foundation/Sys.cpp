@@ -219,8 +219,8 @@ Result<bool> isWritable(int directory, const char* name) {
     return true;
 }
 
-bool isReadableDirectory(int directory, const char* name) {
-    return ::faccessat(directory, name, R_OK | X_OK, AT_EACCESS | AT_SYMLINK_NOFOLLOW) == 0;
+bool isClosedDirectory(int directory, const char* name) {
+    return ::faccessat(directory, name, R_OK | X_OK, AT_EACCESS | AT_SYMLINK_NOFOLLOW) != 0 && errno != ENOENT;
 }
 
 namespace {

@@ -99,9 +99,9 @@ Result<std::size_t> getxattrat(int directory, const char* name, const char* attr
 /// Whether the process may write the entry itself (effective identity, links not followed).
 Result<bool> isWritable(int directory, const char* name);
 
-/// Whether the process may list the directory and reach what is in it (effective identity, links not followed). False
-/// for what is none or can't be asked.
-bool isReadableDirectory(int directory, const char* name);
+/// Whether the process may not list the directory, or not reach what is in it (effective identity, links not followed).
+/// False for what is not there.
+bool isClosedDirectory(int directory, const char* name);
 
 /// What can be relied on in the file system that holds a directory.
 struct FileSystemTraits {
