@@ -174,19 +174,24 @@ std::uint64_t RvStorageManager::resolveDocumentID(std::int64_t documentID, std::
     const auto store = this->store();
     if (!store) return fail(EAGAIN);
     if (documentID <= 0 || documentID > UINT32_MAX) return fail(EINVAL);
-    std::optional<DocumentRecord> document;
-    const Result<FoundObject> found = Search{*this, *store, device}.find([&]() -> Result<FileID> {
-        document = store->document(DocumentID{static_cast<std::uint32_t>(documentID)});
-        if (!document) return KsError::posix(ENOENT);
-        return document->fileID;
-    });
-    if (!found.ok()) return fail(errnoOf(found.error()));
-    // The number went to another object: the document's own is gone.
-    if (found->status.birthStamp() != document->birthTime) return fail(ENOENT);
-    // The object took another document over, and is that one since.
-    const auto object = store->object(document->fileID);
-    if (object && object->documentID != DocumentID{static_cast<std::uint32_t>(documentID)}) return fail(ENOENT);
-    return static_cast<std::uint64_t>(document->fileID);
+    const DocumentID wanted{static_cast<std::uint32_t>(documentID)};
+    for (int search = 0;; ++search) {
+        std::optional<DocumentRecord> document;
+        const Result<FoundObject> found = Search{*this, *store, device}.find([&]() -> Result<FileID> {
+            document = store->document(wanted);
+            if (!document) return KsError::posix(ENOENT);
+            return document->fileID;
+        });
+        if (!found.ok()) return fail(errnoOf(found.error()));
+        const auto object = store->object(document->fileID);
+        // The number went to another object: the document's own is gone. Or the object took another document over, and
+        // is that one since.
+        const bool isAnother =
+            found->status.birthStamp() != document->birthTime || (object && object->documentID != wanted);
+        if (!isAnother) return static_cast<std::uint64_t>(document->fileID);
+        // Unless it was handed over between one look and the next.
+        if (search == kSearchesMax || store->document(wanted) == document) return fail(ENOENT);
+    }
 }
 
 std::uint32_t RvStorageManager::documentIDForDescriptor(int fd) {

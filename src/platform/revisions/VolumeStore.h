@@ -48,6 +48,7 @@ struct ObjectRecord {
 struct DocumentRecord {
     FileID fileID{};
     std::int64_t birthTime = 0;
+    friend bool operator==(const DocumentRecord&, const DocumentRecord&) = default;
 };
 
 // VolumeIndex.h
