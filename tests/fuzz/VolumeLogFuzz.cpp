@@ -49,6 +49,7 @@ void write(BatchWriter& writer, const LogRecord& record) {
             return writer.add(record.type, record.key, DocumentChange::decode(record.value).value().encode());
         case LogRecordType::attributes: return writer.add(record.type, record.key, record.value);
         case LogRecordType::timeMark: return writer.addTimeMark(record.key, record.time());
+        case LogRecordType::historyBegin: return writer.add(record.type, record.key, ByteView());
     }
     require(false);
 }

@@ -99,29 +99,28 @@ Result<void> configure(SqliteDatabase& database) {
     return {};
 }
 
-// An index of before: nothing is wrong with it.
-constexpr int kOutdatedCode = ESTALE;
-
-KsError refusalFor(int code, std::string why) {
-    return KsError::posix(code).with("message", std::move(why));
+KsError refusal(std::string why) {
+    return KsError::posix(EBADMSG).with("message", std::move(why));
 }
 
-/// Fails where the file is none that can be gone on with: with kOutdatedCode, or as a damaged database does.
-Result<void> checkIsOurs(SqliteDatabase& database, const NameCollation& collation) {
+/// Fails as a damaged database does where the file is none that can be gone on with. `isOutdated`: nothing is wrong with
+/// it, it is of before.
+Result<void> checkIsOurs(SqliteDatabase& database, const NameCollation& collation, bool& isOutdated) {
     const std::int64_t application = TRY(database.integer("PRAGMA application_id")).value_or(0);
     const std::int64_t version = TRY(database.integer("PRAGMA user_version")).value_or(0);
     const std::int64_t tables = TRY(database.integer("SELECT count(*) FROM sqlite_schema")).value_or(0);
     if (application == 0 && version == 0 && tables == 0) return {};
-    if (application != kApplicationID) return refusalFor(EBADMSG, "it is no search index");
-    if (version != kVersion) return refusalFor(kOutdatedCode, fmt::format("it is of version {}", version));
+    if (application != kApplicationID) return refusal("it is no search index");
+    isOutdated = version != kVersion;
+    if (isOutdated) return refusal(fmt::format("it is of version {}", version));
     SqliteStatement order = TRY(database.prepare("SELECT value FROM facts WHERE name = 'names'"));
-    if (!TRY(order.step())) return refusalFor(EBADMSG, "it is not whole");
-    if (order.text(0) != versionOf(collation))
-        return refusalFor(kOutdatedCode, "names are folded or ordered otherwise now");
+    if (!TRY(order.step())) return refusal("it is not whole");
+    isOutdated = order.text(0) != versionOf(collation);
+    if (isOutdated) return refusal("names are folded or ordered otherwise now");
     order.reset();
     if (TRY(database.integer("PRAGMA page_count")).value_or(0) <= kCheckedPagesMax) {
         SqliteStatement check = TRY(database.prepare("PRAGMA quick_check(1)"));
-        if (!TRY(check.step()) || check.text(0) != "ok") return refusalFor(EBADMSG, "it is damaged");
+        if (!TRY(check.step()) || check.text(0) != "ok") return refusal("it is damaged");
     }
     return {};
 }
@@ -143,20 +142,19 @@ Result<void> createTables(SqliteDatabase& database, const NameCollation& collati
 
 /// A connection that writes, with a file that can be gone on with. `isReplacement`: another had to go for it.
 Result<SqliteDatabase> openOurs(const std::string& path, const NameCollation& collation, bool& isReplacement) {
+    bool isOutdated = false;
     const auto attempt = [&]() -> Result<SqliteDatabase> {
         struct stat there {};
-        if (::lstat(path.c_str(), &there) == 0 && !S_ISREG(there.st_mode))
-            return refusalFor(EBADMSG, "it is no file");
+        if (::lstat(path.c_str(), &there) == 0 && !S_ISREG(there.st_mode)) return refusal("it is no file");
         SqliteDatabase database = TRY(SqliteDatabase::open(path, SqliteDatabase::Mode::readWrite));
         TRY(search_functions::install(database, collation));
-        TRY(checkIsOurs(database, collation));
+        TRY(checkIsOurs(database, collation, isOutdated));
         TRY(configure(database));
         if (TRY(database.integer("PRAGMA user_version")).value_or(0) == 0) TRY(createTables(database, collation));
         return database;
     };
     Result<SqliteDatabase> opened = attempt();
-    const bool isOutdated = !opened.ok() && opened.error().isPosix(kOutdatedCode);
-    if (opened.ok() || !(isOutdated || isDamagedDatabase(opened.error()))) return opened;
+    if (opened.ok() || !isDamagedDatabase(opened.error())) return opened;
     const auto found = opened.error().userInfo().find("message");
     const std::string why = found != opened.error().userInfo().end() ? found->second : "it is damaged";
     if (isOutdated) {

@@ -570,6 +570,7 @@ bool holdsWithWatches(int watches, const std::function<bool()>& check) {
         limit << watches << std::flush;
         ::_exit(limit.good() && check() ? 0 : 1);
     }
+    if (child < 0) return false;
     int status = 0;
     EXPECT_EQ(::waitpid(child, &status, 0), child);
     return WIFEXITED(status) && WEXITSTATUS(status) == 0;
