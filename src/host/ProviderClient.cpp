@@ -115,15 +115,26 @@ private:
 /// later.
 class ProviderClient::Use {
 public:
-    explicit Use(std::shared_ptr<Handle> handle) : handle_(std::move(handle)) {}
+    /// The group is left when the call has returned: until then the client is there.
+    Use(std::shared_ptr<Handle> handle, DispatchGroup& calls)
+        : handle_(std::move(handle)), place_(handle_->enumerator().enumeratedItemURL()), calls_(calls) {
+        calls_.enter();
+    }
 
     TesselEnumerator& enumerator() { return handle_->enumerator(); }
+    /// Whether the container is no longer where the enumerator looked: it has moved since, or another package has taken
+    /// its document over. What was said is of the old place then.
+    bool isElsewhere(TesselExtension& provider, const TesselItemIdentifier& container) const {
+        return place_ && provider.URLForItemWithPersistentIdentifier(container) != place_;
+    }
 
     void callReturned() {
-        if (!isLast()) return;
-        // Mostly the request was answered within the call, and nobody else has the enumerator.
-        if (handle_.use_count() == 1) handle_->invalidateNow();
-        handle_.reset();
+        if (isLast()) {
+            // Mostly the request was answered within the call, and nobody else has the enumerator.
+            if (handle_.use_count() == 1) handle_->invalidateNow();
+            handle_.reset();
+        }
+        calls_.leave();
     }
     /// Lets go of the use: once answered, the client and all it holds may be on their way out.
     static void answered(std::shared_ptr<Use>& use) {
@@ -135,6 +146,8 @@ private:
     bool isLast() { return pending_.fetch_sub(1) == 1; }
 
     std::shared_ptr<Handle> handle_;
+    const std::optional<KsURL> place_;
+    DispatchGroup& calls_;
     std::atomic<int> pending_ = 2;
 };
 
@@ -206,11 +219,6 @@ void ProviderClient::stopMonitoring(const TesselItemIdentifier& container) {
     if (handle) handle->enumerator().stop();
 }
 
-/// None of what stands for many folders.
-std::optional<KsURL> ProviderClient::placeOf(const TesselItemIdentifier& container) const {
-    return isKept(container) ? std::nullopt : provider_->URLForItemWithPersistentIdentifier(container);
-}
-
 void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor,
                                       ChangesCompletion completion) {
     enumerateChanges(container, anchor, kAttemptsMax, std::move(completion));
@@ -218,22 +226,19 @@ void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, con
 
 void ProviderClient::enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor,
                                       int attempts, ChangesCompletion completion) {
-    const std::optional<KsURL> place = placeOf(container);
     auto made = comingEnumerator(container);
     if (!made.ok()) {
         completion(std::move(made).error());
         return;
     }
-    auto use = std::make_shared<Use>(*std::move(made));
+    auto use = std::make_shared<Use>(*std::move(made), invalidations_);
     use->enumerator().enumerateChangesForObserver(
         std::make_shared<ChangesCollector>(
             [=, this, completion = std::move(completion)](Result<ChangesBatch> result, bool isEnded) mutable {
+                const bool isElsewhere = result.ok() && use->isElsewhere(*provider_, container);
                 Use::answered(use);
                 // Whoever stopped the enumeration meant something else: that the container is no longer monitored.
                 const bool isCut = isEnded && !result.ok() && result.error().isPosix(ECANCELED);
-                // What was told is of the place where the container was when the enumerator was made: it has moved since, or
-                // another package has taken its document over.
-                const bool isElsewhere = result.ok() && placeOf(container) != place;
                 if (!isCut && !isElsewhere) return completion(std::move(result));
                 if (attempts == 1) return completion(KsError::posix(ECANCELED));
                 dispatchAsync([this, container, anchor, attempts, again = std::move(completion)]() mutable {
@@ -251,7 +256,6 @@ void ProviderClient::enumerateItems(const TesselItemIdentifier& container, const
 
 void ProviderClient::enumerateItems(const TesselItemIdentifier& container, const TesselPage& page, int attempts,
                                     PageCompletion completion) {
-    const std::optional<KsURL> place = placeOf(container);
     // On the first page the client comes to see what there is; the others go on with that.
     const bool isFirst = page == tesselInitialPageSortedByName() || page == tesselInitialPageSortedByDate();
     auto made = isFirst ? comingEnumerator(container) : anyEnumerator(container);
@@ -259,13 +263,13 @@ void ProviderClient::enumerateItems(const TesselItemIdentifier& container, const
         completion(std::move(made).error());
         return;
     }
-    auto use = std::make_shared<Use>(*std::move(made));
+    auto use = std::make_shared<Use>(*std::move(made), invalidations_);
     use->enumerator().enumerateItemsForObserver(
         std::make_shared<PageCollector>(
             [=, this, completion = std::move(completion)](Result<ItemsPage> result) mutable {
+                const bool isElsewhere = result.ok() && use->isElsewhere(*provider_, container);
                 Use::answered(use);
-                // What is listed is the folder that was at the place by then.
-                if (!result.ok() || placeOf(container) == place) return completion(std::move(result));
+                if (!isElsewhere) return completion(std::move(result));
                 if (attempts == 1) return completion(KsError::posix(ECANCELED));
                 dispatchAsync([this, container, page, attempts, again = std::move(completion)]() mutable {
                     enumerateItems(container, page, attempts - 1, std::move(again));
@@ -281,7 +285,7 @@ void ProviderClient::currentSyncAnchor(const TesselItemIdentifier& container, An
         completion(std::move(made).error());
         return;
     }
-    auto use = std::make_shared<Use>(*std::move(made));
+    auto use = std::make_shared<Use>(*std::move(made), invalidations_);
     use->enumerator().currentSyncAnchorWithCompletionHandler(
         [use, completion = std::move(completion)](std::optional<TesselSyncAnchor> anchor) mutable {
             Use::answered(use);

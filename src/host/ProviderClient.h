@@ -58,14 +58,13 @@ private:
     Result<std::shared_ptr<Handle>> keptEnumerator(const TesselItemIdentifier& container);
     Result<std::shared_ptr<Handle>> anyEnumerator(const TesselItemIdentifier& container);
     Result<std::shared_ptr<Handle>> comingEnumerator(const TesselItemIdentifier& container);
-    std::optional<KsURL> placeOf(const TesselItemIdentifier& container) const;
     void enumerateItems(const TesselItemIdentifier& container, const TesselPage& page, int attempts,
                         PageCompletion completion);
     void enumerateChanges(const TesselItemIdentifier& container, const TesselSyncAnchor& anchor, int attempts,
                           ChangesCompletion completion);
 
     const std::shared_ptr<TesselExtension> provider_;
-    DispatchGroup invalidations_;
+    DispatchGroup invalidations_;  ///< and calls of enumerators that have not returned
 
     Mutex mutex_;
     std::map<TesselItemIdentifier, std::shared_ptr<Handle>> kept_ GUARDED_BY(mutex_);

@@ -46,6 +46,7 @@ public:
     /// Null where there are no live updates.
     const std::shared_ptr<FSChangesNotifier>& notifier() const { return notifier_; }
 
+    std::optional<KsURL> enumeratedItemURL() const override { return enumeratedItemURL_; }
     void enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer,
                                    const TesselPage& page) override;
     void enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,

@@ -181,7 +181,12 @@ private:
 class FakeEnumerator final : public TesselEnumerator {
 public:
     FakeEnumerator(std::shared_ptr<FakeProvider> provider, std::string container)
-        : provider_(std::move(provider)), container_(std::move(container)) {}
+        : provider_(std::move(provider)), container_(std::move(container)) {
+        const auto item = provider_->items_.find(container_);
+        if (item != provider_->items_.end()) url_ = item->second->url;
+    }
+
+    std::optional<KsURL> enumeratedItemURL() const override { return url_; }
 
     void enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer,
                                    const TesselPage& page) override {
@@ -246,6 +251,7 @@ private:
 
     const std::shared_ptr<FakeProvider> provider_;
     const std::string container_;
+    std::optional<KsURL> url_;
     SerialQueue queue_{"cindral.fake-enumerator"};
 };
 

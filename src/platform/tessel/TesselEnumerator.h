@@ -41,6 +41,9 @@ public:
 class TesselEnumerator {
 public:
     virtual ~TesselEnumerator() = default;
+    /// Where the container was when the enumerator was made, which is where it looks. None where it looks in several
+    /// places.
+    virtual std::optional<KsURL> enumeratedItemURL() const { return std::nullopt; }
     virtual void enumerateItemsForObserver(std::shared_ptr<TesselEnumerationObserver> observer,
                                            const TesselPage& page) = 0;
     virtual void enumerateChangesForObserver(std::shared_ptr<TesselChangeObserver> observer,
