@@ -612,7 +612,7 @@ protected:
 INSTANTIATE_TEST_SUITE_P(Seeds, VolumeIndexModelTest, ::testing::Range(1U, 7U));
 
 // As after a first reading: there are objects, and no event to forget.
-TEST_P(VolumeIndexModelTest, beginsAHistoryWithoutWaitingForTheDisk) {
+TEST_P(VolumeIndexModelTest, goesOnFromAFirstHistory) {
     for (std::uint64_t i = pick(3); i > 0; --i) list();
     begin();
     expectSame();

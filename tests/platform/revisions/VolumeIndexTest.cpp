@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <array>
 #include <atomic>
+#include <filesystem>
 #include <thread>
 
 #include "platform/revisions/VolumeStore.h"
@@ -59,6 +60,7 @@ protected:
     void open() {
         VolumeStoreOptions options = onRequest();
         options.now = [this] { return now_; };
+        options.onCheckpointStep = [this] { ++checkpointSteps_; };
         auto opened = VolumeStore::open(folder(), options);
         ASSERT_TRUE(opened.ok()) << opened.error().description();
         store_ = std::move(opened).value();
@@ -160,6 +162,7 @@ protected:
     TemporaryFolder temporary_;
     std::chrono::system_clock::time_point now_{std::chrono::hours(500'000)};
     std::unique_ptr<VolumeStore> store_;
+    int checkpointSteps_ = 0;
 };
 
 INSTANTIATE_TEST_SUITE_P(InMemory, VolumeIndexTest, ::testing::Values(Saved::no));
@@ -842,6 +845,32 @@ TEST_P(VolumeIndexTest, beginsItsHistory) {
     reopen();
     EXPECT_EQ(store_->historyBegin(), 2U);
     EXPECT_THAT(eventsAfter(2), ElementsAre("3 present 11 2/b"));
+}
+
+// Whoever waits for a first reading waits for no disk.
+TEST_P(VolumeIndexTest, beginsAFirstHistoryWithoutACheckpoint) {
+    put(file(10, "a"), IndexChanges::Journal::no);
+    const int before = checkpointSteps_;
+    EXPECT_EQ(*store_->beginHistory(), 1U);
+    EXPECT_EQ(checkpointSteps_, before);
+    put(file(11, "b"));
+    // Killed here; and killed, with the file of numbers lost.
+    const std::string killed = temporary_ / "killed";
+    std::filesystem::copy(folder(), killed);
+    for (const bool losesNumbers : {false, true}) {
+        store_.reset();
+        std::filesystem::remove_all(folder());
+        std::filesystem::copy(killed, folder());
+        if (losesNumbers) {
+            ASSERT_TRUE(std::filesystem::remove(folder() + "/ids"));
+        }
+        open();
+        EXPECT_EQ(store_->historyBegin(), 1U);
+        EXPECT_THAT(eventsAfter(0), ElementsAre("2 present 11 2/b"));
+        put(file(10, "a"));
+        EXPECT_GT(store_->currentEventID(), 2U);
+        EXPECT_EQ(eventsAfter(2).size(), 1U);
+    }
 }
 
 TEST_P(VolumeIndexTest, keepsAttributes) {
