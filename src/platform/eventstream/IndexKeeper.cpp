@@ -424,7 +424,9 @@ Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name
         changes().addName(object.fileID, folder.fileID, name);
         entriesChanged(folder.fileID);
     }
-    if (object.changeTime != stampOf(status.changeTime) || object.size != sizeOf(status)) {
+    // The stamp alone doesn't tell: a link sets it before it counts the name, and the file may have been looked at then.
+    const bool isUncounted = status.names > 1 && !object.hasOtherNames;
+    if (isUncounted || object.changeTime != stampOf(status.changeTime) || object.size != sizeOf(status)) {
         put(object.parent, known.name, status, false);
     }
     watchNames(folder, name, status);

@@ -172,6 +172,32 @@ TEST_P(RecorderTest, keepsWhatLeftAFolderWhoseNumberIsANewOnesNow) {
     expectIndexIsTree();
 }
 
+// A link sets the stamp first, and counts the name then: who looks in between sees one of after and the other of before.
+TEST_P(RecorderTest, keepsAFileThatWasLookedAtWhileItGotItsOtherName) {
+    write("a", "old");
+    start();
+    const DocumentID document = list("a");
+    link("a", "a~");
+    struct stat status {};
+    ASSERT_EQ(::stat(path("a").c_str(), &status), 0);
+    IndexChanges seen(IndexChanges::Journal::no);
+    const std::string name = "a";
+    ASSERT_TRUE(store().indexed(fileID("a"), [&](IndexedObject object) {
+        object.name = name;
+        object.changeTime = status.st_ctim.tv_sec * 1'000'000'000 + status.st_ctim.tv_nsec;
+        object.hasOtherNames = false;
+        seen.put(object);
+    }));
+    const FileID rootID{root_->status.fileID};
+    ASSERT_TRUE(store().apply(seen, {&rootID, 1}).ok());
+    changes();
+    write("new", "new");
+    rename("new", "a");
+    EXPECT_TRUE(changes().contains("a~"));
+    EXPECT_EQ(this->document("a"), document) << "it is a save";
+    expectIndexIsTree();
+}
+
 TEST_P(RecorderTest, followsTwoFilesThatSwapNames) {
     write("a", "one");
     write("b", "two");
