@@ -424,7 +424,7 @@ Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name
         changes().addName(object.fileID, folder.fileID, name);
         entriesChanged(folder.fileID);
     }
-    // The stamp alone doesn't tell: a link sets it before it counts the name, and the file may have been looked at then.
+    // The stamp alone doesn't tell: a link sets it before it counts the name, and the file may be looked at in between.
     const bool isUncounted = status.names > 1 && !object.hasOtherNames;
     if (isUncounted || object.changeTime != stampOf(status.changeTime) || object.size != sizeOf(status)) {
         put(object.parent, known.name, status, false);

@@ -172,7 +172,7 @@ TEST_P(RecorderTest, keepsWhatLeftAFolderWhoseNumberIsANewOnesNow) {
     expectIndexIsTree();
 }
 
-// A link sets the stamp first, and counts the name then: who looks in between sees one of after and the other of before.
+// A link sets the stamp first, then it counts the name: who looks in between sees one of after and the other of before.
 TEST_P(RecorderTest, keepsAFileThatWasLookedAtWhileItGotItsOtherName) {
     write("a", "old");
     start();
