@@ -810,17 +810,11 @@ TEST_P(RecorderTest, callsItsObserversWhenThereIsNews) {
     EXPECT_EQ(calls, 1);
 }
 
-std::string nameOf(const ::testing::TestParamInfo<Recorder::Choice>& info) {
-    return info.param == Recorder::Choice::inotify ? "inotify" : "automatic";
-}
-
-// Automatic is fanotify where the process may.
 // With a document in it that has two names there.
 TEST_P(RecorderTest, aFolderMayLeaveAtAnyMomentOfALookAndComeBack) {
     makeFolder("here");
     start();
-    bool hasLeft = true;
-    for (int moment = 1; hasLeft; ++moment) {
+    for (int moment = 1;; ++moment) {
         makeFolder("here/f");
         write("here/f/one");
         link("here/f/one", "here/f/two");
@@ -828,7 +822,7 @@ TEST_P(RecorderTest, aFolderMayLeaveAtAnyMomentOfALookAndComeBack) {
         list("here/f/one");
         write("here/f/new");
         write("here/other");
-        hasLeft = false;
+        bool hasLeft = false;
         {
             int calls = 0;
             const sys::FaultInjection faults([&](const char* /*call*/) {
@@ -876,6 +870,11 @@ TEST_P(RecorderInMemoryTest, tellsOfAFolderAsOftenAsItsEntriesChange) {
     }
 }
 
+std::string nameOf(const ::testing::TestParamInfo<Recorder::Choice>& info) {
+    return info.param == Recorder::Choice::inotify ? "inotify" : "automatic";
+}
+
+// Automatic is fanotify where the process may.
 INSTANTIATE_TEST_SUITE_P(Sources, RecorderInMemoryTest,
                          ::testing::Values(Recorder::Choice::inotify, Recorder::Choice::automatic), nameOf);
 INSTANTIATE_TEST_SUITE_P(Sources, RecorderTest,
