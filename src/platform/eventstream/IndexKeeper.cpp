@@ -233,7 +233,8 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
         return {};
     if (holds(departure.parent, departure.name, departure.fileID, departure.birthTime)) return {};
     entriesChanged(departure.parent);
-    if (known->object.hasOtherNames && keepUnderOtherName(departure.fileID)) return {};
+    const bool hadOtherNames = !known->isFolder() && mayHaveOtherNames(departure.fileID, known->object.hasOtherNames);
+    if (hadOtherNames && keepUnderOtherName(departure.fileID)) return {};
     if (known->object.documentID != DocumentID{}) {
         recent_.add(departure.parent, departure.name, known->object.documentID, options_.now());
     }
@@ -241,7 +242,7 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
         TRY(removeBelow(departure.fileID));
         forgetWatch(departure.fileID);
         contexts_.clear();
-    } else if (known->object.hasOtherNames) {
+    } else if (hadOtherNames) {
         forgetWatch(departure.fileID);
     }
     // Whoever takes its document over does so before it is gone.
@@ -255,6 +256,11 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
     placed_.erase(departure.fileID);
     changes().remove(departure.fileID);
     return {};
+}
+
+/// Also where it was last seen with one: a rename over a name counts it off while the file can still be met under it.
+bool IndexKeeper::mayHaveOtherNames(FileID fileID, bool hadWhenSeen) const {
+    return hadWhenSeen || !store_.otherNames(fileID).empty();
 }
 
 /// False when the object has no other name that leads to it.
@@ -382,7 +388,7 @@ Result<void> IndexKeeper::seeMoved(OpenFolder& folder, std::string_view name, co
                                    const Known& known, bool isClosed) {
     const IndexedObject& object = known.object;
     movedAway(known, folder.fileID, name);
-    if (object.hasOtherNames) {
+    if (!status.isDirectory()) {
         for (const VolumeStore::Name& other : store_.otherNames(object.fileID)) {
             if (other.parent == folder.fileID && other.name == name) {
                 changes().removeName(object.fileID, other.parent, other.name);

@@ -112,6 +112,7 @@ private:
     Result<void> lookAtObject(FileID fileID);
     Result<void> endRound(bool isQuiet);
     Result<void> giveUp(const Departure& departure);
+    bool mayHaveOtherNames(FileID fileID, bool hadWhenSeen) const;
     bool keepUnderOtherName(FileID fileID);
     Result<void> resolveReplacements();
     Result<void> flush();

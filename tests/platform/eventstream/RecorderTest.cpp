@@ -198,6 +198,49 @@ TEST_P(RecorderTest, keepsAFileThatWasLookedAtWhileItGotItsOtherName) {
     expectIndexIsTree();
 }
 
+TEST_P(RecorderTest, keepsAFileThatWasLookedAtWhileItLostOneOfItsNames) {
+    write("a", "old");
+    start();
+    const DocumentID document = list("a");
+    link("a", "a~");
+    changes();
+    // What is found at the name that a rename takes: the file, one name less.
+    IndexChanges seen(IndexChanges::Journal::no);
+    const std::string name = "a";
+    ASSERT_TRUE(store().indexed(fileID("a"), [&](IndexedObject object) {
+        object.name = name;
+        object.hasOtherNames = false;
+        seen.put(object);
+    }));
+    const FileID rootID{root_->status.fileID};
+    ASSERT_TRUE(store().apply(seen, {&rootID, 1}).ok());
+    write("new", "new");
+    rename("new", "a");
+    EXPECT_TRUE(changes().contains("a~"));
+    EXPECT_EQ(this->document("a"), document) << "it is a save";
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, keepsAFileBelowAFolderThatWentWhereItWasLookedAtWhileItLostOneOfItsNames) {
+    makeFolder("gone");
+    write("gone/a", "old");
+    start();
+    link("gone/a", "b");
+    changes();
+    IndexChanges seen(IndexChanges::Journal::no);
+    const std::string name = "a";
+    ASSERT_TRUE(store().indexed(fileID("gone/a"), [&](IndexedObject object) {
+        object.name = name;
+        object.hasOtherNames = false;
+        seen.put(object);
+    }));
+    const FileID rootID{root_->status.fileID};
+    ASSERT_TRUE(store().apply(seen, {&rootID, 1}).ok());
+    renamePaths(path("gone"), outside("gone"));
+    EXPECT_TRUE(changes().contains("b"));
+    expectIndexIsTree();
+}
+
 TEST_P(RecorderTest, followsTwoFilesThatSwapNames) {
     write("a", "one");
     write("b", "two");
