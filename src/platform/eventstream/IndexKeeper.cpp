@@ -33,6 +33,8 @@ constexpr int kRoundsMax = 8;
 constexpr int kAttemptsMax = 6;
 // A newcomer waits for so many rounds: one that looks, one that gives up what did not turn up.
 constexpr int kPutOffMax = 3;
+// While folders are on their way to their places, the index may have one below another and that one below it.
+constexpr std::size_t kLevelsMax = 4'096;
 // A number given to an object younger than this was given while it was being saved.
 constexpr std::int64_t kYoungNanoseconds = 60'000'000'000;
 
@@ -234,7 +236,7 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
     if (holds(departure.parent, departure.name, departure.fileID, departure.birthTime)) return {};
     entriesChanged(departure.parent);
     const bool hadOtherNames = !known->isFolder() && mayHaveOtherNames(departure.fileID, known->object.hasOtherNames);
-    if (hadOtherNames && keepUnderOtherName(departure.fileID)) return {};
+    if (hadOtherNames && keepUnderOtherName(departure.fileID, FileID{})) return {};
     if (known->object.documentID != DocumentID{}) {
         recent_.add(departure.parent, departure.name, known->object.documentID, options_.now());
     }
@@ -263,18 +265,50 @@ bool IndexKeeper::mayHaveOtherNames(FileID fileID, bool hadWhenSeen) const {
     return hadWhenSeen || !store_.otherNames(fileID).empty();
 }
 
-/// False when the object has no other name that leads to it.
-bool IndexKeeper::keepUnderOtherName(FileID fileID) {
+/// False when the object has no other name that leads to it. What is in `leaving` is on its way out with it.
+bool IndexKeeper::keepUnderOtherName(FileID fileID, FileID leaving) {
     const std::optional<Known> known = find(fileID);
     if (!known) return false;
-    for (const VolumeStore::Name& other : store_.otherNames(fileID)) {
+    std::optional<VolumeStore::Name> unreached;
+    for (VolumeStore::Name& other : store_.otherNames(fileID)) {
         // By its path, anew: a folder that was opened before may have left the roots since, with the name in it.
         openFolders_.erase(other.parent);
+        if (!openFolder(other.parent)) {
+            if (!unreached && leadsToRoot(other.parent, leaving)) unreached = std::move(other);
+            continue;
+        }
         const std::optional<FileStatus> status = statusAt(other.parent, other.name);
         if (!status || !known->isSame(FileID{status->fileID}, status->birthStamp())) continue;
         changes().removeName(fileID, other.parent, other.name);
         put(other.parent, other.name, *status, false);
         return true;
+    }
+    if (unreached) recordUnderName(*known, *unreached);
+    return unreached.has_value();
+}
+
+/// A folder on the way to the name has moved, with the name in it or not: that is looked at once it is found.
+void IndexKeeper::recordUnderName(const Known& known, const VolumeStore::Name& name) {
+    changes().removeName(known.object.fileID, name.parent, name.name);
+    Known there{known.object, name.name};
+    there.object.parent = name.parent;
+    there.object.changeTime = 0;
+    IndexedObject object = there.object;
+    object.name = there.name;
+    changes().put(object);
+    placed_.insert_or_assign(known.object.fileID, std::move(there));
+    entriesChanged(name.parent);
+    dirtyFolders_[name.parent].names.insert(name.name);
+}
+
+/// Whether the index has the folder below a root, and not in the other.
+bool IndexKeeper::leadsToRoot(FileID folder, FileID other) const {
+    for (std::size_t levels = 0; levels < kLevelsMax; ++levels) {
+        if (folder == other) return false;
+        if (rootWithID(folder) != nullptr) return true;
+        const std::optional<Known> known = find(folder);
+        if (!known) return false;
+        folder = known->object.parent;
     }
     return false;
 }

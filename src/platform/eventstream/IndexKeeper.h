@@ -113,7 +113,9 @@ private:
     Result<void> endRound(bool isQuiet);
     Result<void> giveUp(const Departure& departure);
     bool mayHaveOtherNames(FileID fileID, bool hadWhenSeen) const;
-    bool keepUnderOtherName(FileID fileID);
+    bool keepUnderOtherName(FileID fileID, FileID leaving);
+    void recordUnderName(const Known& known, const VolumeStore::Name& name);
+    bool leadsToRoot(FileID folder, FileID other) const;
     Result<void> resolveReplacements();
     Result<void> flush();
     Result<void> flushWhenFull();

@@ -394,9 +394,9 @@ Result<void> IndexKeeper::forEachBelow(FileID top, const std::function<Result<vo
 
 Result<void> IndexKeeper::removeBelow(FileID folder) {
     TRY(flush());
-    return forEachBelow(folder, [this](const Below& below) -> Result<void> {
+    return forEachBelow(folder, [this, folder](const Below& below) -> Result<void> {
         const bool hadOtherNames = !below.isFolder && mayHaveOtherNames(below.fileID, below.hasOtherNames);
-        if (hadOtherNames && keepUnderOtherName(below.fileID)) return flushWhenFull();
+        if (hadOtherNames && keepUnderOtherName(below.fileID, folder)) return flushWhenFull();
         if (below.isFolder || hadOtherNames) forgetWatch(below.fileID);
         changes().remove(below.fileID);
         return flushWhenFull();

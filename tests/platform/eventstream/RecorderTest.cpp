@@ -7,6 +7,8 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <filesystem>
+
 #include "RecorderFixture.h"
 #include "platform/foundation/SysFaults.h"
 
@@ -887,6 +889,76 @@ TEST_P(RecorderTest, aFolderMayLeaveAtAnyMomentOfALookAndComeBack) {
         removeTree("here/f");
         remove("here/other");
         changes();
+    }
+}
+
+// While the folder of its first name leaves.
+TEST_P(RecorderTest, aFoldersMoveAtAnyMomentTakesAFileWithItThatLosesItsOtherName) {
+    start();
+    for (int moment = 1;; ++moment) {
+        makeFolder("leaving");
+        makeFolder("moving");
+        write("leaving/one");
+        link("leaving/one", "moving/two");
+        changes();
+        list("leaving/one");
+        renamePaths(path("leaving"), outside("leaving"));
+        bool hasMoved = false;
+        {
+            int calls = 0;
+            const sys::FaultInjection faults([&](const char* /*call*/) {
+                if (++calls == moment) {
+                    hasMoved = true;
+                    rename("moving", "moved");
+                }
+                return 0;
+            });
+            ASSERT_TRUE(recorder().drain().ok());
+        }
+        if (!hasMoved) break;
+        EXPECT_THAT(changes(), ::testing::Contains("moved/two")) << moment;
+        EXPECT_TRUE(store().indexed(fileID("moved/two"), [](const IndexedObject&) {})) << moment;
+        expectIndexIsTree();
+        removeTree("moved");
+        changes();
+        expectIndexIsTree();
+        std::filesystem::remove_all(outside("leaving"));
+    }
+}
+
+// And where the name has gone from the folder meanwhile, or the folder with it.
+TEST_P(RecorderTest, aFolderMayGoAtAnyMomentWithTheOtherNameOfAFileThatLeaves) {
+    start();
+    for (const bool goesAlone : {true, false}) {
+        for (int moment = 1;; ++moment) {
+            makeFolder("leaving");
+            makeFolder("going");
+            write("leaving/one");
+            link("leaving/one", "going/two");
+            changes();
+            list("leaving/one");
+            renamePaths(path("leaving"), outside("leaving"));
+            bool hasGone = false;
+            {
+                int calls = 0;
+                const sys::FaultInjection faults([&](const char* /*call*/) {
+                    if (++calls == moment) {
+                        hasGone = true;
+                        if (goesAlone) remove("going/two");
+                        goesAlone ? rename("going", "gone") : renamePaths(path("going"), outside("gone"));
+                    }
+                    return 0;
+                });
+                ASSERT_TRUE(recorder().drain().ok());
+            }
+            changes();
+            expectIndexIsTree();
+            for (const auto& left : {path("gone"), path("going"), outside("gone"), outside("leaving")})
+                std::filesystem::remove_all(left);
+            changes();
+            expectIndexIsTree();
+            if (!hasGone) break;
+        }
     }
 }
 
