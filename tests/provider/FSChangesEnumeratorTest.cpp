@@ -10,6 +10,7 @@
 #include <filesystem>
 #include <random>
 
+#include "platform/revisions/VolumeIndex.h"
 #include "platform/tessel/TesselManager.h"
 #include "provider/HistoryFixture.h"
 #include "provider/KsURL+CdlFileObjectIdentifier.h"
@@ -507,6 +508,28 @@ TEST_F(FSChangesEnumeratorTest, aDocumentThatIsThereGoesByItsDocumentChange) {
     storage_.folder("folder");
     EXPECT_EQ(allChanges(*folder("folder"), tokenAt(since_ + 2).encode()).log,
               (Log{{'d', fmt::format("did={}", static_cast<std::uint32_t>(document))}}));
+}
+
+// What takes it over may be where nothing is listed: a file whose name is the trash's.
+TEST_F(FSChangesEnumeratorTest, aDocumentThatWentToWhatIsListedNowhereIsGone) {
+    storage_.file(".Trash~");
+    storage_.file(".Trash");
+    record(".Trash~");
+    record(".Trash");
+    const DocumentID document = documentID(".Trash~");
+    const std::string before = did(".Trash~");
+    IndexChanges changes;
+    changes.handOver(document, FileID{fileID(".Trash")});
+    ASSERT_TRUE(store_->apply(changes, {}).ok());
+    record(".Trash~");
+    changed(".Trash~");
+    documentWent(document, fileID(".Trash~"), fileID(".Trash"));
+    const Log expected{{'u', ".Trash~"}, {'d', before}};
+    EXPECT_EQ(allChanges(*root(), tokenAt(since_).encode()).log, expected);
+    EXPECT_EQ(allChanges(*workingSet(), tokenAt(since_).encode()).log, expected);
+    EXPECT_EQ(log_.count("item is not a directory"), 0U);
+    EXPECT_TRUE(allChanges(*allDirectories(), tokenAt(since_).encode()).log.empty());
+    EXPECT_EQ(log_.count("item is not a directory"), 2U);
 }
 
 // Where a document was that ended with its object, the event before says: elsewhere, nobody need be told.

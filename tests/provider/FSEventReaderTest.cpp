@@ -259,6 +259,15 @@ TEST_F(FSEventReaderTest, readsDocumentChanges) {
     EXPECT_TRUE(log_.contains(LogLevel::debug, "[DEBUG] did delete " + did));
 }
 
+TEST_F(FSEventReaderTest, dropsADocumentOfWhichNoItemIsToBeMade) {
+    storage_.file("a.txt");
+    record("a.txt");
+    documentWent(documentID("a.txt"), 100, fileID("a.txt"));
+    delegate_->itemlessPath = storage_ / "a.txt";
+    const std::string did = fmt::format("did={}", static_cast<std::uint32_t>(documentID("a.txt")));
+    EXPECT_EQ(replayDocuments(), (Strings{"drop " + did, done()}));
+}
+
 TEST_F(FSEventReaderTest, keepsQuietAboutADeletedDocumentUnlessVerbose) {
     documentWent(DocumentID{42}, 100, 0);
     EXPECT_EQ(replay(*reader(FSEventReaderMode::docIDBased, /*verbose=*/false)), (Strings{"delete did=42", done()}));

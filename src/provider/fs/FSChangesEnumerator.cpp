@@ -290,7 +290,9 @@ FSEventReaderDelegate::LookFurther FSChangesEnumerator::readerDidReceiveEvent(FS
 bool FSChangesEnumerator::readerShouldMakeItem(FSEventReader& reader, const Event& /*event*/, const KsURL& entry) {
     reader.assertOnQueue();
     if (container_contents::isListed(container_, entry)) return true;
-    if (container_contents::isOfFoldersOnly(container_) && !entry.ts_isFolder())
+    // Of a document's event that is said when it is dropped.
+    const bool isOfDocument = reader.mode() == FSEventReaderMode::docIDBased;
+    if (!isOfDocument && container_contents::isOfFoldersOnly(container_) && !entry.ts_isFolder())
         logDebug("dropping fsevent at {}; item is not a directory", entry.path());
     return false;
 }

@@ -361,7 +361,12 @@ Result<FSEventReader::Look> FSEventReader::lookAtPath(FSEventReaderDelegate& del
     // It left, and it is here again: whether this is where it is now, another event says.
     if (event.flags & EventFlags::removed)
         return Look{.kind = Look::Kind::dropped, .identifier = std::move(identifier)};
-    if (!delegate.readerShouldMakeItem(*this, event, *found.url)) return Look{};
+    if (!delegate.readerShouldMakeItem(*this, event, *found.url)) {
+        // A document that was another file's was listed as that one.
+        if (mode_ == FSEventReaderMode::docIDBased)
+            return Look{.kind = Look::Kind::dropped, .identifier = std::move(identifier)};
+        return Look{};
+    }
     return Look{.kind = Look::Kind::item, .identifier = std::move(identifier), .entry = std::move(found.url)};
 }
 

@@ -44,7 +44,8 @@ public:
     /// document that no longer exists. "No" where that alone says all that there is to know: nothing more is reported of
     /// the event. Comes some events ahead of what is reported of earlier ones.
     virtual LookFurther readerDidReceiveEvent(FSEventReader& reader, const Event& event, std::string_view path) = 0;
-    /// The object is where the event says. Without an item nothing more is reported of the event.
+    /// The object is where the event says. Without an item nothing more is reported of the event, except of a document's
+    /// that it was dropped.
     virtual bool readerShouldMakeItem(FSEventReader& reader, const Event& event, const KsURL& entry);
 
     // `identifier` is the event's own: of its file ID, or of its document.
