@@ -580,6 +580,66 @@ TEST_F(FSChangesEnumeratorTest, anObjectBelowAFolderThatJustMovedIsNoDeletion) {
     EXPECT_EQ(std::ranges::count(given.deleted, did("moved/a.txt")), 0);
 }
 
+// Nothing tells later of what came into a folder before that moved.
+TEST_F(FSChangesEnumeratorTest, whatCameIntoAFolderThatJustMovedIsTold) {
+    storage_.file("folder/a.txt");
+    storage_.folder("folder/inside");
+    const auto recordAsTheRecorderDoes = [&](std::string_view name, std::string_view parent) {
+        const Result<FileStatus> status = sys::statx(AT_FDCWD, (storage_ / name).c_str());
+        IndexedObject object;
+        object.fileID = FileID{status->fileID};
+        object.birthTime = status->birthStamp();
+        object.parent =
+            parent.empty() ? FileID{sys::statx(AT_FDCWD, storage_.path().c_str())->fileID} : FileID{fileID(parent)};
+        object.name = name.substr(name.rfind('/') + 1);
+        object.kind = kindOf(name);
+        object.changeTime = 1;
+        IndexChanges changes(IndexChanges::Journal::no);
+        changes.put(object);
+        ASSERT_TRUE(store_->apply(changes, {}).ok());
+    };
+    recordAsTheRecorderDoes("folder", "");
+    recordAsTheRecorderDoes("folder/a.txt", "folder");
+    recordAsTheRecorderDoes("folder/inside", "folder");
+    changed("folder/a.txt");
+    changed("folder/inside");
+    std::filesystem::rename(storage_ / "folder", storage_ / "moved");
+    int drains = 0;
+    history_->onDrain([&]() -> Result<void> {
+        if (++drains == 3) recordAsTheRecorderDoes("moved", "");
+        return {};
+    });
+    const GivenChanges given = changes(*workingSet(), tokenAt(since_).encode());
+    EXPECT_EQ(given.updatedNames(), (std::vector<std::string>{"a.txt", "inside"}));
+    EXPECT_TRUE(given.deleted.empty());
+    drains = 0;
+    std::filesystem::rename(storage_ / "moved", storage_ / "again");
+    history_->onDrain([&]() -> Result<void> {
+        if (++drains == 3) recordAsTheRecorderDoes("again", "");
+        return {};
+    });
+    EXPECT_EQ(changes(*allDirectories(), tokenAt(since_).encode()).updatedNames(),
+              (std::vector<std::string>{"inside"}));
+}
+
+// And what came and went is not.
+TEST_F(FSChangesEnumeratorTest, whatNobodyHasSeenIsNoDeletion) {
+    storage_.file("a.txt");
+    const std::uint64_t number = fileID("a.txt");
+    changed("a.txt");
+    ASSERT_EQ(::unlink((storage_ / "a.txt").c_str()), 0);
+    IndexChanges changes(IndexChanges::Journal::no);
+    IndexedObject object;
+    object.fileID = FileID{number};
+    object.parent = FileID{sys::statx(AT_FDCWD, storage_.path().c_str())->fileID};
+    object.name = "a.txt";
+    object.kind = ObjectKind::file;
+    object.changeTime = 1;
+    changes.put(object);
+    ASSERT_TRUE(store_->apply(changes, {}).ok());
+    EXPECT_TRUE(allChanges(*workingSet(), tokenAt(since_).encode()).log.empty());
+}
+
 TEST_F(FSChangesEnumeratorTest, aRecordThatIsWrongForGoodIsADeletion) {
     storage_.file("a.txt");
     record("a.txt");

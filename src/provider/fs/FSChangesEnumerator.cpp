@@ -152,19 +152,21 @@ std::optional<TesselItemIdentifier> FSChangesEnumerator::identifierOf(const Even
     const auto store = RvStorageManager::defaultManager().store();
     if (event.fileID == FileID{} || !store) return std::nullopt;
     DocumentID documentID = event.documentID;
-    if (!(event.flags & EventFlags::removed)) {
-        bool isListed = true;
-        store->indexed(event.fileID, [&](const IndexedObject& object) {
-            isListed = object.isListed;
-            if (documentID == DocumentID{}) documentID = object.documentID;
-        });
-        // Nobody was ever given an identifier of it.
-        if (!isListed) return std::nullopt;
-    }
+    if (!(event.flags & EventFlags::removed) && documentID == DocumentID{})
+        store->indexed(event.fileID, [&](const IndexedObject& object) { documentID = object.documentID; });
     if (event.kind != ObjectKind::file && event.kind != ObjectKind::package)
         return CdlFileObjectIdentifier::fromFileID(static_cast<std::uint64_t>(event.fileID));
     if (documentID == DocumentID{}) return std::nullopt;
     return CdlFileObjectIdentifier::fromDocumentID(static_cast<std::uint32_t>(documentID));
+}
+
+/// Whether nobody was ever given an identifier of the object, which is still recorded.
+bool FSChangesEnumerator::isNewcomer(const Event& event) {
+    const auto store = RvStorageManager::defaultManager().store();
+    bool isListed = true;
+    if (store && !(event.flags & EventFlags::removed))
+        store->indexed(event.fileID, [&](const IndexedObject& object) { isListed = object.isListed; });
+    return !isListed;
 }
 
 /// Whether the document ended together with its object: the event before says so, and where.
@@ -178,10 +180,10 @@ bool FSChangesEnumerator::isToldByPath(const Event& event) {
 }
 
 Result<FSChangesEnumerator::Answer> FSChangesEnumerator::ask(FSEventReader& reader,
-                                                             const TesselItemIdentifier& identifier) {
+                                                             const TesselItemIdentifier& identifier, Identifier asked) {
     std::string before;
     for (int looks = 1;; ++looks) {
-        Answer answer = TRY(askOnce(reader, identifier));
+        Answer answer = TRY(askOnce(reader, identifier, asked));
         if (answer.kind != Answer::Kind::moving) return answer;
         const bool isStill = std::exchange(before, answer.path) == answer.path;
         if (looks == kLooksMax) {
@@ -197,7 +199,8 @@ Result<FSChangesEnumerator::Answer> FSChangesEnumerator::ask(FSEventReader& read
 /// By the store's records, which are complete while events are recorded: to look for a number that nothing has any more
 /// below all the roots would cost what the tree costs.
 Result<FSChangesEnumerator::Answer> FSChangesEnumerator::askOnce(FSEventReader& reader,
-                                                                 const TesselItemIdentifier& identifier) {
+                                                                 const TesselItemIdentifier& identifier,
+                                                                 Identifier asked) {
     const std::optional<RecordedObject> object = recordedObjectOf(identifier);
     std::optional<std::string> path = object ? recordedPathOf(object->fileID) : std::nullopt;
     if (!path || !container_contents::covers(container_, urls_, *path)) return Answer{};
@@ -205,10 +208,11 @@ Result<FSChangesEnumerator::Answer> FSChangesEnumerator::askOnce(FSEventReader& 
     if (found.standing == FSFoundEntry::Standing::outside) return Answer{};
     if (found.standing == FSFoundEntry::Standing::missing || !isObject(*object, TRY(found.url->status())))
         return Answer{.kind = Answer::Kind::moving, .path = *std::move(path)};
-    return answerOf(*std::move(found.url), identifier);
+    return answerOf(*std::move(found.url), identifier, asked);
 }
 
-Result<FSChangesEnumerator::Answer> FSChangesEnumerator::answerOf(KsURL entry, const TesselItemIdentifier& identifier) {
+Result<FSChangesEnumerator::Answer> FSChangesEnumerator::answerOf(KsURL entry, const TesselItemIdentifier& identifier,
+                                                                  Identifier asked) {
     const bool isEntered = container_contents::isDeep(container_) && entry.ts_isFolder();
     if (!container_contents::isListed(container_, entry)) {
         const bool isTrash = container_contents::isTrashName(entry.lastPathComponent());
@@ -218,7 +222,8 @@ Result<FSChangesEnumerator::Answer> FSChangesEnumerator::answerOf(KsURL entry, c
     entries.push_back(std::move(entry));
     TesselItems items = TRY(container_contents::itemsOf(std::move(entries)));
     if (items.empty() && isEntered) return Answer{.kind = Answer::Kind::passedThrough};
-    if (items.empty() || items.front()->itemIdentifier() != identifier) return Answer{};
+    const bool isAsked = !items.empty() && (asked == Identifier::any || items.front()->itemIdentifier() == identifier);
+    if (!isAsked) return Answer{};
     return Answer{.kind = Answer::Kind::listed, .item = std::move(items.front())};
 }
 
@@ -278,6 +283,17 @@ void FSChangesEnumerator::askAbout(FSEventReader& reader, const Event& event,
     didHandle(reader, event);
 }
 
+/// Of what has just come and is not where the event says: a folder above it may have moved since, of which nothing would
+/// tell that it is in there. Where it is not listed there is nothing to tell.
+void FSChangesEnumerator::askAboutNewcomer(FSEventReader& reader, const Event& event) {
+    const Result<Answer> answer =
+        ask(reader, CdlFileObjectIdentifier::fromFileID(static_cast<std::uint64_t>(event.fileID)), Identifier::any);
+    if (!answer.ok()) return endWithError(reader, answer.error());
+    if (answer->kind == Answer::Kind::moving) return askAgain(reader);
+    if (answer->item) forward(answer->item);
+    didHandle(reader, event);
+}
+
 FSEventReaderDelegate::LookFurther FSChangesEnumerator::readerDidReceiveEvent(FSEventReader& reader, const Event& event,
                                                                               std::string_view path) {
     reader.assertOnQueue();
@@ -317,8 +333,9 @@ void FSChangesEnumerator::readerDidDeleteItem(FSEventReader& reader, const Event
 void FSChangesEnumerator::readerDidDropEvent(FSEventReader& reader, const Event& event,
                                              const TesselItemIdentifier& identifier) {
     reader.assertOnQueue();
-    const bool isOfDocument = reader.mode() == FSEventReaderMode::docIDBased;
-    askAbout(reader, event, isOfDocument ? identifier : identifierOf(event));
+    if (reader.mode() == FSEventReaderMode::docIDBased) return askAbout(reader, event, identifier);
+    if (isNewcomer(event)) return askAboutNewcomer(reader, event);
+    askAbout(reader, event, identifierOf(event));
 }
 
 void FSChangesEnumerator::readerMustScan(FSEventReader& reader, const Event& event) {

@@ -82,10 +82,15 @@ private:
     Result<void> forwardMoved(const Event& event, std::shared_ptr<const TesselItem> item);
     static bool leftTrash(const Event& event);
     static bool isToldByPath(const Event& event);
-    Result<Answer> ask(FSEventReader& reader, const TesselItemIdentifier& identifier);
-    Result<Answer> askOnce(FSEventReader& reader, const TesselItemIdentifier& identifier);
-    Result<Answer> answerOf(KsURL entry, const TesselItemIdentifier& identifier);
+    /// Whether the object is asked for under the identifier alone, or under whatever it is listed by.
+    enum class Identifier { thatOne, any };
+    Result<Answer> ask(FSEventReader& reader, const TesselItemIdentifier& identifier,
+                       Identifier asked = Identifier::thatOne);
+    Result<Answer> askOnce(FSEventReader& reader, const TesselItemIdentifier& identifier, Identifier asked);
+    Result<Answer> answerOf(KsURL entry, const TesselItemIdentifier& identifier, Identifier asked);
     void askAbout(FSEventReader& reader, const Event& event, const std::optional<TesselItemIdentifier>& identifier);
+    void askAboutNewcomer(FSEventReader& reader, const Event& event);
+    static bool isNewcomer(const Event& event);
 
     // What is forwarded.
     bool isBatchFull() const;
