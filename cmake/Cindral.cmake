@@ -59,7 +59,7 @@ function(cindral_tests name)
   target_include_directories(${name} PRIVATE ${CMAKE_SOURCE_DIR}/tests)
   target_link_libraries(${name} PRIVATE cindral_test_support cindral_test_options GTest::gtest GTest::gmock ${arg_DEPENDS})
   target_precompile_headers(${name} REUSE_FROM cindral_test_support)
-  gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST PROPERTIES TIMEOUT 300)
+  gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST NO_PRETTY_VALUES PROPERTIES TIMEOUT 300)
 endfunction()
 
 # cindral_fuzz_target(NAME [DEPENDS library...]): NAME.cpp with LLVMFuzzerTestOneInput. Built with libFuzzer when asked;
