@@ -35,6 +35,8 @@ constexpr int kAttemptsMax = 6;
 constexpr int kPutOffMax = 3;
 // While folders are on their way to their places, the index may have one below another and that one below it.
 constexpr std::size_t kLevelsMax = 4'096;
+// No object's: of one that is recorded where it is only supposed to be. (0 is of one that nobody has looked at.)
+constexpr std::int64_t kSupposedStamp = 1;
 // A number given to an object younger than this was given while it was being saved.
 constexpr std::int64_t kYoungNanoseconds = 60'000'000'000;
 
@@ -236,7 +238,11 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
     if (holds(departure.parent, departure.name, departure.fileID, departure.birthTime)) return {};
     entriesChanged(departure.parent);
     const bool hadOtherNames = !known->isFolder() && mayHaveOtherNames(departure.fileID, known->object.hasOtherNames);
-    if (hadOtherNames && keepUnderOtherName(departure.fileID, FileID{})) return {};
+    if (hadOtherNames) {
+        // Which folders are still there decides, as far as that is known.
+        TRY(flush());
+        if (keepUnderOtherName(departure.fileID, FileID{})) return {};
+    }
     if (known->object.documentID != DocumentID{}) {
         recent_.add(departure.parent, departure.name, known->object.documentID, options_.now());
     }
@@ -247,17 +253,20 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
     } else if (hadOtherNames) {
         forgetWatch(departure.fileID);
     }
-    // Whoever takes its document over does so before it is gone.
-    for (auto at = replacements_.begin(); at != replacements_.end(); ++at) {
-        if (at->document != known->object.documentID || at->document == DocumentID{}) continue;
-        const Replacement replacement = std::move(*at);
-        replacements_.erase(at);
-        TRY(takeOver(replacement.document, replacement.parent, replacement.name, replacement.newcomer));
-        break;
-    }
+    TRY(takeOverFrom(*known));
     placed_.erase(departure.fileID);
     changes().remove(departure.fileID);
     return {};
+}
+
+/// Whoever takes its document over does so before it is gone.
+Result<void> IndexKeeper::takeOverFrom(const Known& leaving) {
+    const DocumentID document = leaving.object.documentID;
+    const auto found = std::ranges::find(replacements_, document, &Replacement::document);
+    if (document == DocumentID{} || found == replacements_.end()) return {};
+    const Replacement replacement = std::move(*found);
+    replacements_.erase(found);
+    return takeOver(replacement.document, replacement.parent, replacement.name, replacement.newcomer);
 }
 
 /// Also where it was last seen with one: a rename over a name counts it off while the file can still be met under it.
@@ -292,7 +301,7 @@ void IndexKeeper::recordUnderName(const Known& known, const VolumeStore::Name& n
     changes().removeName(known.object.fileID, name.parent, name.name);
     Known there{known.object, name.name};
     there.object.parent = name.parent;
-    there.object.changeTime = 0;
+    there.object.changeTime = kSupposedStamp;
     IndexedObject object = there.object;
     object.name = there.name;
     changes().put(object);
@@ -594,18 +603,27 @@ void IndexKeeper::arrived(FileID parent, std::string_view name, FileID newcomer)
 }
 
 Result<void> IndexKeeper::resolveReplacements() {
-    for (const Replacement& replacement : std::exchange(replacements_, {})) {
+    if (replacements_.empty()) return {};
+    // Who has just been given up holds no document.
+    TRY(flush());
+    std::vector<Replacement> undecided;
+    for (Replacement& replacement : std::exchange(replacements_, {})) {
         const auto document = store_.document(replacement.document);
         if (!document) continue;
         const std::optional<Known> holder = find(document->fileID);
         const bool isHeld = holder && holder->object.documentID == replacement.document &&
                             holder->object.birthTime == document->birthTime;
+        if (isHeld && holder->object.changeTime == kSupposedStamp) {
+            undecided.push_back(std::move(replacement));
+            continue;
+        }
         // The document is still somebody's: only a backup gives it away.
         const bool isBackup =
             isHeld && holder->object.parent == replacement.parent && isBackupName(holder->name, replacement.name);
         if (isHeld && !isBackup) continue;
         TRY(takeOver(replacement.document, replacement.parent, replacement.name, replacement.newcomer));
     }
+    std::ranges::move(undecided, std::back_inserter(replacements_));
     return {};
 }
 

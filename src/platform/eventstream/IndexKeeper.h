@@ -112,6 +112,7 @@ private:
     Result<void> lookAtObject(FileID fileID);
     Result<void> endRound(bool isQuiet);
     Result<void> giveUp(const Departure& departure);
+    Result<void> takeOverFrom(const Known& leaving);
     bool mayHaveOtherNames(FileID fileID, bool hadWhenSeen) const;
     bool keepUnderOtherName(FileID fileID, FileID leaving);
     void recordUnderName(const Known& known, const VolumeStore::Name& name);

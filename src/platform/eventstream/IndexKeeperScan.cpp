@@ -398,6 +398,8 @@ Result<void> IndexKeeper::removeBelow(FileID folder) {
         const bool hadOtherNames = !below.isFolder && mayHaveOtherNames(below.fileID, below.hasOtherNames);
         if (hadOtherNames && keepUnderOtherName(below.fileID, folder)) return flushWhenFull();
         if (below.isFolder || hadOtherNames) forgetWatch(below.fileID);
+        const std::optional<Known> known = replacements_.empty() ? std::nullopt : find(below.fileID);
+        if (known) TRY(takeOverFrom(*known));
         changes().remove(below.fileID);
         return flushWhenFull();
     });

@@ -962,6 +962,94 @@ TEST_P(RecorderTest, aFolderMayGoAtAnyMomentWithTheOtherNameOfAFileThatLeaves) {
     }
 }
 
+// The file by itself, and its other names with their folders.
+TEST_P(RecorderTest, aFolderMayGoAtAnyMomentWithAnotherNameOfAFileThatGoes) {
+    start();
+    for (int moment = 1;; ++moment) {
+        makeFolder("first");
+        makeFolder("first/inner");
+        makeFolder("second");
+        makeFolder("second/inner");
+        write("one");
+        link("one", "first/inner/two");
+        link("one", "second/inner/three");
+        changes();
+        list("one");
+        renamePaths(path("first"), outside("first"));
+        bool hasGone = false;
+        {
+            int calls = 0;
+            const sys::FaultInjection faults([&](const char* /*call*/) {
+                if (++calls == moment) {
+                    hasGone = true;
+                    remove("one");
+                    renamePaths(path("second"), outside("second"));
+                }
+                return 0;
+            });
+            ASSERT_TRUE(recorder().drain().ok());
+        }
+        changes();
+        expectIndexIsTree();
+        for (const auto& left : {path("one"), path("second"), outside("first"), outside("second")})
+            std::filesystem::remove_all(left);
+        changes();
+        expectIndexIsTree();
+        if (!hasGone) break;
+    }
+}
+
+TEST_P(RecorderTest, filesWhoseNamesAllWentWhileNobodyLookedAreGone) {
+    constexpr int kFiles = 20;
+    const auto name = [](int i) { return fmt::format("file {}", i); };
+    for (int i = 0; i < kFiles; ++i) {
+        makeFolder(fmt::format("folder {}", i));
+        write(name(i));
+        link(name(i), fmt::format("folder {}/other", i));
+    }
+    start();
+    for (int i = 0; i < kFiles; ++i) list(name(i));
+    stop();
+    for (int i = 0; i < kFiles; ++i) {
+        remove(name(i));
+        removeTree(fmt::format("folder {}", i));
+    }
+    start();
+    expectIndexIsTree();
+    EXPECT_EQ(documentChanges().size(), static_cast<std::size_t>(kFiles)) << "each document has ended";
+}
+
+TEST_P(RecorderTest, aSaveKeepsTheDocumentOfAFileWhoseOtherNameWentWithItsFolder) {
+    constexpr int kFiles = 20;
+    const auto name = [](int i) { return fmt::format("file {}", i); };
+    for (const bool isDown : {true, false}) {
+        for (int i = 0; i < kFiles; ++i) {
+            makeFolder(fmt::format("folder {}", i));
+            write(name(i));
+            link(name(i), fmt::format("folder {}/other", i));
+        }
+        if (isDown) start();
+        changes();
+        std::vector<DocumentID> documents;
+        for (int i = 0; i < kFiles; ++i) documents.push_back(list(name(i)));
+        if (isDown) stop();
+        for (int i = 0; i < kFiles; ++i) {
+            // With a number that nothing had.
+            write(fmt::format("new {}", i), "new");
+        }
+        for (int i = 0; i < kFiles; ++i) {
+            removeTree(fmt::format("folder {}", i));
+            rename(fmt::format("new {}", i), name(i));
+        }
+        if (isDown) start();
+        changes();
+        for (int i = 0; i < kFiles; ++i) EXPECT_EQ(document(name(i)), documents[static_cast<std::size_t>(i)]) << i;
+        expectIndexIsTree();
+        for (int i = 0; i < kFiles; ++i) remove(name(i));
+        changes();
+    }
+}
+
 /// In memory, where a folder is given the stamp of what comes to it or goes from it, which may be one that it bears.
 class RecorderInMemoryTest : public RecorderTest {
 protected:
