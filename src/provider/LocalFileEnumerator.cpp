@@ -8,10 +8,12 @@
 
 #include "platform/eventstream/EventHistory.h"
 #include "platform/eventstream/EventStream.h"
+#include "platform/foundation/Dispatch.h"
 #include "platform/foundation/Log.h"
 #include "platform/foundation/ThreadPool.h"
 #include "platform/revisions/RvStorageManager.h"
 #include "platform/tessel/TesselErrors.h"
+#include "provider/ChangesAhead.h"
 #include "provider/ContainerContents.h"
 #include "provider/LocalChangesObserverContext.h"
 #include "provider/LocalTesselKitError.h"
@@ -43,6 +45,8 @@ EnumeratorOptions pageOptions(const TesselItemIdentifier& container, const std::
 // How far the pages of a follower's listing overlap: so many entries may go while one is read.
 constexpr std::uint64_t kFollowerOverlap = 16;
 constexpr std::size_t kEventsBatchMax = 1'000;
+// Where much is happening, or folders are to be scanned, what is read ahead is mostly read in vain.
+constexpr int kAheadsPassedOver = 16;
 
 /// The event history, where it can tell what happened since the event without a wait for the first look at the roots.
 std::shared_ptr<EventHistory> historyAfter(std::uint64_t eventID) {
@@ -72,21 +76,46 @@ struct LocalFileEnumerator::Gathered {
     bool isFull = false;
 };
 
+class LocalFileEnumerator::ReadingAhead : public TesselChangeObserver {
+public:
+    ReadingAhead(std::shared_ptr<TesselChangeObserver> observer, std::shared_ptr<LocalFileEnumerator> enumerator)
+        : observer_(std::move(observer)), enumerator_(std::move(enumerator)) {}
+
+    void didUpdateItems(TesselItems items) override { observer_->didUpdateItems(std::move(items)); }
+    void didDeleteItemsWithIdentifiers(std::vector<TesselItemIdentifier> identifiers) override {
+        observer_->didDeleteItemsWithIdentifiers(std::move(identifiers));
+    }
+    void finishEnumeratingChangesUpToSyncAnchor(TesselSyncAnchor anchor, bool moreComing) override {
+        // Before the client can ask: it is to wait for what is read ahead.
+        const auto ahead = moreComing ? enumerator_->makeAhead(anchor) : nullptr;
+        observer_->finishEnumeratingChangesUpToSyncAnchor(std::move(anchor), moreComing);
+        if (ahead) enumerator_->fetchChanges(ahead, ahead->since(), /*isAhead=*/true);
+    }
+    void finishEnumeratingWithError(const KsError& error) override { observer_->finishEnumeratingWithError(error); }
+
+private:
+    const std::shared_ptr<TesselChangeObserver> observer_;
+    const std::shared_ptr<LocalFileEnumerator> enumerator_;
+};
+
 std::shared_ptr<LocalFileEnumerator> LocalFileEnumerator::initWithContainer(TesselItemIdentifier container,
-                                                                            std::vector<KsURL> urls) {
+                                                                            std::vector<KsURL> urls,
+                                                                            ReadsAhead readsAhead) {
     if (urls.empty()) {
         std::fputs("can't create enumerator for an empty list of URLs\n", stderr);
         std::abort();
     }
-    return std::shared_ptr<LocalFileEnumerator>(new LocalFileEnumerator(std::move(container), std::move(urls)));
+    return std::shared_ptr<LocalFileEnumerator>(
+        new LocalFileEnumerator(std::move(container), std::move(urls), readsAhead));
 }
 
-LocalFileEnumerator::LocalFileEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls)
+LocalFileEnumerator::LocalFileEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls, ReadsAhead readsAhead)
     : container_(std::move(container)),
       enumeratedItemURL_(urls.size() == 1 ? std::optional(urls.front()) : std::nullopt),
       urls_(std::move(urls)),
       notifier_(makeNotifier(container_, urls_)),
-      shouldUpdateFileIDInPalimp_(container_ == kTesselWorkingSetContainerItemIdentifier) {}
+      shouldUpdateFileIDInPalimp_(container_ == kTesselWorkingSetContainerItemIdentifier),
+      readsAhead_(readsAhead == ReadsAhead::yes) {}
 
 LocalFileEnumerator::~LocalFileEnumerator() {
     if (notifier_) notifier_->stop();
@@ -317,16 +346,72 @@ void LocalFileEnumerator::enumerateChangesForObserver(std::shared_ptr<TesselChan
         return observer->finishEnumeratingWithError(tesselErrorForExpiredPage());
     }
     hostEnumerates();
+    if (!readsAhead_) return fetchChanges(std::move(observer), *token, /*isAhead=*/false);
+    std::shared_ptr<ChangesAhead> ahead;
+    std::uint64_t stops = 0;
+    {
+        const MutexLock lock(mutex_);
+        ahead.swap(ahead_);
+        stops = stops_;
+    }
+    const auto reading = std::make_shared<ReadingAhead>(std::move(observer), shared_from_this());
+    if (!ahead || ahead->since() != *token) return fetchChanges(reading, *token, /*isAhead=*/false);
+    ahead->whenDone([self = shared_from_this(), ahead, reading, stops] { self->handOver(*ahead, reading, stops); });
+}
+
+void LocalFileEnumerator::fetchChanges(std::shared_ptr<TesselChangeObserver> observer, const FSChangeToken& token,
+                                       bool isAhead) {
     const auto context = std::make_shared<LocalChangesObserverContext>(std::move(observer), shared_from_this(),
                                                                        shouldUpdateFileIDInPalimp_);
     const auto enumerator =
-        FSChangesEnumerator::create(container_, urls_, context, *token, EventStream::currentEventID());
+        FSChangesEnumerator::create(container_, urls_, context, token, EventStream::currentEventID(),
+                                    isAhead ? FSChangesEnumerator::Scans::refused : FSChangesEnumerator::Scans::made);
     context->setFSChangesEnumerator(enumerator);
     {
         const MutexLock lock(mutex_);
         enumerators_.insert(enumerator);
     }
     enumerator->start();
+}
+
+/// What is then to be enumerated for the next who asks; null where nothing is to be read ahead.
+std::shared_ptr<ChangesAhead> LocalFileEnumerator::makeAhead(const TesselSyncAnchor& anchor) {
+    std::optional<FSChangeToken> token = FSChangeToken::decode(anchor);
+    if (!token) return nullptr;
+    const auto ahead = std::make_shared<ChangesAhead>(*std::move(token), EventStream::currentEventID());
+    // What nobody came for is let go of without the lock.
+    std::shared_ptr<ChangesAhead> before;
+    const MutexLock lock(mutex_);
+    if (isInvalidated_) return nullptr;
+    if (aheadsToPassOver_ > 0) {
+        --aheadsToPassOver_;
+        return nullptr;
+    }
+    before.swap(ahead_);
+    ahead_ = ahead;
+    return ahead;
+}
+
+void LocalFileEnumerator::handOver(ChangesAhead& ahead, const std::shared_ptr<TesselChangeObserver>& observer,
+                                   std::uint64_t stops) {
+    if (ahead.wasStopped()) return observer->finishEnumeratingWithError(KsError::posix(ECANCELED));
+    const FSChangeToken& token = ahead.since();
+    const auto history = historyAfter(token.streamEventID);
+    const bool isOfNow = history && drain(*history) && history->currentEventID() == ahead.currentEventID() &&
+                         history->canReplayAfter(token.streamEventID);
+    // It waited here, where stop() does not find it.
+    if (this->stops() != stops) return observer->finishEnumeratingWithError(KsError::posix(ECANCELED));
+    if (isOfNow && ahead.handTo(*observer)) return;
+    {
+        const MutexLock lock(mutex_);
+        aheadsToPassOver_ = kAheadsPassedOver;
+    }
+    fetchChanges(observer, token, /*isAhead=*/false);
+}
+
+std::uint64_t LocalFileEnumerator::stops() const {
+    const MutexLock lock(mutex_);
+    return stops_;
 }
 
 void LocalFileEnumerator::currentSyncAnchorWithCompletionHandler(
@@ -363,16 +448,30 @@ void LocalFileEnumerator::start() {
 void LocalFileEnumerator::stop() {
     if (notifier_) notifier_->stop();
     std::set<std::shared_ptr<FSChangesEnumerator>> running;
+    std::shared_ptr<ChangesAhead> ahead;
     {
         const MutexLock lock(mutex_);
+        ++stops_;
         running = enumerators_;
+        ahead.swap(ahead_);
     }
     // Each takes itself out when its observer has been finished.
     for (const auto& enumerator : running) enumerator->stop();
 }
 
+/// Who asked waits for an answer; for what is read ahead, nobody does. It must not outlive the host's history and store.
 void LocalFileEnumerator::invalidate() {
+    std::shared_ptr<ChangesAhead> ahead;
+    {
+        const MutexLock lock(mutex_);
+        isInvalidated_ = true;
+        ahead.swap(ahead_);
+    }
     stop();
+    if (!ahead) return;
+    DispatchSemaphore ended(0);
+    ahead->whenDone([&ended] { ended.signal(); });
+    ended.wait();
 }
 
 }  // namespace cindral

@@ -14,6 +14,7 @@
 
 namespace cindral {
 
+class ChangesAhead;
 class FSChangesEnumerator;
 class FSChangesNotifier;
 
@@ -30,15 +31,21 @@ inline constexpr std::uint64_t kGatherPageEntriesMax = 200;
 /// of several waits until what happened before it is; an anchor and changes wait for all that was complete before they
 /// were asked for.
 ///
+/// While a client reads a batch of changes that is not the last, an enumerator that reads ahead begins on the next.
+///
 /// What each container lists: ContainerContents.h.
 ///
-/// Thread safety: all operations, from any thread. Pages are served on the caller's thread, changes on a queue.
+/// Thread safety: all operations, from any thread. Pages are served on the caller's thread, changes on a queue; what was
+/// read ahead, on the caller's thread as well.
 class LocalFileEnumerator : public TesselEnumerator, public std::enable_shared_from_this<LocalFileEnumerator> {
 public:
+    /// To read ahead is for one that lives from one request to the next.
+    enum class ReadsAhead { no, yes };
     /// An empty list of URLs is a programming error and stops the process. Where there can be no live updates, an error
     /// line says so, and everything else works.
     static std::shared_ptr<LocalFileEnumerator> initWithContainer(TesselItemIdentifier container,
-                                                                  std::vector<KsURL> urls);
+                                                                  std::vector<KsURL> urls,
+                                                                  ReadsAhead readsAhead = ReadsAhead::no);
     ~LocalFileEnumerator() override;
 
     const TesselItemIdentifier& container() const { return container_; }
@@ -61,7 +68,7 @@ public:
     void invalidate() override;
 
 private:
-    LocalFileEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls);
+    LocalFileEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls, ReadsAhead readsAhead);
     std::string enumeratedItemName() const;
     void hostEnumerates() const;
     void gather(TesselEnumerationObserver& observer, FSChangeToken token);
@@ -79,15 +86,30 @@ private:
     Result<std::optional<FSChangeToken>> followingPage(const FSChangeToken& token, const Gathered& gathered) const;
     Result<TesselItems> itemsOf(Gathered gathered) const;
 
+    /// Begins an enumeration of changes.
+    void fetchChanges(std::shared_ptr<TesselChangeObserver> observer, const FSChangeToken& token, bool isAhead);
+    /// Passes changes on, and reads ahead when they have been.
+    class ReadingAhead;
+    std::shared_ptr<ChangesAhead> makeAhead(const TesselSyncAnchor& anchor);
+    /// Gives the observer what was read ahead, or what is found now.
+    /// `stops` is how often enumerations had been stopped when the observer came.
+    void handOver(ChangesAhead& ahead, const std::shared_ptr<TesselChangeObserver>& observer, std::uint64_t stops);
+    std::uint64_t stops() const;
+
     // Constant after construction.
     const TesselItemIdentifier container_;
     const std::optional<KsURL> enumeratedItemURL_;  ///< where a single folder is listed
     const std::vector<KsURL> urls_;
     const std::shared_ptr<FSChangesNotifier> notifier_;
     const bool shouldUpdateFileIDInPalimp_;
+    const bool readsAhead_;
 
-    Mutex mutex_;
+    mutable Mutex mutex_;
     std::set<std::shared_ptr<FSChangesEnumerator>> enumerators_ GUARDED_BY(mutex_);
+    std::shared_ptr<ChangesAhead> ahead_ GUARDED_BY(mutex_);  ///< for the next who asks, under way or done
+    int aheadsToPassOver_ GUARDED_BY(mutex_) = 0;             ///< batches after which nothing is read ahead
+    std::uint64_t stops_ GUARDED_BY(mutex_) = 0;
+    bool isInvalidated_ GUARDED_BY(mutex_) = false;
 };
 
 }  // namespace cindral

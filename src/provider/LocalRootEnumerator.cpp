@@ -87,7 +87,8 @@ LocalRootEnumerator::LocalRootEnumerator(TesselItemIdentifier container)
     : container_(std::move(container)),
       appLibraryManager_(
           makeManager(isWorkingSet() ? LocalAppLibraryCacheSource::workingSet : LocalAppLibraryCacheSource::main)),
-      localFileEnumerator_(LocalFileEnumerator::initWithContainer(container_, monitoredRoots())) {}
+      localFileEnumerator_(
+          LocalFileEnumerator::initWithContainer(container_, monitoredRoots(), LocalFileEnumerator::ReadsAhead::yes)) {}
 
 std::vector<KsURL> LocalRootEnumerator::monitoredRoots() const {
     std::vector<KsURL> roots = appLibraryManager_->rootURLs();
@@ -293,7 +294,8 @@ void LocalRootEnumerator::updateMonitoredRoots() {
     std::vector<std::string> texts;
     std::vector<KsURL> roots = monitoredRoots();
     for (const KsURL& root : roots) texts.push_back(root.description());
-    const auto current = LocalFileEnumerator::initWithContainer(container_, std::move(roots));
+    const auto current =
+        LocalFileEnumerator::initWithContainer(container_, std::move(roots), LocalFileEnumerator::ReadsAhead::yes);
     {
         const MutexLock lock(mutex_);
         localFileEnumerator_ = current;
@@ -347,6 +349,7 @@ void LocalRootEnumerator::stop() {
 
 void LocalRootEnumerator::invalidate() {
     stop();
+    localFileEnumerator()->invalidate();
 }
 
 }  // namespace cindral

@@ -87,21 +87,23 @@ struct FSChangesEnumerator::Answer {
 std::shared_ptr<FSChangesEnumerator> FSChangesEnumerator::create(TesselItemIdentifier container,
                                                                  std::vector<KsURL> urls,
                                                                  std::shared_ptr<TesselChangeObserver> observer,
-                                                                 FSChangeToken token, std::uint64_t currentEventID) {
+                                                                 FSChangeToken token, std::uint64_t currentEventID,
+                                                                 Scans scans) {
     if (urls.empty()) fatal("require at least one URL to init a change enumerator");
     return std::shared_ptr<FSChangesEnumerator>(new FSChangesEnumerator(
-        std::move(container), std::move(urls), std::move(observer), std::move(token), currentEventID));
+        std::move(container), std::move(urls), std::move(observer), std::move(token), currentEventID, scans));
 }
 
 FSChangesEnumerator::FSChangesEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls,
                                          std::shared_ptr<TesselChangeObserver> observer, FSChangeToken token,
-                                         std::uint64_t currentEventID)
+                                         std::uint64_t currentEventID, Scans scans)
     : container_(std::move(container)),
       urls_(std::move(urls)),
       observer_(std::move(observer)),
       receivedToken_(token),
       sinceFSEventID_(token.streamEventID),
       startupFSEventID_(currentEventID),
+      scans_(scans),
       places_(placesOf(urls_)),
       currentToken_(std::move(token)) {}
 
@@ -395,6 +397,7 @@ void FSChangesEnumerator::didHandle(FSEventReader& reader, const Event& event) {
 /// Forwards all that is listed in the folders. Never cut: there is no position within an event.
 Result<void> FSChangesEnumerator::scan(const std::vector<KsURL>& folders) {
     if (folders.empty()) return {};
+    if (scans_ == Scans::refused) return KsError::posix(EAGAIN);
     std::vector<KsURL> entries;
     const auto forwardEntries = [&]() -> Result<void> {
         for (auto& item : TRY(container_contents::itemsOf(std::exchange(entries, {})))) forward(std::move(item));

@@ -40,11 +40,15 @@ struct FSReaderState {
 /// Thread safety: create(), start() and stop(), from any thread. All else on the reader's queue.
 class FSChangesEnumerator : public FSEventReaderDelegate, public std::enable_shared_from_this<FSChangesEnumerator> {
 public:
+    /// Whether folders are scanned where events alone don't tell, which may take as long as all of the container takes,
+    /// or the observer is finished with EAGAIN there.
+    enum class Scans { made, refused };
     /// `token` is the anchor's, `currentEventID` the newest event when the request came. An empty list of URLs is a
     /// programming error and stops the process.
     static std::shared_ptr<FSChangesEnumerator> create(TesselItemIdentifier container, std::vector<KsURL> urls,
                                                        std::shared_ptr<TesselChangeObserver> observer,
-                                                       FSChangeToken token, std::uint64_t currentEventID);
+                                                       FSChangeToken token, std::uint64_t currentEventID,
+                                                       Scans scans = Scans::made);
 
     void start();
     /// Ends the enumeration, unless it has ended: the observer is finished with ECANCELED, soon, on the reader's queue.
@@ -72,7 +76,7 @@ private:
 
     FSChangesEnumerator(TesselItemIdentifier container, std::vector<KsURL> urls,
                         std::shared_ptr<TesselChangeObserver> observer, FSChangeToken token,
-                        std::uint64_t currentEventID);
+                        std::uint64_t currentEventID, Scans scans);
     static std::vector<Place> placesOf(const std::vector<KsURL>& urls);
     std::shared_ptr<FSEventReader> makeReader(FSEventReaderMode mode, bool verbose);
 
@@ -115,6 +119,7 @@ private:
     const FSChangeToken receivedToken_;
     const std::uint64_t sinceFSEventID_;
     const std::uint64_t startupFSEventID_;
+    const Scans scans_;
     const std::vector<Place> places_;
 
     // The current reader's queue's.
