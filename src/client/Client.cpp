@@ -212,6 +212,7 @@ Outcome<Client> Client::start(const Options& options) {
     if (!options.storage.empty()) words.push_back("--storage=" + options.storage);
     if (!options.state.empty()) words.push_back("--state=" + options.state);
     std::vector<char*> arguments;
+    arguments.reserve(words.size() + 1);
     for (std::string& word : words) arguments.push_back(word.data());
     arguments.push_back(nullptr);
 
