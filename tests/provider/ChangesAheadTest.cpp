@@ -78,6 +78,13 @@ protected:
             changed(nameOf(i));
         }
     }
+    void holdTheSecondReading() {
+        onRead_ = [this](int number) {
+            if (number != 2) return;
+            isReading_.signal();
+            mayRead_.wait();
+        };
+    }
     static std::string nameOf(int i) { return fmt::format("file{:03}", i); }
     TesselSyncAnchor begin() const {
         FSChangeToken token;
@@ -90,6 +97,8 @@ protected:
     const std::shared_ptr<LocalFileEnumerator> ahead_ = workingSet(LocalFileEnumerator::ReadsAhead::yes);
     std::atomic<int> reads_ = 0;
     std::function<void(int)> onRead_;  ///< with the number of the reading
+    DispatchSemaphore isReading_{0};
+    DispatchSemaphore mayRead_{0};
 };
 
 TEST_F(ReadingAheadTest, givesTheSameBatchesAndReadsNothingTwice) {
@@ -189,20 +198,15 @@ TEST_F(ReadingAheadTest, leavesAScanToWhoAsks) {
 
 TEST_F(ReadingAheadTest, whoWaitsForWhatIsReadAheadIsToldThatItWasStopped) {
     files(350);
-    DispatchSemaphore isReading(0), mayRead(0);
-    onRead_ = [&](int number) {
-        if (number != 2) return;
-        isReading.signal();
-        mayRead.wait();
-    };
+    holdTheSecondReading();
     const GivenChanges first = changes(*ahead_, begin());
-    isReading.wait();
+    isReading_.wait();
     const auto observer = std::make_shared<RecordingChangeObserver>();
     ahead_->enumerateChangesForObserver(observer, *first.anchor);
     EXPECT_EQ(observer->finishes(), 0);
     ahead_->stop();
     changed(nameOf(1));
-    mayRead.signal();
+    mayRead_.signal();
     const GivenChanges& given = observer->wait();
     ASSERT_TRUE(given.error);
     EXPECT_TRUE(given.error->isPosix(ECANCELED));
@@ -226,21 +230,16 @@ TEST_F(ReadingAheadTest, whoIsBeingGivenWhatWasReadAheadIsStoppedToo) {
 
 TEST_F(ReadingAheadTest, endsWhatItReadsBeforeItIsLetGoOf) {
     files(350);
-    DispatchSemaphore isReading(0), mayRead(0);
-    onRead_ = [&](int number) {
-        if (number != 2) return;
-        isReading.signal();
-        mayRead.wait();
-    };
+    holdTheSecondReading();
     (void)changes(*ahead_, begin());
-    isReading.wait();
+    isReading_.wait();
     std::atomic<bool> isInvalidated = false;
     std::thread thread([&] {
         ahead_->invalidate();
         isInvalidated = true;
     });
     EXPECT_FALSE(isInvalidated);
-    mayRead.signal();
+    mayRead_.signal();
     thread.join();
     EXPECT_EQ(reads_, 2);
 }
