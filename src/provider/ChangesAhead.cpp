@@ -15,11 +15,6 @@ void ChangesAhead::whenDone(std::function<void()> callBack) {
     callBack();
 }
 
-bool ChangesAhead::wasStopped() const {
-    const MutexLock lock(mutex_);
-    return wasStopped_;
-}
-
 bool ChangesAhead::handTo(TesselChangeObserver& observer) {
     std::vector<Call> calls;
     Call end;
@@ -69,10 +64,6 @@ void ChangesAhead::finishEnumeratingChangesUpToSyncAnchor(TesselSyncAnchor ancho
 void ChangesAhead::finishEnumeratingWithError(const KsError& error) {
     // Whoever stopped it meant all who ask. What else failed is tried again.
     if (!error.isPosix(ECANCELED)) return done(nullptr);
-    {
-        const MutexLock lock(mutex_);
-        wasStopped_ = true;
-    }
     done([error](TesselChangeObserver& observer) { observer.finishEnumeratingWithError(error); });
 }
 

@@ -28,8 +28,6 @@ public:
 
     /// Calls back once the enumeration has ended, at once where it has. To be called once.
     void whenDone(std::function<void()> callBack);
-    /// Whether the enumeration was stopped. To be asked when done.
-    bool wasStopped() const;
     /// Ends the observer with what was found. False where that was an error that says nothing to others, and the
     /// observer is as it was. To be called once, when done.
     bool handTo(TesselChangeObserver& observer);
@@ -48,11 +46,10 @@ private:
     const FSChangeToken since_;
     const std::uint64_t currentEventID_;
 
-    mutable Mutex mutex_;
+    Mutex mutex_;
     std::vector<Call> calls_ GUARDED_BY(mutex_);
     Call end_ GUARDED_BY(mutex_);
     bool isDone_ GUARDED_BY(mutex_) = false;
-    bool wasStopped_ GUARDED_BY(mutex_) = false;
     std::function<void()> callBack_ GUARDED_BY(mutex_);
 };
 

@@ -394,12 +394,11 @@ std::shared_ptr<ChangesAhead> LocalFileEnumerator::makeAhead(const TesselSyncAnc
 
 void LocalFileEnumerator::handOver(ChangesAhead& ahead, const std::shared_ptr<TesselChangeObserver>& observer,
                                    std::uint64_t stops) {
-    if (ahead.wasStopped()) return observer->finishEnumeratingWithError(KsError::posix(ECANCELED));
     const FSChangeToken& token = ahead.since();
     const auto history = historyAfter(token.streamEventID);
     const bool isOfNow = history && drain(*history) && history->currentEventID() == ahead.currentEventID() &&
                          history->canReplayAfter(token.streamEventID);
-    // It waited here, where stop() does not find it.
+    // It waited here, where stop() does not find it; or for what was read ahead, which that has stopped.
     if (this->stops() != stops) return observer->finishEnumeratingWithError(KsError::posix(ECANCELED));
     if (isOfNow && ahead.handTo(*observer)) return;
     {

@@ -56,6 +56,22 @@ protected:
             changed(name);
         }
     }
+    /// As the recorder does with what nobody has listed yet.
+    void recordUnlisted(std::string_view name) {
+        const std::filesystem::path path = storage_ / name;
+        const Result<FileStatus> status = sys::statx(AT_FDCWD, path.c_str());
+        const std::string objectName = path.filename();
+        IndexedObject object;
+        object.fileID = FileID{status->fileID};
+        object.birthTime = status->birthStamp();
+        object.parent = FileID{sys::statx(AT_FDCWD, path.parent_path().c_str())->fileID};
+        object.name = objectName;
+        object.kind = kindOf(name);
+        object.changeTime = 1;
+        IndexChanges changes(IndexChanges::Journal::no);
+        changes.put(object);
+        ASSERT_TRUE(store_->apply(changes, {}).ok());
+    }
     std::string did(std::string_view name) const { return identifier(name); }
     std::string fid(std::string_view name) const { return fmt::format("fid={}", fileID(name)); }
     static std::string fid(std::uint64_t number) { return fmt::format("fid={}", number); }
@@ -584,29 +600,15 @@ TEST_F(FSChangesEnumeratorTest, anObjectBelowAFolderThatJustMovedIsNoDeletion) {
 TEST_F(FSChangesEnumeratorTest, whatCameIntoAFolderThatJustMovedIsTold) {
     storage_.file("folder/a.txt");
     storage_.folder("folder/inside");
-    const auto recordAsTheRecorderDoes = [&](std::string_view name, std::string_view parent) {
-        const Result<FileStatus> status = sys::statx(AT_FDCWD, (storage_ / name).c_str());
-        IndexedObject object;
-        object.fileID = FileID{status->fileID};
-        object.birthTime = status->birthStamp();
-        object.parent =
-            parent.empty() ? FileID{sys::statx(AT_FDCWD, storage_.path().c_str())->fileID} : FileID{fileID(parent)};
-        object.name = name.substr(name.rfind('/') + 1);
-        object.kind = kindOf(name);
-        object.changeTime = 1;
-        IndexChanges changes(IndexChanges::Journal::no);
-        changes.put(object);
-        ASSERT_TRUE(store_->apply(changes, {}).ok());
-    };
-    recordAsTheRecorderDoes("folder", "");
-    recordAsTheRecorderDoes("folder/a.txt", "folder");
-    recordAsTheRecorderDoes("folder/inside", "folder");
+    recordUnlisted("folder");
+    recordUnlisted("folder/a.txt");
+    recordUnlisted("folder/inside");
     changed("folder/a.txt");
     changed("folder/inside");
     std::filesystem::rename(storage_ / "folder", storage_ / "moved");
     int drains = 0;
     history_->onDrain([&]() -> Result<void> {
-        if (++drains == 3) recordAsTheRecorderDoes("moved", "");
+        if (++drains == 3) recordUnlisted("moved");
         return {};
     });
     const GivenChanges given = changes(*workingSet(), tokenAt(since_).encode());
@@ -615,7 +617,7 @@ TEST_F(FSChangesEnumeratorTest, whatCameIntoAFolderThatJustMovedIsTold) {
     drains = 0;
     std::filesystem::rename(storage_ / "moved", storage_ / "again");
     history_->onDrain([&]() -> Result<void> {
-        if (++drains == 3) recordAsTheRecorderDoes("again", "");
+        if (++drains == 3) recordUnlisted("again");
         return {};
     });
     EXPECT_EQ(changes(*allDirectories(), tokenAt(since_).encode()).updatedNames(),
@@ -625,18 +627,9 @@ TEST_F(FSChangesEnumeratorTest, whatCameIntoAFolderThatJustMovedIsTold) {
 // And what came and went is not.
 TEST_F(FSChangesEnumeratorTest, whatNobodyHasSeenIsNoDeletion) {
     storage_.file("a.txt");
-    const std::uint64_t number = fileID("a.txt");
+    recordUnlisted("a.txt");
     changed("a.txt");
     ASSERT_EQ(::unlink((storage_ / "a.txt").c_str()), 0);
-    IndexChanges changes(IndexChanges::Journal::no);
-    IndexedObject object;
-    object.fileID = FileID{number};
-    object.parent = FileID{sys::statx(AT_FDCWD, storage_.path().c_str())->fileID};
-    object.name = "a.txt";
-    object.kind = ObjectKind::file;
-    object.changeTime = 1;
-    changes.put(object);
-    ASSERT_TRUE(store_->apply(changes, {}).ok());
     EXPECT_TRUE(allChanges(*workingSet(), tokenAt(since_).encode()).log.empty());
 }
 

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <charconv>
+#include <iterator>
 #include <utility>
 
 #include "platform/eventstream/IndexKeeperTypes.h"
@@ -19,6 +20,7 @@
 namespace cindral {
 
 using index_keeper::kindOf;
+using index_keeper::kLevelsMax;
 using index_keeper::sizeOf;
 using index_keeper::stampOf;
 
@@ -33,8 +35,6 @@ constexpr int kRoundsMax = 8;
 constexpr int kAttemptsMax = 6;
 // A newcomer waits for so many rounds: one that looks, one that gives up what did not turn up.
 constexpr int kPutOffMax = 3;
-// While folders are on their way to their places, the index may have one below another and that one below it.
-constexpr std::size_t kLevelsMax = 4'096;
 // No object's: of one that is recorded where it is only supposed to be. (0 is of one that nobody has looked at.)
 constexpr std::int64_t kSupposedStamp = 1;
 // A number given to an object younger than this was given while it was being saved.

@@ -18,6 +18,7 @@ namespace cindral {
 
 using index_keeper::joined;
 using index_keeper::kindOf;
+using index_keeper::kLevelsMax;
 using index_keeper::sizeOf;
 using index_keeper::stampOf;
 
@@ -468,7 +469,7 @@ std::shared_ptr<IndexKeeper::OpenFolder> IndexKeeper::openFolder(FileID fileID) 
         FileID at = fileID;
         while ((root = rootWithID(at)) == nullptr) {
             const std::optional<Known> known = find(at);
-            if (!known || names.size() > 4'096) return nullptr;
+            if (!known || names.size() > kLevelsMax) return nullptr;
             names.push_back(known->name);
             at = known->object.parent;
         }

@@ -89,6 +89,10 @@ struct IndexKeeper::Context {
 
 namespace index_keeper {
 
+/// Folders from one to its root, at most: while folders are on their way to their places, the index may have one below
+/// another and that one below it.
+inline constexpr std::size_t kLevelsMax = 4'096;
+
 /// A time as the index has it: never 0, which says that nobody looked.
 inline std::int64_t stampOf(const KsDate& time) {
     const auto stamp =

@@ -161,6 +161,18 @@ std::vector<RecorderTest::DocumentChange> RecorderTest::documentChanges() {
     return out;
 }
 
+void RecorderTest::recordAsWithOneName(std::string_view name, std::optional<std::int64_t> changeTime) {
+    IndexChanges seen(IndexChanges::Journal::no);
+    ASSERT_TRUE(store_->indexed(fileID(name), [&](IndexedObject object) {
+        object.name = name.substr(name.rfind('/') + 1);
+        object.changeTime = changeTime.value_or(object.changeTime);
+        object.hasOtherNames = false;
+        seen.put(object);
+    }));
+    const FileID rootID{root_->status.fileID};
+    ASSERT_TRUE(store_->apply(seen, {&rootID, 1}).ok());
+}
+
 void RecorderTest::expectIndexIsTree() {
     ASSERT_TRUE(recorder_->drain().ok());
     std::uint64_t count = 0;

@@ -69,6 +69,8 @@ protected:
         friend bool operator==(const DocumentChange&, const DocumentChange&) = default;
     };
     std::vector<DocumentChange> documentChanges();
+    /// As a look does that came while its names were being counted; with the stamp that it has then, where it is another.
+    void recordAsWithOneName(std::string_view name, std::optional<std::int64_t> changeTime = {});
     /// The index has exactly what the tree has.
     void expectIndexIsTree();
 

@@ -182,16 +182,7 @@ TEST_P(RecorderTest, keepsAFileThatWasLookedAtWhileItGotItsOtherName) {
     link("a", "a~");
     struct stat status {};
     ASSERT_EQ(::stat(path("a").c_str(), &status), 0);
-    IndexChanges seen(IndexChanges::Journal::no);
-    const std::string name = "a";
-    ASSERT_TRUE(store().indexed(fileID("a"), [&](IndexedObject object) {
-        object.name = name;
-        object.changeTime = status.st_ctim.tv_sec * 1'000'000'000 + status.st_ctim.tv_nsec;
-        object.hasOtherNames = false;
-        seen.put(object);
-    }));
-    const FileID rootID{root_->status.fileID};
-    ASSERT_TRUE(store().apply(seen, {&rootID, 1}).ok());
+    recordAsWithOneName("a", status.st_ctim.tv_sec * 1'000'000'000 + status.st_ctim.tv_nsec);
     changes();
     write("new", "new");
     rename("new", "a");
@@ -207,15 +198,7 @@ TEST_P(RecorderTest, keepsAFileThatWasLookedAtWhileItLostOneOfItsNames) {
     link("a", "a~");
     changes();
     // What is found at the name that a rename takes: the file, one name less.
-    IndexChanges seen(IndexChanges::Journal::no);
-    const std::string name = "a";
-    ASSERT_TRUE(store().indexed(fileID("a"), [&](IndexedObject object) {
-        object.name = name;
-        object.hasOtherNames = false;
-        seen.put(object);
-    }));
-    const FileID rootID{root_->status.fileID};
-    ASSERT_TRUE(store().apply(seen, {&rootID, 1}).ok());
+    recordAsWithOneName("a");
     write("new", "new");
     rename("new", "a");
     EXPECT_TRUE(changes().contains("a~"));
@@ -229,15 +212,7 @@ TEST_P(RecorderTest, keepsAFileBelowAFolderThatWentWhereItWasLookedAtWhileItLost
     start();
     link("gone/a", "b");
     changes();
-    IndexChanges seen(IndexChanges::Journal::no);
-    const std::string name = "a";
-    ASSERT_TRUE(store().indexed(fileID("gone/a"), [&](IndexedObject object) {
-        object.name = name;
-        object.hasOtherNames = false;
-        seen.put(object);
-    }));
-    const FileID rootID{root_->status.fileID};
-    ASSERT_TRUE(store().apply(seen, {&rootID, 1}).ok());
+    recordAsWithOneName("gone/a");
     renamePaths(path("gone"), outside("gone"));
     EXPECT_TRUE(changes().contains("b"));
     expectIndexIsTree();
