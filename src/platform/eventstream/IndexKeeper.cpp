@@ -502,9 +502,7 @@ Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, cons
     if (formerHolder) {
         // The number was another object's. That one is gone, wherever it was.
         const DocumentID document = formerHolder->object.documentID;
-        if (document != DocumentID{}) {
-            recent_.add(formerHolder->object.parent, formerHolder->name, document, options_.now());
-        }
+        if (document != DocumentID{}) vacated(*formerHolder);
         entriesChanged(formerHolder->object.parent);
         if (formerHolder->isFolder()) {
             TRY(removeBelow(fileID));
@@ -592,7 +590,16 @@ void IndexKeeper::rememberAttributes(const OpenFolder& folder, std::string_view 
 void IndexKeeper::movedAway(const Known& known, FileID newParent, std::string_view newName) {
     if (known.object.documentID == DocumentID{} || newParent != known.object.parent) return;
     if (!isBackupName(newName, known.name)) return;
-    recent_.add(known.object.parent, known.name, known.object.documentID, options_.now());
+    vacated(known);
+}
+
+/// The document's name is free for the one that replaces it, which may have been met before: a folder is read in an order
+/// of its own, and folders are read for longer than an editor may take.
+void IndexKeeper::vacated(const Known& known) {
+    const DocumentID document = known.object.documentID;
+    recent_.add(known.object.parent, known.name, document, options_.now());
+    if (known.object.changeTime != kSupposedStamp)
+        vacancies_.push_back({known.object.parent, known.name, document, {}});
 }
 
 /// Something is under a name that it did not have before.
@@ -603,9 +610,15 @@ void IndexKeeper::arrived(FileID parent, std::string_view name, FileID newcomer)
 }
 
 Result<void> IndexKeeper::resolveReplacements() {
-    if (replacements_.empty()) return {};
+    if (replacements_.empty() && vacancies_.empty()) return {};
     // Who has just been given up holds no document.
     TRY(flush());
+    for (Replacement& vacancy : std::exchange(vacancies_, {})) {
+        const std::optional<Known> newcomer = findAt(vacancy.parent, vacancy.name);
+        if (!newcomer) continue;
+        vacancy.newcomer = newcomer->object.fileID;
+        replacements_.push_back(std::move(vacancy));
+    }
     std::vector<Replacement> undecided;
     for (Replacement& replacement : std::exchange(replacements_, {})) {
         const auto document = store_.document(replacement.document);

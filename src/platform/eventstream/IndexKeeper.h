@@ -140,6 +140,7 @@ private:
     void rememberAttributes(const OpenFolder& folder, std::string_view name, const Known& known);
 
     // Saves.
+    void vacated(const Known& known);
     void movedAway(const Known& known, FileID newParent, std::string_view newName);
     void arrived(FileID parent, std::string_view name, FileID newcomer);
     Result<void> takeOver(DocumentID document, FileID parent, const std::string& name, FileID newcomer);
@@ -228,6 +229,7 @@ private:
     std::unordered_map<FileID, Known> placed_;  // Puts that are not written yet, of folders and objects that moved.
     std::vector<Departure> departures_;
     std::vector<Replacement> replacements_;
+    std::vector<Replacement> vacancies_;  ///< whose newcomer is known at the end of the round, if there is one
     std::unordered_map<FileID, int> putOff_;  // Newcomers under a number whose former holder is not given up yet.
     std::uint64_t roundNumber_ = 0;
     std::unordered_map<FileID, Context> contexts_;

@@ -15,6 +15,7 @@ public:
     bool try_lock() TRY_ACQUIRE(true) { return mutex_.try_lock(); }  // NOLINT(readability-identifier-naming)
 
 private:
+    friend class Condition;
     std::mutex mutex_;
 };
 
@@ -30,20 +31,34 @@ private:
     Mutex& mutex_;
 };
 
-/// A condition that is waited for under a Mutex.
+/// A condition that is waited for under a Mutex. Waits on the mutex itself: a condition for any kind of lock has a mutex
+/// of its own besides, at which those who wake and those who are woken meet.
 class Condition {
 public:
-    void wait(Mutex& mutex) REQUIRES(mutex) { condition_.wait(mutex); }
+    void wait(Mutex& mutex) REQUIRES(mutex) {
+        Borrowed lock(mutex);
+        condition_.wait(lock.lock);
+    }
     /// False when the deadline passed first.
     template <typename Clock, typename Duration>
     bool waitUntil(Mutex& mutex, const std::chrono::time_point<Clock, Duration>& deadline) REQUIRES(mutex) {
-        return condition_.wait_until(mutex, deadline) == std::cv_status::no_timeout;
+        Borrowed lock(mutex);
+        return condition_.wait_until(lock.lock, deadline) == std::cv_status::no_timeout;
     }
     void notifyOne() { condition_.notify_one(); }
     void notifyAll() { condition_.notify_all(); }
 
 private:
-    std::condition_variable_any condition_;
+    /// The mutex as the standard library's wait wants it: locked before and afterwards.
+    struct Borrowed {
+        explicit Borrowed(Mutex& mutex) : lock(mutex.mutex_, std::adopt_lock) {}
+        ~Borrowed() { lock.release(); }
+        Borrowed(const Borrowed&) = delete;
+        Borrowed& operator=(const Borrowed&) = delete;
+        std::unique_lock<std::mutex> lock;
+    };
+
+    std::condition_variable condition_;
 };
 
 }  // namespace cindral

@@ -3,7 +3,6 @@
 #include <fmt/format.h>
 
 #include <deque>
-#include <optional>
 #include <string_view>
 #include <utility>
 
@@ -153,15 +152,17 @@ void SerialQueue::sync(const Task& task) {
     if (isCurrent()) fatal(fmt::format("queue \"{}\" is entered synchronously from one of its own tasks", label()));
     // The task may destroy the queue.
     const std::shared_ptr<State> state = state_;
-    std::optional<Waiter> waiter;  // Made only where it is needed: a condition allocates.
+    Waiter waiter;
+    bool mustWait = false;
     {
         const MutexLock lock(state->mutex);
-        if (std::exchange(state->isTaken, true)) state->entries.push_back({nullptr, &waiter.emplace()});
+        mustWait = std::exchange(state->isTaken, true);
+        if (mustWait) state->entries.push_back({nullptr, &waiter});
     }
-    if (waiter) {
+    if (mustWait) {
         const ThreadPool::BlockingRegion region;
         const MutexLock lock(state->mutex);
-        while (!waiter->hasTurn) waiter->turn.wait(state->mutex);
+        while (!waiter.hasTurn) waiter.turn.wait(state->mutex);
     }
     {
         const FrameScope frame(*state);

@@ -594,6 +594,93 @@ TEST_P(RecorderTest, handsADocumentOnThroughASaveWhileNobodyRecorded) {
     EXPECT_EQ(this->document("doc"), document);
 }
 
+// Where numbers are given again at once, each file that is saved has the former number of the one before.
+TEST_P(RecorderTest, handsDocumentsOnThroughSavesOneAfterTheOtherWhetherItRecordsOrNot) {
+    constexpr int kCount = 20;
+    makeFolder("f");
+    const auto name = [](int i) { return (i % 2 == 0 ? "doc" : "f/doc") + std::to_string(i); };
+    for (int i = 0; i < kCount; ++i) write(name(i), "old");
+    start();
+    std::vector<DocumentID> documents;
+    for (int i = 0; i < kCount; ++i) documents.push_back(list(name(i)));
+    for (const bool records : {false, true}) {
+        if (!records) stop();
+        for (int i = 0; i < kCount; ++i) {
+            write("f/tmp", "new");
+            rename("f/tmp", name(i));
+        }
+        const std::string another = records ? "another" : "one";
+        write(another, "new");
+        if (!records) start();
+        const Changes all = changes();
+        for (int i = 0; i < kCount; ++i) {
+            EXPECT_TRUE(all.contains(name(i))) << name(i);
+            EXPECT_EQ(document(name(i)), documents[i]) << name(i);
+        }
+        EXPECT_EQ(document(another), kNoDocument);
+        expectIndexIsTree();
+    }
+}
+
+TEST_P(RecorderTest, handsDocumentsOnThatWereRemovedAndCreatedAgainWhileNobodyRecorded) {
+    constexpr int kCount = 20;
+    for (int i = 0; i < kCount; ++i) write("doc" + std::to_string(i), "old");
+    start();
+    std::vector<DocumentID> documents;
+    for (int i = 0; i < kCount; ++i) documents.push_back(list("doc" + std::to_string(i)));
+    stop();
+    for (int i = 0; i < kCount; ++i) remove("doc" + std::to_string(i));
+    for (int i = kCount - 1; i >= 0; --i) write("doc" + std::to_string(i), "new");
+    start();
+    for (int i = 0; i < kCount; ++i) EXPECT_EQ(document("doc" + std::to_string(i)), documents[i]) << i;
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, handsPackagesOnThroughSavesOneAfterTheOtherWhileNobodyRecorded) {
+    constexpr int kCount = 10;
+    const auto name = [](int i) { return "p" + std::to_string(i) + ".folio"; };
+    const auto make = [&](const std::string& folder, std::string_view text) {
+        makeFolder(folder);
+        write(folder + "/inside", text);
+    };
+    for (int i = 0; i < kCount; ++i) make(name(i), "old");
+    start();
+    std::vector<DocumentID> documents;
+    for (int i = 0; i < kCount; ++i) documents.push_back(list(name(i)));
+    stop();
+    for (int i = 0; i < kCount; ++i) {
+        make("saved.folio", "new");
+        rename(name(i), "former.folio");
+        rename("saved.folio", name(i));
+        removeTree("former.folio");
+    }
+    make("another.folio", "new");
+    start();
+    for (int i = 0; i < kCount; ++i) EXPECT_EQ(document(name(i)), documents[i]) << name(i);
+    EXPECT_EQ(document("another.folio"), kNoDocument);
+    expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, handsDocumentsOnWhoseOldFilesBecameBackupsWhileNobodyRecorded) {
+    constexpr int kCount = 20;
+    for (int i = 0; i < kCount; ++i) write("doc" + std::to_string(i), "old");
+    start();
+    std::vector<DocumentID> documents;
+    for (int i = 0; i < kCount; ++i) documents.push_back(list("doc" + std::to_string(i)));
+    stop();
+    for (int i = 0; i < kCount; ++i) {
+        const std::string name = "doc" + std::to_string(i);
+        rename(name, name + "~");
+        if (i % 5 != 0) write(name, "new");
+    }
+    start();
+    for (int i = 0; i < kCount; ++i) {
+        const std::string name = "doc" + std::to_string(i);
+        EXPECT_EQ(document(i % 5 != 0 ? name : name + "~"), documents[i]) << i;
+    }
+    expectIndexIsTree();
+}
+
 TEST_P(RecorderTest, carriesTheAttributesThroughASave) {
     write("doc", "old");
     start();
