@@ -2,7 +2,7 @@
 
 Random operations are made on a storage, behind the host's back, while the host runs, is stopped, killed or suspended.
 After each round of them, clients of some folders, the root, the working set and all directories catch up, each from its
-own anchor, and are held against a fresh listing.
+own anchor, and are held against a fresh listing; and a file that is still there must be the document that it was.
 
     CINDRAL_PROGRAM=build/dev/src/host/cindral python3 -B tests/property/convergence.py --ops 1000000 --recorder inotify
 
@@ -143,6 +143,8 @@ class Convergence:
         self.operations.names_outside_are_told = self.options.model or self.host.call("status")["recorder"] == "fanotify"
         self.whole = [ContainerView(self.host, container) for container in (ROOT, WORKING_SET, ALL_DIRECTORIES)]
         self.folders = []
+        self.documents = {}  # Of each file that was listed: its names, and its identifier.
+        self.newest_document = 0
 
     def _host(self, folder):
         if self.options.model:
@@ -260,6 +262,28 @@ class Convergence:
         lines = view.differences(fresh, lambda item: item.get("fileID") in several, self._had_several_names)
         if lines:
             raise Difference("\n".join([f"the view of {view.container} is not what it lists:", *lines, self._second_look(view, several)]))
+        if view.container == WORKING_SET and self.host.can_end:
+            self._compare_documents(fresh)
+
+    def _compare_documents(self, fresh):
+        """A file that is still there is still the same document, unless another file is that one since."""
+        identifiers = {item["fileID"]: item["identifier"] for item in fresh.values() if item["identifier"].startswith("did=")}
+        left_out = {id(names) for names in self.operations.may_be_another_document}
+        self.operations.may_be_another_document.clear()
+        documents = {}
+        for node in self.tree.lists["file"]:
+            identifier = identifiers.get(os.lstat(self.tree.path(node)).st_ino)
+            # One that has a name outside may have been there with all of them for a while.
+            if identifier is None or any(name.place is None for name in node.names):
+                continue
+            documents[id(node.names)] = node.names, identifier
+            _, before = self.documents.get(id(node.names), (None, identifier))
+            is_new = int(identifier[4:]) > self.newest_document
+            if before != identifier and is_new and before not in fresh and id(node.names) not in left_out:
+                raise Difference(f"{self.tree.path(node)} was {before} and is {identifier}")
+        self.documents = documents
+        self.newest_document = max((int(identifier[4:]) for identifier in identifiers.values()), default=0)
+        self.count["documents compared"] += len(documents)
 
     def _had_several_names(self, item):
         return not self.operations.names_outside_are_told and item.get("fileID") in self.operations.had_several_names

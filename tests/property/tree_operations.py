@@ -66,6 +66,11 @@ class Node:
     def height(self):
         return 1 + max((child.height() for child in self.children.values()), default=0) if self.children else 0
 
+    def and_below(self):
+        yield self
+        for child in self.children.values() if self.children else ():
+            yield from child.and_below()
+
     def fits(self, folder):
         """Whether it can be moved into the folder."""
         return not folder.is_at_or_below(self) and folder.depth() + self.height() < _LEVELS_MAX
@@ -224,6 +229,8 @@ class Operations:
         # folder's events are read; from the next look at the file on it does.
         self.names_outside_are_told = True
         self.had_several_names = set()
+        # Names of files that were out of sight, gave their document to another file, or took another's.
+        self.may_be_another_document = []
         self.growing = [(self.make_file, 10), (self.make_folder, 4), (self.make_tree, 1), (self.move_in, 3), (self.hard_link, 2),
                         (self.symbolic_link, 2), (self.hard_link_outside, 1)]
         self.steady = [(self.write, 6), (self.append, 6), (self.truncate, 3), (self.write_mapped, 3), (self.rename, 8),
@@ -448,6 +455,7 @@ class Operations:
         # Two names of one file: the call does nothing.
         if node is None or node.names is other.names:
             return None
+        self.may_be_another_document.append(node.names)
         return self._move(node, other.parent, other.name)
 
     def rename_folder_over(self):
@@ -529,6 +537,7 @@ class Operations:
         os.rename(path, outside)
         self.tree._detach(node)
         self.tree.outside.append((outside, node))
+        self.may_be_another_document.extend(one.names for one in node.and_below() if one.kind == "file")
         return f"move out {path} -> {outside}"
 
     def move_in(self):
@@ -623,6 +632,7 @@ class Operations:
     def _backup(self, node, affix):
         """The file is under the backup's name, whatever was there before; its own name is free."""
         parent, name = node.parent, node.name
+        self.may_be_another_document.append(node.names)
         os.rename(self.tree.path(node), self.tree.path(parent, name + affix))
         self.tree.place(node, parent, name + affix)
         return parent, name
@@ -679,6 +689,7 @@ class Operations:
         if node.name + b"~" in node.parent.children:
             return
         os.link(path, path + b"~")
+        self.may_be_another_document.append(node.names)
         self.tree.add(node.parent, node.name + b"~", "file", node.names)
         self._save_by_rename(node, path)
 

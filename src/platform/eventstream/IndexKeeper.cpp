@@ -6,6 +6,7 @@
 #include <cerrno>
 #include <charconv>
 #include <iterator>
+#include <span>
 #include <utility>
 
 #include "platform/eventstream/IndexKeeperTypes.h"
@@ -28,17 +29,25 @@ namespace {
 
 // A transaction of so many changes costs little more than its changes.
 constexpr std::size_t kChangesAtOnceMax = 1'000;
-// What comes while a call works is left to the next one after so many rounds. Everything that was complete before the
-// call is done after two: one that looks, one that gives up what did not turn up.
-constexpr int kRoundsMax = 8;
 // A folder that can't be reached so often keeps moving, or can't be opened for a reason of its own.
 constexpr int kAttemptsMax = 6;
-// A newcomer waits for so many rounds: one that looks, one that gives up what did not turn up.
-constexpr int kPutOffMax = 3;
+// What comes while a call works is left to the next one after so many rounds. Everything that was complete before the
+// call is done by then: what is looked for turns up while folders are still reached, or is given up.
+constexpr int kRoundsMax = kAttemptsMax + 2;
+// No file system gives numbers beyond.
+constexpr std::uint64_t kFormerNumber = std::uint64_t{1} << 63;
 // No object's: of one that is recorded where it is only supposed to be. (0 is of one that nobody has looked at.)
 constexpr std::int64_t kSupposedStamp = 1;
 // A number given to an object younger than this was given while it was being saved.
 constexpr std::int64_t kYoungNanoseconds = 60'000'000'000;
+
+FileID formerNumber(FileID fileID) {
+    return FileID{static_cast<std::uint64_t>(fileID) ^ kFormerNumber};
+}
+
+bool isFormer(FileID fileID) {
+    return (static_cast<std::uint64_t>(fileID) & kFormerNumber) != 0;
+}
 
 /// The number in a name such as "#123": what the kernel calls a file that was made without a name.
 std::optional<FileID> numberOfNameless(std::string_view name) {
@@ -101,7 +110,6 @@ Result<void> IndexKeeper::workOff() {
     const Result<void> done = rounds();
     openFolders_.clear();
     contexts_.clear();
-    putOff_.clear();
     if (!done.ok()) {
         // Replacements stay: each is looked at anew before a document is handed over, and can't be found again.
         changes_.reset();
@@ -119,6 +127,7 @@ Result<void> IndexKeeper::rounds() {
     for (int round = 0; round < kRoundsMax; ++round) {
         if (!isFirst && !isDirty() && departures_.empty()) break;
         ++roundNumber_;
+        placedFolder_ = false;
         TRY(lookAtDirt());
         if (isFirst) TRY(compareUnwatched());
         isFirst = false;
@@ -212,12 +221,16 @@ Result<void> IndexKeeper::lookAtObject(FileID fileID) {
     return {};
 }
 
-/// Gives up what did not turn up. In a quiet round nothing is dirty any more, so nothing can; otherwise what was lost in
-/// this round waits for the next.
+/// Gives up what did not turn up. In a quiet round nothing is dirty any more, so nothing can. Otherwise what was lost in
+/// this round waits for the next, and for longer while folders find their places: it may be in one that could not be
+/// reached before the folder above it was.
 Result<void> IndexKeeper::endRound(bool isQuiet) {
+    const auto isOver = [&](std::uint64_t since) {
+        return isQuiet || since + kAttemptsMax <= roundNumber_ || (since < roundNumber_ && !placedFolder_);
+    };
     std::vector<Departure> waiting;
     for (const Departure& departure : std::exchange(departures_, {})) {
-        if (isQuiet || departure.round < roundNumber_) {
+        if (isOver(departure.round)) {
             TRY(giveUp(departure));
             TRY(flushWhenFull());
         } else {
@@ -386,7 +399,6 @@ Result<void> IndexKeeper::see(OpenFolder& folder, std::string_view name, const F
     if (known && known->object.birthTime == status.birthStamp()) {
         return seeKnown(folder, name, status, *known, isHinted);
     }
-    if (isHinted && known && known->isFolder() && TRY(putOff(folder, name, FileID{status.fileID}))) return {};
     return seeNew(folder, name, status, known);
 }
 
@@ -441,7 +453,7 @@ Result<void> IndexKeeper::seeMoved(OpenFolder& folder, std::string_view name, co
     entriesChanged(object.parent);
     entriesChanged(folder.fileID);
     if (!status.isDirectory()) {
-        const bool mayHoldOldName = status.names > 1 && !openFolder(object.parent);
+        const bool mayHoldOldName = status.names > 1 && !isFormer(object.parent) && !openFolder(object.parent);
         put(folder.fileID, name, status, false);
         // Its old folder is on its way to another place, with the name in it.
         if (mayHoldOldName) changes().addName(object.fileID, object.parent, known.name);
@@ -449,6 +461,7 @@ Result<void> IndexKeeper::seeMoved(OpenFolder& folder, std::string_view name, co
         watchNames(folder, name, status);
         return {};
     }
+    placedFolder_ = true;
     noteClosed(object.fileID, isClosed);
     const Context before = contextInside(object.parent, known.name, object.kind);
     const Context after = contextInside(folder.fileID, name, kindOf(status, name));
@@ -482,18 +495,31 @@ Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name
     return {};
 }
 
-/// Whether a newcomer with the number of a folder that is gone waits until what the index has in that one has turned up
-/// where it moved, or was given up: it is no longer there, but may well be somewhere.
-Result<bool> IndexKeeper::putOff(const OpenFolder& folder, std::string_view name, FileID number) {
+/// A folder whose number is another object's now goes on under a number of none, with all that the index has in it: that
+/// is no longer there, but may well be somewhere, until the folder is given up. A process that ends before that finds it
+/// missing when it is started again.
+Result<void> IndexKeeper::keepAsFormer(const Known& folder) {
     TRY(flush());
-    std::vector<Departure> left;
-    TRY(store_.children(number, [&](const IndexedObject& object) {
-        left.push_back({number, std::string(object.name), object.fileID, object.birthTime, roundNumber_});
+    const FileID former = formerNumber(folder.object.fileID);
+    std::vector<Known> moved;
+    TRY(store_.children(folder.object.fileID, [&](const IndexedObject& object) {
+        Known& child = moved.emplace_back(object, std::string(object.name));
+        child.object.parent = former;
     }));
-    if (left.empty() || ++putOff_[number] > kPutOffMax) return false;
-    departures_.insert(departures_.end(), std::make_move_iterator(left.begin()), std::make_move_iterator(left.end()));
-    dirtyFolders_[folder.fileID].names.emplace(name);
-    return true;
+    moved.push_back(folder);
+    moved.back().object.fileID = former;
+    std::ranges::reverse(moved);
+    for (std::size_t at = 0; at < moved.size(); at += kChangesAtOnceMax) {
+        IndexChanges changes(IndexChanges::Journal::no);
+        for (Known& known : std::span(moved).subspan(at, std::min(kChangesAtOnceMax, moved.size() - at))) {
+            known.object.name = known.name;
+            changes.put(known.object);
+        }
+        TRY(store_.apply(changes, rootIDs_));
+    }
+    departures_.push_back({folder.object.parent, folder.name, former, folder.object.birthTime, roundNumber_});
+    contexts_.clear();
+    return {};
 }
 
 Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, const FileStatus& status,
@@ -504,12 +530,7 @@ Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, cons
         const DocumentID document = formerHolder->object.documentID;
         if (document != DocumentID{}) vacated(*formerHolder);
         entriesChanged(formerHolder->object.parent);
-        if (formerHolder->isFolder()) {
-            TRY(removeBelow(fileID));
-            // What was below and turns up elsewhere is new from here on, with all that is in it.
-            TRY(flush());
-            contexts_.clear();
-        }
+        if (formerHolder->isFolder()) TRY(keepAsFormer(*formerHolder));
         forgetWatch(fileID);
         placed_.erase(fileID);
     }
@@ -520,6 +541,7 @@ Result<void> IndexKeeper::seeNew(OpenFolder& folder, std::string_view name, cons
     entriesChanged(folder.fileID);
     arrived(folder.fileID, name, fileID);
     if (isFolder) {
+        placedFolder_ = true;
         if (!isClosed) toScan_.push_back(fileID);
     } else {
         watchNames(folder, name, status);

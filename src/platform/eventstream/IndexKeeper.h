@@ -130,7 +130,7 @@ private:
     Result<void> seeMoved(OpenFolder& folder, std::string_view name, const FileStatus& status, const Known& known,
                           bool isClosed);
     Result<void> seeOtherName(OpenFolder& folder, std::string_view name, const FileStatus& status, const Known& known);
-    Result<bool> putOff(const OpenFolder& folder, std::string_view name, FileID number);
+    Result<void> keepAsFormer(const Known& folder);
     Result<void> seeNew(OpenFolder& folder, std::string_view name, const FileStatus& status,
                         const std::optional<Known>& formerHolder);
     void lost(FileID parent, std::string_view name, const Known& known, std::optional<FileID> newcomer);
@@ -230,8 +230,8 @@ private:
     std::vector<Departure> departures_;
     std::vector<Replacement> replacements_;
     std::vector<Replacement> vacancies_;  ///< whose newcomer is known at the end of the round, if there is one
-    std::unordered_map<FileID, int> putOff_;  // Newcomers under a number whose former holder is not given up yet.
     std::uint64_t roundNumber_ = 0;
+    bool placedFolder_ = false;  // In this round: what could not be reached may be below it.
     std::unordered_map<FileID, Context> contexts_;
     std::unordered_set<FileID> touchedFolders_;
     std::unordered_map<FileID, std::shared_ptr<OpenFolder>> openFolders_;

@@ -7,6 +7,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 
 #include "RecorderFixture.h"
@@ -172,6 +173,70 @@ TEST_P(RecorderTest, keepsWhatLeftAFolderWhoseNumberIsANewOnesNow) {
     EXPECT_EQ(document("found"), kept);
     EXPECT_EQ(document("found too/deep"), deep);
     expectIndexIsTree();
+}
+
+TEST_P(RecorderTest, keepsWhatLeftAFolderWhoseNumberIsAnothersWhetherItRecordsOrNot) {
+    for (const bool records : {true, false}) {
+        // Before and after the others in most orders, below one of them, and no folder at all.
+        for (const std::string newcomer : {"0", "zz", "other/z", "file"}) {
+            const std::string top = newcomer.substr(0, newcomer.find('/')) + (records ? " recorded/" : " compared/");
+            for (const std::string name : {"", "old", "old/sub", "g"}) makeFolder(top + name);
+            for (const std::string name : {"old/a", "old/b", "old/sub/deep", "old/gone", "g/inside"}) write(top + name);
+            start();
+            const DocumentID a = list(top + "old/a"), b = list(top + "old/b"), deep = list(top + "old/sub/deep");
+            const DocumentID inside = list(top + "g/inside");
+            list(top + "old/gone");
+            if (!records) stop();
+            makeFolder(top + "other");
+            rename(top + "old/a", top + "other/a");
+            rename(top + "old/b", top + "b");
+            rename(top + "old/sub", top + "other/sub");
+            removeTree(top + "old");
+            const bool isFile = newcomer == "file";
+            const std::string to = isFile ? top : top + newcomer + "/";
+            isFile ? write(top + newcomer) : makeFolder(top + newcomer);
+            rename(top + "g", to + "g2");
+            if (!records) start();
+            changes();
+            EXPECT_EQ(document(top + "other/a"), a) << top;
+            EXPECT_EQ(document(top + "b"), b) << top;
+            EXPECT_EQ(document(top + "other/sub/deep"), deep) << top;
+            EXPECT_EQ(document(to + "g2/inside"), inside) << top;
+            expectIndexIsTree();
+            stop();
+        }
+    }
+}
+
+// In the order of their numbers each folder may be looked at before those above it are found.
+TEST_P(RecorderTest, keepsWhatMovedIntoFoldersThatMovedIntoEachOtherMeanwhile) {
+    std::vector<std::string> folders{"a", "b", "c", "d"};
+    int round = 0;
+    do {
+        const std::string top = "top" + std::to_string(round++);
+        makeFolder(top);
+        makeFolder(top + "/end");
+        for (const std::string& folder : folders) makeFolder(top + "/" + folder);
+        for (const std::string& folder : folders) write(top + "/" + folder + "/inside");
+        write(top + "/moved");
+        if (recorder_ == nullptr) start();
+        changes();
+        std::vector<DocumentID> inside;
+        for (const std::string& folder : folders) inside.push_back(list(top + "/" + folder + "/inside"));
+        const DocumentID moved = list(top + "/moved");
+        rename(top + "/moved", top + "/a/moved");
+        rename(top + "/a", top + "/b/a");
+        rename(top + "/b", top + "/c/b");
+        rename(top + "/c", top + "/d/c");
+        rename(top + "/d", top + "/end/d");
+        changes();
+        for (std::size_t i = 0; i < folders.size(); ++i) {
+            const std::string below = std::string("d/c/b/a").substr(0, 2 * (std::size_t{'d'} - folders[i][0]) + 1);
+            EXPECT_EQ(document(top + "/end/" + below + "/inside"), inside[i]) << folders[i] << round;
+        }
+        EXPECT_EQ(document(top + "/end/d/c/b/a/moved"), moved) << round;
+        expectIndexIsTree();
+    } while (std::ranges::next_permutation(folders).found);
 }
 
 // A link sets the stamp first, then it counts the name: who looks in between sees one of after and the other of before.
