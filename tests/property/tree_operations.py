@@ -584,6 +584,7 @@ class Operations:
         outside = os.path.join(self.tree.beside_path, b"%d" % self.tree.number)
         os.link(self.tree.path(node), outside)
         self.tree.outside.append((outside, Node(b"", None, "file", node.names)))
+        self.may_be_another_document.append(node.names)
         if not self.names_outside_are_told:
             os.chmod(self.tree.path(node), 0o644)
         return f"link {self.tree.path(node)} {outside}"
