@@ -270,6 +270,8 @@ class Convergence:
         identifiers = {item["fileID"]: item["identifier"] for item in fresh.values() if item["identifier"].startswith("did=")}
         left_out = {id(names) for names in self.operations.may_be_another_document}
         self.operations.may_be_another_document.clear()
+        vacated = set(self.tree.vacated)
+        self.tree.vacated.clear()
         documents = {}
         for node in self.tree.lists["file"]:
             identifier = identifiers.get(os.lstat(self.tree.path(node)).st_ino)
@@ -279,7 +281,8 @@ class Convergence:
             documents[id(node.names)] = node.names, identifier
             _, before = self.documents.get(id(node.names), (None, identifier))
             is_new = int(identifier[4:]) > self.newest_document
-            if before != identifier and is_new and before not in fresh and id(node.names) not in left_out:
+            may_differ = id(node.names) in left_out or (node.parent, node.name) in vacated
+            if before != identifier and is_new and before not in fresh and not may_differ:
                 raise Difference(f"{self.tree.path(node)} was {before} and is {identifier}")
         self.documents = documents
         self.newest_document = max((int(identifier[4:]) for identifier in identifiers.values()), default=0)

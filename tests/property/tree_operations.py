@@ -89,6 +89,7 @@ class Tree:
         self.root = Node(b"", None, "folder")
         self.lists = {"folder": [], "file": [], "link": []}
         self.outside = []
+        self.vacated = set()  # Folders and names that something was removed from: a document's next file takes it over.
         self.number = 0
         self._enter(self.root)
 
@@ -122,6 +123,7 @@ class Tree:
 
     def drop(self, node):
         """The name is gone, and all below it."""
+        self.vacated.add((node.parent, node.name))
         self._detach(node)
         stack = [node]
         while stack:
@@ -535,6 +537,7 @@ class Operations:
         outside = os.path.join(self.tree.beside_path, b"%d" % self.tree.number)
         path = self.tree.path(node)
         os.rename(path, outside)
+        self.tree.vacated.add((node.parent, node.name))
         self.tree._detach(node)
         self.tree.outside.append((outside, node))
         self.may_be_another_document.extend(one.names for one in node.and_below() if one.kind == "file")
