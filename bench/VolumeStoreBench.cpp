@@ -364,8 +364,8 @@ void lookUpChild(benchmark::State& state) {
     std::mt19937_64 random(3);  // NOLINT: the same order in every run.
     for (auto _ : state) {
         const IndexedObject wanted = crawl.object(random() % count);
-        const bool found = store.child(wanted.parent, wanted.name,
-                                       [](const IndexedObject& object) { benchmark::DoNotOptimize(object); });
+        const bool found = store.childrenNamed(wanted.parent, wanted.name,
+                                               [](const IndexedObject& object) { benchmark::DoNotOptimize(object); });
         if (!found) state.SkipWithError("no child");
     }
 }

@@ -183,8 +183,9 @@ Result<void> IndexKeeper::lookAtDirtyFolder(FileID fileID, FolderDirt dirt) {
         TRY(lookAtObject(fileID));
         // Should it be gone from the roots, what changed by a name in it may have another name that is not.
         for (const std::string& name : dirt.names) {
-            const std::optional<Known> known = findAt(fileID, name);
-            if (known && !known->isAt(fileID, name)) dirtyObjects_.insert(known->object.fileID);
+            for (const Known& known : findAt(fileID, name)) {
+                if (!known.isAt(fileID, name)) dirtyObjects_.insert(known.object.fileID);
+            }
         }
         lookAgainLater(fileID, std::move(dirt));
         return {};
@@ -364,18 +365,16 @@ Result<void> IndexKeeper::look(OpenFolder& folder, const std::string& name) {
         logDebug("can't look at {}/{}; {}", folder.path, name, status.error().description());
         return {};
     }
-    const std::optional<Known> former = findAt(folder.fileID, name);
+    const std::vector<Known> formers = findAt(folder.fileID, name);
     const bool isHere = status.ok() && status->device == folder.root->directory->status.device;
+    const auto here = isHere ? std::optional(FileID{status->fileID}) : std::nullopt;
     if (isHere) TRY(see(folder, name, *status, true));
-    if (!former) {
-        if (!isHere) {
-            if (const auto nameless = numberOfNameless(name)) dirtyObjects_.insert(*nameless);
-        }
-        return {};
+    if (formers.empty() && !isHere) {
+        if (const auto nameless = numberOfNameless(name)) dirtyObjects_.insert(*nameless);
     }
-    const bool isSameNumber = isHere && FileID{status->fileID} == former->object.fileID;
-    if (isSameNumber) return {};
-    lost(folder.fileID, name, *former, isHere ? std::optional(FileID{status->fileID}) : std::nullopt);
+    for (const Known& former : formers) {
+        if (former.object.fileID != here) lost(folder.fileID, name, former, here);
+    }
     return {};
 }
 
@@ -480,9 +479,9 @@ Result<void> IndexKeeper::seeMoved(OpenFolder& folder, std::string_view name, co
 Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name, const FileStatus& status,
                                        const Known& known) {
     const IndexedObject& object = known.object;
-    const std::optional<Known> here = findAt(folder.fileID, name);
-    const bool isKnownName = here && here->object.fileID == object.fileID;
-    if (!isKnownName) {
+    const std::vector<Known> here = findAt(folder.fileID, name);
+    const auto isIt = [&](const Known& one) { return one.object.fileID == object.fileID; };
+    if (std::ranges::none_of(here, isIt)) {
         changes().addName(object.fileID, folder.fileID, name);
         entriesChanged(folder.fileID);
     }
@@ -636,10 +635,10 @@ Result<void> IndexKeeper::resolveReplacements() {
     // Who has just been given up holds no document.
     TRY(flush());
     for (Replacement& vacancy : std::exchange(vacancies_, {})) {
-        const std::optional<Known> newcomer = findAt(vacancy.parent, vacancy.name);
-        if (!newcomer) continue;
-        vacancy.newcomer = newcomer->object.fileID;
-        replacements_.push_back(std::move(vacancy));
+        for (const Known& newcomer : findAt(vacancy.parent, vacancy.name)) {
+            vacancy.newcomer = newcomer.object.fileID;
+            replacements_.push_back(vacancy);
+        }
     }
     std::vector<Replacement> undecided;
     for (Replacement& replacement : std::exchange(replacements_, {})) {
@@ -721,18 +720,23 @@ std::optional<IndexKeeper::Known> IndexKeeper::find(FileID fileID) const {
     return found;
 }
 
-std::optional<IndexKeeper::Known> IndexKeeper::findAt(FileID parent, std::string_view name) const {
-    std::optional<Known> found;
-    store_.child(parent, name, [&](const IndexedObject& object) {
-        found.emplace(object, std::string(object.name));
-        found->object.name = {};
+/// Several, while one takes the place of another that is not given up yet.
+std::vector<IndexKeeper::Known> IndexKeeper::findAt(FileID parent, std::string_view name) const {
+    std::vector<Known> found;
+    store_.childrenNamed(parent, name, [&](const IndexedObject& object) {
+        found.emplace_back(object, std::string(object.name)).object.name = {};
     });
-    if (!found) return found;
-    const auto placed = placed_.find(found->object.fileID);
-    if (placed == placed_.end()) return found;
-    // It was here, and has moved since; or its number is another object's.
-    if (found->isAt(parent, name) && !placed->second.isAt(parent, name)) return std::nullopt;
-    return placed->second.object.birthTime == found->object.birthTime ? std::optional(placed->second) : std::nullopt;
+    std::erase_if(found, [&](Known& known) {
+        const auto placed = placed_.find(known.object.fileID);
+        if (placed == placed_.end()) return false;
+        const Known& now = placed->second;
+        // It was here, and has moved since; or its number is another object's.
+        if (known.isAt(parent, name) && !now.isAt(parent, name)) return true;
+        if (now.object.birthTime != known.object.birthTime) return true;
+        known = now;
+        return false;
+    });
+    return found;
 }
 
 IndexKeeper::Context IndexKeeper::contextInside(FileID parent, std::string_view name, ObjectKind kind) {

@@ -189,7 +189,7 @@ private:
 
     // The index, with what is not written yet.
     std::optional<Known> find(FileID fileID) const;
-    std::optional<Known> findAt(FileID parent, std::string_view name) const;
+    std::vector<Known> findAt(FileID parent, std::string_view name) const;
     const Context& contextOf(FileID folder);
     Context contextInside(FileID parent, std::string_view name, ObjectKind kind);
     void packagesChanged(FileID folder);

@@ -68,8 +68,8 @@ Result<void> VolumeStore::indexed(std::span<const FileID> fileIDs,
     return implementation_->indexed(fileIDs, receive);
 }
 
-bool VolumeStore::child(FileID parent, std::string_view name, const ObjectReceiver& receive) const {
-    return implementation_->child(parent, name, receive);
+bool VolumeStore::childrenNamed(FileID parent, std::string_view name, const ObjectReceiver& receive) const {
+    return implementation_->childrenNamed(parent, name, receive);
 }
 
 Result<void> VolumeStore::children(FileID parent, const ObjectReceiver& receive) const {

@@ -151,8 +151,9 @@ public:
     /// Many at once, several times faster: calls back with the place of each file ID, and null for one that is unknown.
     Result<void> indexed(std::span<const FileID> fileIDs,
                          const std::function<void(std::size_t, const IndexedObject*)>& receive) const;
-    /// The object that is recorded under the name, also where that is one of its other names.
-    bool child(FileID parent, std::string_view name, const ObjectReceiver& receive) const;
+    /// Each object that is recorded under the name, also where that is one of its other names. While one takes the place
+    /// of another, there are two. False when there is none.
+    bool childrenNamed(FileID parent, std::string_view name, const ObjectReceiver& receive) const;
     /// Every object whose recorded place is in the folder, in no order. What changes meanwhile is told or not.
     Result<void> children(FileID parent, const ObjectReceiver& receive) const;
     std::uint64_t childCount(FileID parent) const;

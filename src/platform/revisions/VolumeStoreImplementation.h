@@ -54,7 +54,7 @@ public:
     bool indexed(FileID fileID, const ObjectReceiver& receive) const;
     Result<void> indexed(std::span<const FileID> fileIDs,
                          const std::function<void(std::size_t, const IndexedObject*)>& receive) const;
-    bool child(FileID parent, std::string_view name, const ObjectReceiver& receive) const;
+    bool childrenNamed(FileID parent, std::string_view name, const ObjectReceiver& receive) const;
     Result<void> children(FileID parent, const ObjectReceiver& receive) const;
     std::uint64_t childCount(FileID parent) const;
     std::vector<Name> otherNames(FileID fileID) const;
@@ -106,9 +106,10 @@ private:
     template <typename FileIDAt, typename Use>
     Result<void> lookUp(std::size_t count, FileIDAt fileIDAt, Use use) const;
     struct FoundChild;
-    bool findUnsavedChild(FileID parent, std::string_view name, std::uint32_t hash, FoundChild& found) const;
-    bool findSavedChild(FileID parent, std::string_view name, std::uint32_t hash, FoundChild& found) const;
-    bool findByOtherName(FileID parent, std::string_view name, std::uint32_t hash, FoundChild& found) const;
+    class FoundChildren;
+    void findUnsavedChildren(FileID parent, std::string_view name, std::uint32_t hash, FoundChildren& found) const;
+    void findSavedChildren(FileID parent, std::string_view name, std::uint32_t hash, FoundChildren& found) const;
+    void findByOtherName(FileID parent, std::string_view name, std::uint32_t hash, FoundChildren& found) const;
     std::vector<NameKey> namesWithHash(FileID parent, std::uint32_t hash) const;
     std::optional<std::string> nameOf(const NameKey& key) const;
     using Names = std::map<NameKey, std::string>;

@@ -117,56 +117,65 @@ Result<void> VolumeStore::Implementation::indexed(
 
 // MARK: Children
 
-bool VolumeStore::Implementation::child(FileID parent, std::string_view name, const ObjectReceiver& receive) const {
-    const std::uint32_t hash = nameHash(nameHashKey_, name);
-    FoundChild found;
-    if (!findUnsavedChild(parent, name, hash, found) && !findSavedChild(parent, name, hash, found) &&
-        !findByOtherName(parent, name, hash, found)) {
-        return false;
+/// Each once: while the overlays are written, an object may be met in several places.
+class VolumeStore::Implementation::FoundChildren {
+public:
+    void add(FileID fileID, const PackedRecord& record) {
+        const auto isSame = [fileID](const FoundChild& child) { return child.object.fileID == fileID; };
+        if (std::ranges::none_of(children_, isSame)) children_.emplace_back(fileID, record);
     }
-    receive(found.named());
-    return true;
+    bool tell(const ObjectReceiver& receive) {
+        for (FoundChild& child : children_) receive(child.named());
+        return !children_.empty();
+    }
+
+private:
+    std::vector<FoundChild> children_;
+};
+
+bool VolumeStore::Implementation::childrenNamed(FileID parent, std::string_view name,
+                                                const ObjectReceiver& receive) const {
+    const std::uint32_t hash = nameHash(nameHashKey_, name);
+    FoundChildren found;
+    findUnsavedChildren(parent, name, hash, found);
+    findSavedChildren(parent, name, hash, found);
+    findByOtherName(parent, name, hash, found);
+    return found.tell(receive);
 }
 
-bool VolumeStore::Implementation::findUnsavedChild(FileID parent, std::string_view name, std::uint32_t hash,
-                                                   FoundChild& found) const {
-    const MutexLock lock(mutex_);
+void VolumeStore::Implementation::findUnsavedChildren(FileID parent, std::string_view name, std::uint32_t hash,
+                                                      FoundChildren& found) const {
     const auto take = [&](FileID fileID, const PackedRecord& record) {
-        if (record.name != name) return false;
-        found.set(fileID, record);
-        return true;
+        if (record.name == name) found.add(fileID, record);
+        return false;  // There may be more.
     };
-    if (active_->findChild(parent, hash, take)) return true;
+    const MutexLock lock(mutex_);
+    active_->findChild(parent, hash, take);
+    if (!frozen_) return;
     const Overlay& newer = *active_;
-    return frozen_ && frozen_->findChild(parent, hash, [&](FileID fileID, const PackedRecord& record) {
+    frozen_->findChild(parent, hash, [&](FileID fileID, const PackedRecord& record) {
         return !newer.find(fileID).isKnown && take(fileID, record);
     });
 }
 
-bool VolumeStore::Implementation::findSavedChild(FileID parent, std::string_view name, std::uint32_t hash,
-                                                 FoundChild& found) const {
+void VolumeStore::Implementation::findSavedChildren(FileID parent, std::string_view name, std::uint32_t hash,
+                                                    FoundChildren& found) const {
     const auto candidates = noticed(ObjectTables::Snapshot(*tables_).childrenWithHash(parent, hash));
-    if (!candidates.ok()) return false;
+    if (!candidates.ok()) return;
     Reader reader(*this);
     for (const FileID fileID : *candidates) {
-        bool isIt = false;
         reader.read(fileID, [&](const PackedRecord& record) {
-            isIt = record.isAt(parent, name);
-            if (isIt) found.set(fileID, record);
+            if (record.isAt(parent, name)) found.add(fileID, record);
         });
-        if (isIt) return true;
     }
-    return false;
 }
 
-bool VolumeStore::Implementation::findByOtherName(FileID parent, std::string_view name, std::uint32_t hash,
-                                                  FoundChild& found) const {
+void VolumeStore::Implementation::findByOtherName(FileID parent, std::string_view name, std::uint32_t hash,
+                                                  FoundChildren& found) const {
     for (const NameKey& key : namesWithHash(parent, hash)) {
         if (nameOf(key) != name) continue;
-        if (Reader(*this).read(key.fileID, [&](const PackedRecord& record) { found.set(key.fileID, record); }))
-            return true;
+        Reader(*this).read(key.fileID, [&](const PackedRecord& record) { found.add(key.fileID, record); });
     }
-    return false;
 }
 
 Result<void> VolumeStore::Implementation::children(FileID parent, const ObjectReceiver& receive) const {

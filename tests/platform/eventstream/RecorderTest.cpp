@@ -1089,6 +1089,39 @@ TEST_P(RecorderTest, aFolderMayGoAtAnyMomentWithTheOtherNameOfAFileThatLeaves) {
     }
 }
 
+// Until the old file is given up, the index has two under the name.
+TEST_P(RecorderTest, aFileMayLeaveAtAnyMomentAfterItTookAnothersPlace) {
+    start();
+    for (const bool isNew : {true, false}) {
+        for (int moment = 1;; ++moment) {
+            write("a", "old");
+            if (!isNew) write("b", "new");
+            changes();
+            list("a");
+            if (isNew) write("b", "new");
+            rename("b", "a");
+            bool hasGone = false;
+            {
+                int calls = 0;
+                const sys::FaultInjection faults([&](const char* /*call*/) {
+                    if (++calls == moment) {
+                        hasGone = true;
+                        renamePaths(path("a"), outside("a"));
+                    }
+                    return 0;
+                });
+                ASSERT_TRUE(recorder().drain().ok());
+            }
+            changes();
+            expectIndexIsTree();
+            for (const auto& left : {path("a"), outside("a")}) std::filesystem::remove_all(left);
+            changes();
+            expectIndexIsTree();
+            if (!hasGone) break;
+        }
+    }
+}
+
 // The file by itself, and its other names with their folders.
 TEST_P(RecorderTest, aFolderMayGoAtAnyMomentWithAnotherNameOfAFileThatGoes) {
     start();

@@ -134,7 +134,8 @@ protected:
     }
     std::uint64_t childOf(std::uint64_t parent, std::string_view name) const {
         std::uint64_t found = 0;
-        store_->child(FileID{parent}, name, [&](const IndexedObject& object) { found = number(object.fileID); });
+        store_->childrenNamed(FileID{parent}, name,
+                              [&](const IndexedObject& object) { found = number(object.fileID); });
         return found;
     }
     std::vector<std::uint64_t> childrenOf(std::uint64_t parent) const {
@@ -760,7 +761,7 @@ TEST_P(VolumeIndexTest, showsNoEventIDBeforeItsEvent) {
                 std::uint64_t children = 0;
                 store_->children(FileID{3}, [&](const IndexedObject&) { ++children; }).value();
                 if (children > 20 || store_->childCount(FileID{3}) > 20) failed = true;
-                store_->child(FileID{3}, "5", [](const IndexedObject&) {});
+                store_->childrenNamed(FileID{3}, "5", [](const IndexedObject&) {});
             }
         });
         for (std::uint64_t i = 0; i < 600; ++i) {
