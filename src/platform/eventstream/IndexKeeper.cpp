@@ -34,19 +34,15 @@ constexpr int kAttemptsMax = 6;
 // What comes while a call works is left to the next one after so many rounds. Everything that was complete before the
 // call is done by then: what is looked for turns up while folders are still reached, or is given up.
 constexpr int kRoundsMax = kAttemptsMax + 2;
-// No file system gives numbers beyond.
-constexpr std::uint64_t kFormerNumber = std::uint64_t{1} << 63;
+// Numbers from here on are no object's, as far as they are not found to be one's.
+constexpr std::uint64_t kFirstFormer = 0xFFFF'FFFF'0000'0000;
 // No object's: of one that is recorded where it is only supposed to be. (0 is of one that nobody has looked at.)
 constexpr std::int64_t kSupposedStamp = 1;
 // A number given to an object younger than this was given while it was being saved.
 constexpr std::int64_t kYoungNanoseconds = 60'000'000'000;
 
-FileID formerNumber(FileID fileID) {
-    return FileID{static_cast<std::uint64_t>(fileID) ^ kFormerNumber};
-}
-
 bool isFormer(FileID fileID) {
-    return (static_cast<std::uint64_t>(fileID) & kFormerNumber) != 0;
+    return static_cast<std::uint64_t>(fileID) >= kFirstFormer;
 }
 
 /// The number in a name such as "#123": what the kernel calls a file that was made without a name.
@@ -115,6 +111,7 @@ Result<void> IndexKeeper::workOff() {
         changes_.reset();
         placed_.clear();
         departures_.clear();
+        vacancies_.clear();
         everythingIsDirty_ = true;
     }
     return done;
@@ -135,7 +132,7 @@ Result<void> IndexKeeper::rounds() {
         TRY(flush());
         waitForRenames();
         TRY(takeHints());
-        TRY(endRound(!isDirty()));
+        TRY(endRound(!isDirty(), round + 1 == kRoundsMax));
         TRY(flush());
         if (openFailure_) return *std::exchange(openFailure_, std::nullopt);
     }
@@ -223,19 +220,23 @@ Result<void> IndexKeeper::lookAtObject(FileID fileID) {
 }
 
 /// Gives up what did not turn up. In a quiet round nothing is dirty any more, so nothing can. Otherwise what was lost in
-/// this round waits for the next, and for longer while folders find their places: it may be in one that could not be
-/// reached before the folder above it was.
-Result<void> IndexKeeper::endRound(bool isQuiet) {
+/// this round waits for the next, and for longer where folders can't be reached while others are found at new places: it
+/// may be in one that is reached once the folder above it is.
+Result<void> IndexKeeper::endRound(bool isQuiet, bool isLast) {
+    const auto isWaiting = [](const auto& dirty) { return dirty.second.attempts > 0; };
+    const bool mayBeReached =
+        !isLast && placedFolder_ && (!unreached_.empty() || std::ranges::any_of(dirtyFolders_, isWaiting));
     const auto isOver = [&](std::uint64_t since) {
-        return isQuiet || since + kAttemptsMax <= roundNumber_ || (since < roundNumber_ && !placedFolder_);
+        return isQuiet || since + kAttemptsMax <= roundNumber_ || (since < roundNumber_ && !mayBeReached);
     };
+    fillVacancies();
     std::vector<Departure> waiting;
-    for (const Departure& departure : std::exchange(departures_, {})) {
+    for (Departure& departure : std::exchange(departures_, {})) {
         if (isOver(departure.round)) {
             TRY(giveUp(departure));
             TRY(flushWhenFull());
         } else {
-            waiting.push_back(departure);
+            waiting.push_back(std::move(departure));
         }
     }
     departures_.insert(departures_.end(), std::make_move_iterator(waiting.begin()),
@@ -261,6 +262,7 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
         recent_.add(departure.parent, departure.name, known->object.documentID, options_.now());
     }
     if (known->isFolder()) {
+        recent_.forgetFolder(departure.fileID);
         TRY(removeBelow(departure.fileID));
         forgetWatch(departure.fileID);
         contexts_.clear();
@@ -276,11 +278,11 @@ Result<void> IndexKeeper::giveUp(const Departure& departure) {
 /// Whoever takes its document over does so before it is gone.
 Result<void> IndexKeeper::takeOverFrom(const Known& leaving) {
     const DocumentID document = leaving.object.documentID;
-    const auto found = std::ranges::find(replacements_, document, &Replacement::document);
+    const auto found = replacements_.find(document);
     if (document == DocumentID{} || found == replacements_.end()) return {};
-    const Replacement replacement = std::move(*found);
+    const Replacement replacement = std::move(found->second);
     replacements_.erase(found);
-    return takeOver(replacement.document, replacement.parent, replacement.name, replacement.newcomer);
+    return takeOver(document, replacement.parent, replacement.name, replacement.newcomer);
 }
 
 /// Also where it was last seen with one: a rename over a name counts it off while the file can still be met under it.
@@ -389,7 +391,7 @@ void IndexKeeper::lost(FileID parent, std::string_view name, const Known& known,
     }
     departures_.push_back({parent, std::string(name), known.object.fileID, known.object.birthTime, roundNumber_});
     if (newcomer && known.object.documentID != DocumentID{}) {
-        replacements_.push_back({parent, std::string(name), known.object.documentID, *newcomer});
+        replacements_.emplace(known.object.documentID, Replacement{parent, std::string(name), *newcomer});
     }
 }
 
@@ -499,7 +501,9 @@ Result<void> IndexKeeper::seeOtherName(OpenFolder& folder, std::string_view name
 /// missing when it is started again.
 Result<void> IndexKeeper::keepAsFormer(const Known& folder) {
     TRY(flush());
-    const FileID former = formerNumber(folder.object.fileID);
+    FileID former{kFirstFormer + formers_++};
+    while (find(former)) former = FileID{kFirstFormer + formers_++};
+    recent_.forgetFolder(folder.object.fileID);
     std::vector<Known> moved;
     TRY(store_.children(folder.object.fileID, [&](const IndexedObject& object) {
         Known& child = moved.emplace_back(object, std::string(object.name));
@@ -618,46 +622,58 @@ void IndexKeeper::movedAway(const Known& known, FileID newParent, std::string_vi
 /// of its own, and folders are read for longer than an editor may take.
 void IndexKeeper::vacated(const Known& known) {
     const DocumentID document = known.object.documentID;
-    recent_.add(known.object.parent, known.name, document, options_.now());
-    if (known.object.changeTime != kSupposedStamp)
-        vacancies_.push_back({known.object.parent, known.name, document, {}});
+    const FileID parent = known.object.parent;
+    recent_.add(parent, known.name, document, options_.now());
+    if (known.object.changeTime == kSupposedStamp) return;
+    vacancies_.push_back({parent, known.name, document, birthOf(parent)});
+}
+
+/// At the end of the round whoever was there has been met. The number of the folder may be another's by now.
+void IndexKeeper::fillVacancies() {
+    for (const Vacancy& vacancy : std::exchange(vacancies_, {})) {
+        if (birthOf(vacancy.parent) != vacancy.birthOfParent) continue;
+        for (const Known& newcomer : findAt(vacancy.parent, vacancy.name)) {
+            if (newcomer.object.documentID == vacancy.document) continue;
+            replacements_.emplace(vacancy.document, Replacement{vacancy.parent, vacancy.name, newcomer.object.fileID});
+        }
+    }
+}
+
+/// As the index has it; 0 for a root.
+std::int64_t IndexKeeper::birthOf(FileID folder) const {
+    const std::optional<Known> known = rootWithID(folder) == nullptr ? find(folder) : std::nullopt;
+    return known ? known->object.birthTime : 0;
 }
 
 /// Something is under a name that it did not have before.
 void IndexKeeper::arrived(FileID parent, std::string_view name, FileID newcomer) {
     if (const auto document = recent_.take(parent, name, options_.now())) {
-        replacements_.push_back({parent, std::string(name), *document, newcomer});
+        replacements_.emplace(*document, Replacement{parent, std::string(name), newcomer});
     }
 }
 
 Result<void> IndexKeeper::resolveReplacements() {
-    if (replacements_.empty() && vacancies_.empty()) return {};
+    if (replacements_.empty()) return {};
     // Who has just been given up holds no document.
     TRY(flush());
-    for (Replacement& vacancy : std::exchange(vacancies_, {})) {
-        for (const Known& newcomer : findAt(vacancy.parent, vacancy.name)) {
-            vacancy.newcomer = newcomer.object.fileID;
-            replacements_.push_back(vacancy);
-        }
-    }
-    std::vector<Replacement> undecided;
-    for (Replacement& replacement : std::exchange(replacements_, {})) {
-        const auto document = store_.document(replacement.document);
+    std::multimap<DocumentID, Replacement> undecided;
+    for (auto& [documentID, replacement] : std::exchange(replacements_, {})) {
+        const auto document = store_.document(documentID);
         if (!document) continue;
         const std::optional<Known> holder = find(document->fileID);
-        const bool isHeld = holder && holder->object.documentID == replacement.document &&
-                            holder->object.birthTime == document->birthTime;
+        const bool isHeld =
+            holder && holder->object.documentID == documentID && holder->object.birthTime == document->birthTime;
         if (isHeld && holder->object.changeTime == kSupposedStamp) {
-            undecided.push_back(std::move(replacement));
+            undecided.emplace(documentID, std::move(replacement));
             continue;
         }
         // The document is still somebody's: only a backup gives it away.
         const bool isBackup =
             isHeld && holder->object.parent == replacement.parent && isBackupName(holder->name, replacement.name);
         if (isHeld && !isBackup) continue;
-        TRY(takeOver(replacement.document, replacement.parent, replacement.name, replacement.newcomer));
+        TRY(takeOver(documentID, replacement.parent, replacement.name, replacement.newcomer));
     }
-    std::ranges::move(undecided, std::back_inserter(replacements_));
+    replacements_.merge(undecided);
     return {};
 }
 
@@ -772,7 +788,7 @@ void IndexKeeper::packagesChanged(FileID folder) {
 /// A folder that entries came to or went from has changed. Its stamp need not say so: some file systems give it that of
 /// the entry, which may be one that it bears already.
 void IndexKeeper::entriesChanged(FileID folder) {
-    if (journal_ == Journal::no) return;
+    if (journal_ == Journal::no || isFormer(folder)) return;
     if (rootWithID(folder) == nullptr) touchedFolders_.insert(folder);
     packagesChanged(folder);
 }

@@ -3,6 +3,7 @@
 #include <chrono>
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <set>
@@ -92,6 +93,7 @@ private:
     struct Known;        // an object of the index, with its name
     struct Departure;    // a name that lost its object
     struct Replacement;  // a newcomer under a name that a document had
+    struct Vacancy;      // a name that a document had, and whoever is there now
     struct Context;      // what a folder's place means for what is in it
 
     // Hints.
@@ -110,7 +112,7 @@ private:
     void lookAgainLater(FileID fileID, FolderDirt dirt);
     void waitForRenames();
     Result<void> lookAtObject(FileID fileID);
-    Result<void> endRound(bool isQuiet);
+    Result<void> endRound(bool isQuiet, bool isLast);
     Result<void> giveUp(const Departure& departure);
     Result<void> takeOverFrom(const Known& leaving);
     bool mayHaveOtherNames(FileID fileID, bool hadWhenSeen) const;
@@ -141,6 +143,8 @@ private:
 
     // Saves.
     void vacated(const Known& known);
+    void fillVacancies();
+    std::int64_t birthOf(FileID folder) const;
     void movedAway(const Known& known, FileID newParent, std::string_view newName);
     void arrived(FileID parent, std::string_view name, FileID newcomer);
     Result<void> takeOver(DocumentID document, FileID parent, const std::string& name, FileID newcomer);
@@ -228,8 +232,9 @@ private:
     Journal journal_ = Journal::yes;
     std::unordered_map<FileID, Known> placed_;  // Puts that are not written yet, of folders and objects that moved.
     std::vector<Departure> departures_;
-    std::vector<Replacement> replacements_;
-    std::vector<Replacement> vacancies_;  ///< whose newcomer is known at the end of the round, if there is one
+    std::multimap<DocumentID, Replacement> replacements_;
+    std::vector<Vacancy> vacancies_;
+    std::uint64_t formers_ = 0;  // Numbers that former folders were given.
     std::uint64_t roundNumber_ = 0;
     bool placedFolder_ = false;  // In this round: what could not be reached may be below it.
     std::unordered_map<FileID, Context> contexts_;

@@ -398,6 +398,7 @@ Result<void> IndexKeeper::removeBelow(FileID folder) {
     return forEachBelow(folder, [this, folder](const Below& below) -> Result<void> {
         const bool hadOtherNames = !below.isFolder && mayHaveOtherNames(below.fileID, below.hasOtherNames);
         if (hadOtherNames && keepUnderOtherName(below.fileID, folder)) return flushWhenFull();
+        if (below.isFolder) recent_.forgetFolder(below.fileID);
         if (below.isFolder || hadOtherNames) forgetWatch(below.fileID);
         const std::optional<Known> known = replacements_.empty() ? std::nullopt : find(below.fileID);
         if (known) TRY(takeOverFrom(*known));

@@ -72,8 +72,14 @@ struct IndexKeeper::Departure {
 struct IndexKeeper::Replacement {
     FileID parent{};
     std::string name;
-    DocumentID document{};
     FileID newcomer{};
+};
+
+struct IndexKeeper::Vacancy {
+    FileID parent{};
+    std::string name;
+    DocumentID document{};
+    std::int64_t birthOfParent = 0;
 };
 
 struct IndexKeeper::Context {

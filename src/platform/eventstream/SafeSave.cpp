@@ -72,6 +72,13 @@ std::optional<DocumentID> RecentDepartures::take(FileID folder, std::string_view
     return departure.document;
 }
 
+void RecentDepartures::forgetFolder(FileID folder) {
+    const auto first = departures_.lower_bound({folder, std::string()});
+    auto last = first;
+    while (last != departures_.end() && last->first.first == folder) ++last;
+    departures_.erase(first, last);
+}
+
 void RecentDepartures::forgetOld(TimePoint now) {
     // Not at each call: a tree of a million documents that is removed adds them one by one.
     if (now - forgottenAt_ < kWindow) return;

@@ -29,6 +29,8 @@ public:
     void add(FileID folder, std::string_view name, DocumentID document, TimePoint now);
     /// The document that left the name within the window, once.
     std::optional<DocumentID> take(FileID folder, std::string_view name, TimePoint now);
+    /// Of what left a folder that is gone: its number may be another's soon.
+    void forgetFolder(FileID folder);
     void forgetOld(TimePoint now);
     std::size_t size() const { return departures_.size(); }
 

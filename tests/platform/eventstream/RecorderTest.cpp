@@ -687,6 +687,33 @@ TEST_P(RecorderTest, handsDocumentsOnThroughSavesOneAfterTheOtherWhetherItRecord
     }
 }
 
+// The folder's number is another folder's then, where numbers are given again, and the file's own another file's.
+TEST_P(RecorderTest, givesAFileInAnotherFolderANumberOfItsOwnWhetherItRecordsOrNot) {
+    for (const bool records : {true, false}) {
+        for (const std::string other : {"0", "zz"}) {
+            for (const std::string folder : {"00", "z", "zzz"}) {
+                const std::string top = folder + other + (records ? " recorded/" : " compared/");
+                makeFolder(top);
+                makeFolder(top + "f");
+                write(top + "f/a");
+                start();
+                list(top + "f/a");
+                if (!records) stop();
+                removeTree(top + "f");
+                makeFolder(top + folder);
+                write(top + other);
+                write(top + folder + "/a");
+                if (!records) start();
+                changes();
+                EXPECT_EQ(document(top + folder + "/a"), kNoDocument) << top;
+                EXPECT_EQ(document(top + other), kNoDocument) << top;
+                expectIndexIsTree();
+                stop();
+            }
+        }
+    }
+}
+
 TEST_P(RecorderTest, handsDocumentsOnThatWereRemovedAndCreatedAgainWhileNobodyRecorded) {
     constexpr int kCount = 20;
     for (int i = 0; i < kCount; ++i) write("doc" + std::to_string(i), "old");

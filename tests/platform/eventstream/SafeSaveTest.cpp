@@ -50,6 +50,17 @@ TEST_F(RecentDeparturesTest, givesNoneUnderAnotherName) {
     EXPECT_EQ(departures_.take(FileID{2}, "doc", start_), std::nullopt);
 }
 
+TEST_F(RecentDeparturesTest, forgetsWhatLeftAFolderThatIsGone) {
+    for (const std::uint64_t folder : {1, 2, 3}) {
+        departures_.add(FileID{folder}, "", DocumentID{7}, start_);
+        departures_.add(FileID{folder}, "doc", DocumentID{7}, start_);
+    }
+    departures_.forgetFolder(FileID{2});
+    EXPECT_EQ(departures_.size(), 4u);
+    EXPECT_EQ(departures_.take(FileID{2}, "doc", start_), std::nullopt);
+    EXPECT_EQ(departures_.take(FileID{3}, "", start_), DocumentID{7});
+}
+
 TEST_F(RecentDeparturesTest, forgetsWhatIsTooOld) {
     for (int i = 0; i < 100; ++i) departures_.add(FileID{1}, std::to_string(i), DocumentID{7}, start_);
     departures_.add(FileID{1}, "last", DocumentID{8}, start_ + seconds(10));
