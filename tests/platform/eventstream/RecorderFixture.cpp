@@ -122,6 +122,14 @@ DocumentID RecorderTest::list(std::string_view name) {
     return sighting.documentID;
 }
 
+std::vector<DocumentID> RecorderTest::startWithDocuments(int count) {
+    for (int i = 0; i < count; ++i) write("doc" + std::to_string(i), "old");
+    start();
+    std::vector<DocumentID> documents;
+    for (int i = 0; i < count; ++i) documents.push_back(list("doc" + std::to_string(i)));
+    return documents;
+}
+
 FileID RecorderTest::fileID(std::string_view name) const {
     return FileID{sys::statx(AT_FDCWD, path(name).c_str())->fileID};
 }

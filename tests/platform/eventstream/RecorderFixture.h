@@ -55,6 +55,8 @@ protected:
     // What clients do.
     /// Lists a file or folder: it is given its identifier. Answers its document ID, if it is one.
     DocumentID list(std::string_view name);
+    /// The documents of so many files "doc0", "doc1", ..., which are written before it starts to record.
+    std::vector<DocumentID> startWithDocuments(int count);
     FileID fileID(std::string_view name) const;
     /// The document of the file as the index has it now.
     DocumentID document(std::string_view name);

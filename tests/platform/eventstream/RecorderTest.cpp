@@ -716,10 +716,7 @@ TEST_P(RecorderTest, givesAFileInAnotherFolderANumberOfItsOwnWhetherItRecordsOrN
 
 TEST_P(RecorderTest, handsDocumentsOnThatWereRemovedAndCreatedAgainWhileNobodyRecorded) {
     constexpr int kCount = 20;
-    for (int i = 0; i < kCount; ++i) write("doc" + std::to_string(i), "old");
-    start();
-    std::vector<DocumentID> documents;
-    for (int i = 0; i < kCount; ++i) documents.push_back(list("doc" + std::to_string(i)));
+    const std::vector<DocumentID> documents = startWithDocuments(kCount);
     stop();
     for (int i = 0; i < kCount; ++i) remove("doc" + std::to_string(i));
     for (int i = kCount - 1; i >= 0; --i) write("doc" + std::to_string(i), "new");
@@ -755,10 +752,7 @@ TEST_P(RecorderTest, handsPackagesOnThroughSavesOneAfterTheOtherWhileNobodyRecor
 
 TEST_P(RecorderTest, handsDocumentsOnWhoseOldFilesBecameBackupsWhileNobodyRecorded) {
     constexpr int kCount = 20;
-    for (int i = 0; i < kCount; ++i) write("doc" + std::to_string(i), "old");
-    start();
-    std::vector<DocumentID> documents;
-    for (int i = 0; i < kCount; ++i) documents.push_back(list("doc" + std::to_string(i)));
+    const std::vector<DocumentID> documents = startWithDocuments(kCount);
     stop();
     for (int i = 0; i < kCount; ++i) {
         const std::string name = "doc" + std::to_string(i);
