@@ -107,11 +107,11 @@ Result<void> IndexKeeper::workOff() {
     openFolders_.clear();
     contexts_.clear();
     if (!done.ok()) {
-        // Replacements stay: each is looked at anew before a document is handed over, and can't be found again.
+        // Replacements and vacancies stay: each is looked at anew before a document is handed over, and can't be found
+        // again.
         changes_.reset();
         placed_.clear();
         departures_.clear();
-        vacancies_.clear();
         everythingIsDirty_ = true;
     }
     return done;

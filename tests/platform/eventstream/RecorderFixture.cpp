@@ -11,6 +11,7 @@
 #include <fstream>
 
 #include "platform/foundation/Sys.h"
+#include "platform/foundation/SysFaults.h"
 #include "platform/revisions/ObjectFinder.h"
 
 namespace cindral::test {
@@ -120,6 +121,16 @@ DocumentID RecorderTest::list(std::string_view name) {
     sighting.wantsDocumentID = sighting.kind == ObjectKind::file || sighting.kind == ObjectKind::package;
     EXPECT_TRUE(store_->identify({&sighting, 1}).ok());
     return sighting.documentID;
+}
+
+bool RecorderTest::drainAndAct(int moment, const std::function<void()>& act) {
+    int calls = 0;
+    const sys::FaultInjection faults([&](const char* /*call*/) {
+        if (++calls == moment) act();
+        return 0;
+    });
+    EXPECT_TRUE(recorder().drain().ok());
+    return calls >= moment;
 }
 
 std::vector<DocumentID> RecorderTest::startWithDocuments(int count) {

@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <set>
 #include <string>
@@ -51,6 +52,9 @@ protected:
     void link(std::string_view from, std::string_view to);
     void setTag(std::string_view name, std::string_view value);
     std::string tag(std::string_view name) const;
+
+    /// Drains, and acts before the system call of that number, from 1 on. False when there were fewer.
+    bool drainAndAct(int moment, const std::function<void()>& act);
 
     // What clients do.
     /// Lists a file or folder: it is given its identifier. Answers its document ID, if it is one.

@@ -11,7 +11,6 @@
 #include <filesystem>
 
 #include "RecorderFixture.h"
-#include "platform/foundation/SysFaults.h"
 
 namespace cindral::test {
 namespace {
@@ -1015,18 +1014,7 @@ TEST_P(RecorderTest, aFolderMayLeaveAtAnyMomentOfALookAndComeBack) {
         list("here/f/one");
         write("here/f/new");
         write("here/other");
-        bool hasLeft = false;
-        {
-            int calls = 0;
-            const sys::FaultInjection faults([&](const char* /*call*/) {
-                if (++calls == moment) {
-                    hasLeft = true;
-                    renamePaths(path("here/f"), outside("f"));
-                }
-                return 0;
-            });
-            ASSERT_TRUE(recorder().drain().ok());
-        }
+        const bool hasLeft = drainAndAct(moment, [&] { renamePaths(path("here/f"), outside("f")); });
         if (!hasLeft) break;
         changes();
         expectIndexIsTree();
@@ -1051,18 +1039,7 @@ TEST_P(RecorderTest, aFoldersMoveAtAnyMomentTakesAFileWithItThatLosesItsOtherNam
         changes();
         list("leaving/one");
         renamePaths(path("leaving"), outside("leaving"));
-        bool hasMoved = false;
-        {
-            int calls = 0;
-            const sys::FaultInjection faults([&](const char* /*call*/) {
-                if (++calls == moment) {
-                    hasMoved = true;
-                    rename("moving", "moved");
-                }
-                return 0;
-            });
-            ASSERT_TRUE(recorder().drain().ok());
-        }
+        const bool hasMoved = drainAndAct(moment, [&] { rename("moving", "moved"); });
         if (!hasMoved) break;
         EXPECT_THAT(changes(), ::testing::Contains("moved/two")) << moment;
         EXPECT_TRUE(store().indexed(fileID("moved/two"), [](const IndexedObject&) {})) << moment;
@@ -1086,19 +1063,10 @@ TEST_P(RecorderTest, aFolderMayGoAtAnyMomentWithTheOtherNameOfAFileThatLeaves) {
             changes();
             list("leaving/one");
             renamePaths(path("leaving"), outside("leaving"));
-            bool hasGone = false;
-            {
-                int calls = 0;
-                const sys::FaultInjection faults([&](const char* /*call*/) {
-                    if (++calls == moment) {
-                        hasGone = true;
-                        if (goesAlone) remove("going/two");
-                        goesAlone ? rename("going", "gone") : renamePaths(path("going"), outside("gone"));
-                    }
-                    return 0;
-                });
-                ASSERT_TRUE(recorder().drain().ok());
-            }
+            const bool hasGone = drainAndAct(moment, [&] {
+                if (goesAlone) remove("going/two");
+                goesAlone ? rename("going", "gone") : renamePaths(path("going"), outside("gone"));
+            });
             changes();
             expectIndexIsTree();
             for (const auto& left : {path("gone"), path("going"), outside("gone"), outside("leaving")})
@@ -1121,18 +1089,7 @@ TEST_P(RecorderTest, aFileMayLeaveAtAnyMomentAfterItTookAnothersPlace) {
             list("a");
             if (isNew) write("b", "new");
             rename("b", "a");
-            bool hasGone = false;
-            {
-                int calls = 0;
-                const sys::FaultInjection faults([&](const char* /*call*/) {
-                    if (++calls == moment) {
-                        hasGone = true;
-                        renamePaths(path("a"), outside("a"));
-                    }
-                    return 0;
-                });
-                ASSERT_TRUE(recorder().drain().ok());
-            }
+            const bool hasGone = drainAndAct(moment, [&] { renamePaths(path("a"), outside("a")); });
             changes();
             expectIndexIsTree();
             for (const auto& left : {path("a"), outside("a")}) std::filesystem::remove_all(left);
@@ -1157,19 +1114,10 @@ TEST_P(RecorderTest, aFolderMayGoAtAnyMomentWithAnotherNameOfAFileThatGoes) {
         changes();
         list("one");
         renamePaths(path("first"), outside("first"));
-        bool hasGone = false;
-        {
-            int calls = 0;
-            const sys::FaultInjection faults([&](const char* /*call*/) {
-                if (++calls == moment) {
-                    hasGone = true;
-                    remove("one");
-                    renamePaths(path("second"), outside("second"));
-                }
-                return 0;
-            });
-            ASSERT_TRUE(recorder().drain().ok());
-        }
+        const bool hasGone = drainAndAct(moment, [&] {
+            remove("one");
+            renamePaths(path("second"), outside("second"));
+        });
         changes();
         expectIndexIsTree();
         for (const auto& left : {path("one"), path("second"), outside("first"), outside("second")})
