@@ -231,7 +231,7 @@ protected:
 
     // MARK: Steps
 
-    Model::Object randomObject() {
+    Model::Object randomObject(std::uint64_t fileID) {
         static constexpr std::array<ObjectKind, 4> kKinds = {ObjectKind::file, ObjectKind::folder, ObjectKind::package,
                                                              ObjectKind::other};
         Model::Object object;
@@ -239,10 +239,13 @@ protected:
         object.parent = 2 + pick(kFolders);
         object.name = std::string(1 + (oneIn(10) ? pick(300) : 0), static_cast<char>('a' + pick(6)));
         object.kind = kKinds[pick(4)];
+        // Nothing is ever in a file, and the store counts on that.
+        if (canHaveChildren(fileID) && object.kind == ObjectKind::file) object.kind = ObjectKind::folder;
         object.changeTime = oneIn(5) ? 0 : static_cast<std::int64_t>(1 + pick(3));
         object.size = pick(3);
         return object;
     }
+    static bool canHaveChildren(std::uint64_t fileID) { return fileID < 2 + kFolders; }
     std::uint64_t randomFileID() { return 3 + pick(kObjects); }
     std::uint32_t randomDocument() {
         if (model_.documents.empty()) return 1;
@@ -274,7 +277,7 @@ protected:
     bool addOperation(IndexChanges& changes, bool journals) {
         const std::uint64_t fileID = randomFileID();
         const FileID id{fileID};
-        const Model::Object object = randomObject();
+        const Model::Object object = randomObject(fileID);
         switch (pick(12)) {
             case 0:
             case 1:
@@ -328,7 +331,7 @@ protected:
         std::vector<ObjectSighting> page;
         for (std::uint64_t i = 0, count = 1 + pick(6); i < count; ++i) {
             const std::uint64_t fileID = randomFileID();
-            Model::Object object = randomObject();
+            Model::Object object = randomObject(fileID);
             const auto known = model_.objects.find(fileID);
             if (known != model_.objects.end() && !oneIn(3)) object = known->second;
             seen.emplace_back(fileID, object);
