@@ -30,7 +30,8 @@ static void walk(int folder) {
             at += record->length;
             if (strcmp(record->name, ".") == 0 || strcmp(record->name, "..") == 0) continue;
             struct statx status;
-            if (statx(folder, record->name, AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME, &status) != 0) continue;
+            if (statx(folder, record->name, AT_SYMLINK_NOFOLLOW, STATX_BASIC_STATS | STATX_BTIME, &status) != 0)
+                continue;
             ++entries;
             if (!S_ISDIR(status.stx_mode)) continue;
             const int child = openat(folder, record->name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);

@@ -34,10 +34,6 @@ KsError notWell(std::size_t problems) {
     return hostFailure(problems == 1 ? "one thing is not well" : fmt::format("{} things are not well", problems));
 }
 
-bool isExpired(const KsError& error) {
-    return error.is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::pageExpired));
-}
-
 }  // namespace
 
 Commands::Commands(Context context, TextOutput& output)
@@ -244,7 +240,7 @@ Result<void> Commands::changes() {
     TesselSyncAnchor anchor = *anchorBytes;
     ChangePrinter printer = changePrinter();
     const auto followed = follow(printer, container, anchor, /*stop=*/-1);
-    if (!followed.ok() && isExpired(followed.error()))
+    if (!followed.ok() && isExpiredPage(followed.error()))
         return hostFailure(fmt::format("{}: the anchor has expired; list again, and take a new one", subject()));
     if (!followed.ok()) return failure(followed.error());
     printer.printAnchor(anchor);
@@ -265,7 +261,7 @@ Result<void> Commands::watch() {
         // Before what it tells of is asked for: what comes later sets it off again.
         descriptor::clearInterrupt(news);
         const auto followed = follow(printer, container, anchor, stop);
-        if (!followed.ok() && !isExpired(followed.error())) return failure(followed.error());
+        if (!followed.ok() && !isExpiredPage(followed.error())) return failure(followed.error());
         if (!followed.ok()) {
             printer.printLost();
             anchor = TRY(anchorOf(container));

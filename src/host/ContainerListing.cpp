@@ -11,10 +11,6 @@ std::uint64_t hashOf(const TesselItem& item) {
     return std::hash<std::string>{}(item.itemIdentifier());
 }
 
-bool isExpired(const KsError& error) {
-    return error.is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::pageExpired));
-}
-
 }  // namespace
 
 ContainerListing::ContainerListing(ProviderAccess& client, TesselItemIdentifier container)
@@ -36,7 +32,7 @@ Result<std::shared_ptr<const TesselItem>> ContainerListing::next() {
 
 Result<void> ContainerListing::readPage() {
     auto page = client_.itemsOnPage(container_, *nextPage_);
-    if (!page.ok()) return isExpired(page.error()) ? restart(page.error()) : Result<void>(page.error());
+    if (!page.ok()) return isExpiredPage(page.error()) ? restart(page.error()) : Result<void>(page.error());
     items_ = std::move(page->items);
     nextPage_ = std::move(page->nextPage);
     position_ = 0;

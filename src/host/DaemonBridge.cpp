@@ -15,8 +15,6 @@
 namespace cindral {
 namespace {
 
-constexpr std::size_t kReadBytes = 64 << 10;
-
 /// What the thread that passes the input on has, also when nobody waits for it any more.
 struct Way {
     explicit Way(UniqueFd connected) : socket(std::move(connected)) {}
@@ -25,7 +23,7 @@ struct Way {
 };
 
 void passInputOn(int input, Way& way) {
-    std::vector<char> buffer(kReadBytes);
+    std::vector<char> buffer(descriptor::kReadBytes);
     while (true) {
         const auto got = descriptor::read(input, buffer);
         if (!got.ok() || *got == 0) break;
@@ -43,7 +41,7 @@ Result<void> bridgeToDaemon(int input, int output, UniqueFd socket) {
     // It may read for ever: nobody waits for it.
     if (const int error = startBackgroundThread([way, input] { passInputOn(input, *way); }); error != 0)
         return KsError::posix(error);
-    std::vector<char> buffer(kReadBytes);
+    std::vector<char> buffer(descriptor::kReadBytes);
     while (TRY(descriptor::waitForInput(way->socket.get(), output, never.get())) == descriptor::Readiness::input) {
         const auto got = descriptor::read(way->socket.get(), buffer);
         if (!got.ok() || *got == 0) {

@@ -18,7 +18,6 @@
 namespace cindral {
 namespace {
 
-constexpr std::size_t kReadBytes = 64 << 10;
 // The answer to one request may be a batch of thumbnails; a daemon is trusted, its user's own.
 constexpr std::size_t kAnswerBytesMax = std::size_t{1} << 30;
 
@@ -149,7 +148,7 @@ private:
 void DaemonConnection::read() {
     Lines lines(*this);
     LineSplitter splitter(lines, kAnswerBytesMax);
-    std::vector<char> buffer(kReadBytes);
+    std::vector<char> buffer(descriptor::kReadBytes);
     while (true) {
         const auto got = descriptor::read(socket_.get(), buffer);
         if (!got.ok() || *got == 0) break;

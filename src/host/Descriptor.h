@@ -11,6 +11,9 @@
 /// errors are of the POSIX domain.
 namespace cindral::descriptor {
 
+/// A good size of a buffer for lines of requests and answers.
+inline constexpr std::size_t kReadBytes = 64 << 10;
+
 /// Bytes read, at least one; 0 at the end of the stream.
 Result<std::size_t> read(int fd, std::span<char> buffer);
 /// Writes all of it.

@@ -2,6 +2,7 @@
 
 #include <sys/types.h>
 
+#include <chrono>
 #include <optional>
 #include <string>
 
@@ -13,6 +14,8 @@ namespace cindral::local_socket {
 
 /// Connections that wait to be accepted; one more waits for that.
 inline constexpr int kWaitingMax = 4096;
+/// Where nothing can be had for another connection, none is accepted for so long, unless one of those that there are ends.
+inline constexpr std::chrono::seconds kRespite{1};
 
 /// Listens at the path, in place of whatever socket or link was there, in one step: who connects finds the one or the
 /// other. For the owner alone.

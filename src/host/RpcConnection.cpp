@@ -11,7 +11,6 @@
 namespace cindral {
 namespace {
 
-constexpr std::size_t kReadBytes = 64 << 10;
 // A page of a listing fits in the pipe, so that the next one is begun while the client reads.
 constexpr std::size_t kPipeBytes = 1 << 20;
 
@@ -34,7 +33,7 @@ private:
 
 /// Reads until the end of input, or until nobody reads the answers.
 Result<void> readAll(int input, int output, const UniqueFd& interrupt, LineSplitter& lines) {
-    std::vector<char> buffer(kReadBytes);
+    std::vector<char> buffer(descriptor::kReadBytes);
     while (TRY(descriptor::waitForInput(input, output, interrupt.get())) == descriptor::Readiness::input) {
         const std::size_t got = TRY(descriptor::read(input, buffer));
         if (got == 0) {

@@ -20,8 +20,6 @@
 namespace cindral {
 namespace {
 
-// Where nothing can be had for another client, nobody is accepted for so long, unless one of those that there are goes.
-constexpr std::chrono::seconds kRespite{1};
 // How long a client that is about to end by itself may go on after the end has begun.
 constexpr std::chrono::seconds kGrace{5};
 
@@ -143,7 +141,7 @@ void SocketListener::makeDoWithout() {
     auto spare = sys::open("/dev/null", O_RDONLY);
     if (spare.ok()) spare_ = *std::move(spare);
     if (turnedAway.ok()) return;
-    const auto deadline = std::chrono::steady_clock::now() + kRespite;
+    const auto deadline = std::chrono::steady_clock::now() + local_socket::kRespite;
     const MutexLock lock(mutex_);
     if (!isStopping_) (void)changed_.waitUntil(mutex_, deadline);
 }

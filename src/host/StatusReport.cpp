@@ -11,19 +11,15 @@
 namespace cindral {
 namespace {
 
-using Json = nlohmann::ordered_json;
-
-std::string counted(std::uint64_t count, std::string_view one, std::string_view many) {
-    return count == 1 ? fmt::format("1 {}", one) : fmt::format("{} {}", count, many);
-}
+using OrderedJson = nlohmann::ordered_json;
 
 /// Fields of the status, absent ones as nothing.
-class Fields {
+class StatusFields {
 public:
-    explicit Fields(const Json& json) : json_(json) {}
+    explicit StatusFields(const OrderedJson& json) : json_(json) {}
 
     bool has(const char* name) const { return json_.is_object() && json_.contains(name); }
-    Fields operator[](const char* name) const { return Fields(has(name) ? json_[name] : none()); }
+    StatusFields operator[](const char* name) const { return StatusFields(has(name) ? json_[name] : none()); }
     std::string text(const char* name) const {
         return has(name) && json_[name].is_string() ? terminalText(json_[name].get<std::string>()) : "";
     }
@@ -31,14 +27,16 @@ public:
         return has(name) && json_[name].is_number_unsigned() ? json_[name].get<std::uint64_t>() : 0;
     }
     bool flag(const char* name) const { return has(name) && json_[name].is_boolean() && json_[name].get<bool>(); }
-    const Json& list(const char* name) const { return has(name) && json_[name].is_array() ? json_[name] : none(); }
+    const OrderedJson& list(const char* name) const {
+        return has(name) && json_[name].is_array() ? json_[name] : none();
+    }
 
 private:
-    static const Json& none() {
-        static const Json empty = Json::array();
+    static const OrderedJson& none() {
+        static const OrderedJson empty = OrderedJson::array();
         return empty;
     }
-    const Json& json_;
+    const OrderedJson& json_;
 };
 
 std::string momentOf(const std::string& text) {
@@ -46,10 +44,10 @@ std::string momentOf(const std::string& text) {
     return date ? humanMinute(*date) : text;
 }
 
-std::string recorderText(const Fields& fields) {
+std::string recorderText(const StatusFields& fields) {
     std::string text = fields.text("recorder");
     if (const std::string state = fields.text("recorderState"); !state.empty()) text += ", " + state;
-    const Fields watches = fields["watches"];
+    const StatusFields watches = fields["watches"];
     if (watches.number("limit") > 0) {
         text += fmt::format(", {} of {} watches", watches.number("used"), watches.number("limit"));
     } else if (watches.has("used")) {
@@ -58,7 +56,7 @@ std::string recorderText(const Fields& fields) {
     return text;
 }
 
-std::string searchText(const Fields& search) {
+std::string searchText(const StatusFields& search) {
     if (!search.flag("exists")) return "none yet; the first question makes it";
     std::string text = counted(search.number("items"), "item", "items") + ", " + humanSize(search.number("bytes"));
     if (search.flag("isGathering")) return text + ", gathering";
@@ -68,16 +66,16 @@ std::string searchText(const Fields& search) {
 }
 
 /// A line each, the heaviest thing first.
-std::string problemLines(const Json& problems) {
+std::string problemLines(const OrderedJson& problems) {
     std::string lines;
-    for (const Json& each : problems) {
-        const Fields problem(each);
+    for (const OrderedJson& each : problems) {
+        const StatusFields problem(each);
         lines += fmt::format("Not well: {}\n  To do: {}\n", problem.text("what"), problem.text("remedy"));
     }
     return lines;
 }
 
-std::string errorsText(const Fields& errors) {
+std::string errorsText(const StatusFields& errors) {
     if (errors.number("lastHour") == 0) return "none within the last hour";
     return fmt::format("{} within the last hour, the last: {}", errors.number("lastHour"), errors.text("last"));
 }
@@ -85,10 +83,10 @@ std::string errorsText(const Fields& errors) {
 }  // namespace
 
 StatusReport StatusReport::of(const std::string& json) {
-    const Json parsed = Json::parse(json, nullptr, /*allow_exceptions=*/false);
-    const Fields fields(parsed);
+    const OrderedJson parsed = OrderedJson::parse(json, nullptr, /*allow_exceptions=*/false);
+    const StatusFields fields(parsed);
     StatusReport report;
-    const Json& problems = fields.list("problems");
+    const OrderedJson& problems = fields.list("problems");
     report.problems = problems.size();
     if (problems.empty()) report.text += "All is well.\n";
     report.text += problemLines(problems);
@@ -101,8 +99,8 @@ StatusReport StatusReport::of(const std::string& json) {
     line("recorder", "recorder", recorderText(fields));
     if (fields.has("coverage") && fields.list("coverage").empty())
         line("coverage", "coverage", fields.text("coverage"));
-    for (const Json& each : fields.list("coverage")) {
-        const Fields part(each);
+    for (const OrderedJson& each : fields.list("coverage")) {
+        const StatusFields part(each);
         line("coverage", "coverage", fmt::format("{}: {}; {}", part.text("how"), part.text("url"), part.text("why")));
     }
     std::string events = counted(fields.number("events"), "event", "events") + " kept";
@@ -117,15 +115,15 @@ StatusReport StatusReport::of(const std::string& json) {
 }
 
 DoctorReport DoctorReport::of(const std::string& json, const std::vector<std::string>& setAside) {
-    Json parsed = Json::parse(json, nullptr, /*allow_exceptions=*/false);
-    if (!parsed.is_object()) parsed = Json::object();
+    OrderedJson parsed = OrderedJson::parse(json, nullptr, /*allow_exceptions=*/false);
+    if (!parsed.is_object()) parsed = OrderedJson::object();
     parsed["setAside"] = setAside;
-    const Fields fields(parsed);
+    const StatusFields fields(parsed);
     DoctorReport report;
-    report.json = parsed.dump(-1, ' ', false, Json::error_handler_t::replace);
+    report.json = parsed.dump(-1, ' ', false, OrderedJson::error_handler_t::replace);
     const auto line = [&](const std::string& text) { report.text += text + "\n"; };
     for (const std::string& path : setAside) line("Set aside what kept it from starting: " + terminalText(path));
-    for (const Json& repair : fields.list("repairs")) {
+    for (const OrderedJson& repair : fields.list("repairs")) {
         if (repair.is_string()) line("Found at the start: " + terminalText(repair.get<std::string>()));
     }
     const std::string objects = counted(fields.number("objects"), "object", "objects");
@@ -133,7 +131,7 @@ DoctorReport DoctorReport::of(const std::string& json, const std::vector<std::st
     line(fmt::format("Compared what is known of {} with the files: {}.", objects,
                      differences == 0 ? "it is the same"
                                       : counted(differences, "difference was", "differences were") + " put right"));
-    const Fields search = fields["search"];
+    const StatusFields search = fields["search"];
     const std::string items = counted(search.number("items"), "item", "items");
     std::vector<std::string> found;
     const auto note = [&](const char* field, std::string_view what) {
@@ -147,7 +145,7 @@ DoctorReport DoctorReport::of(const std::string& json, const std::vector<std::st
     line(found.empty() ? fmt::format("Compared the search index of {} with the files: it is whole.", items)
                        : fmt::format("Compared the search index of {} with the files: {}; it was put right.", items,
                                      fmt::join(found, ", ")));
-    const Json& problems = fields.list("problems");
+    const OrderedJson& problems = fields.list("problems");
     report.problems = problems.size();
     report.text += problemLines(problems);
     return report;

@@ -55,6 +55,10 @@ std::string terminalText(std::string_view text) {
     return out;
 }
 
+std::string counted(std::uint64_t count, std::string_view one, std::string_view many) {
+    return fmt::format("{} {}", count, count == 1 ? one : many);
+}
+
 std::string humanSize(std::uint64_t bytes) {
     if (bytes < 1000) return fmt::format("{} B", bytes);
     // In tenths of the unit, so that what is shown is decided by integers: 999,950 is "1.0 MB", not "1000 kB".

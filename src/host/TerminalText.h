@@ -16,6 +16,8 @@ namespace cindral {
 std::string terminalText(std::string_view text);
 void appendTerminalText(std::string& out, std::string_view text);
 
+/// "1 folder", "2 folders".
+std::string counted(std::uint64_t count, std::string_view one, std::string_view many);
 /// "0 B", "999 B", "1.2 MB", "340 GB": powers of 1,000, one decimal below ten. At most six characters up to exabytes.
 std::string humanSize(std::uint64_t bytes);
 

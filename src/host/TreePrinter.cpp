@@ -9,13 +9,6 @@
 #include "host/TerminalText.h"
 
 namespace cindral {
-namespace {
-
-std::string counted(std::uint64_t count, std::string_view one, std::string_view many) {
-    return fmt::format("{} {}", count, count == 1 ? one : many);
-}
-
-}  // namespace
 
 TreePrinter::TreePrinter(ProviderAccess& client, const PresentedPaths& paths, const ItemText& text, TextOutput& output,
                          Options options)

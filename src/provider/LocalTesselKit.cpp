@@ -33,9 +33,8 @@ namespace cindral {
 namespace {
 
 constexpr std::chrono::milliseconds kAppRefreshIntervalMin{500};
-constexpr std::string_view kDocumentsName = "Documents";
 // Looks for an item that others move meanwhile.
-constexpr int kLooksMax = 3;
+constexpr int kLooksAtItemMax = 3;
 
 NotificationCenter& requiredDistributedCenter() {
     NotificationCenter* center = NotificationCenter::distributedCenter();
@@ -142,7 +141,7 @@ Result<MeantFile> LocalTesselKit::lookUp(const TesselItemIdentifier& identifier)
     LocalItem::Customs customs;
     customs.isOnlyLookedUp = true;
     // Between the look at where it is and the look at what is there, others may have moved it and taken its place.
-    for (int looks = 0; looks < kLooksMax; ++looks) {
+    for (int looks = 0; looks < kLooksAtItemMax; ++looks) {
         const auto item = resolveItem(identifier, customs);
         if (!item) break;
         const Result<FileStatus> status = item->fileURL()->status();

@@ -27,7 +27,6 @@ namespace cindral {
 
 namespace {
 
-constexpr std::string_view kDocumentsName = "Documents";
 // Deletions of a sweep that are under way at the same time.
 constexpr std::uint64_t kSweepDeletionsMax = 8;
 
@@ -198,7 +197,7 @@ std::optional<KsURL> LocalTesselKit::destinationOfUntrash(const LocalItem& item,
 namespace {
 
 /// Whether an item was put back or deleted by somebody else: then there is nothing to be done any more.
-bool isGone(const KsError& error) {
+bool isGoneItem(const KsError& error) {
     return error.isPosix(ESTALE) || error.is(kKsGeneralErrorDomain, kKsFileNoSuchFileError);
 }
 
@@ -255,7 +254,7 @@ private:
         ts_deleteWithCompletionHandler(
             MeantFile(url, status->identity()),
             [self = shared_from_this(), identifier = *identifier](const std::optional<KsError>& error) {
-                if (error && !isGone(*error)) {
+                if (error && !isGoneItem(*error)) {
                     logError("can't remove item {}; {}", identifier, error->description());
                     self->fail(*error);
                 }

@@ -4,6 +4,7 @@
 #include <cstdlib>
 #include <string>
 
+#include "platform/foundation/Fatal.h"
 #include "platform/foundation/Log.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/foundation/SysEdits.h"
@@ -116,6 +117,12 @@ std::optional<std::string> stringResourceValue(const KsURL& url, ResourceKey key
 }
 std::optional<std::uint64_t> numberResourceValue(const KsURL& url, ResourceKey key) {
     return typedResourceValue<std::uint64_t>(url, key);
+}
+
+std::uint64_t checkedSum(std::uint64_t a, std::uint64_t b) {
+    std::uint64_t sum = 0;
+    if (__builtin_add_overflow(a, b, &sum)) fatal("a count overflows");
+    return sum;
 }
 
 bool isInTrash(const KsURL& url) {

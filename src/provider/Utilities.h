@@ -18,6 +18,9 @@ KsURL properURL(const KsURL& url);
 /// The same for a path; `out` holds the rewritten text where there is one.
 std::string_view properPath(std::string_view path, std::string& out);
 
+/// The folder of documents: of the storage, and of an application's container.
+inline constexpr std::string_view kDocumentsName = "Documents";
+
 /// Where the user's metadata lives: names of extended attributes. Each value is a keyed archive of one object
 /// (docs/keyed-archive.md). On disk: add names, never change one.
 inline constexpr std::string_view kXattrTrashDateName = "com.vemra.trash.time#PS";               ///< a date
@@ -38,6 +41,9 @@ std::optional<bool> boolResourceValue(const KsURL& url, ResourceKey key);
 std::optional<KsDate> dateResourceValue(const KsURL& url, ResourceKey key);
 std::optional<std::string> stringResourceValue(const KsURL& url, ResourceKey key);
 std::optional<std::uint64_t> numberResourceValue(const KsURL& url, ResourceKey key);
+
+/// The process ends where it overflows.
+std::uint64_t checkedSum(std::uint64_t a, std::uint64_t b);
 
 /// Whether a component below the root that holds the URL is exactly ".Trash".
 bool isInTrash(const KsURL& url);

@@ -16,7 +16,7 @@ namespace {
 using ::testing::HasSubstr;
 using ::testing::StartsWith;
 
-constexpr std::chrono::milliseconds kNoPatience{0};
+constexpr std::chrono::milliseconds kNoTime{0};
 
 class HttpConnectionTest : public ::testing::Test {
 protected:
@@ -77,20 +77,20 @@ TEST_F(HttpConnectionTest, refusesABodyThatIsTooLong) {
 
 TEST_F(HttpConnectionTest, waitsForAHeadNoLongerThanItsPatience) {
     HttpLimits limits;
-    limits.head = kNoPatience;
+    limits.head = kNoTime;
     clientSends("GET / HTTP/1.1\r\nHost");
     EXPECT_EQ(statusOf(connection(limits).next()), 408);
 }
 
 TEST_F(HttpConnectionTest, waitsForARequestNoLongerThanItsPatience) {
     HttpLimits limits;
-    limits.idle = kNoPatience;
+    limits.idle = kNoTime;
     EXPECT_TRUE(std::holds_alternative<HttpConnection::End>(connection(limits).next()));
 }
 
 TEST_F(HttpConnectionTest, waitsForABodyNoLongerThanItsPatience) {
     HttpLimits limits;
-    limits.stall = kNoPatience;
+    limits.stall = kNoTime;
     clientSends("POST / HTTP/1.1\r\nContent-Length: 4\r\n\r\nab");
     auto connection = this->connection(limits);
     (void)connection.next();
@@ -99,7 +99,7 @@ TEST_F(HttpConnectionTest, waitsForABodyNoLongerThanItsPatience) {
 
 TEST_F(HttpConnectionTest, waitsForWhoReadsNothingNoLongerThanItsPatience) {
     HttpLimits limits;
-    limits.stall = kNoPatience;
+    limits.stall = kNoTime;
     clientSends("GET / HTTP/1.1\r\n\r\n");
     auto connection = this->connection(limits);
     (void)connection.next();

@@ -1,6 +1,7 @@
 #include "provider/ChangesAhead.h"
 
 #include <fmt/format.h>
+#include <gmock/gmock.h>
 
 #include <algorithm>
 #include <atomic>

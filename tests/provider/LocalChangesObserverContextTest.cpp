@@ -7,7 +7,7 @@
 namespace cindral::test {
 namespace {
 
-class CountingStorageManager : public RvStorageManager {
+class RefusingStorageManager : public RvStorageManager {
 public:
     Result<std::uint32_t> permanentStorageForItem(const KsURL& /*url*/, AllocateIfNone allocate) override {
         ++requests;
@@ -34,7 +34,7 @@ protected:
     }
     TesselItems items() { return all(*listed_); }
 
-    CountingStorageManager manager_;
+    RefusingStorageManager manager_;
     const std::shared_ptr<RecordingChangeObserver> observer_ = std::make_shared<RecordingChangeObserver>();
     const std::shared_ptr<LocalFileEnumerator> listed_ =
         LocalFileEnumerator::initWithContainer(kTesselRootContainerItemIdentifier, {storageURL()});

@@ -20,7 +20,7 @@
 namespace cindral {
 namespace {
 
-constexpr std::size_t kReadBytes = 256 << 10;
+constexpr std::size_t kFileReadBytes = 256 << 10;
 constexpr std::size_t kChunkBytes = 64 << 10;
 constexpr std::string_view kSeveral = "Documents";
 constexpr std::string_view kLeftOut = "Left out.txt";
@@ -71,7 +71,7 @@ class Packing {
 public:
     Packing(const std::shared_ptr<TesselExtension>& provider, const HttpDocuments& documents, ZipWriter& archive,
             int stop)
-        : client_(provider), documents_(documents), archive_(archive), stop_(stop), buffer_(kReadBytes) {}
+        : client_(provider), documents_(documents), archive_(archive), stop_(stop), buffer_(kFileReadBytes) {}
 
     /// False where it can't go on.
     bool addAll(const std::vector<std::shared_ptr<const TesselItem>>& items) {

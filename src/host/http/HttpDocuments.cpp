@@ -17,7 +17,7 @@ namespace cindral {
 namespace {
 
 // A save puts another object under the name between the question and the opening.
-constexpr int kAttemptsMax = 5;
+constexpr int kListingAttemptsMax = 5;
 
 // The browser's own viewer does not work in a sandbox. It is no part of any page, and runs nothing of the document's in
 // our name.
@@ -112,7 +112,7 @@ std::optional<ByteRange> ByteRange::parse(std::string_view field, std::uint64_t 
 Result<HttpDocuments::Opened> HttpDocuments::open(const TesselItemIdentifier& identifier) const {
     for (int attempt = 1;; ++attempt) {
         auto opened = openOnce(identifier);
-        if (opened.ok() || attempt == kAttemptsMax || !opened.error().isPosix(ESTALE)) return opened;
+        if (opened.ok() || attempt == kListingAttemptsMax || !opened.error().isPosix(ESTALE)) return opened;
     }
 }
 

@@ -16,12 +16,6 @@
 #include "platform/foundation/Log.h"
 
 namespace cindral {
-namespace {
-
-// Where nothing can be had for another connection, this long none is accepted.
-constexpr std::chrono::seconds kRespite{1};
-
-}  // namespace
 
 struct HttpListener::Connection {
     explicit Connection(UniqueFd connected) : socket(std::move(connected)) {}
@@ -115,7 +109,7 @@ bool HttpListener::acceptAll() {
         auto accepted = local_socket::acceptFrom(socket_.get());
         if (!accepted.ok()) {
             logError("can't accept a browser; {}", accepted.error().description());
-            const auto deadline = std::chrono::steady_clock::now() + kRespite;
+            const auto deadline = std::chrono::steady_clock::now() + local_socket::kRespite;
             const MutexLock lock(mutex_);
             while (!isStopping_ && changed_.waitUntil(mutex_, deadline)) {
             }

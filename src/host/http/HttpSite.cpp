@@ -13,7 +13,7 @@ namespace {
 constexpr std::size_t kMessageBytesMax = 4 << 20;
 constexpr std::size_t kLinkBytesMax = 1 << 10;
 constexpr unsigned kThumbnailPixelsUsual = 128;
-constexpr unsigned kThumbnailPixelsMax = 1024;
+constexpr unsigned kPageThumbnailPixelsMax = 1024;
 
 std::string tokenText(const HttpSession& session) {
     return R"({"token":)" + jsonString(session.token) + "}\n";
@@ -189,7 +189,7 @@ void HttpSite::sendThumbnail(const Call& call) {
     const std::string size = call.request.parameter("size").value_or("");
     unsigned pixels = kThumbnailPixelsUsual;
     std::from_chars(size.data(), size.data() + size.size(), pixels);
-    call.connection.answer(documents_.thumbnail(*identifier, std::clamp(pixels, 1U, kThumbnailPixelsMax)),
+    call.connection.answer(documents_.thumbnail(*identifier, std::clamp(pixels, 1U, kPageThumbnailPixelsMax)),
                            call.request.method == HttpRequest::Method::head);
 }
 

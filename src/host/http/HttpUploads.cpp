@@ -16,7 +16,7 @@
 namespace cindral {
 namespace {
 
-constexpr std::size_t kBufferBytes = 256 << 10;
+constexpr std::size_t kUploadBufferBytes = 256 << 10;
 // What comes by way of a browser is for its owner alone, until they say otherwise.
 constexpr mode_t kUploadMode = 0600;
 
@@ -86,7 +86,7 @@ HttpUploads::ItemResult HttpUploads::put(HttpConnection& connection, const std::
 }
 
 Result<void> HttpUploads::copyBody(HttpConnection& connection, int file) const {
-    std::vector<char> buffer(kBufferBytes);
+    std::vector<char> buffer(kUploadBufferBytes);
     std::uint64_t written = 0;
     while (true) {
         const std::size_t got = TRY(connection.readBody(buffer));

@@ -22,7 +22,7 @@ constexpr std::uint32_t kEndSignature = 0x06054b50;
 constexpr std::uint32_t kEnd64Signature = 0x06064b50;
 constexpr std::uint32_t kEnd64LocatorSignature = 0x07064b50;
 
-constexpr std::uint16_t kVersion = 45;         // That of ZIP64.
+constexpr std::uint16_t kZipVersion = 45;      // That of ZIP64.
 constexpr std::uint16_t kMadeOnUnix = 3 << 8;  // The upper half of the attributes is a mode.
 constexpr std::uint16_t kSizesFollow = 1 << 3;
 constexpr std::uint16_t kNamesAreUtf8 = 1 << 11;
@@ -189,7 +189,7 @@ void ZipWriter::begin(Entry entry) {
     }
     std::string head;
     append32(head, kLocalSignature);
-    append16(head, kVersion);
+    append16(head, kZipVersion);
     entry.appendCommon(head, /*isKnown=*/false);
     append16(head, static_cast<std::uint16_t>(extra.size()));
     put(head + entry.path + extra);
@@ -209,8 +209,8 @@ void ZipWriter::list(const Entry& entry) {
         if (isFar) append64(extra, entry.position);
     }
     append32(central_, kCentralSignature);
-    append16(central_, kMadeOnUnix | kVersion);
-    append16(central_, kVersion);
+    append16(central_, kMadeOnUnix | kZipVersion);
+    append16(central_, kZipVersion);
     entry.appendCommon(central_, /*isKnown=*/true);
     append16(central_, static_cast<std::uint16_t>(extra.size()));
     append16(central_, 0);  // Comment.
@@ -287,8 +287,8 @@ bool ZipWriter::finish() {
     if (isLong) {
         append32(tail, kEnd64Signature);
         append64(tail, 44);  // Bytes of it that follow.
-        append16(tail, kMadeOnUnix | kVersion);
-        append16(tail, kVersion);
+        append16(tail, kMadeOnUnix | kZipVersion);
+        append16(tail, kZipVersion);
         append32(tail, 0);
         append32(tail, 0);
         append64(tail, entries_);

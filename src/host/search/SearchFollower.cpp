@@ -13,10 +13,6 @@ namespace {
 
 constexpr std::size_t kContainersAtOnceMax = 20'000;
 
-bool isExpired(const KsError& error) {
-    return error.is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::pageExpired));
-}
-
 }  // namespace
 
 /// The listings of some containers, on their way into the store.
@@ -29,7 +25,7 @@ public:
         while (page) {
             TRY(follower_.checkStopped());
             Result<ItemsPage> listed = follower_.client_.itemsOnPage(container, *page);
-            if (!listed.ok() && isExpired(listed.error())) {
+            if (!listed.ok() && isExpiredPage(listed.error())) {
                 // What was listed stays; that it comes twice does no harm.
                 page = tesselInitialPageForFollowers();
                 continue;
@@ -134,7 +130,7 @@ Result<void> SearchFollower::catchUp(SearchStore& store, bool& gathered) {
             TRY(checkStopped());
             more = followOnce(store);
         }
-        if (!more.ok() && isExpired(more.error())) {
+        if (!more.ok() && isExpiredPage(more.error())) {
             TRY(beginGather(store));
             continue;
         }

@@ -10,6 +10,9 @@
 
 namespace cindral {
 
+/// What is read of the kernel's queue at once.
+inline constexpr std::size_t kEventBufferBytes = 32'768;
+
 /// A hint that something is to be looked at. What happened is not said: the kernel merges events on one object, so
 /// that a replay of them can end at the wrong name.
 struct EventHint {

@@ -30,7 +30,6 @@ constexpr std::uint64_t kEvents =
     FAN_CREATE | FAN_DELETE | FAN_MODIFY | FAN_ATTRIB | FAN_CLOSE_WRITE | FAN_DELETE_SELF | FAN_ONDIR;
 
 // Enough for a few hundred events; one event is at most a thousand bytes.
-constexpr std::size_t kReadBytes = 32'768;
 // What readableBytes() counts for an event of any length.
 constexpr std::uint64_t kCountedBytes = sizeof(fanotify_event_metadata);
 
@@ -66,7 +65,7 @@ private:
     std::vector<FileSystem> fileSystems_;
     WatchTable watches_;           // By digest: a shared one costs a look too many, never one too few.
     std::vector<FileID> watched_;  // The objects of the record that is being told.
-    alignas(fanotify_event_metadata) std::array<std::byte, kReadBytes> buffer_;
+    alignas(fanotify_event_metadata) std::array<std::byte, kEventBufferBytes> buffer_;
 };
 
 Result<void> FanotifySource::addRoot(int folder) {
@@ -170,15 +169,15 @@ Result<void> FanotifySource::drain(const Receiver& receive) {
 
 }  // namespace
 
-Result<std::unique_ptr<EventSource>> makeFanotifySource(RenameRecords records) {
+Result<std::unique_ptr<EventSource>> makeFanotifySourceOf(RenameRecords records) {
     const unsigned flags = records == RenameRecords::whole ? kGroup | FAN_REPORT_TARGET_FID : kGroup;
     UniqueFd group = TRY(sys::fanotify_init(flags, O_RDONLY));
     return std::unique_ptr<EventSource>(std::make_unique<FanotifySource>(std::move(group), records));
 }
 
 Result<std::unique_ptr<EventSource>> makeFanotifySource() {
-    auto source = makeFanotifySource(RenameRecords::whole);
-    if (!source.ok() && source.error().isPosix(EINVAL)) return makeFanotifySource(RenameRecords::halves);
+    auto source = makeFanotifySourceOf(RenameRecords::whole);
+    if (!source.ok() && source.error().isPosix(EINVAL)) return makeFanotifySourceOf(RenameRecords::halves);
     return source;
 }
 

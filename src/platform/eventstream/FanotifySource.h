@@ -10,6 +10,6 @@ namespace cindral {
 enum class RenameRecords { whole, halves };
 
 /// makeFanotifySource() for a kernel that has, or is treated as having, no more than that. EINVAL where it has less.
-Result<std::unique_ptr<EventSource>> makeFanotifySource(RenameRecords records);
+Result<std::unique_ptr<EventSource>> makeFanotifySourceOf(RenameRecords records);
 
 }  // namespace cindral

@@ -23,7 +23,6 @@ constexpr std::uint32_t kOfContents = IN_MODIFY | IN_ATTRIB | IN_CLOSE_WRITE | I
 constexpr std::uint32_t kOfEntries = IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO;
 
 // Enough for a few hundred events; one event is at most 272 bytes.
-constexpr std::size_t kReadBytes = 32'768;
 
 // The use of watches is asked for with every answer; how many there may be changes once in a machine's life.
 constexpr std::chrono::milliseconds kLimitIsGood{500};
@@ -70,7 +69,7 @@ private:
     // that after two thousand million watches a new one may have one of these.
     std::unordered_set<int> ended_;
     std::vector<FileID> watched_;  // The objects of the event that is being told.
-    alignas(inotify_event) std::array<std::byte, kReadBytes> buffer_;
+    alignas(inotify_event) std::array<std::byte, kEventBufferBytes> buffer_;
 };
 
 Result<void> InotifySource::watch(int object, FileID fileID, std::uint32_t mask) {

@@ -5,6 +5,8 @@
 #include <charconv>
 #include <tuple>
 
+#include "platform/foundation/Utf8.h"
+
 namespace cindral {
 
 namespace {
@@ -12,20 +14,12 @@ namespace {
 constexpr int kWeightMax = 100;
 /// Ranks a whole name above any pattern of its weight.
 constexpr std::size_t kWholeNameLength = std::string_view::npos;
-bool isUpper(char c) {
-    return c >= 'A' && c <= 'Z';
-}
-
-char lower(char c) {
-    return isUpper(c) ? static_cast<char>(c - 'A' + 'a') : c;
-}
-
 /// The lower-case form of a name, without an allocation for a name that a file can have: 255 bytes at most.
 class FoldedName {
 public:
     explicit FoldedName(std::string_view name) : size_(name.size()) {
         if (size_ > small_.size()) large_.resize(size_);
-        std::ranges::transform(name, size_ > small_.size() ? large_.data() : small_.data(), lower);
+        std::ranges::transform(name, size_ > small_.size() ? large_.data() : small_.data(), lowerASCII);
     }
     std::string_view view() const { return {size_ > small_.size() ? large_.data() : small_.data(), size_}; }
 
@@ -170,7 +164,7 @@ void MimeGlobs::addLine(std::string_view line, MimeTypes& types, FileState& stat
     // A pattern with flags stands there once more without, for readers that know none.
     if (state.caseSensitive.contains(key)) return;
     std::string folded(pattern);
-    std::ranges::transform(folded, folded.begin(), lower);
+    std::ranges::transform(folded, folded.begin(), lowerASCII);
     addPattern(folded, candidate, false, types);
 }
 
@@ -213,7 +207,7 @@ void MimeGlobs::groupPatterns(const MimeTypes& types) {
 std::optional<MimeType> MimeGlobs::find(std::string_view name) const {
     if (name.empty()) return std::nullopt;
     if (const auto type = match(name, Case::asGiven, findWholeName(name))) return type;
-    if (std::ranges::none_of(name, isUpper)) return std::nullopt;
+    if (std::ranges::none_of(name, isUpperASCII)) return std::nullopt;
     return match(FoldedName(name).view(), Case::folded, {});
 }
 
@@ -221,7 +215,7 @@ std::optional<MimeType> MimeGlobs::find(std::string_view name) const {
 MimeGlobs::Candidate MimeGlobs::findWholeName(std::string_view name) const {
     if (name.size() > nameLengthMax_) return {};
     if (const auto place = names_.find(name); place != names_.end()) return place->second.asGiven;
-    if (std::ranges::none_of(name, isUpper)) return {};
+    if (std::ranges::none_of(name, isUpperASCII)) return {};
     const auto place = names_.find(FoldedName(name).view());
     return place == names_.end() ? Candidate() : place->second.folded;
 }

@@ -13,7 +13,7 @@ namespace cindral {
 
 namespace {
 
-constexpr std::string_view kHeader = "bplist00";
+constexpr std::string_view kBinaryHeader = "bplist00";
 constexpr std::size_t kTrailerSize = 32;
 
 // First bytes of objects: a kind in the high half; in the low half a length, the logarithm of one, or a further kind.
@@ -200,8 +200,8 @@ void Writer::addChildren(const PropertyList& value) {
 }
 
 Bytes Writer::write() && {
-    out_.reserve(kHeader.size() + kTrailerSize + objects_.size() * 20);
-    append(bytesOf(kHeader));
+    out_.reserve(kBinaryHeader.size() + kTrailerSize + objects_.size() * 20);
+    append(bytesOf(kBinaryHeader));
     for (Object& object : objects_) {
         object.offset = out_.size();
         writeObject(object);
@@ -356,8 +356,8 @@ Result<PropertyList> Reader::read() {
 }
 
 Result<void> Reader::readTrailer() {
-    if (bytes_.size() < kHeader.size() + kTrailerSize) return malformed("too short for a property list");
-    if (textOf(bytes_.first(kHeader.size())) != kHeader) return malformed("not a binary property list");
+    if (bytes_.size() < kBinaryHeader.size() + kTrailerSize) return malformed("too short for a property list");
+    if (textOf(bytes_.first(kBinaryHeader.size())) != kBinaryHeader) return malformed("not a binary property list");
     const ByteView trailer = bytes_.last(kTrailerSize);
     if (readBigEndian(trailer.first(6)) != 0) return malformed("unknown fields in the trailer");
     offsetSize_ = std::to_integer<std::size_t>(trailer[6]);
@@ -369,7 +369,7 @@ Result<void> Reader::readTrailer() {
     if (referenceSize_ < 1 || referenceSize_ > 8) return malformed("references of an impossible size");
     if (topObject_ >= objectCount_) return malformed("no top object");
     const std::size_t tableEnd = bytes_.size() - kTrailerSize;
-    if (table < kHeader.size() || table > tableEnd) return malformed("offset table outside of the file");
+    if (table < kBinaryHeader.size() || table > tableEnd) return malformed("offset table outside of the file");
     // Exactly between objects and trailer. The division, because a count near 2^64 would overflow a product.
     const std::uint64_t tableSize = tableEnd - table;
     if (tableSize % offsetSize_ != 0 || tableSize / offsetSize_ != objectCount_)
@@ -381,7 +381,7 @@ Result<void> Reader::readTrailer() {
 Result<void> Reader::checkTable() const {
     for (std::uint64_t number = 0; number < objectCount_; ++number) {
         const std::uint64_t at = offset(number);
-        if (at < kHeader.size() || at >= table_) return malformed("object outside of the objects");
+        if (at < kBinaryHeader.size() || at >= table_) return malformed("object outside of the objects");
     }
     return {};
 }

@@ -16,20 +16,19 @@ namespace {
 /// Tasks that a thread runs of one queue before other queues get their turn.
 constexpr int kTasksPerTurnMax = 64;
 
-/// A thread that waits in sync() for its turn. Protected by the queue's mutex; lives on that thread's stack.
-struct Waiter {
-    Condition turn;
-    bool hasTurn = false;
-};
-
-struct Entry {
-    SerialQueue::Task task;
-    Waiter* waiter = nullptr;  ///< instead of a task
-};
-
 }  // namespace
 
 struct SerialQueue::State {
+    /// A thread that waits in sync() for its turn. Protected by the mutex; lives on that thread's stack.
+    struct Waiter {
+        Condition turn;
+        bool hasTurn = false;
+    };
+    struct Entry {
+        Task task;
+        Waiter* waiter = nullptr;  ///< instead of a task
+    };
+
     explicit State(std::string name) : label(std::move(name)) {}
 
     const std::string label;
@@ -120,11 +119,11 @@ void drain(const std::shared_ptr<SerialQueue::State>& state) {
 SerialQueue::SerialQueue(std::string label) : state_(std::make_shared<State>(std::move(label))) {}
 
 SerialQueue::~SerialQueue() {
-    std::deque<Entry> dropped;
+    std::deque<State::Entry> dropped;
     if (isInside(*state_)) {
         const MutexLock lock(state_->mutex);
         dropped.swap(state_->entries);
-        for (const Entry& entry : dropped) {
+        for (const State::Entry& entry : dropped) {
             if (entry.waiter != nullptr)
                 fatal(fmt::format("queue \"{}\" is destroyed while a thread waits to enter it", state_->label));
         }
@@ -152,7 +151,7 @@ void SerialQueue::sync(const Task& task) {
     if (isCurrent()) fatal(fmt::format("queue \"{}\" is entered synchronously from one of its own tasks", label()));
     // The task may destroy the queue.
     const std::shared_ptr<State> state = state_;
-    Waiter waiter;
+    State::Waiter waiter;
     bool mustWait = false;
     {
         const MutexLock lock(state->mutex);

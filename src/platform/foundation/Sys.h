@@ -50,6 +50,8 @@ struct FileStatus {
     std::uint32_t deviceID() const;
     /// Birth time as one number, ns since 1970; 0 where the file system has none.
     std::int64_t birthStamp() const;
+    /// Of two that exist at one time.
+    bool isSameObject(const FileStatus& other) const { return fileID == other.fileID && device == other.device; }
     ObjectIdentity identity() const { return {fileID, device, birthStamp()}; }
 };
 

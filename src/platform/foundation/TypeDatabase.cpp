@@ -15,6 +15,7 @@
 #include "platform/foundation/MimeGlobs.h"
 #include "platform/foundation/MimeMagic.h"
 #include "platform/foundation/MimeTypes.h"
+#include "platform/foundation/Utf8.h"
 
 namespace cindral {
 
@@ -40,13 +41,9 @@ std::string readDatabaseFile(const std::string& path) {
     return text;
 }
 
-char lower(char c) {
-    return c >= 'A' && c <= 'Z' ? static_cast<char>(c - 'A' + 'a') : c;
-}
-
 std::string lowerCase(std::string_view text) {
     std::string folded(text);
-    std::ranges::transform(folded, folded.begin(), lower);
+    std::ranges::transform(folded, folded.begin(), lowerASCII);
     return folded;
 }
 
@@ -165,7 +162,7 @@ const TypeDatabase::Tables::Folder* TypeDatabase::Tables::folder(std::string_vie
     const std::string_view extension = extensionOf(name);
     if (extension.empty()) return nullptr;
     const auto found = std::ranges::find_if(foldersByExtension, [&](const auto& declared) {
-        return std::ranges::equal(extension, declared.first, std::equal_to(), lower);
+        return std::ranges::equal(extension, declared.first, std::equal_to(), lowerASCII);
     });
     return found == foldersByExtension.end() ? nullptr : &found->second;
 }

@@ -20,4 +20,12 @@ Utf8Step utf8Step(std::string_view text);
 
 bool isUtf8(std::string_view text);
 
+/// Only letters of ASCII have case here, whatever the locale says.
+constexpr bool isUpperASCII(char c) {
+    return c >= 'A' && c <= 'Z';
+}
+constexpr char lowerASCII(char c) {
+    return isUpperASCII(c) ? static_cast<char>(c - 'A' + 'a') : c;
+}
+
 }  // namespace cindral

@@ -15,7 +15,7 @@ using namespace tablekeys;
 namespace {
 
 // Looked up at once, as a listing's page is.
-constexpr std::size_t kLookupsAtOnceMax = 128;
+constexpr std::size_t kChangesAtOnceMax = 128;
 // Entries that one transaction removes when many go.
 constexpr std::size_t kForgottenAtOnce = 20'000;
 // Children that are sorted in memory when their list is made anew.
@@ -280,15 +280,15 @@ Result<std::vector<ObjectTables::Child>> ObjectTables::changedChildren(
     const std::vector<Overlay::Object>& objects) const {
     std::vector<Child> changes;
     const std::span all(objects);
-    for (std::size_t begin = 0; begin < all.size(); begin += kLookupsAtOnceMax) {
-        TRY(addChanges(all.subspan(begin, std::min(kLookupsAtOnceMax, all.size() - begin)), changes));
+    for (std::size_t begin = 0; begin < all.size(); begin += kChangesAtOnceMax) {
+        TRY(addChanges(all.subspan(begin, std::min(kChangesAtOnceMax, all.size() - begin)), changes));
     }
     std::ranges::sort(changes, {}, &Child::place);
     return changes;
 }
 
 Result<void> ObjectTables::addChanges(std::span<const Overlay::Object> objects, std::vector<Child>& changes) const {
-    std::array<tablepages::Lookup, kLookupsAtOnceMax> lookups;
+    std::array<tablepages::Lookup, kChangesAtOnceMax> lookups;
     for (std::size_t i = 0; i < objects.size(); ++i) {
         lookups[i] = {.key = static_cast<std::uint64_t>(objects[i].fileID)};
     }

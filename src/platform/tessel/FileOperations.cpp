@@ -31,8 +31,6 @@ namespace {
 using Root = std::shared_ptr<const RootDirectory>;
 
 constexpr mode_t kAsTheUmaskSays = 0777;
-constexpr mode_t kOwnerOnly = 0700;
-constexpr mode_t kPrivateFile = 0600;
 
 /// An open folder in a root, and its path as presented.
 struct Folder {
@@ -74,10 +72,6 @@ KsError collision(const std::string& path) {
 }
 
 /// For objects of which one is held open: numbers of others are compared with the time of birth (ObjectIdentity).
-bool isSameObject(const FileStatus& a, const FileStatus& b) {
-    return a.fileID == b.fileID && a.device == b.device;
-}
-
 /// ESTALE when it is not the object that is meant.
 Result<void> checkIsMeant(const MeantFile& meant, const FileStatus& status) {
     if (meant.object && *meant.object != status.identity()) return KsError::posix(ESTALE, meant.url.path());
@@ -116,7 +110,7 @@ bool isFixed(const KsURL& url) {
 
 bool isRootObject(const FileStatus& status) {
     return std::ranges::any_of(RootDirectories::shared().all(),
-                               [&](const Root& root) { return isSameObject(root->status, status); });
+                               [&](const Root& root) { return root->status.isSameObject(status); });
 }
 
 /// Where something is that is to be moved away, renamed or deleted.
@@ -147,7 +141,7 @@ Mutex& departuresFrom(const Folder& folder) {
 /// ESTALE when the entry of the folder is not the object that is held.
 Result<void> checkIsHeld(int folder, const char* name, int handle) {
     // Both as of now: layered file systems give an object that is changed another number, also through the handle.
-    if (isSameObject(TRY(sys::statx(folder, name)), TRY(sys::statx(handle, "")))) return {};
+    if (TRY(sys::statx(folder, name)).isSameObject(TRY(sys::statx(handle, "")))) return {};
     return KsError::posix(ESTALE);
 }
 
@@ -163,10 +157,10 @@ Result<void> takeOut(const Folder& folder, const std::string& name, const Unique
 Result<bool> isWithin(int folder, const FileStatus& outer) {
     UniqueFd at = TRY(sys::openat(folder, ".", O_PATH | O_DIRECTORY));
     FileStatus status = TRY(sys::statx(at.get(), ""));
-    while (!isSameObject(status, outer)) {
+    while (!status.isSameObject(outer)) {
         UniqueFd above = TRY(sys::openat(at.get(), "..", O_PATH | O_DIRECTORY));
         const FileStatus next = TRY(sys::statx(above.get(), ""));
-        if (isSameObject(next, status)) return false;  // The top.
+        if (next.isSameObject(status)) return false;  // The top.
         at = std::move(above);
         status = next;
     }
@@ -186,7 +180,7 @@ Result<void> linkAndUnlink(int from, const char* name, int to, const char* newNa
     const Result<FileStatus> left = sys::statx(from, name);
     if (!left.ok() && !left.error().isPosix(ENOENT)) return undone(left.error());
     // It has the new name alone: another took its old one over, or took that away.
-    if (!left.ok() || !isSameObject(*linked, *left)) return {};
+    if (!left.ok() || !linked->isSameObject(*left)) return {};
     const Result<void> unlinked = sys::unlinkat(from, name);
     return unlinked.ok() ? unlinked : undone(unlinked.error());
 }
@@ -199,7 +193,7 @@ Result<void> renameWithoutReplacing(int from, const char* name, int to, const ch
     const FileStatus status = TRY(sys::statx(from, name));
     if (!status.isDirectory()) return linkAndUnlink(from, name, to, newName);
     if (TRY(isWithin(to, status))) return KsError::posix(EINVAL);
-    TRY(sys::mkdirat(to, newName, kOwnerOnly));
+    TRY(sys::mkdirat(to, newName, kPrivateFolder));
     const Result<void> moved = sys::renameat2(from, name, to, newName, 0);
     if (!moved.ok()) (void)sys::unlinkat(to, newName, AT_REMOVEDIR);
     return moved;
@@ -462,7 +456,7 @@ Result<Place> openRenamed(const MeantFile& file, const std::optional<std::string
 
 Result<KsURL> move(const Place& place, const Folder& target, const std::string& name, Bouncing bouncing,
                    TesselProgress& progress) {
-    if (isSameObject(place.folder.status, target.status) && name == place.name) return KsURL::fileURL(place.path());
+    if (place.folder.status.isSameObject(target.status) && name == place.name) return KsURL::fileURL(place.path());
     const KsURL url = KsURL::fileURL(place.path());
     const WantedName wanted{name, bouncing == Bouncing::isAllowed ? nameKindOf(url) : NameKind::document, bouncing};
     const Result<std::string> moved = moveUnder(wanted, place, target, progress);
@@ -527,7 +521,7 @@ Result<void> makeFolderUnlessThere(const KsURL& folder) {
     if (!parent) return {};
     const Folder above = TRY(openFolder(*parent));
     const std::string name(folder.lastPathComponent());
-    const Result<void> made = sys::mkdirat(above.fd.get(), name.c_str(), kOwnerOnly);
+    const Result<void> made = sys::mkdirat(above.fd.get(), name.c_str(), kPrivateFolder);
     if (made.ok()) return {};
     const Result<FileStatus> status = sys::statx(above.fd.get(), name.c_str());
     if (status.ok() && status->isDirectory()) return {};

@@ -12,13 +12,13 @@
 
 #include "platform/foundation/Log.h"
 #include "platform/foundation/SysEdits.h"
+#include "platform/tessel/TreeCopy.h"
 #include "platform/tessel/TreeRemoval.h"
 
 namespace cindral {
 
 namespace {
 
-constexpr mode_t kOwnerOnly = 0700;
 constexpr std::string_view kStagingPrefix = ".staging-";
 constexpr std::string_view kKeptPrefix = "kept-";
 
@@ -61,7 +61,7 @@ Result<std::vector<std::string>> entryNames(int directory) {
 
 Result<UniqueFd> openTemporaryFolder(const RootDirectory& root) {
     const std::string name(kTemporaryLocalFolderName);
-    const Result<void> made = sys::mkdirat(root.fd.get(), name.c_str(), kOwnerOnly);
+    const Result<void> made = sys::mkdirat(root.fd.get(), name.c_str(), kPrivateFolder);
     // On a read-only file system one that is there will do.
     if (!made.ok() && !isTaken(made) && !sys::statx(root.fd.get(), name.c_str()).ok()) return made.error();
     return sys::openDirectoryForReading(root.fd.get(), name.c_str(), O_NOFOLLOW);
@@ -74,7 +74,7 @@ Result<std::unique_ptr<StagingFolder>> StagingFolder::make(std::shared_ptr<const
     UniqueFd temporary = *std::move(opened);
     while (true) {
         std::string name = newName(contents == Contents::mayGo ? kStagingPrefix : kKeptPrefix);
-        const Result<void> made = sys::mkdirat(temporary.get(), name.c_str(), kOwnerOnly);
+        const Result<void> made = sys::mkdirat(temporary.get(), name.c_str(), kPrivateFolder);
         if (isTaken(made)) continue;  // By a process of the same number, in another machine or before.
         TRY(made);
         Result<UniqueFd> fd = makeLocked(temporary.get(), name);

@@ -28,6 +28,10 @@ KsError tesselErrorForExpiredPage() {
     return error(TesselErrorCode::pageExpired, {{"message", "The page or sync anchor has expired"}});
 }
 
+bool isExpiredPage(const KsError& error) {
+    return error.is(kTesselErrorDomain, static_cast<std::int64_t>(TesselErrorCode::pageExpired));
+}
+
 KsError tesselErrorForCollisionWithItem(std::shared_ptr<const TesselItem> item) {
     KsError::UserInfo info{{"message", "An item with that name already exists"}};
     if (const KsURL* url = item->fileURL()) info.emplace("path", url->path());

@@ -24,6 +24,7 @@ enum class TSErrorCode : std::int64_t { invalidParameter = 1, itemNotFound = 2 }
 KsError tesselErrorForNonExistentItemWithIdentifier(const TesselItemIdentifier& identifier);
 /// A page or sync anchor that can't be resumed: the host lists anew.
 KsError tesselErrorForExpiredPage();
+bool isExpiredPage(const KsError& error);
 /// Holds the item in the way: collidingItem(). "path" in the user info is its path where it has one.
 KsError tesselErrorForCollisionWithItem(std::shared_ptr<const TesselItem> item);
 /// The item in the way, of an error that a name collides; null for any other.

@@ -21,16 +21,9 @@ constexpr std::size_t kBufferBytes = std::size_t{256} << 10;
 // Files up to this size are read and written: that costs fewer calls than asking for their holes.
 constexpr std::uint64_t kSmallFileBytes = std::uint64_t{128} << 10;
 
-constexpr mode_t kPrivateFile = 0600;
-constexpr mode_t kPrivateFolder = 0700;
-
 constexpr std::string_view kUserNamespace = "user.";
 constexpr std::string_view kAccessList = "system.posix_acl_access";
 constexpr std::string_view kDefaultAccessList = "system.posix_acl_default";
-
-bool isSameObject(const FileStatus& a, const FileStatus& b) {
-    return a.fileID == b.fileID && a.device == b.device;
-}
 
 /// The mode of a copy that belongs to this process: the bits that run a program as its owner stay only where the owner
 /// stays.
@@ -74,7 +67,7 @@ public:
     Result<Descend> willEnter(WalkedFolder& folder, const WalkedFolder* above) override {
         TRY(copy_.progress_.check());
         const FileStatus* excluded = copy_.options_.excluded;
-        if (excluded != nullptr && isSameObject(folder.status, *excluded)) return Descend::no;
+        if (excluded != nullptr && folder.status.isSameObject(*excluded)) return Descend::no;
         const int parent = above != nullptr ? above->counterpart.get() : target_;
         const char* name = above != nullptr ? folder.name.c_str() : targetName_;
         TRY(sys::mkdirat(parent, name, kPrivateFolder));
@@ -300,7 +293,7 @@ public:
 
     Result<Descend> willEnter(WalkedFolder& folder, const WalkedFolder* /*above*/) override {
         TRY(progress_.check());
-        if (excluded_ != nullptr && isSameObject(folder.status, *excluded_)) return Descend::no;
+        if (excluded_ != nullptr && folder.status.isSameObject(*excluded_)) return Descend::no;
         ++items;
         return Descend::yes;
     }

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/types.h>
+
 #include <cstdint>
 #include <map>
 #include <string>
@@ -10,6 +12,10 @@
 #include "platform/tessel/TreeWalk.h"
 
 namespace cindral {
+
+/// Modes of what nobody but the owner is to see: a copy until it is complete, and what holds it.
+inline constexpr mode_t kPrivateFile = 0600;
+inline constexpr mode_t kPrivateFolder = 0700;
 
 /// What to do where the target's file system keeps no attributes.
 enum class AttributeLoss { isLogged, isAnError };

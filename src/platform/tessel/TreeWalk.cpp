@@ -15,10 +15,6 @@ namespace {
 constexpr std::size_t kOpenLevelsMax = 6;
 constexpr std::size_t kBufferSize = 32'768;
 
-bool isSameObject(const FileStatus& a, const FileStatus& b) {
-    return a.fileID == b.fileID && a.device == b.device;
-}
-
 class Walk {
 public:
     Walk(const std::string& path, TreeVisitor& visitor) : path_(path), visitor_(visitor) {}
@@ -140,7 +136,7 @@ private:
 
     static Result<UniqueFd> openAbove(const UniqueFd& fd, const FileStatus& expected) {
         UniqueFd above = TRY(sys::openDirectoryForReading(fd.get(), ".."));
-        if (!isSameObject(TRY(sys::statx(above.get(), "")), expected)) return KsError::posix(ESTALE);
+        if (!TRY(sys::statx(above.get(), "")).isSameObject(expected)) return KsError::posix(ESTALE);
         return above;
     }
 

@@ -13,23 +13,18 @@
 #include "platform/tessel/TesselErrors.h"
 #include "provider/ContainerContents.h"
 #include "provider/KsURL+CdlFileObjectIdentifier.h"
+#include "provider/Utilities.h"
 
 namespace cindral {
 
 namespace {
 
 // Times that an object which is not where the store says is looked for again, each time with the store up to date.
-constexpr int kLooksMax = 5;
+constexpr int kLooksForObjectMax = 5;
 // Entries of a scan that are made items of together.
 constexpr std::size_t kScanEntriesMax = 200;
 
 constexpr std::string_view kFilePrefix = "fid=";
-
-std::uint64_t checkedSum(std::uint64_t a, std::uint64_t b) {
-    std::uint64_t sum = 0;
-    if (__builtin_add_overflow(a, b, &sum)) fatal("the number of changes overflows");
-    return sum;
-}
 
 std::uint64_t numberOf(const TesselItemIdentifier& identifier) {
     std::uint64_t number = 0;
@@ -188,7 +183,7 @@ Result<FSChangesEnumerator::Answer> FSChangesEnumerator::ask(FSEventReader& read
         Answer answer = TRY(askOnce(reader, identifier, asked));
         if (answer.kind != Answer::Kind::moving) return answer;
         const bool isStill = std::exchange(before, answer.path) == answer.path;
-        if (looks == kLooksMax) {
+        if (looks == kLooksForObjectMax) {
             // What the store keeps saying of an object that isn't there is wrong; what it says anew may be right soon.
             if (isStill) answer.kind = Answer::Kind::notListed;
             return answer;

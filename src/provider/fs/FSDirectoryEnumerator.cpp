@@ -6,7 +6,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <cstdlib>
 #include <string_view>
 #include <utility>
 
@@ -14,6 +13,7 @@
 #include "platform/foundation/RootDirectories.h"
 #include "platform/foundation/Sys.h"
 #include "platform/tessel/TesselErrors.h"
+#include "provider/Utilities.h"
 #include "provider/fs/FSListingPositions.h"
 
 namespace cindral {
@@ -26,12 +26,6 @@ constexpr std::size_t kOpenLevelsMax = 32;
 constexpr std::size_t kSmallBufferSize = 8'192;
 constexpr std::size_t kLargeBufferSize = 32'768;
 constexpr std::uint64_t kSmallBufferEntriesMax = 256;
-
-std::uint64_t checkedSum(std::uint64_t a, std::uint64_t b) {
-    std::uint64_t sum = 0;
-    if (__builtin_add_overflow(a, b, &sum)) std::abort();
-    return sum;
-}
 
 }  // namespace
 

@@ -19,7 +19,7 @@ namespace {
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 
-constexpr const char* kRoot = "TesselRootContainerItemIdentifier";
+constexpr const char* kRootContainer = "TesselRootContainerItemIdentifier";
 constexpr const char* kWorkingSet = "TesselWorkingSetContainerItemIdentifier";
 
 std::vector<std::string> identifiersOf(const TesselItems& items) {
@@ -129,7 +129,7 @@ TEST_F(SearchIndexTest, listsAFolderThatComesWhileItGathers) {
         if (container != "fid=10" || std::exchange(isMoved, true)) return;
         FakeItem copy = *std::dynamic_pointer_cast<const FakeItem>(*provider_->itemForIdentifier("fid=20"));
         provider_->remove("fid=20");
-        provider_->folder("fid=20", copy.name, kRoot);
+        provider_->folder("fid=20", copy.name, kRootContainer);
         change({"u fid=20"}, "next");
     };
     EXPECT_THAT(names("inside"), ElementsAre("did=5"));

@@ -79,7 +79,7 @@ struct Kind {
 std::vector<Kind> allKinds() {
     return {{"inotify", makeInotifySource},
             {"fanotify", [] { return makeFanotifySource(); }},
-            {"fanotifyOfOlderKernels", [] { return makeFanotifySource(RenameRecords::halves); }}};
+            {"fanotifyOfOlderKernels", [] { return makeFanotifySourceOf(RenameRecords::halves); }}};
 }
 
 Result<void> tryOn(const Kind& kind, const std::string& folder) {

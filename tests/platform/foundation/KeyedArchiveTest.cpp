@@ -15,19 +15,19 @@ using namespace keyed_archive;  // NOLINT(google-build-using-namespace)
 using test::bytesFromHex;
 using test::hexFromBytes;
 
-PropertyList number(std::uint64_t value) {
+PropertyList plistNumber(std::uint64_t value) {
     return value;
 }
 
 /// The dictionary at the top of an archive of "text", with one entry replaced or added.
 Bytes archiveWith(const char* key, PropertyList value) {
-    Dictionary top{{"archiver", "KsKeyedArchiver"}, {"version", number(1)}, {"root", "text"}};
+    Dictionary top{{"archiver", "KsKeyedArchiver"}, {"version", plistNumber(1)}, {"root", "text"}};
     top.insert_or_assign(key, std::move(value));
     return PropertyList(std::move(top)).encodeBinary();
 }
 
 Bytes archiveWithout(const char* key) {
-    Dictionary top{{"archiver", "KsKeyedArchiver"}, {"version", number(1)}, {"root", "text"}};
+    Dictionary top{{"archiver", "KsKeyedArchiver"}, {"version", plistNumber(1)}, {"root", "text"}};
     top.erase(key);
     return PropertyList(std::move(top)).encodeBinary();
 }
@@ -88,8 +88,8 @@ TEST(KeyedArchive, hasNoIntegerBeyondSigned64Bits) {
 
 TEST(KeyedArchive, refusesEveryOtherClass) {
     const KsDate date{.seconds = 1};
-    for (const PropertyList& root : {PropertyList(true), number(1), PropertyList(std::int64_t{-1}), PropertyList(1.0),
-                                     PropertyList(date), PropertyList(Bytes{}), PropertyList("1"),
+    for (const PropertyList& root : {PropertyList(true), plistNumber(1), PropertyList(std::int64_t{-1}),
+                                     PropertyList(1.0), PropertyList(date), PropertyList(Bytes{}), PropertyList("1"),
                                      PropertyList(Array{"1"}), PropertyList(Dictionary{{"class", "1"}})}) {
         const Bytes bytes = archive(root);
         EXPECT_EQ(unarchiveRoot(bytes), root);
@@ -98,16 +98,16 @@ TEST(KeyedArchive, refusesEveryOtherClass) {
         EXPECT_EQ(unarchiveStrings(bytes).has_value(), root.array() != nullptr);
         EXPECT_EQ(unarchiveInteger(bytes).has_value(), root.unsignedInteger() || root.negativeInteger() || root.real());
     }
-    EXPECT_FALSE(unarchiveStrings(archive(Array{"red", number(1)})));
+    EXPECT_FALSE(unarchiveStrings(archive(Array{"red", plistNumber(1)})));
     EXPECT_FALSE(unarchiveStrings(archive(Array{"red", Array{}})));
 }
 
 TEST(KeyedArchive, refusesAnotherArchiverOrVersion) {
     ASSERT_TRUE(unarchiveRoot(archiveWith("root", "text")));
     EXPECT_FALSE(unarchiveRoot(archiveWith("archiver", "OtherArchiver")));
-    EXPECT_FALSE(unarchiveRoot(archiveWith("archiver", number(1))));
-    EXPECT_FALSE(unarchiveRoot(archiveWith("version", number(2))));
-    EXPECT_FALSE(unarchiveRoot(archiveWith("version", number(0))));
+    EXPECT_FALSE(unarchiveRoot(archiveWith("archiver", plistNumber(1))));
+    EXPECT_FALSE(unarchiveRoot(archiveWith("version", plistNumber(2))));
+    EXPECT_FALSE(unarchiveRoot(archiveWith("version", plistNumber(0))));
     EXPECT_FALSE(unarchiveRoot(archiveWith("version", 1.0)));
     EXPECT_FALSE(unarchiveRoot(archiveWith("version", true)));
     EXPECT_FALSE(unarchiveRoot(archiveWith("version", "1")));

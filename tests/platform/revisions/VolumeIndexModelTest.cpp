@@ -8,6 +8,7 @@
 #include <set>
 #include <tuple>
 
+#include "platform/revisions/RevisionsNumbers.h"
 #include "platform/revisions/VolumeIndex.h"
 #include "platform/revisions/VolumeStore.h"
 #include "support/TemporaryFolder.h"
@@ -16,14 +17,6 @@ namespace cindral {
 namespace {
 
 using test::TemporaryFolder;
-
-std::uint64_t number(FileID id) {
-    return static_cast<std::uint64_t>(id);
-}
-
-std::uint32_t number(DocumentID id) {
-    return static_cast<std::uint32_t>(id);
-}
 
 /// The rules of the index and the journal, carried out on plain maps.
 class Model {
@@ -186,7 +179,7 @@ private:
     }
 };
 
-std::string lineOf(const JournalEvent& event) {
+std::string modelLineOf(const JournalEvent& event) {
     switch (event.kind) {
         case JournalEvent::Kind::present:
             return fmt::format("{} present {} at {}/{} kind {} document {}", event.id, number(event.fileID),
@@ -568,7 +561,7 @@ protected:
                 wanted.push_back(at->second);
             }
             const std::vector<JournalEvent> events = read(after, max);
-            for (const JournalEvent& event : events) found.push_back(lineOf(event));
+            for (const JournalEvent& event : events) found.push_back(modelLineOf(event));
             ASSERT_EQ(found, wanted) << "after " << after << ", at most " << max;
         }
     }

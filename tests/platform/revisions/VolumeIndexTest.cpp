@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <thread>
 
+#include "platform/revisions/RevisionsNumbers.h"
 #include "platform/revisions/VolumeStore.h"
 #include "support/TemporaryFolder.h"
 
@@ -19,12 +20,6 @@ using test::TemporaryFolder;
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 using ::testing::UnorderedElementsAre;
-
-constexpr FileID kRoot{2};
-
-std::uint64_t number(FileID id) {
-    return static_cast<std::uint64_t>(id);
-}
 
 /// What an event tells, in a line.
 std::string lineOf(const JournalEvent& event) {

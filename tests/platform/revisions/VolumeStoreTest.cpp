@@ -23,6 +23,7 @@
 
 #include "platform/revisions/HighWaterFile.h"
 #include "platform/revisions/NumberSource.h"
+#include "platform/revisions/RevisionsNumbers.h"
 #include "support/LogCapture.h"
 #include "support/TemporaryFolder.h"
 
@@ -33,8 +34,6 @@ using test::LogCapture;
 using test::TemporaryFolder;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
-
-constexpr FileID kRoot{2};
 
 VolumeStoreOptions onRequest() {
     VolumeStoreOptions options;
@@ -70,10 +69,6 @@ private:
     std::vector<std::unique_ptr<std::string>> names_;
     std::vector<ObjectSighting> sightings_;
 };
-
-std::uint32_t number(DocumentID id) {
-    return static_cast<std::uint32_t>(id);
-}
 
 std::string readFile(const std::string& path) {
     std::ifstream stream(path, std::ios::binary);
