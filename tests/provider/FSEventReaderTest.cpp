@@ -1,9 +1,12 @@
 #include "provider/fs/FSEventReader.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <fmt/format.h>
+
+#include <algorithm>
 
 #include "platform/foundation/Dispatch.h"
 #include "provider/HistoryFixture.h"
@@ -103,6 +106,53 @@ TEST_F(FSEventReaderTest, reportsItemsOfWhatIsThere) {
     changed("folder");
     EXPECT_EQ(replay(), (Strings{"update " + fid("a.txt") + " a.txt", "update " + fid("folder") + " folder", done()}));
     EXPECT_TRUE(log_.contains(LogLevel::info, "[INFO] done processing history"));
+}
+
+TEST_F(FSEventReaderTest, takesAFileForWhatTheRecorderSaw) {
+    storage_.file("a.txt", "hello");
+    storage_.file("folder/inner/b.txt", "hello");
+    // Each is looked at, too, so that what is told of it is known.
+    changed("a.txt");
+    changed("folder/inner/b.txt");
+    (void)replay();
+    const TesselItems looked = std::exchange(delegate_->items, {});
+    ASSERT_EQ(looked.size(), 2U);
+    const std::uint64_t since = history_->currentEventID();
+    for (const char* name : {"a.txt", "folder/inner/b.txt"}) {
+        Event event{.path = storage_ / name, .fileID = FileID{fileID(name)}, .kind = ObjectKind::file};
+        event.seen = std::make_shared<const FileStatus>(*sys::statx(AT_FDCWD, event.path.c_str()));
+        event.folder = FileID{sys::statx(AT_FDCWD, event.path.substr(0, event.path.rfind('/')).c_str())->fileID};
+        history_->add(event);
+        ASSERT_EQ(::unlink((storage_ / name).c_str()), 0);
+    }
+    const auto reader = FSEventReader::create({storageURL()}, FSEventReaderMode::pathBased, /*verbose=*/false, since);
+    reader->setDelegate(delegate_);
+    (void)replay(*reader);
+    ASSERT_EQ(delegate_->items.size(), 2U);
+    for (std::size_t i = 0; i < looked.size(); ++i) {
+        const TesselItem& item = *delegate_->items[i];
+        EXPECT_EQ(item.itemIdentifier(), looked[i]->itemIdentifier());
+        EXPECT_EQ(item.parentItemIdentifier(), looked[i]->parentItemIdentifier());
+        EXPECT_EQ(item.filename(), looked[i]->filename());
+        EXPECT_EQ(item.documentSize(), looked[i]->documentSize());
+        ASSERT_TRUE(item.versionIdentifier() && looked[i]->versionIdentifier());
+        EXPECT_TRUE(std::ranges::equal(*item.versionIdentifier(), *looked[i]->versionIdentifier()));
+        EXPECT_EQ(item.capabilities(), looked[i]->capabilities());
+        EXPECT_EQ(item.typeIdentifier(), looked[i]->typeIdentifier());
+        EXPECT_EQ(*item.fileURL(), *looked[i]->fileURL());
+    }
+}
+
+TEST_F(FSEventReaderTest, looksAtAFileThatWasSeenOnAnotherDevice) {
+    storage_.file("a.txt", "hello");
+    Event event{.path = storage_ / "a.txt", .fileID = FileID{fileID("a.txt")}, .kind = ObjectKind::file};
+    FileStatus status = *sys::statx(AT_FDCWD, event.path.c_str());
+    ++status.device;
+    event.seen = std::make_shared<const FileStatus>(status);
+    event.folder = FileID{sys::statx(AT_FDCWD, storage_.path().c_str())->fileID};
+    history_->add(event);
+    ASSERT_EQ(::unlink((storage_ / "a.txt").c_str()), 0);
+    EXPECT_EQ(replay(), (Strings{"delete " + fmt::format("fid={}", static_cast<std::uint64_t>(event.fileID)), done()}));
 }
 
 TEST_F(FSEventReaderTest, givesDocumentsTheirIDsTogether) {

@@ -10,6 +10,7 @@
 #include "platform/foundation/KsURL.h"
 #include "platform/foundation/KsUUID.h"
 #include "platform/foundation/Result.h"
+#include "platform/foundation/Sys.h"
 #include "platform/revisions/VolumeStore.h"
 
 namespace cindral {
@@ -43,6 +44,10 @@ struct Event {
     DocumentID documentID{};  ///< that the object had when it was recorded, or has now; 0 for none
     /// What the object was when it left, or is; `other` with document-ID changes.
     ObjectKind kind = ObjectKind::other;
+    /// Of a plain file with no extended attributes and no other name: what the recorder saw when it looked last, in a
+    /// folder that listings get to. Null: it has to be looked at.
+    std::shared_ptr<const FileStatus> seen{};
+    FileID folder{};  ///< with `seen`
 };
 
 /// The events of the volume, in order, and where they come to an end: now.

@@ -159,6 +159,7 @@ void IndexKeeper::waitForRenames() {
 
 Result<void> IndexKeeper::lookAtDirt() {
     if (std::exchange(everythingIsDirty_, false)) {
+        if (options_.seenFiles != nullptr) options_.seenFiles->clear();
         dirtyFolders_.clear();
         dirtyObjects_.clear();
         unreached_.clear();
@@ -370,7 +371,10 @@ Result<void> IndexKeeper::look(OpenFolder& folder, const std::string& name) {
     const std::vector<Known> formers = findAt(folder.fileID, name);
     const bool isHere = status.ok() && status->device == folder.root->directory->status.device;
     const auto here = isHere ? std::optional(FileID{status->fileID}) : std::nullopt;
-    if (isHere) TRY(see(folder, name, *status, true));
+    if (isHere) {
+        TRY(see(folder, name, *status, true));
+        noteSeen(folder, name, *status);
+    }
     if (formers.empty() && !isHere) {
         if (const auto nameless = numberOfNameless(name)) dirtyObjects_.insert(*nameless);
     }
@@ -378,6 +382,19 @@ Result<void> IndexKeeper::look(OpenFolder& folder, const std::string& name) {
         if (former.object.fileID != here) lost(folder.fileID, name, former, here);
     }
     return {};
+}
+
+/// Another name is looked at by hints of its own, and changes what the first one's said.
+void IndexKeeper::noteSeen(const OpenFolder& folder, const std::string& name, const FileStatus& status) {
+    if (options_.seenFiles == nullptr) return;
+    SeenFiles& files = *options_.seenFiles;
+    std::string attributes;
+    if (status.isRegular() && status.names == 1 && files.takesMore() &&
+        !sys::hasXattrs(folder.fd.get(), name.c_str(), attributes).valueOr(true)) {
+        files.put(status);
+    } else {
+        files.forget(FileID{status.fileID});
+    }
 }
 
 /// A name of an object that is no longer there, or has another.

@@ -15,6 +15,7 @@
 
 #include "platform/eventstream/EventSource.h"
 #include "platform/eventstream/SafeSave.h"
+#include "platform/eventstream/SeenFiles.h"
 #include "platform/foundation/Mutex.h"
 #include "platform/foundation/RootDirectories.h"
 #include "platform/foundation/Sys.h"
@@ -43,6 +44,8 @@ public:
         std::function<KsDate()> wallClock = KsDate::now;
         /// Asked between folders of a long comparison; true makes it stop with ECANCELED.
         std::function<bool()> isStopping = [] { return false; };
+        /// Told of each file that a hint led to. Borrowed for life; null: nobody.
+        SeenFiles* seenFiles = nullptr;
     };
     /// `store` is borrowed for life.
     IndexKeeper(VolumeStore& store, Options options);
@@ -135,6 +138,7 @@ private:
     Result<void> keepAsFormer(const Known& folder);
     Result<void> seeNew(OpenFolder& folder, std::string_view name, const FileStatus& status,
                         const std::optional<Known>& formerHolder);
+    void noteSeen(const OpenFolder& folder, const std::string& name, const FileStatus& status);
     void lost(FileID parent, std::string_view name, const Known& known, std::optional<FileID> newcomer);
     void noteClosed(FileID folder, bool isClosed);
     void lookAtFolderItself(OpenFolder& folder);

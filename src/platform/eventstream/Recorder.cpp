@@ -73,9 +73,10 @@ Recorder::Recorder(std::shared_ptr<VolumeStore> store, Options options)
     : store_(std::move(store)),
       options_(std::move(options)),
       wakeFd_(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)),
-      keeper_(*store_, {.now = options_.now, .wallClock = options_.wallClock, .isStopping = [this] {
-                            return stopping_.load(std::memory_order_relaxed);
-                        }}) {}
+      keeper_(*store_, {.now = options_.now,
+                        .wallClock = options_.wallClock,
+                        .isStopping = [this] { return stopping_.load(std::memory_order_relaxed); },
+                        .seenFiles = &seenFiles_}) {}
 
 Recorder::~Recorder() {
     stop();
@@ -420,9 +421,9 @@ void Recorder::noteState() {
             status.uncovered.push_back({root.directory->path, "its file system does not tell of changes"});
     }
     for (const FileID folder : keeper_.closedFolders()) {
-        std::map<FileID, std::string> paths;
+        FolderPlaces places;
         status.uncovered.push_back(
-            {pathOf(*this->roots(), keeper_.rootIDs(), folder, paths), std::string(kUnreadable)});
+            {placeOf(*this->roots(), keeper_.rootIDs(), folder, places).path, std::string(kUnreadable)});
     }
     if (keeper_.reachedWatchLimit() && inotify_) {
         const EventSource::Usage usage = inotify_->usage();
@@ -485,16 +486,17 @@ bool Recorder::canReplayAfter(std::uint64_t eventID) const {
     return begin && eventID >= *begin && eventID <= store_->currentEventID();
 }
 
-/// Path of a folder as presented; empty when it can't be told.
-std::string Recorder::pathOf(const Roots& roots, std::span<const FileID> rootIDs, FileID folder,
-                             std::map<FileID, std::string>& known) const {
+const Recorder::FolderPlace& Recorder::placeOf(const Roots& roots, std::span<const FileID> rootIDs, FileID folder,
+                                               FolderPlaces& known) const {
     const auto [at, isNew] = known.try_emplace(folder);
-    if (!isNew) return at->second;
+    FolderPlace& place = at->second;
+    if (!isNew) return place;
     if (const auto recorded = store_->recordedPath(folder, rootIDs)) {
-        at->second = roots[recorded->rootIndex]->path;
-        if (!recorded->path.empty()) at->second += "/" + recorded->path;
+        place.path = roots[recorded->rootIndex]->path;
+        if (!recorded->path.empty()) place.path += "/" + recorded->path;
+        place.isOpen = recorded->isOpen;
     }
-    return at->second;
+    return place;
 }
 
 Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_t max) const {
@@ -514,7 +516,7 @@ Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_
     batch.upTo = found.empty() ? after : found.back().id;
     if (batch.isLast) batch.upTo = std::max(batch.upTo, current);
     batch.events.reserve(found.size());
-    std::map<FileID, std::string> paths;
+    FolderPlaces places;
     /// Where an object was when it left; empty where that was not recorded.
     const auto placeLeft = [&](const JournalEvent& departure) -> std::string {
         if (departure.path.empty()) return {};
@@ -526,21 +528,22 @@ Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_
         return former == formerRoots.end() ? std::string() : former->second + "/" + departure.path;
     };
     for (const JournalEvent& journalled : found) {
-        std::string folder = pathOf(*roots, rootIDs, journalled.parent, paths);
+        FolderPlace folder = placeOf(*roots, rootIDs, journalled.parent, places);
         std::string name = journalled.name;
         // A folder on the way may have moved between two looks at the index: it leads to a root at every moment.
-        for (int tries = 0; folder.empty() && tries < kPathTriesMax; ++tries) {
+        for (int tries = 0; folder.path.empty() && tries < kPathTriesMax; ++tries) {
             FileID parent{};
             store_->indexed(journalled.fileID, [&](const IndexedObject& object) {
                 if (object.eventID == journalled.id) parent = object.parent, name = object.name;
             });
             if (parent == FileID{}) break;
-            paths.clear();
-            folder = pathOf(*roots, rootIDs, parent, paths);
+            places.clear();
+            folder = placeOf(*roots, rootIDs, parent, places);
+            folder.isOpen = false;
         }
         Event event;
-        if (!folder.empty()) {
-            event.path = folder + "/" + name;
+        if (!folder.path.empty()) {
+            event.path = folder.path + "/" + name;
         } else if (journalled.kind == JournalEvent::Kind::departed) {
             // Its folder is gone as well.
             event.path = placeLeft(journalled);
@@ -552,7 +555,14 @@ Result<EventHistory::Batch> Recorder::pathEvents(std::uint64_t after, std::size_
         event.kind = journalled.objectKind;
         if (journalled.kind == JournalEvent::Kind::departed) {
             event.flags = journalled.goesOn ? EventFlags::removed | EventFlags::renamed : EventFlags::removed;
-            if (folder.empty() || event.path != placeLeft(journalled)) event.flags = event.flags | EventFlags::cutOff;
+            if (folder.path.empty() || event.path != placeLeft(journalled))
+                event.flags = event.flags | EventFlags::cutOff;
+        }
+        if (journalled.kind == JournalEvent::Kind::present && journalled.objectKind == ObjectKind::file &&
+            folder.isOpen) {
+            event.seen =
+                seenFiles_.find(journalled.fileID, journalled.birthTime, journalled.changeTime, journalled.size);
+            event.folder = journalled.parent;
         }
         batch.events.push_back(std::move(event));
     }

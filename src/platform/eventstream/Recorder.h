@@ -117,8 +117,14 @@ private:
     std::chrono::milliseconds untilAudit() const;
     void rest(std::chrono::milliseconds time);
     std::shared_ptr<const Roots> roots() const;
-    std::string pathOf(const Roots& roots, std::span<const FileID> rootIDs, FileID folder,
-                       std::map<FileID, std::string>& known) const;
+    /// A folder as the index has it.
+    struct FolderPlace {
+        std::string path;     ///< as presented; empty when it can't be told
+        bool isOpen = false;  ///< listings get to what is in it
+    };
+    using FolderPlaces = std::map<FileID, FolderPlace>;
+    const FolderPlace& placeOf(const Roots& roots, std::span<const FileID> rootIDs, FileID folder,
+                               FolderPlaces& known) const;
 
     // Constant.
     const std::shared_ptr<VolumeStore> store_;
@@ -127,6 +133,8 @@ private:
     std::thread thread_;
 
     std::atomic<bool> stopping_{false};
+
+    SeenFiles seenFiles_;
 
     /// Held while the index is worked on: over system calls and the store's writes.
     Mutex mutex_;

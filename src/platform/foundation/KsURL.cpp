@@ -128,6 +128,14 @@ KsURL KsURL::child(std::shared_ptr<const DirectoryReference> directory, std::str
     return url;
 }
 
+KsURL KsURL::seenChild(std::shared_ptr<const DirectoryReference> directory, std::string_view name,
+                       const FileStatus& status) {
+    KsURL url = child(std::move(directory), name);
+    url.status_ = status;
+    url.attributeNames_.emplace();
+    return url;
+}
+
 KsURL KsURL::of(const DirectoryReference& directory) {
     KsURL url = fileURL(directory.path);
     url.status_ = directory.status;
@@ -195,7 +203,7 @@ std::string KsURL::absoluteString() const {
 Result<KsURL::Place> KsURL::place() const {
     if (!isFileURL_) return KsError::posix(EINVAL, path_);
     Place place;
-    if (directory_) {
+    if (directory_ && directory_->fd) {
         place.directory = directory_->fd.get();
         place.name = path_.c_str() + path_.rfind('/') + 1;
         return place;
@@ -207,7 +215,8 @@ Result<KsURL::Place> KsURL::place() const {
 
 Result<UniqueFd> KsURL::open(int flags) const {
     if (!isFileURL_) return KsError::posix(EINVAL, path_);
-    if (directory_) return sys::openat(directory_->fd.get(), path_.c_str() + path_.rfind('/') + 1, flags | O_NOFOLLOW);
+    if (directory_ && directory_->fd)
+        return sys::openat(directory_->fd.get(), path_.c_str() + path_.rfind('/') + 1, flags | O_NOFOLLOW);
     return RootDirectories::open(path_, flags);
 }
 

@@ -53,6 +53,9 @@ public:
     static KsURL fileURL(std::string path);
     /// The entry of an open directory. `directory` stays open for as long as the URL is not detached.
     static KsURL child(std::shared_ptr<const DirectoryReference> directory, std::string_view name);
+    /// The same of an entry whose status is known, and that it has no extended attributes.
+    static KsURL seenChild(std::shared_ptr<const DirectoryReference> directory, std::string_view name,
+                           const FileStatus& status);
     /// The open directory itself, with its status as it is known already.
     static KsURL of(const DirectoryReference& directory);
     /// Reads a URL as text. None for a file URL that is malformed, relative, of another machine, or holds a NUL.

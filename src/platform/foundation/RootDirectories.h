@@ -14,7 +14,7 @@
 
 namespace cindral {
 
-/// An open directory and the path that it is presented under.
+/// A directory and the path that it is presented under.
 ///
 /// Thread safety: immutable.
 struct DirectoryReference {
@@ -23,9 +23,9 @@ struct DirectoryReference {
     DirectoryReference(const DirectoryReference&) = delete;
     DirectoryReference& operator=(const DirectoryReference&) = delete;
 
-    UniqueFd fd;
-    std::string path;  ///< absolute, without a trailing slash
-    FileStatus status;
+    UniqueFd fd;                   ///< invalid: what is in the directory is reached by the path
+    std::string path;              ///< absolute, without a trailing slash
+    FileStatus status;             ///< without a descriptor only the file ID, the device and that it is a directory
     KsDate seenAt;                 ///< when the status was taken
     sys::FileSystemTraits traits;  ///< nothing to rely on where nobody asked
 };

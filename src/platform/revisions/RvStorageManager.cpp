@@ -262,7 +262,8 @@ Result<void> RvStorageManager::identify(std::vector<KsURL>& entries) {
         const DirectoryReference& folder = *entry.directory();
         const Result<FileStatus> status = entry.status();
         if (!status.ok() || status->device != folder.status.device) continue;
-        if (folders.empty() || folders.back() != &folder) folders.push_back(&folder);
+        // One that is not open is known by its record.
+        if (folder.fd && (folders.empty() || folders.back() != &folder)) folders.push_back(&folder);
         ObjectSighting& sighting = sightings.emplace_back();
         sighting.fileID = FileID{status->fileID};
         sighting.birthTime = status->birthStamp();

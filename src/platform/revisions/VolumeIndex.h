@@ -50,6 +50,10 @@ struct JournalEvent {
     FileID root{};          ///< departed only: the root that `path` is below
     bool goesOn = false;    ///< departed only: it was listed as the same object elsewhere after it
     FileID target{};        ///< document only; 0: the document no longer exists
+    // Present only: as in IndexedObject.
+    std::int64_t birthTime = 0;
+    std::int64_t changeTime = 0;
+    std::uint64_t size = 0;
 };
 
 /// Changes of the index, collected in order, that VolumeStore::apply() carries out in one transaction together with

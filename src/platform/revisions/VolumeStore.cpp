@@ -191,6 +191,7 @@ std::optional<VolumeStore::RecordedPath> VolumeStore::Implementation::recordedPa
             if (depth == 0) found.birthTime = record.birthTime;
             if (isRoot) return;
             isGood = isFileName(record.name);
+            found.isOpen = found.isOpen && record.kind == ObjectKind::folder && !record.isClosed;
             path.prepend(record.name);
             at = record.parent;
         });

@@ -123,6 +123,7 @@ public:
         std::string path;
         std::size_t rootIndex = 0;
         std::int64_t birthTime = 0;
+        bool isOpen = true;  ///< the object, and all above it to the root, are folders that could be read
     };
     std::optional<RecordedPath> recordedPath(FileID fileID, std::span<const FileID> roots) const;
 

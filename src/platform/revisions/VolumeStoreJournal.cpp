@@ -105,6 +105,9 @@ Result<std::uint64_t> VolumeStore::Implementation::resolve(std::vector<JournalEv
             event.name = record->name;
             event.objectKind = record->kind;
             event.documentID = record->documentID;
+            event.birthTime = record->birthTime;
+            event.changeTime = record->changeTime;
+            event.size = record->size;
         }));
     for (JournalEvent& event : candidates) {
         if (event.id != 0) found.push_back(std::move(event));

@@ -61,6 +61,7 @@ FSEntryFinder::FSEntryFinder(std::vector<KsURL> urls) : urls_(std::move(urls)) {
 
 void FSEntryFinder::forget() {
     folders_.clear();
+    unopened_.clear();
 }
 
 Result<FSEntryFinder::Folder> FSEntryFinder::openTop(const KsURL& top) {
@@ -134,6 +135,32 @@ Result<FSFoundEntry> FSEntryFinder::find(std::string_view path) {
     if (!status.ok()) return FSFoundEntry{TRY(standingAfter(status.error())), std::nullopt};
     if (status->device != folder.directory->status.device) return FSFoundEntry{Standing::outside, std::nullopt};
     return FSFoundEntry{Standing::reached, std::move(url)};
+}
+
+std::optional<KsURL> FSEntryFinder::foundAlready(std::string_view path, FileID folder, const FileStatus& status) {
+    const KsURL* top = directoryHolding(urls_, path);
+    if (top == nullptr || !path.starts_with(top->path())) return std::nullopt;
+    const Result<Folder> open = this->folder(*top, top->path());
+    if (!open.ok() || open->standing != Standing::reached) return std::nullopt;
+    const DirectoryReference& opened = *open->directory;
+    if (opened.status.device != status.device) return std::nullopt;
+    const std::size_t slash = path.rfind('/');
+    const std::string_view name = path.substr(slash + 1);
+    if (slash == top->path().size()) {
+        if (FileID{opened.status.fileID} != folder) return std::nullopt;
+        return KsURL::seenChild(open->directory, name, status);
+    }
+    auto& known = unopened_[std::string(path.substr(0, slash))];
+    if (!known || FileID{known->status.fileID} != folder) {
+        auto directory = std::make_shared<DirectoryReference>();
+        directory->path = path.substr(0, slash);
+        directory->status.fileID = static_cast<std::uint64_t>(folder);
+        directory->status.device = status.device;
+        directory->status.mode = S_IFDIR;
+        directory->traits = opened.traits;
+        known = std::move(directory);
+    }
+    return KsURL::seenChild(known, name, status);
 }
 
 }  // namespace cindral

@@ -10,6 +10,7 @@
 #include "platform/foundation/KsURL.h"
 #include "platform/foundation/Result.h"
 #include "platform/foundation/RootDirectories.h"
+#include "platform/revisions/VolumeStore.h"
 
 namespace cindral {
 
@@ -39,6 +40,9 @@ public:
     /// `path` as presented. Outside of the directories, and the directories themselves, are `missing`. An error says
     /// that it can't be told: the process lacks descriptors or memory, or the disk failed.
     Result<FSFoundEntry> find(std::string_view path);
+    /// What find() would answer of an entry with the status, a file without extended attributes in a folder of that ID,
+    /// where it is known to be listed; without a look at it. None where that can't be told.
+    std::optional<KsURL> foundAlready(std::string_view path, FileID folder, const FileStatus& status);
     /// Directories may have moved: what is asked next is looked for anew.
     void forget();
 
@@ -55,6 +59,7 @@ private:
 
     const std::vector<KsURL> urls_;
     std::unordered_map<std::string, Folder> folders_;
+    std::unordered_map<std::string, std::shared_ptr<const DirectoryReference>> unopened_;
 };
 
 /// The innermost of the directories that the path is strictly below; null when it is below none.

@@ -344,7 +344,13 @@ Result<FSEventReader::Look> FSEventReader::lookAtPath(FSEventReaderDelegate& del
         return Look{};
     }
     if (delegate.readerDidReceiveEvent(*this, event, path) == FSEventReaderDelegate::LookFurther::no) return Look{};
-    FSFoundEntry found = TRY(entryFinder().find(path));
+    FSFoundEntry found;
+    if (event.seen) found.url = entryFinder().foundAlready(path, event.folder, *event.seen);
+    if (found.url) {
+        found.standing = FSFoundEntry::Standing::reached;
+    } else {
+        found = TRY(entryFinder().find(path));
+    }
     if (found.standing == FSFoundEntry::Standing::outside)
         return Look{.kind = Look::Kind::dropped, .identifier = std::move(identifier)};
     if (found.standing == FSFoundEntry::Standing::missing) {

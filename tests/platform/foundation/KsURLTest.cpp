@@ -1,9 +1,12 @@
 #include "platform/foundation/KsURL.h"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
+
+#include <array>
 
 #include "platform/foundation/RootDirectories.h"
 #include "support/TemporaryFolder.h"
@@ -147,6 +150,26 @@ TEST_F(KsURLValuesTest, attributeNamesAreLookedAtOnce) {
     EXPECT_FALSE(file.mayHaveAttribute("user.one2"));
     EXPECT_EQ(file.attribute("user.one", {}).value(), 1U);
     EXPECT_TRUE(file.attribute("user.two", {}).error().isPosix(ENODATA));
+}
+
+TEST_F(KsURLValuesTest, aChildThatWasSeenIsNotLookedAt) {
+    folder_.file("dir/a.txt", "hello");
+    const FileStatus status = *KsURL::fileURL(folder_ / "dir/a.txt").status();
+    auto directory = std::make_shared<DirectoryReference>();
+    directory->path = folder_ / "dir";
+    const KsURL url = KsURL::seenChild(directory, "a.txt", status);
+    ASSERT_EQ(::setxattr(url.path().c_str(), "user.color", "red", 3, 0), 0);
+    ASSERT_EQ(::truncate(url.path().c_str(), 1), 0);
+    EXPECT_EQ(url.status()->size, 5U);
+    EXPECT_FALSE(url.mayHaveAttribute("user.color"));
+    // What was not seen is read by the path, the directory not being open.
+    std::array<std::byte, 8> value{};
+    EXPECT_EQ(*url.attribute("user.color", value), 3U);
+    EXPECT_TRUE(url.open(O_RDONLY).ok());
+    KsURL anew = url;
+    anew.removeCachedResourceValues();
+    EXPECT_EQ(anew.status()->size, 1U);
+    EXPECT_TRUE(*anew.isWritable());
 }
 
 TEST_F(KsURLValuesTest, aChildReadsThroughItsDirectory) {
