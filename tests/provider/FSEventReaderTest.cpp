@@ -143,6 +143,41 @@ TEST_F(FSEventReaderTest, takesAFileForWhatTheRecorderSaw) {
     }
 }
 
+TEST_F(FSEventReaderTest, looksAtAFileOfWhichNotEverythingWasSeen) {
+    storage_.file("folder/text", "hello");
+    storage_.file("folder/closed.txt", "hello");
+    ASSERT_EQ(::chmod((storage_ / "folder/closed.txt").c_str(), 0444), 0);
+    for (const char* name : {"folder/text", "folder/closed.txt"}) {
+        Event event{.path = storage_ / name, .fileID = FileID{fileID(name)}, .kind = ObjectKind::file};
+        event.seen = std::make_shared<const FileStatus>(*sys::statx(AT_FDCWD, event.path.c_str()));
+        event.folder = FileID{fileID("folder")};
+        history_->add(event);
+    }
+    const std::string text = fid("folder/text");
+    const std::string closed = fid("folder/closed.txt");
+    // The folder goes, and others have its files' names.
+    ASSERT_EQ(::rename((storage_ / "folder").c_str(), (storage_ / "moved").c_str()), 0);
+    storage_.file("folder/text", "\x89PNG\r\n\x1A\n");
+    storage_.file("folder/closed.txt", "hello");
+    EXPECT_EQ(replay(), (Strings{"drop " + text, "drop " + closed, done()}));
+}
+
+TEST_F(FSEventReaderTest, recordsNoFileThatLeftTheIndexSinceItWasSeen) {
+    storage_.file("a.txt", "hello");
+    const std::string path = storage_ / "a.txt";
+    const FileID gone{fileID("a.txt")};
+    Event event{.path = path, .fileID = gone, .kind = ObjectKind::file};
+    event.seen = std::make_shared<const FileStatus>(*sys::statx(AT_FDCWD, path.c_str()));
+    event.folder = FileID{sys::statx(AT_FDCWD, storage_.path().c_str())->fileID};
+    history_->add(event);
+    ASSERT_EQ(::unlink(path.c_str()), 0);
+    ASSERT_FALSE(store_->object(gone));
+    const std::uint64_t documents = store_->counts().documents;
+    EXPECT_EQ(replay(), (Strings{fmt::format("drop fid={}", static_cast<std::uint64_t>(gone)), done()}));
+    EXPECT_FALSE(store_->object(gone));
+    EXPECT_EQ(store_->counts().documents, documents);
+}
+
 TEST_F(FSEventReaderTest, looksAtAFileThatWasSeenOnAnotherDevice) {
     storage_.file("a.txt", "hello");
     Event event{.path = storage_ / "a.txt", .fileID = FileID{fileID("a.txt")}, .kind = ObjectKind::file};

@@ -44,7 +44,7 @@ struct Event {
     DocumentID documentID{};  ///< that the object had when it was recorded, or has now; 0 for none
     /// What the object was when it left, or is; `other` with document-ID changes.
     ObjectKind kind = ObjectKind::other;
-    /// Of a plain file with no extended attributes and no other name: what the recorder saw when it looked last, in a
+    /// What the recorder saw when it looked last, of a plain file that had no extended attributes and one name, in a
     /// folder that listings get to. Null: it has to be looked at.
     std::shared_ptr<const FileStatus> seen{};
     FileID folder{};  ///< with `seen`

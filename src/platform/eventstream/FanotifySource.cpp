@@ -29,7 +29,6 @@ constexpr unsigned kGroup =
 constexpr std::uint64_t kEvents =
     FAN_CREATE | FAN_DELETE | FAN_MODIFY | FAN_ATTRIB | FAN_CLOSE_WRITE | FAN_DELETE_SELF | FAN_ONDIR;
 
-// Enough for a few hundred events; one event is at most a thousand bytes.
 // What readableBytes() counts for an event of any length.
 constexpr std::uint64_t kCountedBytes = sizeof(fanotify_event_metadata);
 

@@ -585,6 +585,11 @@ void IndexKeeper::lookAtFolderItself(OpenFolder& folder) {
     // One without a name is told of by its parent.
     if (!known || !status.ok() || status->names == 0 || status->birthStamp() != known->object.birthTime) return;
     if (known->object.changeTime == stampOf(status->changeTime)) return;
+    if (sys::isClosedDirectory(folder.fd.get(), ".") != known->object.isClosed) {
+        // What is below shows, or no longer shows. That is found where its parent is looked at.
+        dirtyObjects_.insert(folder.fileID);
+        return;
+    }
     put(known->object.parent, known->name, *status, known->object.isClosed);
 }
 

@@ -22,8 +22,6 @@ namespace {
 constexpr std::uint32_t kOfContents = IN_MODIFY | IN_ATTRIB | IN_CLOSE_WRITE | IN_MOVE_SELF;
 constexpr std::uint32_t kOfEntries = IN_CREATE | IN_DELETE | IN_MOVED_FROM | IN_MOVED_TO;
 
-// Enough for a few hundred events; one event is at most 272 bytes.
-
 // The use of watches is asked for with every answer; how many there may be changes once in a machine's life.
 constexpr std::chrono::milliseconds kLimitIsGood{500};
 

@@ -128,11 +128,23 @@ KsURL KsURL::child(std::shared_ptr<const DirectoryReference> directory, std::str
     return url;
 }
 
-KsURL KsURL::seenChild(std::shared_ptr<const DirectoryReference> directory, std::string_view name,
-                       const FileStatus& status) {
+std::optional<KsURL> KsURL::seenChild(std::shared_ptr<const DirectoryReference> directory, std::string_view name,
+                                      const FileStatus& status) {
+    const std::optional<bool> isWritable = sys::isWritableByStatus(status, directory->traits.ownerWhoseModeDecides);
+    if (!isWritable) return std::nullopt;
+    bool isRead = false;
+    const auto reader = [&isRead](std::size_t) -> std::optional<Bytes> {
+        isRead = true;
+        return std::nullopt;
+    };
+    const InternedString type = TypeDatabase::shared().typeOf(status.mode, name, status.size, reader);
+    if (isRead) return std::nullopt;
     KsURL url = child(std::move(directory), name);
     url.status_ = status;
     url.attributeNames_.emplace();
+    url.typeIdentifier_ = type;
+    url.isWritable_ = isWritable;
+    url.wasSeenBefore_ = true;
     return url;
 }
 

@@ -53,9 +53,11 @@ public:
     static KsURL fileURL(std::string path);
     /// The entry of an open directory. `directory` stays open for as long as the URL is not detached.
     static KsURL child(std::shared_ptr<const DirectoryReference> directory, std::string_view name);
-    /// The same of an entry whose status is known, and that it has no extended attributes.
-    static KsURL seenChild(std::shared_ptr<const DirectoryReference> directory, std::string_view name,
-                           const FileStatus& status);
+    /// The same of an entry whose status is known, and that it has no extended attributes. Everything that is to be told
+    /// of it is known then, and it is not looked at; none where something can't be told without a look.
+    static std::optional<KsURL> seenChild(std::shared_ptr<const DirectoryReference> directory, std::string_view name,
+                                          const FileStatus& status);
+    bool wasSeenBefore() const { return wasSeenBefore_; }
     /// The open directory itself, with its status as it is known already.
     static KsURL of(const DirectoryReference& directory);
     /// Reads a URL as text. None for a file URL that is malformed, relative, of another machine, or holds a NUL.
@@ -136,6 +138,7 @@ private:
     mutable std::optional<bool> isWritable_;
     mutable std::optional<std::uint16_t> linkCount_;
     bool isFileURL_ = true;
+    bool wasSeenBefore_ = false;
 };
 
 }  // namespace cindral

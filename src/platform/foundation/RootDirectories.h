@@ -23,7 +23,7 @@ struct DirectoryReference {
     DirectoryReference(const DirectoryReference&) = delete;
     DirectoryReference& operator=(const DirectoryReference&) = delete;
 
-    UniqueFd fd;                   ///< invalid: what is in the directory is reached by the path
+    UniqueFd fd;                   ///< invalid: nothing is to be read of what is in the directory
     std::string path;              ///< absolute, without a trailing slash
     FileStatus status;             ///< without a descriptor only the file ID, the device and that it is a directory
     KsDate seenAt;                 ///< when the status was taken

@@ -56,7 +56,8 @@ Result<bool> hasUnknown(const VolumeStore& store, std::span<const ObjectSighting
     for (const ObjectSighting& sighting : sightings) fileIDs.push_back(sighting.fileID);
     bool isUnknown = false;
     TRY(store.indexed(fileIDs, [&](std::size_t i, const IndexedObject* object) {
-        isUnknown = isUnknown || object == nullptr || object->birthTime != sightings[i].birthTime;
+        const bool isKnown = object != nullptr && object->birthTime == sightings[i].birthTime;
+        isUnknown = isUnknown || (!isKnown && !sightings[i].isByIndex);
     }));
     return isUnknown;
 }
@@ -271,18 +272,25 @@ Result<void> RvStorageManager::identify(std::vector<KsURL>& entries) {
         sighting.kind = objectKindOf(*status, entry.isPackage().valueOr(false));
         sighting.name = entry.lastPathComponent();
         sighting.wantsDocumentID = sighting.kind == ObjectKind::file || sighting.kind == ObjectKind::package;
+        sighting.isByIndex = entry.wasSeenBefore();
         sighted.push_back(&entry);
     }
     // A new file may be a document that was just saved: the recorder knows, and hands it the number it had.
     if (TRY(hasUnknown(*store, sightings))) (void)catchUp();
     TRY(recordFolders(*store, folders, sightings));
     TRY(store->identify(sightings));
+    std::vector<const KsURL*> gone;
     for (std::size_t i = 0; i < sightings.size(); ++i) {
         if (!sightings[i].wantsDocumentID) continue;
+        if (sightings[i].isByIndex && sightings[i].documentID == DocumentID{}) {
+            gone.push_back(sighted[i]);
+            continue;
+        }
         sighted[i]->setCachedResourceValue(ResourceKey::documentIdentifier,
                                            std::uint64_t{static_cast<std::uint32_t>(sightings[i].documentID)});
         rememberAttributes(*store, *sighted[i], sightings[i].documentID);
     }
+    std::erase_if(entries, [&](const KsURL& entry) { return std::ranges::find(gone, &entry) != gone.end(); });
     return {};
 }
 

@@ -33,6 +33,8 @@ struct ObjectSighting {
     ObjectKind kind = ObjectKind::other;
     std::string_view name;  ///< borrowed for the call
     bool wantsDocumentID = false;
+    /// By the index alone: where that has no such object any more, nothing is recorded and no ID is given.
+    bool isByIndex = false;
     DocumentID documentID{};  ///< out: the document ID it has or was given
 };
 

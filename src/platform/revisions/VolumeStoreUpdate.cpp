@@ -67,6 +67,8 @@ VolumeStore::Implementation::Update::Object& VolumeStore::Implementation::Update
 
 DocumentID VolumeStore::Implementation::Update::sight(const ObjectSighting& sighting) {
     Object& seen = object(sighting.fileID);
+    const bool isAnother = !seen.isThere || seen.now.birthTime != sighting.birthTime;
+    if (sighting.isByIndex && isAnother) return {};
     if (seen.isThere && seen.now.birthTime != sighting.birthTime) {
         // Another object under the number. What the recorder had looked at does not vanish without an event.
         if (seen.now.changeTime != 0) {

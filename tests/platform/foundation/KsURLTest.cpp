@@ -157,19 +157,34 @@ TEST_F(KsURLValuesTest, aChildThatWasSeenIsNotLookedAt) {
     const FileStatus status = *KsURL::fileURL(folder_ / "dir/a.txt").status();
     auto directory = std::make_shared<DirectoryReference>();
     directory->path = folder_ / "dir";
-    const KsURL url = KsURL::seenChild(directory, "a.txt", status);
+    directory->traits.ownerWhoseModeDecides = status.owner;
+    const auto seen = KsURL::seenChild(directory, "a.txt", status);
+    ASSERT_TRUE(seen);
+    const KsURL& url = *seen;
+    EXPECT_TRUE(url.wasSeenBefore());
     ASSERT_EQ(::setxattr(url.path().c_str(), "user.color", "red", 3, 0), 0);
     ASSERT_EQ(::truncate(url.path().c_str(), 1), 0);
     EXPECT_EQ(url.status()->size, 5U);
     EXPECT_FALSE(url.mayHaveAttribute("user.color"));
-    // What was not seen is read by the path, the directory not being open.
-    std::array<std::byte, 8> value{};
-    EXPECT_EQ(*url.attribute("user.color", value), 3U);
-    EXPECT_TRUE(url.open(O_RDONLY).ok());
-    KsURL anew = url;
-    anew.removeCachedResourceValues();
-    EXPECT_EQ(anew.status()->size, 1U);
-    EXPECT_TRUE(*anew.isWritable());
+    ASSERT_EQ(::unlink(url.path().c_str()), 0);
+    EXPECT_TRUE(*url.isWritable());
+    EXPECT_EQ(url.typeIdentifier()->string(), "text/plain");
+}
+
+TEST_F(KsURLValuesTest, aChildThatWasSeenHasNothingLeftToRead) {
+    const FileStatus status = *KsURL::fileURL(folder_.file("dir/a", "hello")).status();
+    auto directory = std::make_shared<DirectoryReference>();
+    directory->path = folder_ / "dir";
+    EXPECT_FALSE(KsURL::seenChild(directory, "a.txt", status)) << "who may write it is not told by its mode alone";
+    directory->traits.ownerWhoseModeDecides = status.owner;
+    EXPECT_TRUE(KsURL::seenChild(directory, "a.txt", status));
+    EXPECT_FALSE(KsURL::seenChild(directory, "a", status)) << "its type is in its contents";
+    FileStatus other = status;
+    other.mode = S_IFREG | 0444;
+    EXPECT_FALSE(KsURL::seenChild(directory, "a.txt", other)) << "privilege may let it be written";
+    other = status;
+    other.owner += 1;
+    EXPECT_FALSE(KsURL::seenChild(directory, "a.txt", other));
 }
 
 TEST_F(KsURLValuesTest, aChildReadsThroughItsDirectory) {
