@@ -59,7 +59,7 @@ function(cindral_tests name)
   target_include_directories(${name} PRIVATE ${CMAKE_SOURCE_DIR}/tests)
   target_link_libraries(${name} PRIVATE cindral_test_support cindral_test_options GTest::gtest GTest::gmock ${arg_DEPENDS})
   target_precompile_headers(${name} REUSE_FROM cindral_test_support)
-  set_target_properties(${name} PROPERTIES UNITY_BUILD ${CINDRAL_UNITY_BUILD} UNITY_BUILD_BATCH_SIZE 6) # As src/CMakeLists.txt says.
+  set_target_properties(${name} PROPERTIES UNITY_BUILD ${CINDRAL_UNITY_BUILD} UNITY_BUILD_BATCH_SIZE 12) # As src/CMakeLists.txt says.
   gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST NO_PRETTY_VALUES PROPERTIES TIMEOUT 300)
 endfunction()
 
